@@ -1,0 +1,29 @@
+// The platform's analytics service and its power event log.
+#pragma once
+
+#include <cstdint>
+#include <string>
+#include <string_view>
+
+#include "platform/Function.h"
+#include "platform/Payload.h"
+
+namespace vx {
+
+class AnalyticsEventService {
+ public:
+  virtual ~AnalyticsEventService() = default;
+  // The builder is called only if the service wants the event, possibly later and on another
+  // thread.
+  virtual void sendEventLazy(std::string name, Function<Payload()> builder) = 0;
+};
+
+class PowerEventLog {
+ public:
+  virtual ~PowerEventLog() = default;
+  // Records a named event. `options` may be null.
+  virtual void logRegisteredEvent(int64_t clientIdentifier, std::string_view eventName,
+                                  const Payload& record, const Payload* options) = 0;
+};
+
+}  // namespace vx

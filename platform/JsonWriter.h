@@ -1,0 +1,33 @@
+// Streams JSON text (RFC 8259) of property lists: compact for the store, pretty for files. Constant
+// memory beyond the caller's buffer. Dates become text ("2026-11-21T03:46:00Z"); keys are not
+// sorted.
+#pragma once
+
+#include <cstddef>
+#include <optional>
+#include <string>
+#include <string_view>
+
+#include "platform/Error.h"
+#include "platform/Payload.h"
+
+namespace vx {
+
+// Non-finite numbers have no JSON form.
+enum class NonFinite {
+  AsText,  // "NaN", "Infinity", "-Infinity" as strings: nothing is lost (the store)
+  Refuse,  // checkJson names the offending key; append writes null
+};
+
+// Compact: no white space.
+void appendJson(std::string& out, const Payload& payload, NonFinite nonFinite = NonFinite::AsText);
+void appendJson(std::string& out, const Value& value, NonFinite nonFinite = NonFinite::AsText);
+void appendJsonString(std::string& out, std::string_view text);
+// Pretty: two blanks a level, "key" : value separated as `"key": value`; the first line is not
+// indented, the others by `indent` levels at least.
+void appendPrettyJson(std::string& out, const Payload& payload, int indent);
+// The error that a strict JSON serialisation would report: a non-finite number, named by its key
+// path. None when fine.
+std::optional<Error> checkJson(const Payload& payload);
+
+}  // namespace vx

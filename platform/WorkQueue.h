@@ -1,0 +1,67 @@
+// Serial work queues and the shared background queue.
+#pragma once
+
+#include <chrono>
+#include <memory>
+#include <string_view>
+
+#include "platform/Function.h"
+#include "platform/ThreadAnnotations.h"
+
+namespace vx {
+
+using Work = Function<void()>;
+
+enum class QualityOfService {
+  UserInteractive,  // one thread, the one on which ServiceListener resume runs
+  Utility,          // relay work of the sessions
+  Background,       // standalone sends
+};
+
+// Runs submitted work one item at a time in submission order (the background queue: concurrently).
+// Thread-safe. Items queued when the process ends may never run.
+class CAPABILITY("queue") WorkQueue {
+ public:
+  virtual ~WorkQueue() = default;
+  // Never runs the work before it returns.
+  virtual void async(Work work) = 0;
+  // The work joins the queue once the delay has passed on the monotonic clock.
+  virtual void asyncAfter(std::chrono::nanoseconds delay, Work work) = 0;
+  virtual bool isCurrent() const = 0;
+  virtual std::string_view label() const = 0;
+  // Fails the process when the caller is not running on this queue (debug builds).
+  void assertIsCurrent() const ASSERT_CAPABILITY(this) {
+#ifndef NDEBUG
+    if (!isCurrent()) __builtin_trap();
+#endif
+  }
+};
+
+class WorkQueues {
+ public:
+  virtual ~WorkQueues() = default;
+  // A new serial queue; `label` must outlive it (a literal). Cheap: thousands may exist. Work
+  // queued on it keeps it alive until it has run.
+  virtual std::shared_ptr<WorkQueue> makeSerial(std::string_view label,
+                                                QualityOfService quality) = 0;
+  // The shared concurrent queue of background priority.
+  virtual WorkQueue& background() = 0;
+  // Bracket a wait on a queue's thread, so that the other queues of its lane are served meanwhile.
+  // See Blocking.
+  virtual void beginBlocking() = 0;
+  virtual void endBlocking() = 0;
+};
+
+// Held around work that waits for somebody else. No effect off the queues' threads.
+class Blocking {
+ public:
+  explicit Blocking(WorkQueues& queues) : queues_(queues) { queues_.beginBlocking(); }
+  ~Blocking() { queues_.endBlocking(); }
+  Blocking(const Blocking&) = delete;
+  Blocking& operator=(const Blocking&) = delete;
+
+ private:
+  WorkQueues& queues_;
+};
+
+}  // namespace vx
