@@ -1,0 +1,669 @@
+#include "platform/linux/SocketConnection.h"
+
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstring>
+
+#include "platform/CborWriter.h"
+
+namespace vx::lnx {
+
+namespace {
+
+constexpr std::size_t kLengthBytes = 4;
+constexpr std::size_t kReadBytes = 64 << 10;
+// Frames run before the replies they cause get their turn, which bounds how far replies overshoot
+// their limit.
+constexpr int kFramesPerTurn = 512;
+// An operation whose answer may be as large as a frame uses up this much of a turn.
+constexpr int kLargeReplyCost = 64;
+// A buffer larger than this is given back when it is empty.
+constexpr std::size_t kKeptBufferBytes = 64 << 10;
+
+uint32_t readLength(const uint8_t* at) {
+  return uint32_t{at[0]} | uint32_t{at[1]} << 8 | uint32_t{at[2]} << 16 | uint32_t{at[3]} << 24;
+}
+
+void writeLength(uint8_t* at, std::size_t length) {
+  for (int i = 0; i < 4; ++i) at[i] = static_cast<uint8_t>(length >> (8 * i));
+}
+
+std::optional<int64_t> wholeNumber(const Value& value) {
+  if (value.kind() != ValueKind::Integer) return std::nullopt;
+  return value.asInt64();
+}
+
+}  // namespace
+
+std::string ListenerCounters::text() const {
+  std::string out;
+  auto add = [&out](const char* name, uint64_t value) {
+    out += out.empty() ? "" : " ";
+    out += name;
+    out += "=" + std::to_string(value);
+  };
+  add("accepted", accepted);
+  add("calls", calls);
+  add("refused_connections", refusedConnections);
+  add("descriptor_exhaustions", descriptorExhaustions);
+  add("malformed_frames", malformedFrames);
+  add("oversized_frames", oversizedFrames);
+  add("unknown_operations", unknownOperations);
+  add("wrong_arguments", wrongArguments);
+  add("too_many_sessions", tooManySessions);
+  add("unsupported_versions", unsupportedVersions);
+  add("second_replies", secondReplies);
+  add("abandoned_calls", abandonedCalls);
+  add("oversized_replies", oversizedReplies);
+  add("slow_clients_cut", slowClientsCut);
+  add("reading_pauses", readingPauses);
+  return out;
+}
+
+SocketConnection::SocketConnection(ConnectionHost& host, int fd, pid_t pid, uid_t uid)
+    : host_(host),
+      fd_(fd),
+      pid_(pid),
+      uid_(uid),
+      queue_(host.executor().makeSerial("com.quorvel.sonik.reporting.connection",
+                                        QualityOfService::UserInteractive)) {}
+
+SocketConnection::~SocketConnection() {
+  if (fd_ >= 0) ::close(fd_);
+}
+
+std::string SocketConnection::description() const {
+  return "<ClientConnection fd " + std::to_string(fd_) + " pid " + std::to_string(pid_) + " uid " +
+         std::to_string(uid_) + ">";
+}
+
+void SocketConnection::resume() {
+  if (state_ != State::Accepted) return;
+  state_ = State::Open;
+  interest_ = EPOLLIN;
+  if (!host_.loop().add(fd_, interest_, *this)) {
+    interest_ = 0;
+    queue_->async([self = shared_from_this()] { self->finishReading(End::Interrupted); });
+  }
+}
+
+// ---------------------------------------------------------------------------------------------------------------------
+// Reading
+
+void SocketConnection::onReady(uint32_t events) {
+  if (events & (EPOLLOUT | EPOLLERR)) flush();
+  if (events & (EPOLLIN | EPOLLHUP | EPOLLERR)) scheduleRead();
+}
+
+void SocketConnection::scheduleRead() {
+  if (readScheduled_ || state_ != State::Open) return;
+  readScheduled_ = true;
+  queue_->async([self = shared_from_this()] {
+    self->readScheduled_ = false;
+    self->readPass();
+  });
+}
+
+bool SocketConnection::mustPause() const {
+  const auto& limits = host_.limits();
+  return callsInFlight_ >= limits.maxCallsInFlight ||
+         out_.size() - outOffset_ >= limits.maxUnreadReplyBytes;
+}
+
+void SocketConnection::pauseReading() {
+  ++host_.counters().readingPauses;
+  updateInterest();
+}
+
+void SocketConnection::continueReading() {
+  waitingForHost_ = false;
+  updateInterest();
+  scheduleRead();
+}
+
+void SocketConnection::readPass() {
+  if (state_ != State::Open || waitingForHost_) return;
+  // Complete frames left over from the read before come first; only when they are through is more
+  // read.
+  if (hasCompleteFrame()) {
+    inOffset_ += runFrames(std::span<const uint8_t>(in_).subspan(inOffset_));
+  } else {
+    std::span<uint8_t> buffer = host_.readBuffer();
+    const std::size_t had = in_.size() - inOffset_;
+    const bool inPlace = had <= buffer.size() - kReadBytes;
+    ssize_t got = 0;
+    if (inPlace) {
+      if (had != 0) std::memcpy(buffer.data(), in_.data() + inOffset_, had);
+      got = recv(fd_, buffer.data() + had, kReadBytes, MSG_DONTWAIT);
+    } else {  // inside a large frame
+      in_.resize(in_.size() + kReadBytes);
+      got = recv(fd_, in_.data() + inOffset_ + had, kReadBytes, MSG_DONTWAIT);
+      in_.resize(inOffset_ + had + static_cast<std::size_t>(got > 0 ? got : 0));
+    }
+    if (got < 0 && (errno == EAGAIN || errno == EINTR)) return;
+    if (got <= 0) return finishReading(End::Interrupted);
+    if (inPlace) {
+      const std::span<const uint8_t> bytes(buffer.data(), had + static_cast<std::size_t>(got));
+      const std::size_t used = runFrames(bytes);
+      if (state_ != State::Open) return;
+      keepRest(bytes.subspan(used));
+    } else {
+      inOffset_ += runFrames(std::span<const uint8_t>(in_).subspan(inOffset_));
+    }
+  }
+  if (state_ != State::Open) return;
+  if (inOffset_ == in_.size()) keepRest({});
+  if (waitingForHost_ || mustPause()) return pauseReading();
+  // More bytes in the socket than one read takes are left to the next pass, so that this one's
+  // replies leave first.
+  if (hasCompleteFrame()) scheduleRead();
+}
+
+// Whether in_ starts with a whole frame, or with a length that will be refused.
+bool SocketConnection::hasCompleteFrame() const {
+  const std::size_t had = in_.size() - inOffset_;
+  if (had < kLengthBytes) return false;
+  const std::size_t length = readLength(in_.data() + inOffset_);
+  return had - kLengthBytes >= length || length > host_.limits().maxFrameBytes;
+}
+
+void SocketConnection::keepRest(std::span<const uint8_t> rest) {
+  inOffset_ = 0;
+  if (rest.empty() && in_.capacity() != 0)
+    in_ = {};
+  else
+    in_.assign(rest.begin(), rest.end());
+}
+
+std::size_t SocketConnection::runFrames(std::span<const uint8_t> bytes) {
+  std::size_t used = 0;
+  turnBudget_ = kFramesPerTurn;
+  while (turnBudget_-- > 0 && bytes.size() - used >= kLengthBytes) {
+    if (mustPause()) break;
+    if (host_.readingPaused()) {
+      waitingForHost_ = true;
+      host_.waitForReading(shared_from_this());
+      break;
+    }
+    const std::size_t length = readLength(bytes.data() + used);
+    if (length > host_.limits().maxFrameBytes) {
+      ++host_.counters().oversizedFrames;
+      fail(WireError::FrameTooLarge, "a frame of " + std::to_string(length) +
+                                         " bytes; the limit is " +
+                                         std::to_string(host_.limits().maxFrameBytes));
+      return used;
+    }
+    if (bytes.size() - used - kLengthBytes < length) break;
+    runFrame(bytes.subspan(used + kLengthBytes, length));
+    if (state_ != State::Open) return used;
+    used += kLengthBytes + length;
+  }
+  return used;
+}
+
+void SocketConnection::runFrame(std::span<const uint8_t> frame) {
+  DecodeError error;
+  const std::optional<ArrayView> items = FrameDecoder::decode(frame, &error);
+  std::optional<int64_t> kind;
+  if (items && !items->empty()) kind = wholeNumber(*items->begin());
+  if (!items || !kind) {
+    ++host_.counters().malformedFrames;
+    return fail(WireError::MalformedFrame,
+                !items ? error.text + " at byte " + std::to_string(error.offset)
+                       : "the first element of a frame must be its kind, an integer");
+  }
+  if (*kind == static_cast<int64_t>(FrameKind::Hello)) return runHello(*items);
+  if (!helloSeen_) {
+    ++host_.counters().malformedFrames;
+    return fail(WireError::MalformedFrame, "the first frame must be a hello: [0, 1]");
+  }
+  if (*kind == static_cast<int64_t>(FrameKind::Call)) return runCall(*items);
+  if (*kind == static_cast<int64_t>(FrameKind::Goodbye)) return finishReading(End::Orderly);
+  ++host_.counters().malformedFrames;
+  fail(WireError::MalformedFrame, "unknown kind of frame " + std::to_string(*kind));
+}
+
+void SocketConnection::runHello(const ArrayView& frame) {
+  auto at = frame.begin();
+  std::optional<int64_t> version;
+  if (frame.size() >= 2) version = wholeNumber(*++at);
+  if (version != kProtocolVersion) {
+    ++host_.counters().unsupportedVersions;
+    return fail(
+        WireError::UnsupportedVersion,
+        "this service speaks version " + std::to_string(kProtocolVersion) + " of the protocol");
+  }
+  if (helloSeen_) return;
+  helloSeen_ = true;
+  const auto& limits = host_.limits();
+  const std::size_t start = beginFrame();
+  CborWriter writer(out_);
+  writer.array(3);
+  writer.integer(static_cast<int64_t>(FrameKind::Hello));
+  writer.integer(kProtocolVersion);
+  writer.dictionary(5);
+  writer.string("interface");
+  writer.string(interface_ != nullptr ? interface_->name : "");
+  auto limit = [&writer](std::string_view name, uint64_t value) {
+    writer.string(name);
+    writer.unsignedInteger(value);
+  };
+  limit("max_frame_bytes", limits.maxFrameBytes);
+  limit("max_calls_in_flight", limits.maxCallsInFlight);
+  limit("max_unread_reply_bytes", limits.maxUnreadReplyBytes);
+  limit("max_sessions", limits.maxSessionsPerConnection);
+  endFrame(start);
+}
+
+// ---------------------------------------------------------------------------------------------------------------------
+// Calls
+
+void SocketConnection::runCall(const ArrayView& frame) {
+  ++host_.counters().calls;
+  auto at = frame.begin();
+  std::optional<int64_t> number;
+  std::optional<int64_t> operationNumber;
+  if (frame.size() >= 3) {
+    number = wholeNumber(*++at);
+    operationNumber = wholeNumber(*++at);
+    ++at;
+  }
+  if (!number || *number < 0 || !operationNumber) {
+    ++host_.counters().malformedFrames;
+    return fail(WireError::MalformedFrame, "a call is [1, number, operation, argument...]");
+  }
+  const auto callNumber = static_cast<uint64_t>(*number);
+  if (interface_ == nullptr || *operationNumber < 1 ||
+      static_cast<uint64_t>(*operationNumber) > interface_->operations.size()) {
+    ++host_.counters().unknownOperations;
+    return sendError(callNumber, WireError::UnknownOperation,
+                     "there is no operation " + std::to_string(*operationNumber));
+  }
+  const OperationDescription& operation =
+      interface_->operations[static_cast<std::size_t>(*operationNumber - 1)];
+  CallArguments arguments;
+  std::string problem;
+  if (!readArguments(operation, at, frame.size() - 3, arguments, problem)) {
+    ++host_.counters().wrongArguments;
+    return sendError(callNumber, WireError::WrongArguments, problem);
+  }
+  if (!admitResource(operation, arguments)) {
+    ++host_.counters().tooManySessions;
+    return sendError(callNumber, WireError::TooManySessions,
+                     "this connection holds " + std::to_string(resources_.size()) +
+                         " sessions already; destroy some first");
+  }
+  if (operation.reply == ReplyKind::Int64Array) turnBudget_ -= kLargeReplyCost;
+  const uint64_t token = openSlot(callNumber, !operation.replyMayBeHeld);
+  operation.invoke(*object_, arguments, Reply(weak_from_this(), token));
+}
+
+bool SocketConnection::readArguments(const OperationDescription& operation, ArrayView::Iterator at,
+                                     std::size_t count, CallArguments& arguments,
+                                     std::string& problem) const {
+  if (count != operation.arguments.size()) {
+    problem = std::string(operation.name) + " takes " + std::to_string(operation.arguments.size()) +
+              " arguments, not " + std::to_string(count);
+    return false;
+  }
+  const char* wanted = nullptr;
+  for (std::size_t i = 0; i < count && wanted == nullptr; ++i, ++at) {
+    const Value value = *at;
+    const ValueKind kind = value.kind();
+    switch (operation.arguments[i]) {
+      case ArgumentKind::Int64:
+        if (kind == ValueKind::Integer)
+          arguments.set(i, value.asInt64());
+        else
+          wanted = "a signed 64-bit integer";
+        break;
+      case ArgumentKind::UInt16:
+      case ArgumentKind::UInt32: {
+        const bool narrow = operation.arguments[i] == ArgumentKind::UInt16;
+        const int64_t most = narrow ? UINT16_MAX : int64_t{UINT32_MAX};
+        if (kind == ValueKind::Integer && value.asInt64() >= 0 && value.asInt64() <= most) {
+          arguments.set(i, static_cast<uint64_t>(value.asInt64()));
+        } else {
+          wanted = narrow ? "an unsigned 16-bit integer" : "an unsigned 32-bit integer";
+        }
+        break;
+      }
+      case ArgumentKind::Dictionary:
+      case ArgumentKind::OptionalDictionary:
+        if (kind == ValueKind::Dictionary) {
+          arguments.set(i, std::optional<Payload>(Payload::copyOf(value)));
+        } else if (kind == ValueKind::Null &&
+                   operation.arguments[i] == ArgumentKind::OptionalDictionary) {
+          arguments.set(i, std::optional<Payload>());
+        } else {
+          wanted = operation.arguments[i] == ArgumentKind::Dictionary ? "a dictionary"
+                                                                      : "a dictionary or null";
+        }
+        break;
+      case ArgumentKind::OptionalInt64Array:
+        if (kind == ValueKind::Null) {
+          arguments.set(i, std::optional<std::vector<int64_t>>());
+        } else if (kind == ValueKind::Array) {
+          std::vector<int64_t> numbers;
+          for (const Value element : value.asArray()) {
+            if (element.kind() != ValueKind::Integer) wanted = "an array of signed 64-bit integers";
+            numbers.push_back(element.asInt64());
+          }
+          arguments.set(i, std::optional<std::vector<int64_t>>(std::move(numbers)));
+        } else {
+          wanted = "an array of signed 64-bit integers or null";
+        }
+        break;
+    }
+    if (wanted != nullptr) {
+      problem = "argument " + std::to_string(i + 1) + " of " + std::string(operation.name) +
+                " must be " + wanted;
+    }
+  }
+  return wanted == nullptr;
+}
+
+bool SocketConnection::admitResource(const OperationDescription& operation,
+                                     const CallArguments& arguments) {
+  if (operation.resource == ResourceEffect::Release) resources_.erase(arguments.int64(0));
+  if (operation.resource != ResourceEffect::Acquire) return true;
+  if (resources_.size() >= host_.limits().maxSessionsPerConnection &&
+      !resources_.contains(arguments.int64(0))) {
+    return false;
+  }
+  resources_.insert(arguments.int64(0));
+  return true;
+}
+
+uint64_t SocketConnection::openSlot(uint64_t number, bool counted) {
+  uint32_t index = 0;
+  if (freeSlots_.empty()) {
+    index = static_cast<uint32_t>(slots_.size());
+    slots_.emplace_back();
+  } else {
+    index = freeSlots_.back();
+    freeSlots_.pop_back();
+  }
+  Slot& slot = slots_[index];
+  slot.number = number;
+  slot.used = true;
+  slot.answered = false;
+  slot.counted = counted;
+  if (counted) ++callsInFlight_;
+  return uint64_t{slot.generation} << 32 | index;
+}
+
+SocketConnection::Slot* SocketConnection::slotFor(uint64_t token) {
+  const auto index = static_cast<uint32_t>(token);
+  if (index >= slots_.size()) return nullptr;
+  Slot& slot = slots_[index];
+  return slot.used && slot.generation == token >> 32 ? &slot : nullptr;
+}
+
+// The call has its answer, or will never have one.
+void SocketConnection::settle(Slot& slot) {
+  slot.answered = true;
+  if (!slot.counted) return;
+  slot.counted = false;
+  const bool wasFull = callsInFlight_-- >= host_.limits().maxCallsInFlight;
+  if (wasFull && state_ == State::Open) {
+    updateInterest();
+    scheduleRead();
+  }
+  if (state_ == State::Draining && callsInFlight_ == 0) wantFlush();
+}
+
+void SocketConnection::reply(uint64_t token, ReplyValue value) {
+  if (!host_.executor().isInteractiveThread()) {
+    queue_->async([self = shared_from_this(), token, value = std::move(value)]() mutable {
+      self->reply(token, std::move(value));
+    });
+    return;
+  }
+  Slot* slot = slotFor(token);
+  if (slot == nullptr || state_ == State::Closed) return;
+  if (slot->answered) {
+    ++host_.counters().secondReplies;
+    return;
+  }
+  sendReply(slot->number, value);
+  settle(*slot);
+}
+
+void SocketConnection::release(uint64_t token) {
+  if (!host_.executor().isInteractiveThread()) {
+    queue_->async([self = shared_from_this(), token] { self->release(token); });
+    return;
+  }
+  Slot* slot = slotFor(token);
+  if (slot == nullptr) return;
+  if (!slot->answered) {
+    if (state_ == State::Open) {
+      ++host_.counters().abandonedCalls;
+      sendError(slot->number, WireError::Abandoned,
+                "the service let go of this call without an answer");
+    }
+    settle(*slot);
+  }
+  ++slot->generation;
+  slot->used = false;
+  freeSlots_.push_back(static_cast<uint32_t>(token));
+}
+
+// ---------------------------------------------------------------------------------------------------------------------
+// Writing
+
+std::size_t SocketConnection::beginFrame() {
+  const std::size_t start = out_.size();
+  out_.resize(start + kLengthBytes);
+  return start;
+}
+
+void SocketConnection::endFrame(std::size_t start) {
+  writeLength(out_.data() + start, out_.size() - start - kLengthBytes);
+  wantFlush();
+}
+
+void SocketConnection::wantFlush() {
+  if (flushQueued_ || state_ == State::Closed) return;
+  flushQueued_ = true;
+  host_.flushAtPassEnd(shared_from_this());
+}
+
+void SocketConnection::sendReply(uint64_t number, const ReplyValue& value) {
+  const std::size_t start = beginFrame();
+  CborWriter writer(out_);
+  writer.array(3);
+  writer.integer(static_cast<int64_t>(FrameKind::Reply));
+  writer.unsignedInteger(number);
+  if (const bool* boolean = std::get_if<bool>(&value)) {
+    writer.boolean(*boolean);
+  } else if (const uint16_t* code = std::get_if<uint16_t>(&value)) {
+    writer.unsignedInteger(*code);
+  } else if (const Error* error = std::get_if<Error>(&value)) {
+    writer.dictionary(error->reason.empty() ? 2 : 3);
+    writer.string("domain");
+    writer.string(error->domain);
+    writer.string("code");
+    writer.integer(error->code);
+    if (!error->reason.empty()) {
+      writer.string("reason");
+      writer.string(error->reason);
+    }
+  } else if (const Payload* dictionary = std::get_if<Payload>(&value)) {
+    writer.encoded(dictionary->encoded());
+  } else if (const auto* numbers = std::get_if<std::vector<int64_t>>(&value)) {
+    writer.array(numbers->size());
+    for (const int64_t element : *numbers) writer.integer(element);
+  } else {
+    writer.null();
+  }
+  if (out_.size() - start - kLengthBytes > host_.limits().maxFrameBytes) {
+    ++host_.counters().oversizedReplies;
+    out_.resize(start);
+    return sendError(number, WireError::FrameTooLarge, "the answer does not fit into one frame");
+  }
+  endFrame(start);
+}
+
+void SocketConnection::sendError(std::optional<uint64_t> number, WireError code,
+                                 std::string_view text) {
+  const std::size_t start = beginFrame();
+  CborWriter writer(out_);
+  writer.array(4);
+  writer.integer(static_cast<int64_t>(FrameKind::Error));
+  if (number)
+    writer.unsignedInteger(*number);
+  else
+    writer.null();
+  writer.integer(static_cast<int64_t>(code));
+  writer.string(text);
+  endFrame(start);
+}
+
+void SocketConnection::sendGoodbye() {
+  if (goodbyeSent_) return;
+  goodbyeSent_ = true;
+  const std::size_t start = beginFrame();
+  CborWriter writer(out_);
+  writer.array(1);
+  writer.integer(static_cast<int64_t>(FrameKind::Goodbye));
+  endFrame(start);
+}
+
+void SocketConnection::flush() {
+  flushQueued_ = false;
+  if (state_ == State::Closed) return;
+  if (outOffset_ < out_.size()) {
+    const bool wasFull = mustPause();
+    const ssize_t sent =
+        send(fd_, out_.data() + outOffset_, out_.size() - outOffset_, MSG_DONTWAIT | MSG_NOSIGNAL);
+    if (sent < 0 && errno != EAGAIN && errno != EINTR) {
+      // The peer is gone. Whoever reads from it finds out; when nobody reads any more, this was the
+      // end.
+      out_.clear();
+      outOffset_ = 0;
+      if (state_ == State::Draining) return closeNow();
+      return;
+    }
+    if (sent > 0) outOffset_ += static_cast<std::size_t>(sent);
+    if (outOffset_ != out_.size() && (sent > 0 || lastProgress_ == Monotonic{})) {
+      lastProgress_ = host_.clock().monotonic();
+    }
+    if (outOffset_ == out_.size()) {
+      outOffset_ = 0;
+      lastProgress_ = Monotonic{};
+      if (out_.capacity() > kKeptBufferBytes)
+        out_ = {};
+      else
+        out_.clear();
+    } else if (outOffset_ > kKeptBufferBytes) {
+      out_.erase(out_.begin(), out_.begin() + static_cast<std::ptrdiff_t>(outOffset_));
+      outOffset_ = 0;
+    }
+    if (wasFull && !mustPause()) scheduleRead();
+  }
+  if (state_ == State::Draining && callsInFlight_ == 0 && out_.empty()) return closeNow();
+  updateInterest();
+}
+
+void SocketConnection::updateInterest() {
+  if (state_ == State::Closed || state_ == State::Accepted) return;
+  uint32_t wanted = 0;
+  if (state_ == State::Open && !waitingForHost_ && !mustPause()) wanted |= EPOLLIN;
+  if (outOffset_ < out_.size() && !flushQueued_) wanted |= EPOLLOUT;
+  if (wanted == interest_) return;
+  if ((wanted ^ interest_) & EPOLLOUT) host_.unreadChanged(*this, (wanted & EPOLLOUT) != 0);
+  // Without any interest the descriptor leaves the set: epoll would go on reporting a hang-up.
+  if (wanted == 0)
+    host_.loop().remove(fd_, *this);
+  else if (interest_ == 0)
+    (void)host_.loop().add(fd_, wanted, *this);
+  else
+    host_.loop().modify(fd_, wanted, *this);
+  interest_ = wanted;
+}
+
+std::optional<Monotonic> SocketConnection::stallDeadline() const {
+  if (outOffset_ == out_.size() || lastProgress_ == Monotonic{}) return std::nullopt;
+  return lastProgress_ + host_.limits().stalledClientTimeout;
+}
+
+void SocketConnection::cutStalled() {
+  ++host_.counters().slowClientsCut;
+  out_.clear();
+  outOffset_ = 0;
+  const bool open = state_ == State::Open;
+  if (open)
+    sendError(std::nullopt, WireError::ReadsTooSlowly, "replies were not read for too long");
+  if (open) finishReading(End::Interrupted);
+  closeNow();
+}
+
+// ---------------------------------------------------------------------------------------------------------------------
+// The end
+
+void SocketConnection::fail(WireError code, std::string_view text) {
+  sendError(std::nullopt, code, text);
+  finishReading(End::Interrupted);
+}
+
+void SocketConnection::finishReading(End end) {
+  if (state_ != State::Open) return;
+  state_ = State::Draining;
+  in_ = {};
+  updateInterest();
+  // In their own turns on this connection's queue: the caller may be inside a front half.
+  queue_->async([self = shared_from_this(), end] {
+    if (end == End::Interrupted && self->interruption_) self->interruption_();
+    if (self->invalidation_) self->invalidation_();
+    self->interruption_ = nullptr;
+    self->invalidation_ = nullptr;
+    self->object_ = nullptr;  // calls under way hold it as long as they need it
+    self->wantFlush();
+  });
+}
+
+void SocketConnection::shutDown() {
+  if (state_ == State::Accepted) state_ = State::Open;
+  if (state_ != State::Open) return wantFlush();
+  // What the peer sent before now has been accepted: everything complete runs before the goodbye.
+  queue_->async([self = shared_from_this()] {
+    if (self->state_ != State::Open) return;
+    if (self->waitingForHost_ || self->mustPause()) {  // the listener's own deadline bounds this
+      self->queue_->asyncAfter(std::chrono::milliseconds(5), [self] { self->shutDown(); });
+      return;
+    }
+    const std::size_t before = self->in_.size() - self->inOffset_;
+    const uint64_t calls = self->host_.counters().calls;
+    self->readPass();
+    if (self->state_ != State::Open) return;
+    const bool moved =
+        self->in_.size() - self->inOffset_ != before || self->host_.counters().calls != calls;
+    if (moved) return self->shutDown();
+    self->sendGoodbye();
+    self->finishReading(End::Orderly);
+  });
+}
+
+void SocketConnection::shutDownNow() {
+  if (state_ == State::Accepted) state_ = State::Open;
+  sendGoodbye();
+  finishReading(End::Orderly);
+  wantFlush();
+}
+
+void SocketConnection::closeNow() {
+  if (state_ == State::Closed) return;
+  if (interest_ & EPOLLOUT) host_.unreadChanged(*this, false);
+  if (interest_ != 0) host_.loop().remove(fd_, *this);
+  interest_ = 0;
+  state_ = State::Closed;
+  ::close(fd_);
+  fd_ = -1;
+  host_.closed(*this);
+}
+
+}  // namespace vx::lnx
