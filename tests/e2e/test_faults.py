@@ -1,0 +1,288 @@
+"""Bad input and failing surroundings: each is answered, the other clients notice nothing, nothing accepted is lost."""
+import json
+import os
+import resource
+import signal
+import socket
+import struct
+import subprocess
+import time
+import unittest
+
+from harness import *
+
+
+class BadInput(DaemonTest):
+    def assert_refused(self, d, data, code):
+        c = d.client()
+        c.raw(data)
+        c.until_closed()
+        self.assertEqual(c.connection_error[:3], [ERROR, None, code], data[:40])
+
+    def test_broken_frames_close_that_connection_only(self):
+        d = self.daemon()
+        bystander = d.client()
+        bystander.started(1)
+        call = lambda payload: struct.pack("<I", len(payload)) + payload
+        send = encode([CALL, 1, SEND])[1:]
+        message = lambda body: call(b"\x87" + send + body + encode(3) + encode(1) + b"\xf6")
+        self.assert_refused(d, b"\xff\xff\xff\xff" + b"x" * 100, 2)
+        self.assert_refused(d, struct.pack("<I", (1 << 20) + 1), 2)
+        self.assert_refused(d, call(b"\x81" * 100000), 1)
+        for broken in (b"", b"\x80", b"\x81\xf6", b"\x9f\xff", b"\xa0", b"\x81\x01\x01", b"\x81\x18\x63"):
+            self.assert_refused(d, call(broken), 1)
+        for body in (b"\xa1\x61\xff\x01", b"\xa2\x61a\x01\x61a\x02", b"\xa1\x01\x01", b"\xa1\x61a\x41x",
+                     b"\xa1\x61a\xf6", b"\xa1\x61a\xc2\x41\x01", b"\xbb" + b"\xff" * 8, b"\xbf\xff",
+                     b"\xa1\x61a" + b"\x81" * 40 + b"\x01"):
+            self.assert_refused(d, message(body), 1)
+        self.assertIs(bystander.call(STOP, 1), True)
+        self.assert_unharmed(d)
+
+    def test_first_frame_must_be_a_hello_of_this_version(self):
+        d = self.daemon()
+        for data, code in ((frame(CALL, 1, REPORTERS), 1), (frame(HELLO, 2), 7), (frame(HELLO), 7)):
+            c = d.client(hello=False)
+            c.raw(data)
+            c.until_closed()
+            self.assertEqual(c.connection_error[2], code)
+
+    def test_wrong_calls_are_answered_and_do_nothing(self):
+        d = self.daemon()
+        c = d.client()
+        for arguments, code in (((12,), 3), ((0,), 3), ((-1,), 3), ((CREATE,), 4), ((CREATE, 1, 2), 4), ((CREATE, "1"), 4),
+                                ((CREATE, True), 4), ((CREATE, 1 << 63), 4), ((SET_TYPE, 65536, 1), 4),
+                                ((SET_TYPE, -1, 1), 4), ((SEND, [], 1, 1, None), 4), ((SEND, None, 1, 1, None), 4),
+                                ((SEND, {}, 1 << 32, 1, None), 4), ((SEND, {}, 1, 1, [1.5]), 4),
+                                ((SEND, {}, 1, 1, 7), 4), ((CONFIGURE, 3, 1), 4)):
+            f = c.answer(c.post(*arguments))
+            self.assertEqual((f[0], f[2]), (ERROR, code), arguments)
+            self.assertGreater(len(f[3]), 10)
+        self.assertEqual(c.call(REPORTERS), [])
+
+    def test_frames_in_pieces_and_cut_off_at_any_byte(self):
+        d = self.daemon()
+        whole = frame(HELLO, 1) + frame(CALL, 1, CREATE, 77) + frame(CALL, 2, SEND, {"key": "value"}, 3, 1, [77])
+        slow = d.client(hello=False)
+        for i in range(len(whole)):
+            slow.raw(whole[i:i + 1])
+        self.assertIsNone(slow.answer(2)[2])
+        for cut in range(1, len(whole)):
+            c = Client(d.socket_path, hello=False)
+            c.raw(whole[:cut])
+            c.close()
+        self.assert_unharmed(d)
+        self.assertEqual(slow.call(REPORTERS), [77])
+
+    def test_calls_before_a_goodbye_are_answered(self):
+        d = self.daemon()
+        c = d.client()
+        c.raw(frame(CALL, 1, CREATE, 1) + frame(CALL, 2, START, 1) + frame(CALL, 3, REPORTERS) + frame(GOODBYE)
+              + frame(CALL, 4, KILL))
+        c.until_closed()
+        self.assertEqual(c.answers[3][0][2], [1])
+        self.assertNotIn(4, c.answers)
+        d.wait_until(lambda: "removing" in d.log(), "the client is removed")
+        self.assertNotIn("InterruptionHandler", d.log())
+        self.assertIn("InvalidationHandler: connection exited process=", d.log())
+
+    def test_session_limit_is_an_answer_of_its_own(self):
+        d = self.daemon(config="[listener]\nmax_sessions_per_connection = 3\n")
+        c = d.client()
+        for i in (1, 2, 3, 3):
+            self.assertIs(c.call(CREATE, i), True)
+        self.assertEqual(c.answer(c.post(CREATE, 4))[2], 5)
+        self.assertIs(c.call(DESTROY, 1), True)
+        self.assertIs(c.call(CREATE, 4), True)
+        self.assertEqual(sorted(c.call(REPORTERS)), [2, 3, 4])
+
+    def test_more_connections_than_allowed(self):
+        d = self.daemon(config="[listener]\nmax_connections = 3\n")
+        d.wait_until(lambda: "removing" in d.log(), "the start-up probe is gone")
+        kept = [d.client() for _ in range(3)]
+        refused = d.client(hello=False).until_closed()
+        self.assertEqual(refused.connection_error[2], 6)
+        kept.pop().close()
+        d.wait_until(lambda: d.log().count("removing") >= 2, "its place is free")
+        self.assert_unharmed(d)
+
+    def test_client_that_never_reads_is_cut_and_harms_nobody(self):
+        d = self.daemon(config="[listener]\nstalled_client_timeout_ms = 300\n")
+        deaf = d.client()
+        for i in range(300):
+            deaf.post(CREATE, 1000000 + i)
+        deaf.socket.setblocking(False)
+        request = frame(CALL, 1, REPORTERS) * 1000
+        end = time.monotonic() + PATIENCE
+        cut = False
+        while not cut and time.monotonic() < end:
+            try:
+                deaf.socket.send(request)
+            except BlockingIOError:
+                self.assert_unharmed(d)
+                time.sleep(0.02)
+            except (BrokenPipeError, ConnectionResetError):
+                cut = True
+        self.assertTrue(cut, d.log()[-2000:])
+        self.assert_unharmed(d)
+
+    def test_descriptor_exhaustion(self):
+        d = self.daemon(preexec=lambda: resource.setrlimit(resource.RLIMIT_NOFILE, (48, 48)))
+        first = d.client()
+        crowd, refused = [], 0
+        for _ in range(80):
+            c = Client(d.socket_path, hello=False)
+            crowd.append(c)
+            c.raw(frame(HELLO, 1))
+            f = c.next_frame()
+            refused += f is not None and f[0] == ERROR and f[2] == 6
+        self.assertGreater(refused, 20)
+        first.started(5)
+        self.assertIsNone(first.call(SEND, {"a": 1}, 3, 1, [5]))
+        for c in crowd:
+            c.close()
+        d.wait_until(lambda: d.log().count("removing") >= len(crowd) - refused, "the crowd has gone")
+        self.assert_unharmed(d)
+        self.assertEqual(d.stop(), 0)
+        self.assertEqual(d.rows("SELECT count(*) FROM relay_messages WHERE category = 3"), [(1,)])
+
+
+class Surroundings(DaemonTest):
+    def test_killed_client_in_mid_session(self):
+        d = self.daemon()
+        script = (f"import sys, time; sys.path.insert(0, {os.path.dirname(os.path.abspath(__file__))!r})\n"
+                  f"from harness import *\nc = Client({d.socket_path!r}); c.started(6, 2)\n"
+                  "c.call(SEND, {'a': 1}, 3, 1, [6])\nprint('ready', flush=True); time.sleep(60)\n")
+        child = subprocess.Popen(["python3", "-c", script], stdout=subprocess.PIPE)
+        self.addCleanup(child.stdout.close)
+        self.assertEqual(child.stdout.readline(), b"ready\n")
+        child.kill()
+        child.wait()
+        d.wait_until(lambda: f"removing {child.pid} from the server client list" in d.log(), "the client is removed")
+        self.assertIn("InterruptionHandler: connection exited", d.log())
+        self.assert_unharmed(d)
+        self.assertEqual(d.stop(), 0)
+        self.assertEqual(d.rows("SELECT category FROM relay_messages ORDER BY id"), [(3,), (0xFFFF,)])
+        self.assertEqual(len(d.rows("SELECT 1 FROM analytics_events WHERE name LIKE '%clientuptime'"
+                                    " AND json_extract(payload, '$.processName') LIKE 'python%'")), 3)
+
+    def test_sigterm_with_a_hundred_started_sessions(self):
+        d = self.daemon()
+        clients = [d.client() for _ in range(10)]
+        for i, c in enumerate(clients):
+            for j in range(10):
+                c.started(100 + 10 * i + j, 8)
+                c.post(SEND, {"n": j}, 3, 0, [100 + 10 * i + j])
+        for c in clients:
+            c.raw(frame(CALL, 999, SEND, {"last": True}, 11, 0, [100 + 10 * clients.index(c)]))
+        self.assertEqual(d.stop(), 0)
+        for c in clients:
+            c.until_closed()
+            self.assertTrue(c.goodbye)
+        self.assertEqual(d.rows("SELECT category, count(*) FROM relay_messages GROUP BY 1 ORDER BY 1"),
+                         [(3, 100), (11, 10), (0xFFFF, 100)])
+        self.assertFalse(os.path.exists(d.socket_path))
+
+    def test_second_daemon_is_refused(self):
+        d = self.daemon()
+        c = d.client()
+        c.started(1)
+        for changed in ({}, {"RUNTIME_DIRECTORY": d.folder + "/log"}):
+            second = subprocess.run([DAEMON], env=dict(d.environment, **changed), stderr=subprocess.PIPE, timeout=PATIENCE)
+            self.assertEqual(second.returncode, 1)
+            self.assertIn(b"another", second.stderr)
+        self.assertIsNone(c.call(SEND, {"a": 1}, 3, 1, [1]))
+        self.assert_unharmed(d)
+
+    def test_unusable_directories_are_named(self):
+        d = self.daemon()
+        d.stop()
+        for name in ("RUNTIME_DIRECTORY", "STATE_DIRECTORY"):
+            path = d.folder + "/file"
+            open(path, "w").close()
+            got = subprocess.run([DAEMON], env=dict(d.environment, **{name: path + "/x"}), stderr=subprocess.PIPE,
+                                 timeout=PATIENCE)
+            self.assertEqual(got.returncode, 1)
+            self.assertIn(path.encode(), got.stderr)
+
+    def test_garbage_database_is_moved_aside(self):
+        d = self.daemon()
+        d.stop()
+        with open(d.database, "wb") as f:
+            f.write(b"not a database " * 1000)
+        d.start()
+        c = d.client()
+        c.started(1)
+        c.call(SEND, {"a": 1}, 3, 1, [1])
+        self.assertEqual(d.stop(), 0)
+        self.assertEqual(d.rows("SELECT count(*) FROM relay_messages WHERE category = 3"), [(1,)])
+        self.assertTrue(d.rows("SELECT * FROM store_ledger"))
+        aside = [n for n in os.listdir(d.folder + "/state") if n.startswith("telemetry.db.damaged")]
+        self.assertEqual(len(aside), 1)
+        with open(f"{d.folder}/state/{aside[0]}", "rb") as f:
+            self.assertTrue(f.read().startswith(b"not a database"))
+
+    def test_full_disk_keeps_what_was_accepted(self):
+        d = self.daemon()
+        c = d.client()
+        c.started(1)
+        c.call(SEND, {"i": -1}, 3, 1, [1])
+        d.wait_until(lambda: d.rows("SELECT count(*) FROM relay_messages") == [(1,)], "the first message is stored")
+        # No file of the daemon may grow any more: to SQLite that is a full disk.
+        resource.prlimit(d.process.pid, resource.RLIMIT_FSIZE, (4096, resource.RLIM_INFINITY))
+        for i in range(200):
+            self.assertIsNone(c.call(SEND, {"i": i}, 3, 1, [1]))
+        d.wait_until(lambda: "<3>" in d.log(), "the failure is in the log")
+        self.assert_unharmed(d)
+        resource.prlimit(d.process.pid, resource.RLIMIT_FSIZE, (resource.RLIM_INFINITY, resource.RLIM_INFINITY))
+        self.assertEqual(d.stop(), 0)
+        self.assertEqual(d.rows("SELECT count(*), count(DISTINCT json_extract(payload, '$.i')) FROM relay_messages"
+                                " WHERE category = 3"), [(201, 201)])
+
+    def test_full_queue_pauses_reading_and_loses_nothing(self):
+        d = self.daemon(config="[store]\nqueue_bytes = 65536\n")
+        c = d.client()
+        c.started(1)
+        posts = [c.post(SEND, {"i": i, "text": "x" * 500}, 3, 1, [1]) for i in range(500)]
+        for n in posts:
+            self.assertIsNone(c.answer(n)[2])
+        self.assertEqual(d.stop(), 0)
+        self.assertEqual(d.rows("SELECT count(*) FROM relay_messages WHERE category = 3"), [(500,)])
+
+    def test_socket_activation_and_readiness(self):
+        folder = tempfile.mkdtemp(prefix="vx")
+        os.makedirs(folder + "/run")
+        notify = socket.socket(socket.AF_UNIX, socket.SOCK_DGRAM)
+        notify.bind(folder + "/notify")
+        notify.settimeout(PATIENCE)
+        self.addCleanup(notify.close)
+        listener = socket.socket(socket.AF_UNIX, socket.SOCK_STREAM)
+        listener.bind(folder + "/run/service.socket")
+        listener.listen(16)
+        self.addCleanup(listener.close)
+
+        def activate():
+            os.dup2(listener.fileno(), 3)
+            os.set_inheritable(3, True)
+            os.environ["LISTEN_PID"] = str(os.getpid())
+
+        # LISTEN_PID must be the daemon's own: a shell sets it and becomes the daemon.
+        import harness
+        wrapper = folder + "/activate"
+        with open(wrapper, "w") as f:
+            f.write(f'#!/bin/sh\nLISTEN_PID=$$ LISTEN_FDS=1 exec "{DAEMON}"\n')
+        os.chmod(wrapper, 0o755)
+        harness.DAEMON, saved = wrapper, harness.DAEMON
+        try:
+            d = self.daemon(folder=folder, wait=False, preexec=activate,
+                            environment={"NOTIFY_SOCKET": folder + "/notify"})
+        finally:
+            harness.DAEMON = saved
+        self.assertIn(b"READY=1", notify.recv(4096))
+        self.assert_unharmed(d)
+        self.assertEqual(d.stop(), 0)
+        self.assertIn(b"STOPPING=1", notify.recv(4096))
+        self.assertTrue(os.path.exists(folder + "/run/service.socket"))  # the service manager's to remove
+
+
+if __name__ == "__main__":
+    unittest.main()
