@@ -1,5 +1,5 @@
-// Appends CBOR items (RFC 8949, preferred encodings, definite lengths) to a byte buffer. The caller
-// keeps counts right.
+// Appends CBOR items (RFC 8949, definite lengths, the shortest heads) to a byte buffer. The caller
+// keeps counts right; single and double floats keep their width, so that the kinds stay apart.
 #pragma once
 
 #include <cstdint>
@@ -20,8 +20,8 @@ class CborWriter {
   void doubleFloat(double value);
   void boolean(bool value) { out_.push_back(value ? 0xF5 : 0xF4); }
   void null() { out_.push_back(0xF6); }
-  void string(std::string_view value);
-  void date(double secondsSince1970);
+  void string(std::string_view value);  // bytes that are not UTF-8 become U+FFFD
+  void date(double secondsSince1970);   // 1970 when not finite
   void encoded(std::span<const uint8_t> item) { out_.insert(out_.end(), item.begin(), item.end()); }
 
  private:

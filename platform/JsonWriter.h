@@ -1,6 +1,6 @@
 // Streams JSON text (RFC 8259) of property lists: compact for the store, pretty for files. Constant
-// memory beyond the caller's buffer. Dates become text ("2026-11-21T03:46:00Z"); keys are not
-// sorted.
+// memory beyond the caller's buffer. Dates become text ("2026-11-21T03:46:00Z"), booleans true and
+// false, numbers their text as Value::appendText has it; keys are not sorted.
 #pragma once
 
 #include <cstddef>
@@ -22,6 +22,7 @@ enum class NonFinite {
 // Compact: no white space.
 void appendJson(std::string& out, const Payload& payload, NonFinite nonFinite = NonFinite::AsText);
 void appendJson(std::string& out, const Value& value, NonFinite nonFinite = NonFinite::AsText);
+// Bytes that are not UTF-8 become U+FFFD.
 void appendJsonString(std::string& out, std::string_view text);
 // Pretty: two blanks a level, "key" : value separated as `"key": value`; the first line is not
 // indented, the others by `indent` levels at least.

@@ -20,7 +20,6 @@
 #include <span>
 #include <string>
 #include <string_view>
-#include <unordered_map>
 #include <utility>
 #include <vector>
 
@@ -52,7 +51,8 @@ class Value {
   bool isDictionary() const { return kind() == ValueKind::Dictionary; }
 
   // Numbers (and Boolean as 1 and 0, and Date as its seconds) as another number type. Truncates
-  // toward zero and saturates at the ends of the range; NaN gives 0. Every other kind gives 0.
+  // toward zero and saturates at the ends of the range; as an integer, NaN gives 0. Every other
+  // kind gives 0.
   int64_t asInt64() const;
   uint64_t asUInt64() const;
   double asDouble() const;
@@ -65,10 +65,11 @@ class Value {
   // The value's own CBOR bytes.
   std::span<const uint8_t> encoded() const { return {begin_, end_}; }
 
-  // Text of a value: decimal integers, shortest round-trip floating numbers ("nan", "inf", "-inf"
-  // for those), booleans as 1 and 0, strings as themselves, dates as "2026-11-21T03:46:00Z" (with a
-  // fraction when there is one), arrays as (a,b,c), dictionaries as {key=value,key=value}. Equal
-  // values have equal text.
+  // Text of a value: decimal integers, shortest round-trip floating numbers (3 and 3.0 are both
+  // "3"; "nan", "inf", "-inf" for those), booleans as 1 and 0, strings as themselves, dates as
+  // "2026-11-21T03:46:00Z" (with a fraction when there is one; outside of the years 0000 to 9999 as
+  // their seconds), arrays as (a,b,c), dictionaries as {key=value,key=value}. Equal values have
+  // equal text.
   void appendText(std::string& out) const;
   std::string text() const {
     std::string out;
@@ -223,6 +224,11 @@ class ArrayBuilder;
 
 // Builds a Payload. set() under a key that is there already replaces the value and keeps the
 // entry's place. Any number of entries costs amortised constant time each.
+//
+// What is put in always makes a valid Payload: bytes that are not UTF-8 become U+FFFD, a date that
+// is not finite becomes 1970, a Null value changes nothing. Nesting is the caller's affair: one
+// deeper than Payload::kMaxNesting can be built and written, but no peer will accept it.
+// std::length_error beyond 2 GiB.
 class PayloadBuilder {
  public:
   PayloadBuilder() = default;
@@ -255,21 +261,41 @@ class PayloadBuilder {
   // Adds every entry of `from`, replacing values under keys that are there already.
   PayloadBuilder& merge(const Payload& from);
 
-  std::size_t size() const { return count_; }
+  std::size_t size() const { return entries_.size(); }
   Payload build() const;
 
  private:
+  // Where an entry lies in body_. The value follows its key, unless a replaced value of another
+  // size moved it to the end.
+  struct Entry {
+    uint32_t key = 0;
+    uint32_t value = 0;
+    uint32_t valueEnd = 0;
+    uint32_t hash = 0;
+  };
+
   PayloadBuilder& setBoolean(std::string_view key, bool value);
   PayloadBuilder& setInteger(std::string_view key, int64_t value);
   PayloadBuilder& setUnsigned(std::string_view key, uint64_t value);
-  PayloadBuilder& setEncoded(std::string_view key, std::span<const uint8_t> value);
+  template <typename Write>
+  PayloadBuilder& put(std::string_view key, Write write);
+  std::string_view keyOf(const Entry& entry) const;
+  Entry* find(std::string_view key, uint32_t hash);
+  void add(std::string_view key, const Entry& entry);
+  void replace(Entry& entry, std::size_t value);
+  void index(std::size_t entry);
+  void growIndex();
+  void compact();
 
-  // One key-and-value after the other, encoded. An index of the keys is made once there are enough
-  // to be worth it.
+  // Keys and values one after the other, encoded. A value that was replaced may stay as dead bytes
+  // until there are as many of them as living ones.
   std::vector<uint8_t> body_;
-  std::size_t count_ = 0;
-  std::unordered_multimap<std::size_t, std::size_t>
-      index_;  // key hash -> offset of the entry in body_
+  std::vector<Entry> entries_;  // in insertion order
+  std::vector<uint32_t>
+      slots_;  // open addressing: number of an entry + 1; empty while they are few
+  std::size_t deadBytes_ = 0;
+  bool inOrder_ = true;  // body_ is the dictionary's encoding as it stands
+  bool spaceInKeys_ = false;
 };
 
 class ArrayBuilder {
