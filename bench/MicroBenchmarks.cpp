@@ -1,0 +1,129 @@
+// The steps of a message's road by themselves, one benchmark each.
+#include <benchmark/benchmark.h>
+
+#include <cstring>
+#include <string>
+#include <vector>
+
+#include "bench/Workload.h"
+#include "platform/CborWriter.h"
+#include "platform/JsonWriter.h"
+#include "platform/Payload.h"
+#include "platform/linux/Executor.h"
+
+namespace vx::bench {
+namespace {
+
+std::vector<uint8_t> workloadFrame() {
+  std::vector<uint8_t> frame;
+  CborWriter writer(frame);
+  writer.array(7);
+  writer.integer(1);
+  writer.integer(100000);
+  writer.integer(6);
+  writer.encoded(workloadPayload(1).encoded());
+  writer.integer(kWorkloadCategory);
+  writer.integer(kWorkloadType);
+  writer.null();
+  return frame;
+}
+
+void memcpyOfPayload(benchmark::State& state) {  // the floor of everything below
+  const Payload payload = workloadPayload(1);
+  std::vector<uint8_t> to(payload.encoded().size());
+  for (auto _ : state) {
+    std::memcpy(to.data(), payload.encoded().data(), to.size());
+    benchmark::DoNotOptimize(to.data());
+    benchmark::ClobberMemory();
+  }
+}
+BENCHMARK(memcpyOfPayload);
+
+void decodeFrame(benchmark::State& state) {
+  const std::vector<uint8_t> frame = workloadFrame();
+  for (auto _ : state) benchmark::DoNotOptimize(FrameDecoder::decode(frame));
+}
+BENCHMARK(decodeFrame);
+
+void decodeFrameAndKeepPayload(benchmark::State& state) {
+  const std::vector<uint8_t> frame = workloadFrame();
+  for (auto _ : state) {
+    auto at = FrameDecoder::decode(frame)->begin();
+    ++ ++ ++at;
+    benchmark::DoNotOptimize(Payload::copyOf(*at));
+  }
+}
+BENCHMARK(decodeFrameAndKeepPayload);
+
+void buildPayload(benchmark::State& state) {
+  for (auto _ : state) benchmark::DoNotOptimize(workloadPayload(7));
+}
+BENCHMARK(buildPayload);
+
+void findLastKey(benchmark::State& state) {
+  const Payload payload = workloadPayload(1);
+  for (auto _ : state) benchmark::DoNotOptimize(payload.find("is_spatialized"));
+}
+BENCHMARK(findLastKey);
+
+void addOneEntry(benchmark::State& state) {  // what the analytics sink does to a message
+  const Payload payload = workloadPayload(1);
+  for (auto _ : state) {
+    benchmark::DoNotOptimize(
+        PayloadBuilder(payload).set("HostApplicationDisplayID", "Unknown").build());
+  }
+}
+BENCHMARK(addOneEntry);
+
+void writeJson(benchmark::State& state) {
+  const Payload payload = workloadPayload(1);
+  std::string json;
+  for (auto _ : state) {
+    json.clear();
+    appendJson(json, payload);
+    benchmark::DoNotOptimize(json.data());
+  }
+}
+BENCHMARK(writeJson);
+
+void textOfEveryValue(benchmark::State& state) {  // what the summary event is made of
+  const Payload payload = workloadPayload(1);
+  std::string text;
+  for (auto _ : state) {
+    text.clear();
+    for (const auto& [key, value] : payload) value.appendText(text);
+    benchmark::DoNotOptimize(text.data());
+  }
+  state.SetItemsProcessed(state.iterations() * static_cast<int64_t>(kEntriesPerPayload));
+}
+BENCHMARK(textOfEveryValue);
+
+void queueAndRunInteractive(benchmark::State& state) {
+  lnx::Executor executor;
+  executor.adoptInteractiveThread();
+  const auto queue = executor.makeSerial("bench", QualityOfService::UserInteractive);
+  const auto owner = std::make_shared<int>(0);
+  for (auto _ : state) {
+    queue->async([owner] { ++*owner; });
+    executor.runInteractive(16);
+  }
+  executor.stop({});
+}
+BENCHMARK(queueAndRunInteractive);
+
+void queueToUtilityLane(benchmark::State& state) {
+  lnx::Executor executor;
+  const auto queue = executor.makeSerial("bench", QualityOfService::Utility);
+  const auto owner = std::make_shared<std::atomic<int>>(0);
+  for (auto _ : state) {
+    queue->async([owner] { owner->fetch_add(1, std::memory_order_relaxed); });
+    while (executor.utilityBacklog() > 100000) {
+    }
+  }
+  executor.drain(Monotonic::max());
+  executor.stop(Monotonic::max());
+}
+BENCHMARK(queueToUtilityLane);
+
+}  // namespace
+}  // namespace vx::bench
