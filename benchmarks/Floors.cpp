@@ -1,4 +1,4 @@
-#include "bench/Floors.h"
+#include "benchmarks/Floors.h"
 
 #include <sched.h>
 #include <signal.h>
@@ -13,7 +13,7 @@
 #include <stdexcept>
 #include <thread>
 
-#include "bench/Workload.h"
+#include "benchmarks/Workload.h"
 #include "platform/JsonWriter.h"
 
 namespace vx::bench {

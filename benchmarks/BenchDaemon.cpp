@@ -1,4 +1,4 @@
-#include "bench/BenchDaemon.h"
+#include "benchmarks/BenchDaemon.h"
 
 #include <fcntl.h>
 #include <poll.h>

@@ -1,4 +1,4 @@
-#include "bench/Results.h"
+#include "benchmarks/Results.h"
 
 #include <algorithm>
 #include <cmath>

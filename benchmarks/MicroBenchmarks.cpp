@@ -5,7 +5,7 @@
 #include <string>
 #include <vector>
 
-#include "bench/Workload.h"
+#include "benchmarks/Workload.h"
 #include "platform/CborWriter.h"
 #include "platform/JsonWriter.h"
 #include "platform/Payload.h"

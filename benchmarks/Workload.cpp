@@ -1,4 +1,4 @@
-#include "bench/Workload.h"
+#include "benchmarks/Workload.h"
 
 #include <cstdio>
 #include <string>

@@ -1,0 +1,518 @@
+#include "benchmarks/Measurements.h"
+
+#include <sqlite3.h>
+#include <sys/resource.h>
+
+#include <algorithm>
+#include <atomic>
+#include <chrono>
+#include <cstdio>
+#include <fstream>
+#include <memory>
+#include <stdexcept>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "benchmarks/BenchDaemon.h"
+#include "benchmarks/Floors.h"
+#include "benchmarks/RawClient.h"
+#include "benchmarks/Workload.h"
+#include "client/ReportingClient.h"
+
+namespace vx::bench {
+
+namespace {
+
+using SteadyClock = std::chrono::steady_clock;
+
+double secondsSince(SteadyClock::time_point start) {
+  return std::chrono::duration<double>(SteadyClock::now() - start).count();
+}
+
+void progress(const std::string& text) {
+  std::printf("  ... %s\n", text.c_str());
+  std::fflush(stdout);
+}
+
+std::vector<std::vector<uint8_t>> workloadFrames(const int64_t* reporter = nullptr) {
+  std::vector<std::vector<uint8_t>> frames;
+  for (const Payload& payload : workloadPayloads(64)) {
+    frames.push_back(RawClient::messageFrame(payload, reporter));
+  }
+  return frames;
+}
+
+// Reads the daemon's database as an analyst would.
+class StoreReader {
+ public:
+  explicit StoreReader(const std::string& path) {
+    if (sqlite3_open_v2(path.c_str(), &database_, SQLITE_OPEN_READONLY, nullptr) != SQLITE_OK) {
+      throw std::runtime_error("cannot open " + path);
+    }
+    sqlite3_busy_timeout(database_, 5000);
+  }
+  ~StoreReader() { sqlite3_close(database_); }
+  StoreReader(const StoreReader&) = delete;
+  StoreReader& operator=(const StoreReader&) = delete;
+
+  int64_t lastRow(const std::string& table) {
+    sqlite3_stmt* statement = nullptr;
+    sqlite3_prepare_v2(database_, ("SELECT max(id) FROM " + table).c_str(), -1, &statement,
+                       nullptr);
+    const int64_t last =
+        sqlite3_step(statement) == SQLITE_ROW ? sqlite3_column_int64(statement, 0) : 0;
+    sqlite3_finalize(statement);
+    return last;
+  }
+  void waitFor(int64_t relayRows, int64_t analyticsRows) {
+    const auto end = SteadyClock::now() + std::chrono::seconds(120);
+    while (lastRow("relay_messages") < relayRows || lastRow("analytics_events") < analyticsRows) {
+      if (SteadyClock::now() > end)
+        throw std::runtime_error("the store did not take every row in time");
+      std::this_thread::sleep_for(std::chrono::milliseconds(2));
+    }
+  }
+
+ private:
+  sqlite3* database_ = nullptr;
+};
+
+std::vector<double> timedRoundTrips(RawClient& client,
+                                    const std::vector<std::vector<uint8_t>>& frames,
+                                    std::size_t count) {
+  std::vector<double> times;
+  times.reserve(count);
+  for (std::size_t i = 0; i < count; ++i) {
+    const auto start = SteadyClock::now();
+    client.sendOnce(frames[i % frames.size()]);
+    times.push_back(secondsSince(start) * 1e9);
+  }
+  return times;
+}
+
+}  // namespace
+
+Effort Effort::quickEffort() {
+  Effort effort;
+  effort.quick = true;
+  effort.roundTripsPerRound = 5000;
+  effort.sustainedMessages = 250000;
+  effort.idleSeconds = 5;
+  return effort;
+}
+
+void measureStart(Results& results, const Effort& effort) {
+  progress("start to ready");
+  std::vector<double> times;
+  for (std::size_t i = 0; i < effort.rounds + 1; ++i) {
+    BenchDaemon daemon;
+    if (i > 0) times.push_back(daemon.startToReadyMs());  // the first one warms the file cache
+    daemon.stop();
+  }
+  results.add({.name = "start_to_ready_ms",
+               .value = median(times),
+               .unit = "ms",
+               .floor = {},
+               .ratio = {},
+               .reach = {},
+               .what = "process start until it says that it is ready"},
+              60, 20, false);
+}
+
+void measureRoundTrip(Results& results, const Effort& effort) {
+  progress("round trips on one CPU");
+  constexpr int kCpu = 0;
+  DaemonOptions options;
+  options.cpu = kCpu;
+  BenchDaemon daemon(options);
+  EchoFloor echo(callBytes(workloadPayload(1)), kReplyBytes, kCpu);
+  pinThisThread(kCpu);
+  RawClient client(daemon.socketPath());
+  client.create(1);
+  client.start(1);
+  const auto frames = workloadFrames();
+  timedRoundTrips(client, frames, 2000);
+  echo.roundTrips(2000);
+  std::vector<double> p50, p99, floor50, floor99, ratio50, ratio99;
+  for (std::size_t round = 0; round < effort.rounds; ++round) {
+    const std::vector<double> floor = echo.roundTrips(effort.roundTripsPerRound);
+    const std::vector<double> times = timedRoundTrips(client, frames, effort.roundTripsPerRound);
+    p50.push_back(percentile(times, 0.5));
+    p99.push_back(percentile(times, 0.99));
+    floor50.push_back(percentile(floor, 0.5));
+    floor99.push_back(percentile(floor, 0.99));
+    ratio50.push_back(p50.back() / floor50.back());
+    ratio99.push_back(p99.back() / floor99.back());
+  }
+  pinThisThread(-1);
+  results.add(
+      {.name = "roundtrip_p50_same_cpu",
+       .value = median(p50),
+       .unit = "ns",
+       .floor = median(floor50),
+       .ratio = median(ratio50),
+       .reach = {},
+       .what = "one sendMessage at a time into a started session, client and daemon on one CPU"},
+      1.6, 1.25, false);
+  results.add({.name = "roundtrip_p99_same_cpu",
+               .value = median(p99),
+               .unit = "ns",
+               .floor = median(floor99),
+               .ratio = median(ratio99),
+               .reach = {},
+               .what = "the same, 99th percentile"},
+              2.0, 1.4, false);
+}
+
+void measureAccepted(Results& results, const Effort& effort) {
+  progress("bursts of messages into an idle store");
+  constexpr std::size_t kWindow = 256;
+  BenchDaemon daemon;
+  EchoFloor echo(callBytes(workloadPayload(1)), kReplyBytes, -1);
+  RawClient client(daemon.socketPath());
+  client.create(1);
+  client.start(1);
+  const auto frames = workloadFrames();
+  client.pump(frames, effort.burstMessages, kWindow);
+  std::vector<double> rates, floors, ratios;
+  for (std::size_t round = 0; round < effort.rounds; ++round) {
+    daemon.waitUntilIdle();
+    floors.push_back(echo.messagesPerSecond(effort.burstMessages, kWindow));
+    const auto start = SteadyClock::now();
+    client.pump(frames, effort.burstMessages, kWindow);
+    rates.push_back(static_cast<double>(effort.burstMessages) / secondsSince(start));
+    ratios.push_back(rates.back() / floors.back());
+  }
+  results.add({.name = "accepted_per_s",
+               .value = median(rates),
+               .unit = "1/s",
+               .floor = median(floors),
+               .ratio = median(ratios),
+               .reach = {},
+               .what = "256 calls outstanding, replies counted, bursts of 30,000 messages, store "
+                       "idle before each"},
+              0.8, 1.5, true);
+}
+
+void measureSustained(Results& results, const Effort& effort) {
+  constexpr std::size_t kWindow = 256;
+  BenchDaemon daemon;
+  SqliteFloor sqlite(daemon.folder());
+  RawClient client(daemon.socketPath());
+  client.create(1);
+  client.start(1);
+  const auto frames = workloadFrames();
+  // Buffers reach their working size before memory is measured.
+  constexpr std::size_t kWarmUp = 50000;
+  client.pump(frames, kWarmUp, kWindow);
+  StoreReader store(daemon.databasePath());
+  auto rows = static_cast<int64_t>(kWarmUp);
+  store.waitFor(rows, rows);
+  sqlite.run(kWarmUp);
+  daemon.waitUntilIdle();
+  const uint64_t memoryBefore = daemon.anonymousBytes();
+  std::vector<double> rates, floors, ratios, cpu, cpuFloors, cpuRatios;
+  const std::size_t perRound = effort.sustainedMessages / effort.rounds;
+  for (std::size_t round = 0; round < effort.rounds; ++round) {
+    progress("sustained messages, round " + std::to_string(round + 1) + " of " +
+             std::to_string(effort.rounds));
+    const SqliteFloorResult floor = sqlite.run(perRound);
+    const double cpuBefore = daemon.cpuSeconds();
+    const auto start = SteadyClock::now();
+    client.pump(frames, perRound, kWindow);
+    rows += static_cast<int64_t>(perRound);
+    store.waitFor(rows, rows);
+    rates.push_back(static_cast<double>(perRound) / secondsSince(start));
+    cpu.push_back((daemon.cpuSeconds() - cpuBefore) * 1e6 / static_cast<double>(perRound));
+    floors.push_back(floor.rowsPerSecond);
+    cpuFloors.push_back(floor.cpuMicrosecondsPerRow);
+    ratios.push_back(rates.back() / floors.back());
+    cpuRatios.push_back(cpu.back() / cpuFloors.back());
+  }
+  daemon.waitUntilIdle();
+  const double memory = static_cast<double>(daemon.anonymousBytes() - memoryBefore) /
+                        static_cast<double>(perRound * effort.rounds);
+  const auto encoded = static_cast<double>(workloadPayload(1).encoded().size());
+  results.add(
+      {.name = "stored_per_s",
+       .value = median(rates),
+       .unit = "1/s",
+       .floor = median(floors),
+       .ratio = median(ratios),
+       .reach = {},
+       .what =
+           "messages whose two rows are committed, sustained, against rows of a bare SQLite loop"},
+      0.35, 0.5, true);
+  results.add({.name = "daemon_cpu_us_per_message",
+               .value = median(cpu),
+               .unit = "us",
+               .floor = median(cpuFloors),
+               .ratio = median(cpuRatios),
+               .reach = {},
+               .what = "all threads of the daemon, against the bare SQLite loop's CPU per row"},
+              3.0, 2.0, false);
+  results.add(
+      {.name = "bytes_per_aggregated_message",
+       .value = memory,
+       .unit = "B",
+       .floor = encoded,
+       .ratio = {},
+       .reach = {},
+       .what = "growth of anonymous memory per message kept by one session, over its encoding"},
+      1.5, 1.15, false);
+  results.note("memcpy_of_payload_ns", memcpyNanoseconds(static_cast<std::size_t>(encoded)), "ns",
+               "copying one payload's bytes");
+}
+
+void measureIdle(Results& results, const Effort& effort) {
+  progress("an idle daemon for " + std::to_string(effort.idleSeconds) + " s");
+  BenchDaemon daemon;
+  RawClient client(daemon.socketPath());
+  daemon.waitUntilIdle();
+  results.add({.name = "idle_rss_mib",
+               .value = static_cast<double>(daemon.residentBytes()) / (1 << 20),
+               .unit = "MiB",
+               .floor = {},
+               .ratio = {},
+               .reach = {},
+               .what = "resident memory with one client connected"},
+              7, 4.5, false);
+  client.create(1);
+  client.start(1);
+  daemon.waitUntilIdle();
+  std::this_thread::sleep_for(std::chrono::seconds(1));
+  const uint64_t before = daemon.voluntarySwitches();
+  std::this_thread::sleep_for(std::chrono::seconds(effort.idleSeconds));
+  const double wakeups = static_cast<double>(daemon.voluntarySwitches() - before) * 60.0 /
+                         static_cast<double>(effort.idleSeconds);
+  results.add(
+      {.name = "idle_wakeups_per_minute",
+       .value = wakeups,
+       .unit = "1/min",
+       .floor = {},
+       .ratio = {},
+       .reach = {},
+       .what = "voluntary context switches of all threads, one idle client, one started session"},
+      0, 0, false);
+}
+
+void measureSessions(Results& results, const Effort&) {
+  progress("10,000 sessions that wait to be started");
+  constexpr int64_t kSessions = 10000;
+  BenchDaemon daemon;
+  RawClient client(daemon.socketPath());
+  const Payload configuration =
+      PayloadBuilder().set("HostApplicationDisplayID", "com.example.player").build();
+  auto make = [&](int64_t reporter) {
+    client.create(reporter);
+    client.setServiceType(7, reporter);
+    client.configure(configuration, reporter);
+  };
+  make(kSessions + 1);
+  daemon.waitUntilIdle();
+  const uint64_t before = daemon.anonymousBytes();
+  for (int64_t reporter = 1; reporter <= kSessions; ++reporter) make(reporter);
+  daemon.waitUntilIdle();
+  results.add({.name = "bytes_per_idle_session",
+               .value = static_cast<double>(daemon.anonymousBytes() - before) / kSessions,
+               .unit = "B",
+               .floor = {},
+               .ratio = {},
+               .reach = {},
+               .what = "growth over 10,000 created and configured sessions"},
+              2048, 1024, false);
+}
+
+void measureStop(Results& results, const Effort& effort) {
+  constexpr std::size_t kMessages = 200000;
+  DaemonOptions options;
+  options.internalBuild = true;
+  std::vector<double> perValue, stalls;
+  const std::size_t rounds = effort.quick ? 3 : effort.rounds;
+  for (std::size_t round = 0; round < rounds; ++round) {
+    progress("stopping a session of 200,000 messages, round " + std::to_string(round + 1) + " of " +
+             std::to_string(rounds));
+    BenchDaemon daemon(options);
+    RawClient client(daemon.socketPath());
+    RawClient other(daemon.socketPath());
+    client.create(1);
+    client.start(1);
+    client.pump(workloadFrames(), kMessages, 256);
+    StoreReader store(daemon.databasePath());
+    store.waitFor(static_cast<int64_t>(kMessages), static_cast<int64_t>(kMessages));
+    daemon.waitUntilIdle();
+    // A second client asks for something small over and over; its longest wait is the stall.
+    std::atomic<bool> done{false};
+    double longest = 0;
+    std::thread second([&] {
+      while (!done.load()) {
+        const auto start = SteadyClock::now();
+        other.create(99);
+        longest = std::max(longest, secondsSince(start) * 1e3);
+        std::this_thread::sleep_for(std::chrono::milliseconds(1));
+      }
+    });
+    std::this_thread::sleep_for(std::chrono::milliseconds(20));
+    const auto start = SteadyClock::now();
+    client.stop(1);
+    perValue.push_back(secondsSince(start) * 1e9 /
+                       static_cast<double>(kMessages * kEntriesPerPayload));
+    done.store(true);
+    second.join();
+    stalls.push_back(longest);
+  }
+  results.add({.name = "stop_ns_per_value",
+               .value = median(perValue),
+               .unit = "ns",
+               .floor = {},
+               .ratio = {},
+               .reach = {},
+               .what = "stop call to its reply with 200,000 messages, summary and file included"},
+              150, 60, false);
+  results.note("stall_ms_while_stopping", median(stalls), "ms",
+               "longest answer a second client waits for meanwhile (aim: under 50)");
+}
+
+void measureClientSend(Results& results, const Effort& effort) {
+  progress("the client library's non-blocking send");
+  BenchDaemon daemon;
+  ReportingClient client;
+  if (!client.connect(daemon.socketPath()).ok())
+    throw std::runtime_error("the client cannot connect");
+  client.createReportingSession(1);
+  const std::vector<Payload> payloads = workloadPayloads(64);
+  const std::vector<int64_t> nobody{
+      0};  // routed to no session: the daemon's work stays out of the way
+  constexpr std::size_t kBatch = 64;
+  std::vector<double> times;
+  std::size_t answered = 0;
+  std::size_t sent = 0;
+  for (std::size_t i = 0; i < effort.roundTripsPerRound; ++i) {
+    const auto start = SteadyClock::now();
+    for (std::size_t k = 0; k < kBatch; ++k) {
+      client.sendMessageAsync(payloads[k], kWorkloadCategory, kWorkloadType, nobody,
+                              [&answered](const auto&) { ++answered; });
+    }
+    times.push_back(secondsSince(start) * 1e9 / static_cast<double>(kBatch));
+    sent += kBatch;
+    while (answered < sent) client.process();
+  }
+  results.add({.name = "client_send_ns",
+               .value = median(times),
+               .unit = "ns",
+               .floor = {},
+               .ratio = {},
+               .reach = {},
+               .what = "time inside the client library's non-blocking send"},
+              500, 200, false);
+}
+
+void measureConnections(Results& results, const Effort&) {
+  progress("10,000 connections");
+  constexpr std::size_t kConnections = 10000;
+  rlimit limit{};
+  getrlimit(RLIMIT_NOFILE, &limit);
+  limit.rlim_cur = limit.rlim_max;
+  setrlimit(RLIMIT_NOFILE, &limit);
+  BenchDaemon daemon;
+  { RawClient warm(daemon.socketPath()); }
+  daemon.waitUntilIdle();
+  const uint64_t before = daemon.anonymousBytes();
+  std::vector<RawClient> clients;
+  clients.reserve(kConnections);
+  const auto start = SteadyClock::now();
+  while (clients.size() < kConnections) clients.emplace_back(daemon.socketPath());
+  clients.back().create(1);  // registered: the service queue has come to the last one
+  const double seconds = secondsSince(start);
+  daemon.waitUntilIdle();
+  const double mib = static_cast<double>(daemon.anonymousBytes() - before) / (1 << 20);
+  results.add({.name = "connect_10000_s",
+               .value = seconds,
+               .unit = "s",
+               .floor = {},
+               .ratio = {},
+               .reach = {},
+               .what = "10,000 connections opened and registered"},
+              3, 3, false);
+  results.add({.name = "connect_10000_mib",
+               .value = mib,
+               .unit = "MiB",
+               .floor = {},
+               .ratio = {},
+               .reach = {},
+               .what = "the daemon's memory for them"},
+              64, 64, false);
+}
+
+void measureGrowth(const char* file, const Effort& effort) {
+  std::string json = "{\"clients\": [\n";
+  const std::size_t total = effort.quick ? 50000 : 200000;
+  char line[256];
+  for (const std::size_t count : {1u, 10u, 100u, 1000u}) {
+    progress(std::to_string(count) + " clients");
+    BenchDaemon daemon;
+    std::vector<RawClient> clients;
+    const uint64_t before = daemon.anonymousBytes();
+    for (std::size_t i = 0; i < count; ++i) {
+      clients.emplace_back(daemon.socketPath());
+      clients.back().create(static_cast<int64_t>(i + 1));
+      clients.back().start(static_cast<int64_t>(i + 1));
+    }
+    daemon.waitUntilIdle();
+    const double kib =
+        static_cast<double>(daemon.anonymousBytes() - before) / 1024 / static_cast<double>(count);
+    const double cpuBefore = daemon.cpuSeconds();
+    const auto start = SteadyClock::now();
+    const std::size_t perTurn = 50;
+    for (std::size_t sent = 0; sent < total;) {
+      for (std::size_t i = 0; i < count && sent < total; ++i, sent += perTurn) {
+        const auto reporter = static_cast<int64_t>(i + 1);
+        static const Payload payload = workloadPayload(1);
+        clients[i].pump({RawClient::messageFrame(payload, &reporter)}, perTurn, perTurn);
+      }
+    }
+    const double seconds = secondsSince(start);
+    daemon.waitUntilIdle();
+    std::snprintf(line, sizeof line,
+                  "%s{\"n\": %zu, \"messages_per_s\": %.0f, \"cpu_us_per_message\": %.2f, "
+                  "\"kib_each\": %.1f}",
+                  count == 1 ? "" : ",\n", count, static_cast<double>(total) / seconds,
+                  (daemon.cpuSeconds() - cpuBefore) * 1e6 / static_cast<double>(total), kib);
+    json += line;
+  }
+  json += "],\n\"sessions\": [\n";
+  for (const std::size_t count : {1u, 10u, 1000u}) {
+    progress(std::to_string(count) + " started sessions per message");
+    BenchDaemon daemon;
+    RawClient client(daemon.socketPath());
+    const uint64_t before = daemon.anonymousBytes();
+    for (std::size_t i = 0; i < count; ++i) {
+      client.create(static_cast<int64_t>(i + 1));
+      client.start(static_cast<int64_t>(i + 1));
+    }
+    daemon.waitUntilIdle();
+    const double kib =
+        static_cast<double>(daemon.anonymousBytes() - before) / 1024 / static_cast<double>(count);
+    const std::size_t messages = std::max<std::size_t>(100, total / count / 2);
+    const double cpuBefore = daemon.cpuSeconds();
+    const auto start = SteadyClock::now();
+    client.pump(workloadFrames(), messages, 256);
+    const double accepted = static_cast<double>(messages) / secondsSince(start);
+    StoreReader(daemon.databasePath())
+        .waitFor(static_cast<int64_t>(messages * count), static_cast<int64_t>(messages * count));
+    const double seconds = secondsSince(start);
+    daemon.waitUntilIdle();
+    std::snprintf(
+        line, sizeof line,
+        "%s{\"n\": %zu, \"messages_per_s\": %.0f, \"deliveries_stored_per_s\": %.0f, "
+        "\"cpu_us_per_delivery\": %.2f, \"kib_each\": %.1f}",
+        count == 1 ? "" : ",\n", count, accepted, static_cast<double>(messages * count) / seconds,
+        (daemon.cpuSeconds() - cpuBefore) * 1e6 / static_cast<double>(messages * count), kib);
+    json += line;
+  }
+  json += "]}\n";
+  std::ofstream(file) << json;
+}
+
+}  // namespace vx::bench
