@@ -1,4 +1,5 @@
-// The process entry: installs the Linux platform, creates the service, and serves until told to end.
+// The process entry: installs the Linux platform, creates the service, and serves until told to
+// end.
 #include <cstdio>
 #include <memory>
 #include <string>

@@ -1,4 +1,5 @@
-// The platform of this process on Linux: every service, made from the environment and platform.toml, and its end.
+// The platform of this process on Linux: every service, made from the environment and
+// platform.toml, and its end.
 #pragma once
 
 #include <memory>
@@ -8,17 +9,20 @@
 
 namespace vx::lnx {
 
-// Owned by main, on the interactive thread. start() and shutDown() bracket the life of every other thread.
+// Owned by main, on the interactive thread. start() and shutDown() bracket the life of every other
+// thread.
 class LinuxPlatform {
  public:
-  // Null and one clear sentence in `problem` when the service cannot start (directories, locks, socket).
+  // Null and one clear sentence in `problem` when the service cannot start (directories, locks,
+  // socket).
   static std::unique_ptr<LinuxPlatform> start(std::string& problem);
   virtual ~LinuxPlatform() = default;
 
   virtual Platform& services() = 0;
 
-  // After the listener's resume has returned: drains the relay queues, commits the store and ends all threads, within
-  // five seconds of the request to end. The exit status: 0, or 1 when something accepted could not be stored.
+  // After the listener's resume has returned: drains the relay queues, commits the store and ends
+  // all threads, within five seconds of the request to end. The exit status: 0, or 1 when something
+  // accepted could not be stored.
   virtual int shutDown() = 0;
 };
 

@@ -1,0 +1,177 @@
+// The unit of reporting: one object per reporter identifier.
+#pragma once
+
+#include <atomic>
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <utility>
+#include <vector>
+
+#include "Statistics/Service/VXReportingAggregate.h"
+#include "Statistics/VXReportingDriverUtility.h"
+#include "Statistics/VXReportingUtility.h"
+#include "platform/Clock.h"
+#include "platform/Error.h"
+#include "platform/Function.h"
+#include "platform/Mutex.h"
+#include "platform/ScopedLog.h"
+#include "platform/VyrReporting.h"
+#include "platform/WorkQueue.h"
+
+namespace vx {
+
+// A mutable dictionary that several owners share: configuration and service defaults merged.
+// Thread-safe.
+class VXReportingUserInfo {
+ public:
+  void merge(const Payload& entries);
+  Payload snapshot() const {
+    MutexLock lock(mutex_);
+    return entries_;
+  }
+
+ private:
+  mutable Mutex mutex_;
+  Payload entries_ GUARDED_BY(mutex_);
+};
+
+// What a client configured, what it received while started, and its relay session. Owned by the
+// server instance that created it; queued relay work and registered orientation handlers hold it
+// too. Lives on the service queue, but for its relay work (its own serial queue) and its
+// orientation handlers (the notifier's thread). Bounds nothing itself: the connections bound the
+// number of sessions, and reading from clients pauses while too much relay work waits.
+class VXReportingSession : public std::enable_shared_from_this<VXReportingSession> {
+ public:
+  using MessageReply = Function<void(const std::optional<Error>&)>;
+
+  static std::shared_ptr<VXReportingSession> initWithID(ReporterID reporterID,
+                                                        std::vector<int32_t> processIdentifiers);
+  // Does not stop the session: the owner is expected to have done that.
+  ~VXReportingSession();
+  VXReportingSession(const VXReportingSession&) = delete;
+  VXReportingSession& operator=(const VXReportingSession&) = delete;
+
+  void setServiceType(ServiceType type);
+  // Both merge into the user information; none does nothing.
+  void setConfiguration(const std::optional<Payload>& configuration);
+  void updateDefaults(const std::optional<Payload>& defaults);
+  void start();
+  void stop();
+
+  // Numbers, aggregates and relays a message. The reply, if any, is called before this returns and
+  // says nothing of the relay. The sync flag is accepted and ignored: callers rely on the order of
+  // the relay queue alone.
+  enum class Sync : uint8_t { No, Yes };
+  void sendMessage(const Payload& message, MessageCategory category, MessageType type, Sync sync,
+                   MessageReply reply);
+  void sendMessage(const Payload& message, MessageCategory category, MessageType type,
+                   MessageReply reply) {
+    sendMessage(message, category, type, Sync::No, std::move(reply));
+  }
+  // Sends a message that belongs to no started session, after a random delay for service type 4.
+  // The user information is never used: what goes out is made from the service type alone.
+  static void sendSingleMessage(const Payload& message, MessageCategory category, MessageType type,
+                                ServiceType serviceType, const std::optional<Payload>& userInfo,
+                                MessageReply reply);
+
+  bool shouldReportOrientation() const;
+  // Issues the next identifier of the kind: "Session_Setup_Start_1", "..._2". Numbering goes on
+  // across restarts.
+  std::string messageIdForCategory(MessageCategory category, MessageType type);
+  // Every space in a key becomes "_"; of two keys that become the same, the later one's value
+  // stays.
+  static Payload normalizePayloadKeys(const Payload& payload);
+  std::optional<Payload> createSummaryEventForSession() const;
+  void writeSummaryJson();
+
+  // Fields. Those that other queues see are guarded; the others belong to the service queue.
+  bool started() const { return started_; }
+  void setStarted(bool started) { started_ = started; }
+  bool vyrReportingSessionStarted() const { return vyrReportingSessionStarted_; }
+  void setVyrReportingSessionStarted(bool started) { vyrReportingSessionStarted_ = started; }
+  ServiceType serviceType() const { return serviceType_.load(std::memory_order_relaxed); }
+  std::string_view serviceName() const { return serviceName_; }
+  const std::shared_ptr<VXReportingUserInfo>& userInfo() const { return userInfo_; }
+  const std::shared_ptr<DriverSnapShot>& driverSnapShot() const { return driverSnapShot_; }
+  void setDriverSnapShot(std::shared_ptr<DriverSnapShot> snapShot) {
+    driverSnapShot_ = std::move(snapShot);
+  }
+  // The pending start reply. The session keeps it and never calls it.
+  bool hasTransactionCompleteBlock() const { return static_cast<bool>(transactionCompleteBlock_); }
+  Function<void(bool)> takeTransactionCompleteBlock() {
+    return std::move(transactionCompleteBlock_);
+  }
+  void setTransactionCompleteBlock(Function<void(bool)> block) {
+    transactionCompleteBlock_ = std::move(block);
+  }
+  ReporterID reporterID() const { return reporterID_; }
+  const std::vector<int32_t>& processIdentifiers() const { return processIdentifiers_; }
+  std::optional<std::string> orientationCallbackID() const;
+  std::optional<Date> startDate() const;
+  std::shared_ptr<VyrReportingSession> vyrReportingSession() const;
+  std::shared_ptr<const VyrSecureHierarchyToken> vyrReportingAgentToken() const;
+  const std::shared_ptr<WorkQueue>& vyrReportingQueue() const { return vyrReportingQueue_; }
+  // Copies, none when absent; a nested element as its one-entry dictionary.
+  std::optional<std::vector<Payload>> aggregatedPayloadData() const;
+  std::optional<std::vector<Payload>> nestedAggregatedPayloadData() const;
+  std::string description() const;
+
+ private:
+  struct KindCount {
+    MessageKind kind;
+    uint32_t count;
+  };
+  struct RelayConfiguration;
+
+  VXReportingSession(ReporterID reporterID, std::vector<int32_t> processIdentifiers);
+  void mergeIntoUserInfo(const std::optional<Payload>& entries);
+  KindCount nextIdentifier(MessageCategory category, MessageType type);
+  static std::string identifierText(MessageKind kind, uint32_t count);
+
+  void registerOrientationHandlers();
+  void unregisterOrientationHandlers();
+  void orientationChanged(const char* mode, std::string_view key, int64_t orientation);
+
+  void setUpRelay(std::string_view serviceName, ServiceType serviceType, bool configurationDone);
+  void relayMessage(const Payload& normalised, const Payload& message, MessageCategory category,
+                    MessageType type, bool startedThen);
+  void flushRelay();
+  static void sendSingleMessageNow(const Payload& message, MessageCategory category,
+                                   MessageType type, ServiceType serviceType,
+                                   const MessageReply& reply);
+  void setVyrReportingSession(std::shared_ptr<VyrReportingSession> session);
+  void setVyrReportingAgentToken(std::shared_ptr<const VyrSecureHierarchyToken> token);
+
+  bool started_ = false;
+  bool vyrReportingSessionStarted_ = false;
+  std::atomic<ServiceType> serviceType_{kServiceTypeUnknown};
+  const ReporterID reporterID_;
+  const std::vector<int32_t> processIdentifiers_;
+  std::string_view serviceName_ = "unknown";
+  const std::shared_ptr<VXReportingUserInfo> userInfo_ = std::make_shared<VXReportingUserInfo>();
+  std::shared_ptr<DriverSnapShot> driverSnapShot_;
+  Function<void(bool)> transactionCompleteBlock_;
+  VXReportingAggregate<Payload> aggregatedPayloadData_;
+  VXReportingAggregate<VXReportingNestedEntry> nestedAggregatedPayloadData_;
+  std::vector<KindCount> messageTypeCounts_;  // bounded by the number of kinds, some hundreds
+  std::shared_ptr<WorkQueue> vyrReportingQueue_;
+
+  mutable Mutex fieldsMutex_;  // the references below, each read and replaced as a whole
+  std::optional<std::string> orientationCallbackID_ GUARDED_BY(fieldsMutex_);
+  std::optional<Date> startDate_ GUARDED_BY(fieldsMutex_);
+  std::shared_ptr<VyrReportingSession> vyrReportingSession_ GUARDED_BY(fieldsMutex_);
+  std::shared_ptr<const VyrSecureHierarchyToken> vyrReportingAgentToken_ GUARDED_BY(fieldsMutex_);
+};
+
+// The "vxrr" scope, once a session has been created; null before.
+const LogScope* sessionLogScope();
+
+namespace testing_hooks {
+// Forgets the session log scope, as a new process would.
+void forgetSessionLogScope();
+}  // namespace testing_hooks
+
+}  // namespace vx

@@ -1,0 +1,197 @@
+// The session's road to the reporting relay: set-up, sends and flush on its own queue, and
+// standalone messages.
+#include <cstdlib>
+
+#include "Statistics/Service/VXReportingSession.h"
+#include "platform/Log.h"
+
+namespace vx {
+
+namespace {
+
+constexpr uint32_t kTraceMessage = 0x21042838;
+constexpr int32_t kClientType = 19;
+constexpr const char* kClientVersion = "2.0";
+constexpr std::string_view kClientName = "com.quorvel.sonik";
+constexpr const char* kConfigurationTimeLimit =
+    "9.0";                                   // seconds; parsed as single precision, then widened
+constexpr uint32_t kAlarmDelaySeconds = 60;  // exclusive
+
+float clientVersion() { return std::strtof(kClientVersion, nullptr); }
+
+uint16_t relayCategory(MessageCategory category) {
+  return static_cast<uint16_t>(category & 0xFFFF);
+}
+
+std::string listText(const VyrReportingSession::BackendList& backends) {
+  std::string text = "(";
+  for (const std::string& backend : backends) text += (text.size() > 1 ? ", " : "") + backend;
+  return text + ")";
+}
+
+// The configuration-done flag and its condition. The completion handler may come after the set-up
+// has given up, so both parties own them.
+struct ConfigurationState {
+  std::unique_ptr<Condition> condition = platform().threading.makeCondition();
+  bool done = false;  // guarded by the condition's lock
+};
+
+}  // namespace
+
+void VXReportingSession::setUpRelay(std::string_view serviceName, ServiceType serviceTypeThen,
+                                    bool configurationDone) {
+  static constexpr const char* kFunction = "start";
+  if (serviceType() == kServiceTypeTest) return;
+  setVyrReportingAgentToken(
+      platform().vyrReporting.newSecureHierarchyTokenFromParentToken(nullptr));
+
+  const bool realtime = serviceTypeThen == kServiceTypeApiUsage;
+  const VyrSessionInfo sessionInfo = {
+      {kVyrReportingSessionInfoClientType, kClientType},
+      {kVyrReportingSessionInfoClientVersion, clientVersion()},
+      {kVyrReportingSessionInfoSessionID, int64_t{reporterID_}},
+      {kVyrReportingSessionInfoBatchEvent, !realtime},
+      {kVyrReportingSessionInfoHierarchyToken, vyrReportingAgentToken()},
+      {kVyrReportingSessionInfoContainsRealtimeEvents, realtime},
+  };
+  PayloadBuilder userInformation;
+  userInformation.set(kVyrReportingUserInfoClientName, kClientName);
+  userInformation.set(kVyrReportingUserInfoServiceName, std::string(serviceName) + "_session");
+  const Payload configured = userInfo_->snapshot();
+  if (!configured.empty()) userInformation.merge(configured);
+  const std::shared_ptr<VyrReportingSession> relay =
+      platform().vyrReporting.initWithSessionInfo(sessionInfo, userInformation.build(), {});
+  setVyrReportingSession(relay);
+
+  const auto state = std::make_shared<ConfigurationState>();
+  state->done = configurationDone;
+  relay->startConfigurationWithCompletionHandler(
+      [state](std::optional<VyrReportingSession::BackendList> backends) {
+        if (!backends) {
+          VX_LOG_AS(kFunction, sessionLogScope(), Error,
+                    "No backends found, this session won't get sent to the server");
+          return;  // the waiter runs out of time
+        }
+        VX_LOG_AS(kFunction, sessionLogScope(), Default, "List of backends %s",
+                  listText(*backends).c_str());
+        state->condition->lock();
+        state->done = true;
+        state->condition->signal();
+        state->condition->unlock();
+      });
+  bool configured_ = false;
+  {
+    Blocking blocking(platform().workQueues);
+    configured_ = VXReportingUtilityWait(*state->condition, state->done,
+                                         "waiting for vyrreportingd to find backends",
+                                         "failed to find backend", sessionLogScope(),
+                                         double{std::strtof(kConfigurationTimeLimit, nullptr)});
+  }
+  if (!configured_) {
+    setVyrReportingSession(nullptr);
+    setVyrReportingSessionStarted(false);
+  }
+}
+
+void VXReportingSession::relayMessage(const Payload& normalised, const Payload& message,
+                                      MessageCategory category, MessageType type,
+                                      bool startedThen) {
+  static constexpr const char* kFunction = "sendMessage";
+  if (!startedThen) {
+    if (platform().log.isLogEnabled(5, sessionLogScope())) {
+      VX_LOG_AS(kFunction, sessionLogScope(), Debug,
+                "session not started, will send as a single message");
+    }
+    sendSingleMessage(normalised, category, type, serviceType(), userInfo_->snapshot(), nullptr);
+    return;
+  }
+  if (serviceType() == kServiceTypeTest) {
+    VX_LOG_AS(kFunction, sessionLogScope(), Info, "transactions aren't allowed on this platform");
+    return;
+  }
+  const std::shared_ptr<VyrReportingSession> relay = vyrReportingSession();
+  if (relay == nullptr) {
+    const Error error{kGenericErrorDomain, -1, "No valid VyrReportingSession"};
+    VX_LOG_AS(kFunction, sessionLogScope(), Error, "%s", error.reason.c_str());
+    return;
+  }
+  std::optional<Error> sendError;
+  if (relay->sendMessageWithCategory(relayCategory(category), type, normalised, sendError)) {
+    if (platform().log.isLogEnabled(5, sessionLogScope())) {
+      VX_LOG_AS(kFunction, sessionLogScope(), Debug,
+                "VyrReportingAgent %s : message %s : category %i : type %i",
+                relay->description().c_str(), message.text().c_str(), static_cast<int>(category),
+                int{type});
+    }
+    return;
+  }
+  // A failed send is silent. The line below looks at an error slot that belongs to this piece of
+  // work and is always empty, not at the error the send returned; the silence is intended.
+  const std::optional<Error> error;
+  if (error)
+    VX_LOG_AS(kFunction, sessionLogScope(), Error, "error sending message %s",
+              error->description().c_str());
+}
+
+void VXReportingSession::flushRelay() {
+  static constexpr const char* kFunction = "stop";
+  if (serviceType() == kServiceTypeTest) return;
+  if (const std::shared_ptr<VyrReportingSession> relay = vyrReportingSession()) {
+    relay->flushMessagesWithCompletion([](std::optional<Error> error) {
+      if (error)
+        VX_LOG_AS(kFunction, sessionLogScope(), Error, "flush error %s",
+                  error->description().c_str());
+    });
+  }
+  setVyrReportingSession(nullptr);
+}
+
+void VXReportingSession::sendSingleMessage(const Payload& message, MessageCategory category,
+                                           MessageType type, ServiceType serviceType,
+                                           const std::optional<Payload>&, MessageReply reply) {
+  const uint32_t delay =
+      serviceType == kServiceTypeAlarms ? platform().random.below(kAlarmDelaySeconds) : 0;
+  VX_VERBOSE(sessionLogScope(), "sending single message after delta %lli for service %i",
+             static_cast<long long>(delay), int{serviceType});
+  platform().workQueues.background().asyncAfter(
+      std::chrono::seconds(delay),
+      [message, reply = std::move(reply), category, serviceType, type] {
+        sendSingleMessageNow(message, category, type, serviceType, reply);
+      });
+}
+
+void VXReportingSession::sendSingleMessageNow(const Payload& message, MessageCategory category,
+                                              MessageType type, ServiceType serviceType,
+                                              const MessageReply& reply) {
+  static constexpr const char* kFunction = "sendSingleMessage";
+  const bool verbose = platform().log.isLogEnabled(5, sessionLogScope());
+  platform().trace.emit(kTraceMessage, 0, 0, 0, 0);
+  if (verbose) VX_LOG_AS(kFunction, sessionLogScope(), Debug, "sending single message");
+  const VyrSessionInfo sessionInfo = {
+      {kVyrReportingSessionInfoClientType, kClientType},
+      {kVyrReportingSessionInfoClientVersion, clientVersion()},
+      {kVyrReportingSessionInfoSessionID, int32_t{-1}},
+  };
+  const Payload userInformation =
+      PayloadBuilder()
+          .set(kVyrReportingUserInfoClientName, kClientName)
+          .set(kVyrReportingUserInfoServiceName, VXReportingServiceTypeName(serviceType))
+          .build();
+  std::optional<Error> error;
+  const bool sent = platform().vyrReporting.sendOneMessageWithSessionInfo(
+      sessionInfo, userInformation, relayCategory(category), type, normalizePayloadKeys(message),
+      error);
+  if (sent) {
+    error.reset();
+    if (verbose) {
+      VX_LOG_AS(kFunction, sessionLogScope(), Debug, "message %s : category %i : type %i",
+                message.text().c_str(), static_cast<int>(category), int{type});
+    }
+  } else if (error) {
+    VX_LOG_AS(kFunction, sessionLogScope(), Error, "sendOneMessageWithSessionInfo %s",
+              error->description().c_str());
+  }
+  if (reply) reply(error);
+}
+
+}  // namespace vx

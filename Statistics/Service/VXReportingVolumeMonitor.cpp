@@ -1,0 +1,1 @@
+#include "Statistics/Service/VXReportingVolumeMonitor.h"
