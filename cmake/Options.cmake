@@ -1,7 +1,7 @@
 # vx_options: what every target of the project is compiled with.
 add_library(vx_options INTERFACE)
 target_include_directories(vx_options INTERFACE ${PROJECT_SOURCE_DIR})
-target_compile_options(vx_options INTERFACE -Wall -Wextra -Wshadow -Wnon-virtual-dtor -Wold-style-cast
+target_compile_options(vx_options INTERFACE -Wall -Wextra -Wshadow=local -Wnon-virtual-dtor -Wold-style-cast
                                             -Wcast-qual -Wformat=2 -Wno-unused-parameter)
 if(VX_WERROR)
   target_compile_options(vx_options INTERFACE -Werror)

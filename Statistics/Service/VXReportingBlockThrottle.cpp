@@ -168,7 +168,7 @@ void VXReportingBlockThrottle::addMessageBlock(Block block, ReporterID reporter,
     timersInFlight_[key] = wrapper;
   }
   MutexLock lock(unscheduledMutex_);
-  unscheduledTimerKeys_.push_back(key);
+  unscheduledTimerKeys_.emplace_back(key, wrapper);
 }
 
 void VXReportingBlockThrottle::fire(const Wrapper& wrapper, const std::string& key) {
@@ -193,9 +193,7 @@ void VXReportingBlockThrottle::fire(const Wrapper& wrapper, const std::string& k
 
 void VXReportingBlockThrottle::attachUnscheduled(RunLoop& runLoop) {
   MutexLock lock(unscheduledMutex_);
-  for (const std::string& key : unscheduledTimerKeys_) {
-    const Wrapper wrapper = pending(key);
-    if (wrapper == nullptr) continue;
+  for (const auto& [key, wrapper] : unscheduledTimerKeys_) {
     if (auto timer = wrapper->timer()) runLoop.attach(std::move(timer));
   }
   unscheduledTimerKeys_.clear();

@@ -6,6 +6,7 @@
 #include <map>
 #include <memory>
 #include <string>
+#include <utility>
 #include <vector>
 
 #include "Statistics/VXReportingUtility.h"
@@ -84,7 +85,8 @@ class VXReportingBlockThrottle : public std::enable_shared_from_this<VXReporting
   mutable Mutex timersMutex_;
   std::map<std::string, Wrapper> timersInFlight_ GUARDED_BY(timersMutex_);
   mutable Mutex unscheduledMutex_;
-  std::vector<std::string> unscheduledTimerKeys_ GUARDED_BY(unscheduledMutex_);
+  // Each key with its wrapper, so that attaching needs no look at the map.
+  std::vector<std::pair<std::string, Wrapper>> unscheduledTimerKeys_ GUARDED_BY(unscheduledMutex_);
   std::unique_ptr<Thread> queueThread_;
 };
 

@@ -1,0 +1,19 @@
+// Reads small files that somebody else writes, without being held up or flooded by what stands in their place.
+#pragma once
+
+#include <cstddef>
+#include <optional>
+#include <string>
+
+#include "platform/Error.h"
+
+namespace vx::lnx {
+
+// The whole content of a regular file of at most `maxBytes`. None and an error (code: errno) for anything else: a
+// directory, a FIFO (never waited for), a loop of links, a larger file.
+std::optional<std::string> readRegularFile(const std::string& path, std::size_t maxBytes, Error& error);
+
+// An error that carries errno and what was tried.
+Error posixError(int errnoValue, const std::string& what);
+
+}  // namespace vx::lnx

@@ -1,0 +1,157 @@
+// The store's queue and the one thread that empties it into the database.
+#pragma once
+
+#include <atomic>
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <string>
+#include <thread>
+#include <utility>
+#include <variant>
+#include <vector>
+
+#include "platform/Clock.h"
+#include "platform/Function.h"
+#include "platform/Mutex.h"
+#include "platform/Payload.h"
+#include "platform/VyrReporting.h"
+#include "platform/linux/LocalStore.h"
+#include "platform/linux/StoreSchema.h"
+
+namespace vx::lnx {
+
+// The row of a relay session, known to the writer's thread once it has inserted it.
+struct RelayRow {
+  int64_t id = 0;
+};
+
+struct RelayOpenRecord {
+  std::shared_ptr<RelayRow> row;
+  std::unique_ptr<std::pair<VyrSessionInfo, Payload>> information;  // session and user information
+};
+struct RelayMessageRecord {
+  std::shared_ptr<RelayRow> row;
+  Payload payload;
+  uint16_t category = 0;
+  uint16_t type = 0;
+};
+struct AnalyticsRecord {
+  std::string name;
+  Function<Payload()> builder;
+};
+struct PowerRecord {
+  int64_t clientIdentifier = 0;
+  std::string name;
+  Payload record;
+};
+struct FlushRecord {
+  Function<void(std::optional<Error>)> completion;
+};
+
+struct StoreRecord {
+  double time = 0;  // seconds since 1970
+  std::variant<RelayOpenRecord, RelayMessageRecord, AnalyticsRecord, PowerRecord, FlushRecord> what;
+};
+
+// Owned by the local store. append() and the questions are thread-safe; everything else belongs to the writer's thread.
+// What is not yet committed is bounded by queueBytes, by way of the listener: see LocalStore.
+class StoreWriter {
+ public:
+  StoreWriter(std::string path, Database database, const PlatformConfiguration::Store& options, Clock& clock);
+  ~StoreWriter();
+  StoreWriter(const StoreWriter&) = delete;
+  StoreWriter& operator=(const StoreWriter&) = delete;
+
+  // Something worth a row in the ledger that happened before the writer began.
+  void noteAtStart(std::string event, std::string detail);
+  void start();
+
+  // `bytes`: what the record holds besides itself. False once closed.
+  bool append(StoreRecord record, std::size_t bytes);
+  // Runs on the writer's thread at once, before anything that waits to be written.
+  void runSoon(Function<void()> job);
+
+  bool isCongested() const { return congested_.load(std::memory_order_relaxed); }
+  void setDrainedHandler(Function<void()> handler) { drained_ = std::move(handler); }
+  bool close(Monotonic deadline);
+  LocalStore::Counters counters() const;
+  double now() const { return std::chrono::duration<double>(clock_.now().time_since_epoch()).count(); }
+
+ private:
+  struct Statements {
+    Statement relaySession;
+    Statement relayMessage;
+    Statement analytics;
+    Statement power;
+    Statement ledger;
+  };
+  struct LedgerNote {
+    std::string event;
+    std::string table;
+    int64_t rows = 0;
+    std::string detail;
+  };
+
+  static constexpr std::size_t kRowsPerCommit = 1000;
+  static constexpr std::size_t kBytesPerCommit = 1 << 20;
+
+  void threadMain();
+  void checkDatabase();
+  void prepareStatements();
+  bool waitForBatch();  // false: closed and empty
+  void runJobs();
+  void writeBatch();
+  // Writes records [first, last) in one transaction. SQLITE_OK or the error after which everything was rolled back.
+  int writeTransaction(std::size_t first, std::size_t last);
+  int writeRecord(const StoreRecord& record);
+  int writeRelaySession(double time, const RelayOpenRecord& record);
+  int writeLedger(const LedgerNote& note);
+  // False: the store is closing and time is up.
+  bool waitBeforeRetry(int code);
+  void committed(std::size_t first, std::size_t last);
+  void applyRetention();
+  int64_t removeOldest(const char* table, std::optional<double> before);
+  void note(LedgerNote note) { notes_.push_back(std::move(note)); }
+
+  const std::string path_;
+  const PlatformConfiguration::Store options_;
+  Clock& clock_;
+  Function<void()> drained_;
+  std::atomic<bool> congested_{false};
+  std::atomic<uint64_t> rowsCommitted_{0};
+  std::atomic<uint64_t> commits_{0};
+  std::atomic<uint64_t> writeFailures_{0};
+  std::atomic<uint64_t> rowsLost_{0};
+
+  Mutex mutex_;
+  CondVar wake_;
+  CondVar ended_;
+  std::vector<StoreRecord> pending_ GUARDED_BY(mutex_);
+  std::size_t pendingBytes_ GUARDED_BY(mutex_) = 0;
+  std::size_t heldBytes_ GUARDED_BY(mutex_) = 0;  // all that is not committed, pending_ included
+  Monotonic firstPending_ GUARDED_BY(mutex_);
+  std::vector<Function<void()>> jobs_ GUARDED_BY(mutex_);
+  bool urgent_ GUARDED_BY(mutex_) = false;  // a flush waits
+  enum class Sleep : uint8_t { Awake, UntilCommit, UntilWork };
+  Sleep sleep_ GUARDED_BY(mutex_) = Sleep::Awake;
+  bool closing_ GUARDED_BY(mutex_) = false;
+  bool finished_ GUARDED_BY(mutex_) = false;
+  Monotonic closeDeadline_ GUARDED_BY(mutex_);
+
+  // The writer's thread.
+  Database database_;
+  Statements statements_;
+  std::vector<StoreRecord> batch_;
+  std::size_t batchBytes_ = 0;
+  std::vector<LedgerNote> notes_;
+  std::string json_;
+  std::string moreJson_;
+  bool failing_ = false;
+  std::chrono::milliseconds backoff_{0};
+  std::size_t commitsSinceRetention_ = 0;
+  Monotonic lastAgeCheck_{};
+  std::thread thread_;
+};
+
+}  // namespace vx::lnx

@@ -1,0 +1,54 @@
+// The log scopes and the system log: the journal when there is one, else stderr.
+#pragma once
+
+#include <atomic>
+#include <deque>
+#include <string>
+
+#include "platform/Function.h"
+#include "platform/Mutex.h"
+#include "platform/ScopedLog.h"
+#include "platform/linux/PlatformConfiguration.h"
+
+namespace vx::lnx {
+
+// Thread-safe. Owned by the platform. Lines of one statement are limited to a burst and a rate, so that no client can
+// flood the log or make the service pay for text that nobody reads; how many were left out is said with the next line.
+// Never waits: a line that stderr's reader has no room for is dropped and counted.
+class SystemLog final : public ScopedLog {
+ public:
+  SystemLog();
+  void configure(const PlatformConfiguration::Log& options);
+  // How a scope's verbose preference is read: (domain, key). Asked at registration and by refreshVerbose().
+  void setVerboseReader(Function<bool(std::string_view domain, std::string_view key)> reader);
+  void refreshVerbose();
+
+  const LogScope* registerScope(bool enabled, uint32_t code, std::string_view name, std::string_view domain,
+                                std::string_view verboseKey, uint32_t level) override;
+  bool isLogEnabled(int level, const LogScope* scope) override;
+  bool wantsLine(const LogScope* scope, LogLevel level, const LogSite& site) override;
+  void write(const LogScope* scope, LogLevel level, const LogSite& site, std::string_view text,
+             std::size_t prefixLength) override;
+
+  uint64_t droppedLines() const { return dropped_.load(); }
+
+ private:
+  struct Scope final : LogScope {
+    std::string name;
+    std::string domain;
+    std::string verboseKey;
+    std::atomic<bool> verbose{false};
+  };
+  void writeStderr(int priority, std::string_view scopeName, std::string_view text);
+
+  std::atomic<int> threshold_;  // the lowest rank that is written
+  std::atomic<uint32_t> burst_;
+  std::atomic<double> refillPerSecond_;
+  std::atomic<bool> journal_{false};
+  std::atomic<uint64_t> dropped_{0};
+  Mutex mutex_;
+  std::deque<Scope> scopes_ GUARDED_BY(mutex_);  // a handful; never removed, so handles stay valid
+  Function<bool(std::string_view, std::string_view)> verboseReader_ GUARDED_BY(mutex_);
+};
+
+}  // namespace vx::lnx
