@@ -2,7 +2,7 @@
 add_library(vx_options INTERFACE)
 target_include_directories(vx_options INTERFACE ${PROJECT_SOURCE_DIR})
 target_compile_options(vx_options INTERFACE -Wall -Wextra -Wshadow=local -Wnon-virtual-dtor -Wold-style-cast
-                                            -Wcast-qual -Wformat=2 -Wno-unused-parameter)
+                                            -Wcast-qual -Wformat=2 -Wno-format-nonliteral -Wno-unused-parameter)
 if(VX_WERROR)
   target_compile_options(vx_options INTERFACE -Werror)
 endif()

@@ -18,6 +18,7 @@ int main() {
   }
   vx::Platform& services = linuxPlatform->services();
   vx::installPlatform(&services);
+  linuxPlatform->begin();
   {
     const std::shared_ptr<vx::VXReportingServiceDelegate> delegate =
         vx::VXReportingServiceDelegate::create();

@@ -20,6 +20,9 @@ class LinuxPlatform {
 
   virtual Platform& services() = 0;
 
+  // Starts what works in the background. The services must be installed.
+  virtual void begin() = 0;
+
   // After the listener's resume has returned: drains the relay queues, commits the store and ends
   // all threads, within five seconds of the request to end. The exit status: 0, or 1 when something
   // accepted could not be stored.

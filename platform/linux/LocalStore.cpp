@@ -36,15 +36,20 @@ struct Backends {
 Error noStore() { return {"com.quorvel.vyr", 1, "the back end \"store\" is not configured"}; }
 Error closed() { return {"com.quorvel.vyr", 2, "the store is closed"}; }
 
-// One relay session of the store. Owned by whoever made it; refers to a writer that outlives all of them. Thread-safe.
+// One relay session of the store. Owned by whoever made it; refers to a writer that outlives all of
+// them. Thread-safe.
 class StoreRelaySession final : public VyrReportingSession {
  public:
-  StoreRelaySession(StoreWriter& writer, const Backends& backends, std::shared_ptr<RelayRow> row, int64_t sessionID)
+  StoreRelaySession(StoreWriter& writer, const Backends& backends, std::shared_ptr<RelayRow> row,
+                    int64_t sessionID)
       : writer_(writer), backends_(backends), row_(std::move(row)), sessionID_(sessionID) {}
 
-  std::string description() const override { return "<VyrReportingSession " + std::to_string(sessionID_) + ">"; }
+  std::string description() const override {
+    return "<VyrReportingSession " + std::to_string(sessionID_) + ">";
+  }
 
-  void startConfigurationWithCompletionHandler(Function<void(std::optional<BackendList>)> handler) override {
+  void startConfigurationWithCompletionHandler(
+      Function<void(std::optional<BackendList>)> handler) override {
     writer_.runSoon([names = backends_.names, handler = std::move(handler)] {
       handler(names.empty() ? std::nullopt : std::optional<BackendList>(names));
     });
@@ -57,7 +62,8 @@ class StoreRelaySession final : public VyrReportingSession {
       return false;
     }
     const std::size_t bytes = payload.encoded().size();
-    if (writer_.append({writer_.now(), RelayMessageRecord{row_, payload, category, type}}, bytes)) return true;
+    if (writer_.append({writer_.now(), RelayMessageRecord{row_, payload, category, type}}, bytes))
+      return true;
     error = closed();
     return false;
   }
@@ -78,20 +84,29 @@ class SqliteStore final : public LocalStore,
                           public AnalyticsEventService,
                           public PowerEventLog {
  public:
-  SqliteStore(int lockFd, std::string path, Database database, const PlatformConfiguration::Store& options,
-              Clock& clock)
+  SqliteStore(int lockFd, std::string path, Database database,
+              const PlatformConfiguration::Store& options, Clock& clock)
       : lockFd_(lockFd), writer_(std::move(path), std::move(database), options, clock) {
     setBackends({kStoreBackend});
   }
   ~SqliteStore() override { ::close(lockFd_); }
 
-  StoreWriter& writer() { return writer_; }
+  void setDamage(std::string note) { damage_ = std::move(note); }
+  void start() override {
+    if (!damage_.empty()) {
+      VX_LOG(nullptr, Error, "the store was damaged and a fresh one is begun: %s", damage_.c_str());
+      writer_.noteAtStart("moved_aside", damage_);
+    }
+    writer_.start();
+  }
 
   VyrReporting& relay() override { return *this; }
   AnalyticsEventService& analytics() override { return *this; }
   PowerEventLog& power() override { return *this; }
   bool isCongested() const override { return writer_.isCongested(); }
-  void setDrainedHandler(Function<void()> handler) override { writer_.setDrainedHandler(std::move(handler)); }
+  void setDrainedHandler(Function<void()> handler) override {
+    writer_.setDrainedHandler(std::move(handler));
+  }
   void setBackends(std::vector<std::string> names) override {
     backends_.hasStore = std::find(names.begin(), names.end(), kStoreBackend) != names.end();
     backends_.names = std::move(names);
@@ -103,12 +118,14 @@ class SqliteStore final : public LocalStore,
       const VyrSecureHierarchyToken* parent) override {
     auto token = std::make_shared<HierarchyToken>();
     if (getrandom(token->bytes.data(), token->bytes.size(), 0) < 0) token->bytes = {};
-    if (const auto* known = dynamic_cast<const HierarchyToken*>(parent)) token->parent = known->bytes;
+    if (const auto* known = dynamic_cast<const HierarchyToken*>(parent))
+      token->parent = known->bytes;
     return token;
   }
 
-  std::shared_ptr<VyrReportingSession> initWithSessionInfo(const VyrSessionInfo& sessionInfo, const Payload& userInfo,
-                                                           const std::vector<std::string>&) override {
+  std::shared_ptr<VyrReportingSession> initWithSessionInfo(
+      const VyrSessionInfo& sessionInfo, const Payload& userInfo,
+      const std::vector<std::string>&) override {
     auto row = std::make_shared<RelayRow>();
     int64_t sessionID = 0;
     for (const auto& [key, value] : sessionInfo) {
@@ -120,8 +137,9 @@ class SqliteStore final : public LocalStore,
     return std::make_shared<StoreRelaySession>(writer_, backends_, std::move(row), sessionID);
   }
 
-  bool sendOneMessageWithSessionInfo(const VyrSessionInfo& sessionInfo, const Payload& userInfo, uint16_t category,
-                                     uint16_t type, const Payload& payload, std::optional<Error>& error) override {
+  bool sendOneMessageWithSessionInfo(const VyrSessionInfo& sessionInfo, const Payload& userInfo,
+                                     uint16_t category, uint16_t type, const Payload& payload,
+                                     std::optional<Error>& error) override {
     if (!backends_.hasStore) {
       error = noStore();
       return false;
@@ -129,7 +147,8 @@ class SqliteStore final : public LocalStore,
     auto row = std::make_shared<RelayRow>();
     const std::size_t bytes = payload.encoded().size();
     if (open(row, sessionInfo, userInfo) &&
-        writer_.append({writer_.now(), RelayMessageRecord{std::move(row), payload, category, type}}, bytes)) {
+        writer_.append({writer_.now(), RelayMessageRecord{std::move(row), payload, category, type}},
+                       bytes)) {
       return true;
     }
     error = closed();
@@ -137,29 +156,36 @@ class SqliteStore final : public LocalStore,
   }
 
   void sendEventLazy(std::string name, Function<Payload()> builder) override {
-    // The builder holds a message, most likely one that the relay holds too: counted by a typical size.
+    // The builder holds a message, most likely one that the relay holds too: counted by a typical
+    // size.
     constexpr std::size_t kTypicalEventBytes = 128;
-    (void)writer_.append({writer_.now(), AnalyticsRecord{std::move(name), std::move(builder)}}, kTypicalEventBytes);
+    (void)writer_.append({writer_.now(), AnalyticsRecord{std::move(name), std::move(builder)}},
+                         kTypicalEventBytes);
   }
 
-  void logRegisteredEvent(int64_t clientIdentifier, std::string_view eventName, const Payload& record,
-                          const Payload*) override {
+  void logRegisteredEvent(int64_t clientIdentifier, std::string_view eventName,
+                          const Payload& record, const Payload*) override {
     const std::size_t bytes = record.encoded().size();
-    (void)writer_.append({writer_.now(), PowerRecord{clientIdentifier, std::string(eventName), record}}, bytes);
+    (void)writer_.append(
+        {writer_.now(), PowerRecord{clientIdentifier, std::string(eventName), record}}, bytes);
   }
 
  private:
-  bool open(const std::shared_ptr<RelayRow>& row, const VyrSessionInfo& info, const Payload& userInfo) {
+  bool open(const std::shared_ptr<RelayRow>& row, const VyrSessionInfo& info,
+            const Payload& userInfo) {
     VyrSessionInfo kept = info;
-    std::erase_if(kept, [](const auto& entry) { return entry.first == kVyrReportingSessionInfoHierarchyToken; });
+    std::erase_if(kept, [](const auto& entry) {
+      return entry.first == kVyrReportingSessionInfoHierarchyToken;
+    });
     return writer_.append(
-        {writer_.now(),
-         RelayOpenRecord{row, std::make_unique<std::pair<VyrSessionInfo, Payload>>(std::move(kept), userInfo)}},
+        {writer_.now(), RelayOpenRecord{row, std::make_unique<std::pair<VyrSessionInfo, Payload>>(
+                                                 std::move(kept), userInfo)}},
         userInfo.encoded().size() + 256);
   }
 
   const int lockFd_;
-  Backends backends_;  // set before any traffic
+  std::string damage_;  // what was found and moved aside when the store was opened
+  Backends backends_;   // set before any traffic
   StoreWriter writer_;
 };
 
@@ -171,7 +197,8 @@ int lockStore(const std::string& directory, std::string& problem) {
   const std::string path = directory + "/telemetry.lock";
   const int fd = ::open(path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW, 0640);
   if (fd < 0) {
-    problem = because("cannot open " + path) + " (set STATE_DIRECTORY to a folder that can be written)";
+    problem =
+        because("cannot open " + path) + " (set STATE_DIRECTORY to a folder that can be written)";
     return -1;
   }
   if (flock(fd, LOCK_EX | LOCK_NB) != 0) {
@@ -186,8 +213,8 @@ int lockStore(const std::string& directory, std::string& problem) {
 }  // namespace
 
 std::unique_ptr<LocalStore> LocalStore::open(const Directories& directories,
-                                             const PlatformConfiguration::Store& options, Clock& clock,
-                                             std::string& problem) {
+                                             const PlatformConfiguration::Store& options,
+                                             Clock& clock, std::string& problem) {
   const int lockFd = lockStore(directories.state, problem);
   if (lockFd < 0) return nullptr;
   const std::string path = directories.state + "/telemetry.db";
@@ -208,11 +235,7 @@ std::unique_ptr<LocalStore> LocalStore::open(const Directories& directories,
     return nullptr;
   }
   auto store = std::make_unique<SqliteStore>(lockFd, path, std::move(database), options, clock);
-  if (!note.empty()) {
-    VX_LOG(nullptr, Error, "the store was damaged and a fresh one is begun: %s", note.c_str());
-    store->writer().noteAtStart("moved_aside", note);
-  }
-  store->writer().start();
+  store->setDamage(std::move(note));
   return store;
 }
 

@@ -36,6 +36,9 @@ class LocalStore {
                                           std::string& problem);
   virtual ~LocalStore() = default;
 
+  // Starts the writer. Logs, so the platform must be installed; what is appended before is kept.
+  virtual void start() = 0;
+
   virtual VyrReporting& relay() = 0;
   virtual AnalyticsEventService& analytics() = 0;
   virtual PowerEventLog& power() = 0;

@@ -1,0 +1,249 @@
+#include "platform/linux/LinuxPlatform.h"
+
+#include <fcntl.h>
+#include <signal.h>
+#include <sys/resource.h>
+#include <sys/signalfd.h>
+#include <systemd/sd-daemon.h>
+#include <unistd.h>
+
+#include <cstdlib>
+#include <optional>
+#include <vector>
+
+#include "platform/Log.h"
+#include "platform/linux/CounterChannels.h"
+#include "platform/linux/EventLoop.h"
+#include "platform/linux/Executor.h"
+#include "platform/linux/LinuxDiagnosticFiles.h"
+#include "platform/linux/LinuxOrientation.h"
+#include "platform/linux/LocalStore.h"
+#include "platform/linux/PlatformConfiguration.h"
+#include "platform/linux/PreferencesWatcher.h"
+#include "platform/linux/SocketListener.h"
+#include "platform/linux/SystemLog.h"
+#include "platform/linux/SystemServices.h"
+#include "platform/linux/SystemThreading.h"
+#include "platform/linux/TomlPreferences.h"
+
+namespace vx::lnx {
+
+namespace {
+
+constexpr std::string_view kPreferencesNotification = "com.quorvel.sonik.reporting";
+constexpr std::string_view kPreferencesFile = "com.quorvel.sonik.toml";
+// Relay work that accepted messages may have caused before reading from clients pauses.
+constexpr std::size_t kRelayBacklogHigh = 64 << 10;
+constexpr std::size_t kRelayBacklogLow = 32 << 10;
+constexpr std::chrono::milliseconds kDrainTime{1500};
+constexpr std::chrono::milliseconds kStoreTime{1000};
+constexpr std::chrono::milliseconds kThreadTime{200};
+
+// A descriptor of the loop whose readiness means one call.
+class CallOnReady final : public EventLoop::Source {
+ public:
+  explicit CallOnReady(Function<void()> call) : call_(std::move(call)) {}
+  void onReady(uint32_t) override { call_(); }
+
+ private:
+  Function<void()> call_;
+};
+
+// The store and one descriptor per connection want more than the customary 1024.
+void raiseDescriptorLimit() {
+  rlimit limit{};
+  if (getrlimit(RLIMIT_NOFILE, &limit) != 0 || limit.rlim_cur >= limit.rlim_max) return;
+  limit.rlim_cur = limit.rlim_max;
+  setrlimit(RLIMIT_NOFILE, &limit);
+}
+
+PlatformConfiguration::Orientation withDefaults(PlatformConfiguration::Orientation orientation,
+                                                const Directories& directories) {
+  if (orientation.interfaceStateFile.empty()) {
+    orientation.interfaceStateFile = directories.runtime + "/interface-orientation";
+  }
+  return orientation;
+}
+
+class RunningPlatform final : public LinuxPlatform {
+ public:
+  RunningPlatform(const Directories& directories, const PlatformConfiguration& configuration)
+      : configuration_(configuration),
+        loop_(executor_, clock_),
+        listener_(loop_, executor_, clock_, configuration.listener),
+        preferences_(directories.configuration + "/preferences"),
+        channels_(configuration.drivers),
+        properties_(configuration.device),
+        orientation_(withDefaults(configuration.orientation, directories)),
+        diagnosticFiles_(directories.logs) {
+    log_.configure(configuration.log);
+    log_.setVerboseReader([this](std::string_view domain, std::string_view key) {
+      return preferences_.open(domain)->boolean(key);
+    });
+  }
+
+  ~RunningPlatform() override {
+    if (signalFd_ >= 0) ::close(signalFd_);
+  }
+
+  bool open(const Directories& directories, std::string& problem) {
+    if (!listener_.open(directories, problem)) return false;
+    watcher_.emplace(directories.configuration + "/preferences", directories.runtime + "/notify",
+                     std::vector<PreferencesWatcher::Notification>{
+                         {std::string(kPreferencesNotification), std::string(kPreferencesFile)}},
+                     configuration_.preferences, clock_);
+    store_ = LocalStore::open(directories, configuration_.store, clock_, problem);
+    if (store_ == nullptr) return false;
+    store_->setBackends(configuration_.relay.backends);
+    services_.emplace(Platform{
+        .serviceListener = listener_,
+        .workQueues = executor_,
+        .clock = clock_,
+        .threading = threading_,
+        .processInfo = processInfo_,
+        .processControl = processControl_,
+        .random = random_,
+        .preferences = preferences_,
+        .systemNotify = *watcher_,
+        .vyrReporting = store_->relay(),
+        .analytics = store_->analytics(),
+        .powerLog = store_->power(),
+        .channelReports = channels_,
+        .deviceProperties = properties_,
+        .orientation = orientation_,
+        .log = log_,
+        .trace = trace_,
+        .diagnosticFiles = diagnosticFiles_,
+    });
+    return true;
+  }
+
+  Platform& services() override { return *services_; }
+
+  void begin() override {
+    watcher_->start();
+    store_->start();
+    connect();
+  }
+  SystemLog& log() { return log_; }
+
+  int shutDown() override {
+    const Monotonic start = clock_.monotonic();
+    const bool drained = executor_.drain(start + kDrainTime);
+    if (!drained) VX_LOG(nullptr, Error, "relay work was left behind: it did not finish in time");
+    const bool stored = store_->close(clock_.monotonic() + kStoreTime);
+    const LocalStore::Counters counters = store_->counters();
+    VX_LOG(
+        nullptr, Info,
+        "stored: rows=%llu commits=%llu write_failures=%llu rows_lost=%llu log_lines_dropped=%llu",
+        static_cast<unsigned long long>(counters.rowsCommitted),
+        static_cast<unsigned long long>(counters.commits),
+        static_cast<unsigned long long>(counters.writeFailures),
+        static_cast<unsigned long long>(counters.rowsLost),
+        static_cast<unsigned long long>(log_.droppedLines()));
+    executor_.stop(clock_.monotonic() + kThreadTime);
+    const int status = drained && stored ? 0 : 1;
+    // A thread that could not be ended must not find the services destroyed.
+    if (status != 0) std::_Exit(status);
+    return status;
+  }
+
+ private:
+  // Everything that the event loop looks after besides connections.
+  void connect() {
+    store_->setDrainedHandler([this] { listener_.congestionEnded(); });
+    executor_.setUtilityLowWater(kRelayBacklogLow, [this] { listener_.congestionEnded(); });
+    listener_.setHooks({
+        .congested =
+            [this] {
+              return store_->isCongested() || executor_.utilityBacklog() > kRelayBacklogHigh;
+            },
+        .listening = [] { sd_notify(0, "READY=1"); },
+        .stopping = [] { sd_notify(0, "STOPPING=1"); },
+    });
+
+    sigset_t signals;
+    sigemptyset(&signals);
+    for (const int number : {SIGTERM, SIGINT, SIGUSR1}) sigaddset(&signals, number);
+    pthread_sigmask(SIG_BLOCK, &signals, nullptr);
+    signalFd_ = signalfd(-1, &signals, SFD_CLOEXEC | SFD_NONBLOCK);
+    (void)loop_.add(signalFd_, EPOLLIN, signalSource_);
+
+    watcher_->setBeforeFire([this](std::string_view) { log_.refreshVerbose(); });
+    if (watcher_->fd() >= 0) (void)loop_.add(watcher_->fd(), EPOLLIN, watcherSource_);
+    loop_.addDeadline([this] { return watcher_->nextDue(); }, [this] { watcher_->onDue(); });
+
+    uint64_t microseconds = 0;
+    if (sd_watchdog_enabled(1, &microseconds) > 0) {
+      watchdogInterval_ = std::chrono::microseconds(microseconds / 2);
+      nextPing_ = clock_.monotonic();
+      loop_.addDeadline([this]() -> std::optional<Monotonic> { return nextPing_; },
+                        [this] {
+                          sd_notify(0, "WATCHDOG=1");
+                          nextPing_ = clock_.monotonic() + watchdogInterval_;
+                        });
+    }
+  }
+
+  void onSignal() {
+    signalfd_siginfo info{};
+    while (read(signalFd_, &info, sizeof info) == static_cast<ssize_t>(sizeof info)) {
+      if (info.ssi_signo != SIGUSR1) {
+        loop_.stop();
+        continue;
+      }
+      const LocalStore::Counters counters = store_->counters();
+      VX_LOG(nullptr, Error,
+             "counters: %s rows=%llu commits=%llu write_failures=%llu relay_backlog=%zu",
+             listener_.counters().text().c_str(),
+             static_cast<unsigned long long>(counters.rowsCommitted),
+             static_cast<unsigned long long>(counters.commits),
+             static_cast<unsigned long long>(counters.writeFailures), executor_.utilityBacklog());
+    }
+  }
+
+  const PlatformConfiguration configuration_;
+  SystemClock clock_;
+  SystemThreading threading_;
+  SystemLog log_;
+  Executor executor_;
+  EventLoop loop_;
+  SocketListener listener_;
+  TomlPreferences preferences_;
+  CounterChannels channels_;
+  ConfiguredDeviceProperties properties_;
+  LinuxOrientation orientation_;
+  LinuxDiagnosticFiles diagnosticFiles_;
+  ProcProcessInfo processInfo_;
+  ImmediateProcessControl processControl_;
+  KernelRandom random_;
+  UsdtTracePoint trace_;
+  std::optional<PreferencesWatcher> watcher_;
+  std::unique_ptr<LocalStore> store_;
+  std::optional<Platform> services_;
+  int signalFd_ = -1;
+  CallOnReady signalSource_{[this] { onSignal(); }};
+  CallOnReady watcherSource_{[this] { watcher_->onReadable(); }};
+  std::chrono::nanoseconds watchdogInterval_{0};
+  Monotonic nextPing_{};
+};
+
+}  // namespace
+
+std::unique_ptr<LinuxPlatform> LinuxPlatform::start(std::string& problem) {
+  signal(SIGPIPE, SIG_IGN);
+  signal(SIGXFSZ, SIG_IGN);  // a file that may not grow is an error of its write
+  raiseDescriptorLimit();
+  const Directories directories = Directories::fromEnvironment();
+  std::vector<std::string> complaints;
+  const PlatformConfiguration configuration = PlatformConfiguration::load(directories, complaints);
+  auto running = std::make_unique<RunningPlatform>(directories, configuration);
+  for (const std::string& complaint : complaints) {
+    static constexpr LogSite kSite{__FILE_NAME__, __LINE__, "start", 0};
+    running->log().write(nullptr, LogLevel::Error, kSite, "configuration: " + complaint, 0);
+  }
+  if (!running->open(directories, problem)) return nullptr;
+  return running;
+}
+
+}  // namespace vx::lnx
