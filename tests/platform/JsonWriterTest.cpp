@@ -44,12 +44,12 @@ TEST(JsonWriter, WritesEveryKind) {
 TEST(JsonWriter, EscapesWhereverTheCharacterStands) {
   EXPECT_EQ(asJson(std::string_view("\0\x1F\b\f\n\r\t\"\\/\x7F", 11)),
             "\"\\u0000\\u001f\\b\\f\\n\\r\\t\\\"\\\\/\x7F\"");
-  for (std::size_t size = 1; size < 40; ++size) {
-    for (std::size_t at = 0; at < size; ++at) {
-      std::string text(size, '\x7F');
-      text[at] = '"';
-      EXPECT_EQ(asJson(text),
-                '"' + std::string(at, '\x7F') + "\\\"" + std::string(size - at - 1, '\x7F') + '"');
+  for (const auto& [special, escaped] : {std::pair('"', "\\\""), {'\\', "\\\\"}, {'\n', "\\n"}}) {
+    for (std::size_t at = 0; at < 20; ++at) {
+      std::string text(20, '\x7F');
+      text[at] = special;
+      EXPECT_EQ(asJson(text.substr(0, at + 1)), '"' + std::string(at, '\x7F') + escaped + '"');
+      EXPECT_EQ(asJson(text.substr(at)), '"' + (escaped + std::string(19 - at, '\x7F')) + '"');
     }
   }
   EXPECT_EQ(asJson(std::string(5000, '\n')).size(), 10002u);
