@@ -1,0 +1,167 @@
+// The client library: reports into the audio-telemetry service from any process.
+//
+//   vx::ReportingClient client;
+//   if (!client.connect().ok()) return;                     // reporting is off; nothing else
+//   changes client.createReportingSession(42); client.setServiceType(7, 42);
+//   client.startReportingSession(42, [](const auto&) {});   // answered when the session stops
+//   client.sendMessage(vx::PayloadBuilder().set("gain", 0.5).build(), 0x08000005, 1);
+//   client.stopReportingSession(42);
+//
+// No threads of its own, never blocks unless asked to, never aborts the caller, whatever the daemon
+// does.
+#pragma once
+
+#include <chrono>
+#include <cstddef>
+#include <cstdint>
+#include <deque>
+#include <functional>
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <variant>
+#include <vector>
+
+#include "platform/Function.h"
+#include "platform/Payload.h"
+
+namespace vx {
+
+// What went wrong with a call or the connection.
+struct ClientStatus {
+  enum class Code : uint8_t {
+    Ok,
+    NotConnected,  // connect() or reconnect() first
+    Disconnected,  // the daemon went away, or sent something that is not the protocol
+    BufferFull,    // the daemon is not reading; nothing of the call was kept
+    TimedOut,      // a blocking form's patience ended; the answer, if it comes, is ignored
+    Refused,  // the daemon answered with an error of the protocol (docs/protocol.md); see wireCode
+    ReportingError  // sendMessage: the service refused the message; see domain and wireCode
+  };
+  Code code = Code::Ok;
+  std::string text;    // a sentence for people
+  std::string domain;  // of a ReportingError
+  int64_t wireCode = 0;
+  bool ok() const { return code == Code::Ok; }
+};
+
+// A value, or why there is none.
+template <class T>
+struct ClientResult {
+  ClientStatus status;
+  T value{};
+  bool ok() const { return status.ok(); }
+};
+
+// The validation answer: an unknown reporter gives 0 and 65535.
+struct ReporterValidation {
+  int64_t reporterID = 0;
+  uint16_t serviceType = 65535;
+};
+
+// One connection to the service. Not thread-safe: one thread, or the caller's own lock. Callbacks
+// run inside process() and the blocking forms (and, when the connection is lost, inside whatever
+// call finds out); they may call back into the client, reconnect it or destroy it. Bounds:
+// maxBufferedBytes of calls not yet written.
+class ReportingClient {
+ public:
+  template <class T>
+  using Callback = Function<void(const ClientResult<T>&)>;
+  using Done = std::monostate;
+  static constexpr std::chrono::milliseconds kDefaultPatience{5000};
+
+  struct Options {
+    std::size_t maxBufferedBytes = 1 << 20;
+    // Bytes of calls that are gathered before one write; process() and flush() write whatever there
+    // is.
+    std::size_t writeAtBytes = 16 << 10;
+  };
+
+  ReportingClient();
+  explicit ReportingClient(const Options& options);
+  ~ReportingClient();  // an abrupt end, unless goodbye() came first; pending callbacks are not
+                       // called
+  ReportingClient(const ReportingClient&) = delete;
+  ReportingClient& operator=(const ReportingClient&) = delete;
+
+  // "" stands for $VXREPORTING_SOCKET, or /run/vxreporting/service.socket. Waits for the daemon's
+  // hello.
+  ClientStatus connect(std::string socketPath = "",
+                       std::chrono::milliseconds patience = kDefaultPatience);
+  // Takes an already connected descriptor (tests, sandboxes).
+  ClientStatus adopt(int connectedFd, std::chrono::milliseconds patience = kDefaultPatience);
+  ClientStatus reconnect(std::chrono::milliseconds patience = kDefaultPatience);
+  bool isConnected() const;
+  // An orderly end: everything sent before is run and answered, then the daemon closes. Waits for
+  // that.
+  ClientStatus goodbye(std::chrono::milliseconds patience = kDefaultPatience);
+  // Ends at once; every pending call fails.
+  void disconnect();
+
+  // For the caller's own poll loop: wait for reading, and for writing when wantsWrite(), then call
+  // process().
+  int fd() const;
+  bool wantsWrite() const;
+  // Reads what is there, writes what is buffered, runs callbacks. Never blocks.
+  ClientStatus process();
+  // Writes what is buffered as far as the socket takes it. Never blocks.
+  ClientStatus flush();
+
+  // --- never blocking: the callback is called once, with the answer or the reason why there will
+  // be none. The returned status says whether the call was taken; when it was not, the callback is
+  // not called. ---
+  ClientStatus createReportingSessionAsync(int64_t reporterID, Callback<bool> done);
+  ClientStatus setServiceTypeAsync(uint16_t serviceType, int64_t reporterID, Callback<bool> done);
+  ClientStatus getServiceTypeAsync(int64_t reporterID, Callback<uint16_t> done);
+  ClientStatus setConfigurationAsync(const Payload& configuration, int64_t reporterID,
+                                     Callback<bool> done);
+  // Answered when the session is stopped.
+  ClientStatus startReportingSession(int64_t reporterID, Callback<bool> done);
+  // Without identifiers: to every started session of the service. An empty list routes nothing.
+  ClientStatus sendMessageAsync(const Payload& message, uint32_t category, uint16_t type,
+                                Callback<Done> done = nullptr);
+  ClientStatus sendMessageAsync(const Payload& message, uint32_t category, uint16_t type,
+                                const std::vector<int64_t>& reporterIDs,
+                                Callback<Done> done = nullptr);
+  ClientStatus stopReportingSessionAsync(int64_t reporterID, Callback<bool> done);
+  ClientStatus destroyReportingSessionAsync(int64_t reporterID, Callback<bool> done);
+  ClientStatus validateReporterAsync(int64_t reporterID, Callback<ReporterValidation> done);
+  ClientStatus getAllReportersAsync(Callback<std::vector<int64_t>> done);
+  // Ends the daemon. There is no answer; the connection ends.
+  ClientStatus killService();
+
+  // --- blocking, for scripts and tests ---
+  ClientResult<bool> createReportingSession(int64_t reporterID,
+                                            std::chrono::milliseconds patience = kDefaultPatience);
+  ClientResult<bool> setServiceType(uint16_t serviceType, int64_t reporterID,
+                                    std::chrono::milliseconds patience = kDefaultPatience);
+  ClientResult<uint16_t> getServiceType(int64_t reporterID,
+                                        std::chrono::milliseconds patience = kDefaultPatience);
+  ClientResult<bool> setConfiguration(const Payload& configuration, int64_t reporterID,
+                                      std::chrono::milliseconds patience = kDefaultPatience);
+  ClientStatus sendMessage(const Payload& message, uint32_t category, uint16_t type,
+                           std::chrono::milliseconds patience = kDefaultPatience);
+  ClientStatus sendMessage(const Payload& message, uint32_t category, uint16_t type,
+                           const std::vector<int64_t>& reporterIDs,
+                           std::chrono::milliseconds patience = kDefaultPatience);
+  ClientResult<bool> stopReportingSession(int64_t reporterID,
+                                          std::chrono::milliseconds patience = kDefaultPatience);
+  ClientResult<bool> destroyReportingSession(int64_t reporterID,
+                                             std::chrono::milliseconds patience = kDefaultPatience);
+  ClientResult<ReporterValidation> validateReporter(
+      int64_t reporterID, std::chrono::milliseconds patience = kDefaultPatience);
+  ClientResult<std::vector<int64_t>> getAllReporters(
+      std::chrono::milliseconds patience = kDefaultPatience);
+
+  std::size_t pendingCalls() const;
+  uint64_t unknownAnswers() const;  // answers to calls that were not made, or answered already
+
+  struct Connection;
+
+ private:
+  // Callbacks may destroy the client, so its state outlives the call that runs them.
+  std::shared_ptr<Connection> connection_;
+};
+
+}  // namespace vx
