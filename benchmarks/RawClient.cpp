@@ -18,9 +18,9 @@ constexpr uint64_t kCallNumber = 1;       // every ordinary call; answers need n
 constexpr uint64_t kHeldNumber = 900000;  // starts, whose answers come later and do not count
 
 std::vector<uint8_t> frameOf(const std::vector<uint8_t>& body) {
-  std::vector<uint8_t> frame(4);
-  for (int i = 0; i < 4; ++i)
-    frame[static_cast<std::size_t>(i)] = static_cast<uint8_t>(body.size() >> (8 * i));
+  std::vector<uint8_t> frame;
+  frame.reserve(4 + body.size());
+  for (int i = 0; i < 4; ++i) frame.push_back(static_cast<uint8_t>(body.size() >> (8 * i)));
   frame.insert(frame.end(), body.begin(), body.end());
   return frame;
 }

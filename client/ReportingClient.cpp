@@ -8,6 +8,7 @@
 #include <cerrno>
 #include <cstdlib>
 #include <cstring>
+#include <map>
 #include <utility>
 
 #include "platform/CborWriter.h"
@@ -23,6 +24,7 @@ constexpr const char* kDefaultSocket = "/run/vxreporting/service.socket";
 constexpr int64_t kProtocolVersion = 1;
 constexpr std::size_t kLengthBytes = 4;
 constexpr std::size_t kReadBytes = 64 << 10;
+constexpr std::size_t kPendingSlack = 64;
 constexpr std::size_t kLargestFrame = 64 << 20;  // of the daemon's; more is not the protocol
 
 enum Operation : uint8_t {
@@ -108,10 +110,15 @@ struct ReportingClient::Connection : std::enable_shared_from_this<Connection> {
     close(fd);
     fd = -1;
     std::deque<Pending> failed;
+    std::map<uint64_t, Answer> failedHeld;
     failed.swap(pending);
+    failedHeld.swap(held);
     firstPending = nextNumber;
     pendingCount = 0;
     const auto self = shared_from_this();  // a callback may destroy the client
+    for (auto& [number, answer] : failedHeld) {
+      if (answer) answer(why, nullptr);
+    }
     for (Pending& call : failed) {
       if (call.waiting && call.answer) call.answer(why, nullptr);
     }
@@ -269,16 +276,25 @@ struct ReportingClient::Connection : std::enable_shared_from_this<Connection> {
 
   void answer(const Value& numberValue, const ClientStatus& status, const Value* value) {
     const uint64_t number = numberValue.asUInt64();
-    if (numberValue.kind() != ValueKind::Integer || number < firstPending ||
-        number - firstPending >= pending.size() || !pending[number - firstPending].waiting) {
+    Answer answered;
+    if (const auto older = held.find(number); older != held.end()) {
+      answered = std::move(older->second);
+      held.erase(older);
+    } else if (numberValue.kind() == ValueKind::Integer && number >= firstPending &&
+               number - firstPending < pending.size() && pending[number - firstPending].waiting) {
+      Pending& call = pending[number - firstPending];
+      call.waiting = false;
+      answered = std::move(call.answer);
+    } else {
       ++unknownAnswers;
       return;
     }
-    Pending& call = pending[number - firstPending];
-    call.waiting = false;
     --pendingCount;
-    const Answer answered = std::move(call.answer);
-    while (!pending.empty() && !pending.front().waiting) {
+    while (!pending.empty() &&
+           (!pending.front().waiting || pending.size() > 2 * pendingCount + kPendingSlack)) {
+      // A call that is answered much later than its successors, a start for one, must not keep
+      // their places taken.
+      if (pending.front().waiting) held.emplace(firstPending, std::move(pending.front().answer));
       pending.pop_front();
       ++firstPending;
     }
@@ -321,9 +337,9 @@ struct ReportingClient::Connection : std::enable_shared_from_this<Connection> {
   bool helloSeen = false;
   bool goodbyeSeen = false;
   std::string lastError;
-  // Calls are numbered in turn: the one called n is at n - firstPending. A held start keeps its
-  // place.
+  // Calls are numbered in turn: the one called n is at n - firstPending, or among the held ones.
   std::deque<Pending> pending;
+  std::map<uint64_t, Answer> held;
   uint64_t firstPending = 1;
   uint64_t nextNumber = 1;
   std::size_t pendingCount = 0;

@@ -1,8 +1,10 @@
 # vx_options: what every target of the project is compiled with.
 add_library(vx_options INTERFACE)
 target_include_directories(vx_options INTERFACE ${PROJECT_SOURCE_DIR})
-target_compile_options(vx_options INTERFACE -Wall -Wextra -Wshadow=local -Wnon-virtual-dtor -Wold-style-cast
-                                            -Wcast-qual -Wformat=2 -Wno-format-nonliteral -Wno-unused-parameter)
+target_compile_options(vx_options INTERFACE -Wall -Wextra -Wnon-virtual-dtor -Wold-style-cast
+                                            -Wcast-qual -Wformat=2 -Wno-format-nonliteral
+                                            $<$<CXX_COMPILER_ID:GNU>:-Wno-restrict> $<$<CXX_COMPILER_ID:GNU>:-Wshadow=local>
+                                            $<$<CXX_COMPILER_ID:Clang>:-Wshadow> -Wno-unused-parameter)
 if(VX_WERROR)
   target_compile_options(vx_options INTERFACE -Werror)
 endif()

@@ -133,7 +133,9 @@ class Client:
         f = self.next_frame()
         if f is None:
             return False
-        if f[0] == GOODBYE:
+        if f[0] == HELLO:
+            self.hello = f
+        elif f[0] == GOODBYE:
             self.goodbye = True
         elif f[0] == ERROR and f[1] is None:
             self.connection_error = f
@@ -208,6 +210,9 @@ class Daemon:
                                             preexec_fn=self.preexec, close_fds=self.preexec is None)
         if wait:
             self.wait_until(self.listening, "the daemon listens")
+            # The probe above was a client too; what follows starts from a clean list.
+            self.wait_until(lambda: "dealloc" in self.log(), "the probe is gone")
+            self.quiet_before = len(self.log())
 
     def listening(self):
         if self.process.poll() is not None:
@@ -233,6 +238,9 @@ class Daemon:
         c = Client(self.socket_path, **options)
         self.clients.append(c)
         return c
+
+    def log_since_start(self):
+        return self.log()[self.quiet_before:]
 
     def log(self):
         with open(self.log_path, errors="replace") as f:

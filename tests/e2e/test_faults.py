@@ -81,9 +81,9 @@ class BadInput(DaemonTest):
         c.until_closed()
         self.assertEqual(c.answers[3][0][2], [1])
         self.assertNotIn(4, c.answers)
-        d.wait_until(lambda: "removing" in d.log(), "the client is removed")
-        self.assertNotIn("InterruptionHandler", d.log())
-        self.assertIn("InvalidationHandler: connection exited process=", d.log())
+        d.wait_until(lambda: "removing" in d.log_since_start(), "the client is removed")
+        self.assertNotIn("InterruptionHandler", d.log_since_start())
+        self.assertIn("InvalidationHandler: connection exited process=", d.log_since_start())
 
     def test_session_limit_is_an_answer_of_its_own(self):
         d = self.daemon(config="[listener]\nmax_sessions_per_connection = 3\n")
@@ -97,12 +97,11 @@ class BadInput(DaemonTest):
 
     def test_more_connections_than_allowed(self):
         d = self.daemon(config="[listener]\nmax_connections = 3\n")
-        d.wait_until(lambda: "removing" in d.log(), "the start-up probe is gone")
         kept = [d.client() for _ in range(3)]
         refused = d.client(hello=False).until_closed()
         self.assertEqual(refused.connection_error[2], 6)
         kept.pop().close()
-        d.wait_until(lambda: d.log().count("removing") >= 2, "its place is free")
+        d.wait_until(lambda: "removing" in d.log_since_start(), "its place is free")
         self.assert_unharmed(d)
 
     def test_client_that_never_reads_is_cut_and_harms_nobody(self):
@@ -132,7 +131,10 @@ class BadInput(DaemonTest):
         for _ in range(80):
             c = Client(d.socket_path, hello=False)
             crowd.append(c)
-            c.raw(frame(HELLO, 1))
+            try:
+                c.raw(frame(HELLO, 1))
+            except BrokenPipeError:
+                pass  # turned away before the hello was sent; the reason is there to read all the same
             f = c.next_frame()
             refused += f is not None and f[0] == ERROR and f[2] == 6
         self.assertGreater(refused, 20)

@@ -1,0 +1,171 @@
+// vxreport: talks to the service from a shell. `vxreport help` lists the commands; `vxreport
+// script` reads them from standard input, one a line, over one connection.
+#include <cstdio>
+#include <cstdlib>
+#include <iostream>
+#include <sstream>
+#include <string>
+#include <vector>
+
+#include "client/ReportingClient.h"
+
+namespace {
+
+using vx::PayloadBuilder;
+using Words = std::vector<std::string>;
+
+constexpr const char* kHelp =
+    "commands:\n"
+    "  create ID                     a reporting session\n"
+    "  type ID SERVICE_TYPE          0 generic, 2 telephony, 3 haptics, 4 alarms, 7 longformaudio "
+    "...\n"
+    "  configure ID KEY=VALUE...     for example HostApplicationDisplayID=com.example.app\n"
+    "  start ID                      answered when the session stops\n"
+    "  send CATEGORY TYPE KEY=VALUE...           to every started session; CATEGORY such as "
+    "0x08000005\n"
+    "  sendto ID[,ID...] CATEGORY TYPE KEY=VALUE...\n"
+    "  stop ID / destroy ID / validate ID / service ID\n"
+    "  reporters                     every client's sessions\n"
+    "  kill                          ends the service\n"
+    "  script                        reads commands from standard input over one connection\n"
+    "values: true, false, whole and floating numbers, everything else is text\n"
+    "the socket: $VXREPORTING_SOCKET, or /run/vxreporting/service.socket\n";
+
+class UsageError : public std::exception {};
+
+int64_t number(const std::string& text) {
+  char* end = nullptr;
+  const long long value = std::strtoll(text.c_str(), &end, 0);
+  if (end == text.c_str() || *end != '\0') throw UsageError();
+  return value;
+}
+
+vx::Payload payload(const Words& words, std::size_t from) {
+  PayloadBuilder builder;
+  for (std::size_t i = from; i < words.size(); ++i) {
+    const std::size_t equals = words[i].find('=');
+    if (equals == std::string::npos) throw UsageError();
+    const std::string key = words[i].substr(0, equals);
+    const std::string value = words[i].substr(equals + 1);
+    char* end = nullptr;
+    if (value == "true" || value == "false") {
+      builder.set(key, value == "true");
+    } else if (const long long whole = std::strtoll(value.c_str(), &end, 10);
+               !value.empty() && *end == '\0') {
+      builder.set(key, int64_t{whole});
+    } else if (const double real = std::strtod(value.c_str(), &end);
+               !value.empty() && *end == '\0') {
+      builder.set(key, real);
+    } else {
+      builder.set(key, value);
+    }
+  }
+  return builder.build();
+}
+
+int report(const vx::ClientStatus& status, const std::string& answer) {
+  if (status.ok())
+    std::printf("%s\n", answer.c_str());
+  else
+    std::fprintf(stderr, "vxreport: %s\n", status.text.c_str());
+  return status.ok() ? 0 : 1;
+}
+
+int answered(const vx::ClientResult<bool>& result) {
+  return report(result.status, result.value ? "true" : "false");
+}
+
+const std::string& at(const Words& words, std::size_t i) {
+  if (i >= words.size()) throw UsageError();
+  return words[i];
+}
+
+int run(vx::ReportingClient& client, const Words& words) {
+  const std::string& command = at(words, 0);
+  if (command == "create") return answered(client.createReportingSession(number(at(words, 1))));
+  if (command == "type") {
+    return answered(
+        client.setServiceType(static_cast<uint16_t>(number(at(words, 2))), number(at(words, 1))));
+  }
+  if (command == "configure")
+    return answered(client.setConfiguration(payload(words, 2), number(at(words, 1))));
+  if (command == "start") {
+    const std::string id = at(words, 1);
+    return report(client.startReportingSession(
+                      number(id),
+                      [id](const auto& result) {
+                        std::printf("session %s: %s\n", id.c_str(),
+                                    result.ok() ? "ended" : result.status.text.c_str());
+                      }),
+                  "started; answered when it stops");
+  }
+  if (command == "send") {
+    return report(client.sendMessage(payload(words, 3), static_cast<uint32_t>(number(at(words, 1))),
+                                     static_cast<uint16_t>(number(at(words, 2)))),
+                  "taken");
+  }
+  if (command == "sendto") {
+    std::vector<int64_t> ids;
+    std::stringstream list(at(words, 1));
+    for (std::string id; std::getline(list, id, ',');) ids.push_back(number(id));
+    return report(client.sendMessage(payload(words, 4), static_cast<uint32_t>(number(at(words, 2))),
+                                     static_cast<uint16_t>(number(at(words, 3))), ids),
+                  "taken");
+  }
+  if (command == "stop") return answered(client.stopReportingSession(number(at(words, 1))));
+  if (command == "destroy") return answered(client.destroyReportingSession(number(at(words, 1))));
+  if (command == "service") {
+    const auto result = client.getServiceType(number(at(words, 1)));
+    return report(result.status, std::to_string(result.value));
+  }
+  if (command == "validate") {
+    const auto result = client.validateReporter(number(at(words, 1)));
+    return report(result.status, "reporterID=" + std::to_string(result.value.reporterID) +
+                                     " serviceType=" + std::to_string(result.value.serviceType));
+  }
+  if (command == "reporters") {
+    const auto result = client.getAllReporters();
+    std::string text;
+    for (const int64_t id : result.value) text += (text.empty() ? "" : " ") + std::to_string(id);
+    return report(result.status, text);
+  }
+  if (command == "kill") return report(client.killService(), "asked the service to end");
+  throw UsageError();
+}
+
+int runScript(vx::ReportingClient& client) {
+  int worst = 0;
+  for (std::string line; std::getline(std::cin, line);) {
+    std::stringstream stream(line);
+    Words words;
+    for (std::string word; stream >> word;) words.push_back(word);
+    if (words.empty() || words[0][0] == '#') continue;
+    try {
+      worst |= run(client, words);
+    } catch (const UsageError&) {
+      std::fprintf(stderr, "vxreport: cannot use: %s\n", line.c_str());
+      worst = 2;
+    }
+  }
+  return worst;
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  const Words words(argv + 1, argv + argc);
+  if (words.empty() || words[0] == "help" || words[0] == "--help") {
+    std::fputs(kHelp, words.empty() ? stderr : stdout);
+    return words.empty() ? 2 : 0;
+  }
+  try {
+    vx::ReportingClient client;
+    if (const vx::ClientStatus status = client.connect(); !status.ok()) return report(status, "");
+    const int status = words[0] == "script" ? runScript(client) : run(client, words);
+    if (client.isConnected()) (void)client.goodbye();
+    return status;
+  } catch (const UsageError&) {
+    std::fputs(kHelp, stderr);
+    return 2;
+  }
+}
