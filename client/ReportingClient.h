@@ -1,9 +1,10 @@
 // The client library: reports into the audio-telemetry service from any process.
 //
 //   vx::ReportingClient client;
-//   if (!client.connect().ok()) return;                     // reporting is off; nothing else
-//   changes client.createReportingSession(42); client.setServiceType(7, 42);
-//   client.startReportingSession(42, [](const auto&) {});   // answered when the session stops
+//   if (!client.connect().ok()) return;  // no reporting; nothing else changes
+//   client.createReportingSession(42);
+//   client.setServiceType(7, 42);
+//   client.startReportingSession(42, [](const auto&) {});  // answered when the session stops
 //   client.sendMessage(vx::PayloadBuilder().set("gain", 0.5).build(), 0x08000005, 1);
 //   client.stopReportingSession(42);
 //
@@ -14,12 +15,8 @@
 #include <chrono>
 #include <cstddef>
 #include <cstdint>
-#include <deque>
-#include <functional>
 #include <memory>
-#include <optional>
 #include <string>
-#include <string_view>
 #include <variant>
 #include <vector>
 
@@ -37,7 +34,8 @@ struct ClientStatus {
     BufferFull,    // the daemon is not reading; nothing of the call was kept
     TimedOut,      // a blocking form's patience ended; the answer, if it comes, is ignored
     Refused,  // the daemon answered with an error of the protocol (docs/protocol.md); see wireCode
-    ReportingError  // sendMessage: the service refused the message; see domain and wireCode
+    ReportingError,  // sendMessage: the service refused the message; see domain and wireCode
+    TooLarge         // the call does not fit into a frame, or never into the buffer
   };
   Code code = Code::Ok;
   std::string text;    // a sentence for people
@@ -60,10 +58,12 @@ struct ReporterValidation {
   uint16_t serviceType = 65535;
 };
 
+class ServiceConnection;
+
 // One connection to the service. Not thread-safe: one thread, or the caller's own lock. Callbacks
 // run inside process() and the blocking forms (and, when the connection is lost, inside whatever
-// call finds out); they may call back into the client, reconnect it or destroy it. Bounds:
-// maxBufferedBytes of calls not yet written.
+// call finds out); they may call back into the client, reconnect it or destroy it. Bounds: Options,
+// and what is read: one frame.
 class ReportingClient {
  public:
   template <class T>
@@ -72,7 +72,8 @@ class ReportingClient {
   static constexpr std::chrono::milliseconds kDefaultPatience{5000};
 
   struct Options {
-    std::size_t maxBufferedBytes = 1 << 20;
+    std::size_t maxBufferedBytes = 1 << 20;  // of calls not yet written
+    std::size_t maxPendingCalls = 65536;     // calls not yet answered, held starts included
     // Bytes of calls that are gathered before one write; process() and flush() write whatever there
     // is.
     std::size_t writeAtBytes = 16 << 10;
@@ -86,10 +87,11 @@ class ReportingClient {
   ReportingClient& operator=(const ReportingClient&) = delete;
 
   // "" stands for $VXREPORTING_SOCKET, or /run/vxreporting/service.socket. Waits for the daemon's
-  // hello.
+  // hello. Pending calls of an earlier connection fail first; when one of their callbacks connects
+  // anew, that connection stays.
   ClientStatus connect(std::string socketPath = "",
                        std::chrono::milliseconds patience = kDefaultPatience);
-  // Takes an already connected descriptor (tests, sandboxes).
+  // Takes an already connected descriptor (tests, sandboxes), in blocking mode.
   ClientStatus adopt(int connectedFd, std::chrono::milliseconds patience = kDefaultPatience);
   ClientStatus reconnect(std::chrono::milliseconds patience = kDefaultPatience);
   bool isConnected() const;
@@ -103,7 +105,7 @@ class ReportingClient {
   // process().
   int fd() const;
   bool wantsWrite() const;
-  // Reads what is there, writes what is buffered, runs callbacks. Never blocks.
+  // Writes what is buffered, reads what is there (up to 64 KiB), runs callbacks. Never blocks.
   ClientStatus process();
   // Writes what is buffered as far as the socket takes it. Never blocks.
   ClientStatus flush();
@@ -157,11 +159,9 @@ class ReportingClient {
   std::size_t pendingCalls() const;
   uint64_t unknownAnswers() const;  // answers to calls that were not made, or answered already
 
-  struct Connection;
-
  private:
   // Callbacks may destroy the client, so its state outlives the call that runs them.
-  std::shared_ptr<Connection> connection_;
+  std::shared_ptr<ServiceConnection> connection_;
 };
 
 }  // namespace vx

@@ -1,0 +1,414 @@
+#include "client/ServiceConnection.h"
+
+#include <poll.h>
+#include <sys/socket.h>
+#include <sys/time.h>
+#include <sys/un.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <climits>
+#include <cstring>
+#include <optional>
+#include <utility>
+
+namespace vx {
+
+namespace {
+
+using SteadyClock = std::chrono::steady_clock;
+using Code = ClientStatus::Code;
+
+constexpr int64_t kProtocolVersion = 1;
+constexpr std::size_t kLengthBytes = 4;
+constexpr std::size_t kReadBytes = 64 << 10;
+// A buffer larger than this is given back when it is empty.
+constexpr std::size_t kKeptBytes = 256 << 10;
+// Either direction, until the service's hello says otherwise; and what is believed of its word.
+constexpr std::size_t kDefaultFrameBytes = 1 << 20;
+constexpr std::size_t kLargestFrameBytes = 64 << 20;
+// Reads of what a service that takes no more may still have said.
+constexpr int kLastReads = 64;
+constexpr std::chrono::hours kLongestPatience{24 * 365};
+
+enum FrameKind : uint8_t { kHello = 0, kCall = 1, kReply = 2, kError = 3, kGoodbye = 4 };
+
+ClientStatus failure(Code code, std::string text) { return {code, std::move(text), "", 0}; }
+
+timeval timeOf(std::chrono::milliseconds time) {
+  return {.tv_sec = static_cast<time_t>(time.count() / 1000),
+          .tv_usec = static_cast<suseconds_t>(time.count() % 1000 * 1000)};
+}
+
+}  // namespace
+
+ServiceConnection::Wait::Wait(Patience wanted)
+    : patience(std::clamp<Patience>(wanted, Patience(0), kLongestPatience)),
+      deadline(SteadyClock::now() + patience) {}
+
+ServiceConnection::~ServiceConnection() {
+  if (fd_ >= 0) close(fd_);
+}
+
+// ---------------------------------------------------------------------------------------------------------------------
+// Connecting and ending
+
+ClientStatus ServiceConnection::open(const std::string& path, Patience patience) {
+  const auto self = shared_from_this();
+  socketPath_ = path;
+  disconnect(failure(Code::Disconnected, "the connection was made anew"));
+  if (abandoned_ || isConnected()) return {};  // a callback of the old connection has seen to it
+  sockaddr_un address{};
+  address.sun_family = AF_UNIX;
+  if (path.size() >= sizeof address.sun_path)
+    return failure(Code::NotConnected,
+                   "the socket path " + path + " is too long for a Unix socket");
+  std::memcpy(address.sun_path, path.c_str(), path.size() + 1);
+  const int made = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  int error = made < 0 ? errno : 0;
+  if (made >= 0) {
+    // Connecting waits while the service's queue of new connections is full; this bounds it.
+    const timeval limit = timeOf(std::max(Wait(patience).patience, Patience(1)));
+    setsockopt(made, SOL_SOCKET, SO_SNDTIMEO, &limit, sizeof limit);
+    while (::connect(made, reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0) {
+      error = errno;
+      if (error != EINTR) break;
+      error = 0;
+    }
+  }
+  if (error == 0) return begin(made, patience);
+  if (made >= 0) close(made);
+  return failure(Code::NotConnected,
+                 "cannot connect to " + path + ": " +
+                     (error == EAGAIN ? "it takes no connections" : std::strerror(error)) +
+                     " (is vxreportingd running? set VXREPORTING_SOCKET to its socket)");
+}
+
+ClientStatus ServiceConnection::adopt(int connectedFd, Patience patience) {
+  const auto self = shared_from_this();
+  disconnect(failure(Code::Disconnected, "the connection was made anew"));
+  if (abandoned_ || isConnected()) {  // a callback of the old connection has seen to it
+    close(connectedFd);
+    return {};
+  }
+  return begin(connectedFd, patience);
+}
+
+ClientStatus ServiceConnection::begin(int connectedFd, Patience patience) {
+  fd_ = connectedFd;
+  ++generation_;
+  in_.clear();
+  inBegin_ = inEnd_ = 0;
+  out_.clear();
+  outBegin_ = 0;
+  writeAt_ = options_.writeAtBytes;
+  receiveTimeout_ = Patience(0);
+  largestFrame_ = kDefaultFrameBytes;
+  helloSeen_ = goodbyeSeen_ = false;
+  serviceError_.clear();
+  const std::size_t start = beginFrame();
+  CborWriter hello(out_);
+  hello.array(2);
+  hello.integer(kHello);
+  hello.integer(kProtocolVersion);
+  endFrame(start);
+  const uint64_t generation = generation_;
+  const ClientStatus status = waitUntil([this] { return helloSeen_; }, patience);
+  if (status.ok())
+    acceptsCalls_ = true;
+  else if (generation == generation_)
+    disconnect(status);
+  return status;
+}
+
+ClientStatus ServiceConnection::sayGoodbye(Patience patience) {
+  const auto self = shared_from_this();
+  if (!isConnected()) return whyNoCalls();
+  acceptsCalls_ = false;
+  const std::size_t start = beginFrame();
+  CborWriter goodbye(out_);
+  goodbye.array(1);
+  goodbye.integer(kGoodbye);
+  endFrame(start);
+  const uint64_t generation = generation_;
+  ClientStatus status = waitUntil([&] { return generation != generation_; }, patience);
+  if (generation == generation_) disconnect(failure(Code::Disconnected, "said goodbye"));
+  return status;
+}
+
+void ServiceConnection::disconnect(const ClientStatus& why) {
+  if (fd_ < 0) return;
+  const auto self = shared_from_this();
+  const ClientStatus reason = why;
+  ended_ = reason;
+  close(fd_);
+  fd_ = -1;
+  acceptsCalls_ = false;
+  ++generation_;
+  for (const CallAnswer& failed : calls_.takeAll()) {
+    if (abandoned_) return;
+    deliver(failed, reason, nullptr);
+  }
+}
+
+void ServiceConnection::abandon() {
+  abandoned_ = true;
+  disconnect(failure(Code::Disconnected, "the client was destroyed"));
+}
+
+ServiceConnection::Received ServiceConnection::lost(const std::string& what) {
+  disconnect(failure(Code::Disconnected, serviceError_.empty() ? what : serviceError_));
+  return Received::Ended;
+}
+
+ClientStatus ServiceConnection::whyNoCalls() const {
+  if (isConnected()) return failure(Code::NotConnected, "goodbye has been said");
+  return failure(Code::NotConnected,
+                 "not connected to the service" + (ended_.ok() ? "" : " (" + ended_.text + ")"));
+}
+
+// ---------------------------------------------------------------------------------------------------------------------
+// Writing
+
+std::size_t ServiceConnection::beginFrame() {
+  const std::size_t start = out_.size();
+  out_.resize(start + kLengthBytes);
+  return start;
+}
+
+void ServiceConnection::endFrame(std::size_t start) {
+  const std::size_t length = out_.size() - start - kLengthBytes;
+  for (std::size_t i = 0; i < kLengthBytes; ++i)
+    out_[start + i] = static_cast<uint8_t>(length >> (8 * i));
+}
+
+std::size_t ServiceConnection::beginCall(ServiceOperation operation, std::size_t arguments) {
+  const std::size_t start = beginFrame();
+  CborWriter call(out_);
+  call.array(3 + arguments);
+  call.integer(kCall);
+  call.unsignedInteger(calls_.nextNumber());
+  call.integer(static_cast<int64_t>(operation));
+  return start;
+}
+
+ClientStatus ServiceConnection::endCall(std::size_t start, CallAnswer answer) {
+  endFrame(start);
+  const std::size_t bytes = out_.size() - start;
+  if (bytes - kLengthBytes > largestFrame_ || bytes > options_.maxBufferedBytes) {
+    out_.resize(start);
+    return failure(Code::TooLarge, "a call of " + std::to_string(bytes) +
+                                       " bytes; the service takes " +
+                                       std::to_string(largestFrame_) + ", the buffer " +
+                                       std::to_string(options_.maxBufferedBytes));
+  }
+  const bool tooManyCalls = calls_.size() >= options_.maxPendingCalls;
+  if (tooManyCalls || out_.size() - outBegin_ > options_.maxBufferedBytes) {
+    const int error = writeUpTo(start);
+    if (error != 0 || tooManyCalls || out_.size() - outBegin_ > options_.maxBufferedBytes) {
+      out_.resize(start);
+      if (error != 0) return lostWhileSending(error);
+      trimOutput();
+      return failure(Code::BufferFull,
+                     tooManyCalls
+                         ? std::to_string(calls_.size()) + " calls wait for their answers"
+                         : "the service is not reading; " +
+                               std::to_string(out_.size() - outBegin_) + " bytes wait already");
+    }
+  }
+  calls_.add(std::move(answer));
+  if (out_.size() - outBegin_ >= writeAt_) (void)flush();  // a failure is the callbacks' to tell
+  return {};
+}
+
+int ServiceConnection::writeUpTo(std::size_t end) {
+  while (outBegin_ < end) {
+    const ssize_t sent =
+        send(fd_, out_.data() + outBegin_, end - outBegin_, MSG_DONTWAIT | MSG_NOSIGNAL);
+    if (sent >= 0) {
+      outBegin_ += static_cast<std::size_t>(sent);
+    } else if (errno == EAGAIN || errno == EWOULDBLOCK) {
+      break;
+    } else if (errno != EINTR) {
+      return errno;
+    }
+  }
+  return 0;
+}
+
+void ServiceConnection::trimOutput() {
+  if (outBegin_ == out_.size()) {
+    if (out_.capacity() > kKeptBytes)
+      out_ = {};
+    else
+      out_.clear();
+    outBegin_ = 0;
+  } else if (outBegin_ > out_.size() / 2) {
+    out_.erase(out_.begin(), out_.begin() + static_cast<std::ptrdiff_t>(outBegin_));
+    outBegin_ = 0;
+  }
+  // While the socket is full, a system call per call made would be for nothing.
+  writeAt_ = out_.size() - outBegin_ + options_.writeAtBytes;
+}
+
+ClientStatus ServiceConnection::flush() {
+  if (fd_ < 0) return whyNoCalls();
+  if (!wantsWrite()) return {};
+  if (const int error = writeUpTo(out_.size()); error != 0) return lostWhileSending(error);
+  trimOutput();
+  return {};
+}
+
+// The service takes no more, but what it said before it left is still to be read.
+ClientStatus ServiceConnection::lostWhileSending(int error) {
+  const auto self = shared_from_this();
+  const uint64_t generation = generation_;
+  for (int i = 0; i < kLastReads && receive(MSG_DONTWAIT) == Received::Something; ++i) {
+    if (generation != generation_) break;
+  }
+  if (generation == generation_)
+    lost(std::string("the service went away: ") + std::strerror(error));
+  return ended_;
+}
+
+// ---------------------------------------------------------------------------------------------------------------------
+// Reading
+
+ClientStatus ServiceConnection::process() {
+  if (fd_ < 0) return whyNoCalls();
+  const auto self = shared_from_this();
+  const uint64_t generation = generation_;
+  if (ClientStatus status = flush(); !status.ok()) return status;
+  if (receive(MSG_DONTWAIT) == Received::Ended) return isConnected() ? ClientStatus() : ended_;
+  return generation == generation_ ? flush() : ClientStatus();  // what the callbacks called
+}
+
+ServiceConnection::Received ServiceConnection::receive(int flags) {
+  if (inBegin_ == inEnd_) {
+    inBegin_ = inEnd_ = 0;
+    if (in_.size() != kReadBytes) in_ = std::vector<uint8_t>(kReadBytes);
+  } else if (inEnd_ == in_.size()) {  // inside a frame
+    in_.erase(in_.begin(), in_.begin() + static_cast<std::ptrdiff_t>(inBegin_));
+    inEnd_ -= inBegin_;
+    inBegin_ = 0;
+    in_.resize(std::max(kReadBytes, 2 * in_.size()));
+  }
+  ssize_t got = recv(fd_, in_.data() + inEnd_, in_.size() - inEnd_, flags);
+  if (got < 0 && (errno == EAGAIN || errno == EWOULDBLOCK || errno == EINTR))
+    return Received::Nothing;
+  if (got < 0) return lost(std::string("the service went away: ") + std::strerror(errno));
+  if (got == 0)
+    return lost(goodbyeSeen_ ? "the service ended" : "the service closed the connection");
+  inEnd_ += static_cast<std::size_t>(got);
+  return runFrames();
+}
+
+ServiceConnection::Received ServiceConnection::runFrames() {
+  const uint64_t generation = generation_;
+  while (inEnd_ - inBegin_ >= kLengthBytes) {
+    const uint8_t* head = in_.data() + inBegin_;
+    const std::size_t length = head[0] | std::size_t{head[1]} << 8 | std::size_t{head[2]} << 16 |
+                               std::size_t{head[3]} << 24;
+    if (length > largestFrame_)
+      return lost("the service sent a frame of " + std::to_string(length) + " bytes");
+    if (inEnd_ - inBegin_ - kLengthBytes < length) break;
+    // Behind us before its callback runs: that may come here again.
+    inBegin_ += kLengthBytes + length;
+    if (!runFrame({head + kLengthBytes, length}))
+      return lost("the service sent something that is not the protocol");
+    if (generation != generation_) return Received::Ended;
+  }
+  return Received::Something;
+}
+
+bool ServiceConnection::runFrame(std::span<const uint8_t> frame) {
+  const std::optional<ArrayView> items = FrameDecoder::decode(frame);
+  if (!items || items->empty()) return false;
+  const std::size_t size = items->size();
+  auto at = items->begin();
+  const Value kind = *at;
+  if (kind.kind() != ValueKind::Integer) return false;
+  if (kind.asInt64() == kGoodbye) return goodbyeSeen_ = true;
+  if (size < 2) return false;
+  ++at;
+  if (kind.asInt64() == kHello) return runHello(at, size);
+  const Value number = *at;
+  if (kind.asInt64() == kReply && helloSeen_ && size >= 3) {
+    ++at;
+    const Value value = *at;
+    answer(number, {}, &value);
+    return true;
+  }
+  if (kind.asInt64() != kError || size < 4) return false;
+  ClientStatus status = failure(Code::Refused, "");
+  ++at;
+  status.wireCode = (*at).asInt64();
+  ++at;
+  status.text = (*at).asString();
+  if (number.kind() == ValueKind::Null)
+    serviceError_ = "the service closed the connection: " + status.text;
+  else
+    answer(number, status, nullptr);
+  return true;
+}
+
+// [0, version, limits]
+bool ServiceConnection::runHello(ArrayView::Iterator at, std::size_t size) {
+  if (helloSeen_ || (*at).kind() != ValueKind::Integer || (*at).asInt64() != kProtocolVersion)
+    return false;
+  helloSeen_ = true;
+  if (size < 3) return true;
+  ++at;
+  const std::optional<Value> limit = (*at).asDictionary().find("max_frame_bytes");
+  if (limit && limit->kind() == ValueKind::Integer && limit->asInt64() > 0)
+    largestFrame_ = std::min<uint64_t>(limit->asUInt64(), kLargestFrameBytes);
+  return true;
+}
+
+void ServiceConnection::answer(const Value& number, const ClientStatus& status,
+                               const Value* value) {
+  CallAnswer answered;
+  if (number.kind() != ValueKind::Integer || number.asInt64() < 0 ||
+      !calls_.take(number.asUInt64(), answered)) {
+    ++unknownAnswers_;
+    return;
+  }
+  deliver(answered, status, value);
+}
+
+// ---------------------------------------------------------------------------------------------------------------------
+// Waiting
+
+void ServiceConnection::setReceiveTimeout(Patience patience) {
+  if (patience == receiveTimeout_) return;
+  const timeval limit = timeOf(patience);
+  if (setsockopt(fd_, SOL_SOCKET, SO_RCVTIMEO, &limit, sizeof limit) == 0)
+    receiveTimeout_ = patience;
+}
+
+// One write and one read, waiting for the latter. A lone call costs no more than that: the first
+// wait is the read itself, bounded by the descriptor's own time-out; only what is left of the
+// patience after it, and a socket that takes nothing, need a poll.
+ClientStatus ServiceConnection::waitStep(Wait& wait) {
+  if (fd_ < 0) return ended_;
+  if (ClientStatus status = flush(); !status.ok()) return status;
+  if (std::exchange(wait.first, false) && !wantsWrite() && wait.patience > Patience(0)) {
+    setReceiveTimeout(wait.patience);
+    if (receiveTimeout_ == wait.patience) {
+      return receive(0) == Received::Ended && !isConnected() ? ended_ : ClientStatus();
+    }
+  }
+  const auto left = std::chrono::ceil<Patience>(wait.deadline - SteadyClock::now()).count();
+  if (left <= 0) return failure(Code::TimedOut, "no answer from the service in time");
+  pollfd ready{fd_, static_cast<short>(POLLIN | (wantsWrite() ? POLLOUT : 0)), 0};
+  const int events = poll(&ready, 1, static_cast<int>(std::min<int64_t>(left, INT_MAX)));
+  if (events < 0 && errno != EINTR) {
+    lost(std::string("cannot wait for the service: ") + std::strerror(errno));
+    return ended_;
+  }
+  if (events <= 0 || (ready.revents & (POLLIN | POLLHUP | POLLERR | POLLNVAL)) == 0) return {};
+  return receive(MSG_DONTWAIT) == Received::Ended && !isConnected() ? ended_ : ClientStatus();
+}
+
+}  // namespace vx

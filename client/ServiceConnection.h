@@ -1,0 +1,132 @@
+// The client library's end of the service socket: framing, buffers, the calls that wait. Private to
+// the client library.
+#pragma once
+
+#include <sys/types.h>
+
+#include <chrono>
+#include <cstddef>
+#include <cstdint>
+#include <memory>
+#include <span>
+#include <string>
+#include <vector>
+
+#include "client/PendingCalls.h"
+#include "client/ReportingClient.h"
+#include "platform/CborWriter.h"
+
+namespace vx {
+
+// The operations of the service, by the numbers they have on the wire.
+enum class ServiceOperation : uint8_t {
+  CreateReportingSession = 1,
+  SetServiceType,
+  GetServiceNameForReporterID,
+  SetConfiguration,
+  StartReportingSessionForID,
+  SendMessage,
+  StopReportingSessionForID,
+  DestroyReportingSession,
+  ReporterID,
+  GetAllReporters,
+  KillService,
+};
+
+// Owned by its ReportingClient, and by whatever function of its own is running: a callback may
+// destroy the client. Not thread-safe. Bounds: Options, and one frame of the service.
+class ServiceConnection : public std::enable_shared_from_this<ServiceConnection> {
+ public:
+  using Patience = std::chrono::milliseconds;
+
+  explicit ServiceConnection(const ReportingClient::Options& options) : options_(options) {}
+  ~ServiceConnection();
+
+  ClientStatus open(const std::string& path, Patience patience);
+  ClientStatus adopt(int connectedFd, Patience patience);
+  const std::string& socketPath() const { return socketPath_; }
+  bool isConnected() const { return fd_ >= 0; }
+  int fd() const { return fd_; }
+  ClientStatus sayGoodbye(Patience patience);
+  // Every pending call fails with this reason, once.
+  void disconnect(const ClientStatus& why);
+  // The client is being destroyed: as disconnect(), but no callback runs any more.
+  void abandon();
+
+  bool wantsWrite() const { return outBegin_ < out_.size(); }
+  ClientStatus process();
+  ClientStatus flush();
+
+  // A call: when acceptsCalls(), beginCall(), write that many arguments to the writer, endCall().
+  // endCall() says whether the call was taken; only then is the answer ever delivered.
+  bool acceptsCalls() const { return acceptsCalls_; }
+  ClientStatus whyNoCalls() const;
+  std::size_t beginCall(ServiceOperation operation, std::size_t arguments);
+  CborWriter writer() { return CborWriter(out_); }
+  ClientStatus endCall(std::size_t start, CallAnswer answer);
+
+  // Works until the condition holds; a callback may be what makes it hold.
+  template <class Condition>
+  ClientStatus waitUntil(const Condition& condition, Patience patience) {
+    const auto self = shared_from_this();
+    Wait wait(patience);
+    while (!condition()) {
+      if (ClientStatus status = waitStep(wait); !status.ok() && !condition()) return status;
+    }
+    return {};
+  }
+
+  std::size_t pendingCalls() const { return calls_.size(); }
+  uint64_t unknownAnswers() const { return unknownAnswers_; }
+
+ private:
+  enum class Received : uint8_t { Nothing, Something, Ended };
+  struct Wait {
+    explicit Wait(Patience patience);
+    Patience patience;
+    std::chrono::steady_clock::time_point deadline;
+    bool first = true;
+  };
+
+  ClientStatus begin(int connectedFd, Patience patience);
+  ClientStatus waitStep(Wait& wait);
+  void setReceiveTimeout(Patience patience);
+
+  int writeUpTo(std::size_t end);  // 0, or the errno that ends the connection
+  void trimOutput();
+  ClientStatus lostWhileSending(int error);
+  Received lost(const std::string& what);
+
+  Received receive(int flags);
+  Received runFrames();
+  bool runFrame(std::span<const uint8_t> frame);
+  bool runHello(ArrayView::Iterator at, std::size_t size);
+  void answer(const Value& number, const ClientStatus& status, const Value* value);
+
+  std::size_t beginFrame();
+  void endFrame(std::size_t start);
+
+  const ReportingClient::Options options_;
+  std::string socketPath_;
+  int fd_ = -1;
+  bool acceptsCalls_ = false;
+  bool helloSeen_ = false;
+  bool goodbyeSeen_ = false;
+  bool abandoned_ = false;
+  uint64_t generation_ = 0;       // changes with every connection and disconnection
+  Patience receiveTimeout_{0};    // as the descriptor has it
+  std::size_t largestFrame_ = 0;  // as the service announced it
+  std::string serviceError_;      // what the service said about the connection before closing it
+  ClientStatus ended_;            // why the last connection ended
+
+  std::vector<uint8_t> in_;  // read, not yet run: from inBegin_ to inEnd_
+  std::size_t inBegin_ = 0;
+  std::size_t inEnd_ = 0;
+  std::vector<uint8_t> out_;  // not yet written: from outBegin_
+  std::size_t outBegin_ = 0;
+  std::size_t writeAt_ = 0;  // bytes in out_ at which the next write is due
+  PendingCalls calls_;
+  uint64_t unknownAnswers_ = 0;
+};
+
+}  // namespace vx
