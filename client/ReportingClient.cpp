@@ -36,19 +36,20 @@ ClientStatus callOnReporter(ServiceConnection& connection, Operation operation, 
 // Makes the call and waits for its answer. The result lives on its own: patience may end before the
 // answer comes, and a callback that runs meanwhile may destroy the client.
 template <class T, class Call>
-ClientResult<T> blocking(std::shared_ptr<ServiceConnection> connection,
-                         std::chrono::milliseconds patience, const Call& makeCall) {
+ClientResult<T> blocking(ServiceConnection& connection, std::chrono::milliseconds patience,
+                         const Call& makeCall) {
   struct Waiting {
     bool answered = false;
     ClientResult<T> result;
   };
+  const auto self = connection.shared_from_this();
   const auto waiting = std::make_shared<Waiting>();
   const ClientStatus taken = makeCall([waiting](const ClientResult<T>& result) {
     waiting->result = result;
     waiting->answered = true;
   });
   if (!taken.ok()) return {taken, {}};
-  const ClientStatus status = connection->waitUntil([&] { return waiting->answered; }, patience);
+  const ClientStatus status = connection.waitUntil([&] { return waiting->answered; }, patience);
   if (!waiting->answered) return {status, {}};
   return std::move(waiting->result);
 }
@@ -191,21 +192,21 @@ ClientStatus ReportingClient::killService() {
 
 ClientResult<bool> ReportingClient::createReportingSession(int64_t reporterID,
                                                            std::chrono::milliseconds patience) {
-  return blocking<bool>(connection_, patience, [&](Callback<bool> done) {
+  return blocking<bool>(*connection_, patience, [&](Callback<bool> done) {
     return createReportingSessionAsync(reporterID, std::move(done));
   });
 }
 
 ClientResult<bool> ReportingClient::setServiceType(uint16_t serviceType, int64_t reporterID,
                                                    std::chrono::milliseconds patience) {
-  return blocking<bool>(connection_, patience, [&](Callback<bool> done) {
+  return blocking<bool>(*connection_, patience, [&](Callback<bool> done) {
     return setServiceTypeAsync(serviceType, reporterID, std::move(done));
   });
 }
 
 ClientResult<uint16_t> ReportingClient::getServiceType(int64_t reporterID,
                                                        std::chrono::milliseconds patience) {
-  return blocking<uint16_t>(connection_, patience, [&](Callback<uint16_t> done) {
+  return blocking<uint16_t>(*connection_, patience, [&](Callback<uint16_t> done) {
     return getServiceTypeAsync(reporterID, std::move(done));
   });
 }
@@ -213,14 +214,14 @@ ClientResult<uint16_t> ReportingClient::getServiceType(int64_t reporterID,
 ClientResult<bool> ReportingClient::setConfiguration(const Payload& configuration,
                                                      int64_t reporterID,
                                                      std::chrono::milliseconds patience) {
-  return blocking<bool>(connection_, patience, [&](Callback<bool> done) {
+  return blocking<bool>(*connection_, patience, [&](Callback<bool> done) {
     return setConfigurationAsync(configuration, reporterID, std::move(done));
   });
 }
 
 ClientStatus ReportingClient::sendMessage(const Payload& message, uint32_t category, uint16_t type,
                                           std::chrono::milliseconds patience) {
-  return blocking<Done>(connection_, patience,
+  return blocking<Done>(*connection_, patience,
                         [&](Callback<Done> done) {
                           return sendMessageAsync(message, category, type, std::move(done));
                         })
@@ -230,7 +231,7 @@ ClientStatus ReportingClient::sendMessage(const Payload& message, uint32_t categ
 ClientStatus ReportingClient::sendMessage(const Payload& message, uint32_t category, uint16_t type,
                                           const std::vector<int64_t>& reporterIDs,
                                           std::chrono::milliseconds patience) {
-  return blocking<Done>(connection_, patience,
+  return blocking<Done>(*connection_, patience,
                         [&](Callback<Done> done) {
                           return sendMessageAsync(message, category, type, reporterIDs,
                                                   std::move(done));
@@ -240,21 +241,21 @@ ClientStatus ReportingClient::sendMessage(const Payload& message, uint32_t categ
 
 ClientResult<bool> ReportingClient::stopReportingSession(int64_t reporterID,
                                                          std::chrono::milliseconds patience) {
-  return blocking<bool>(connection_, patience, [&](Callback<bool> done) {
+  return blocking<bool>(*connection_, patience, [&](Callback<bool> done) {
     return stopReportingSessionAsync(reporterID, std::move(done));
   });
 }
 
 ClientResult<bool> ReportingClient::destroyReportingSession(int64_t reporterID,
                                                             std::chrono::milliseconds patience) {
-  return blocking<bool>(connection_, patience, [&](Callback<bool> done) {
+  return blocking<bool>(*connection_, patience, [&](Callback<bool> done) {
     return destroyReportingSessionAsync(reporterID, std::move(done));
   });
 }
 
 ClientResult<ReporterValidation> ReportingClient::validateReporter(
     int64_t reporterID, std::chrono::milliseconds patience) {
-  return blocking<ReporterValidation>(connection_, patience,
+  return blocking<ReporterValidation>(*connection_, patience,
                                       [&](Callback<ReporterValidation> done) {
                                         return validateReporterAsync(reporterID, std::move(done));
                                       });
@@ -263,7 +264,7 @@ ClientResult<ReporterValidation> ReportingClient::validateReporter(
 ClientResult<std::vector<int64_t>> ReportingClient::getAllReporters(
     std::chrono::milliseconds patience) {
   return blocking<std::vector<int64_t>>(
-      connection_, patience,
+      *connection_, patience,
       [&](Callback<std::vector<int64_t>> done) { return getAllReportersAsync(std::move(done)); });
 }
 

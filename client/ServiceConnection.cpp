@@ -114,7 +114,7 @@ ClientStatus ServiceConnection::begin(int connectedFd, Patience patience) {
   hello.integer(kProtocolVersion);
   endFrame(start);
   const uint64_t generation = generation_;
-  const ClientStatus status = waitUntil([this] { return helloSeen_; }, patience);
+  ClientStatus status = waitUntil([this] { return helloSeen_; }, patience);
   if (status.ok())
     acceptsCalls_ = true;
   else if (generation == generation_)
@@ -140,15 +140,14 @@ ClientStatus ServiceConnection::sayGoodbye(Patience patience) {
 void ServiceConnection::disconnect(const ClientStatus& why) {
   if (fd_ < 0) return;
   const auto self = shared_from_this();
-  const ClientStatus reason = why;
-  ended_ = reason;
+  ended_ = why;
   close(fd_);
   fd_ = -1;
   acceptsCalls_ = false;
   ++generation_;
   for (const CallAnswer& failed : calls_.takeAll()) {
     if (abandoned_) return;
-    deliver(failed, reason, nullptr);
+    deliver(failed, why, nullptr);
   }
 }
 
