@@ -1,0 +1,64 @@
+#include "tests/statistics/ServiceFixture.h"
+
+namespace vx {
+namespace {
+
+class PreferencesTest : public ServiceTest {
+ protected:
+  void notify(int token = fakes::FakeServices::kToken) { (*p.services.notifyHandler)(token); }
+};
+
+TEST_F(PreferencesTest, NothingIsReadBeforeTheFirstNotification) {
+  p.services.preferences["disable_reporting"] = "true";
+  EXPECT_EQ(p.services.preferenceReads, 0);
+  EXPECT_TRUE(service->isReportingEnabled());
+  EXPECT_EQ(service->getDefaults(), std::nullopt);
+  EXPECT_EQ(p.services.notifyQueue, serviceQueue());
+}
+
+TEST_F(PreferencesTest, ForeignTokenChangesNothing) {
+  p.services.preferences["disable_reporting"] = "true";
+  EXPECT_THAT(during([&] { notify(3); }), IsEmpty());
+  EXPECT_TRUE(service->isReportingEnabled());
+}
+
+TEST_F(PreferencesTest, AbsentSwitchIsTheIntegerZeroPresentOneABoolean) {
+  EXPECT_EQ(VXReportingServiceDelegate::VXReportingDefaults().find("disable_reporting")->kind(),
+            ValueKind::Integer);
+  p.services.preferences = {{"disable_reporting", "false"}, {"device_name", "<table>"}};
+  const Payload defaults = VXReportingServiceDelegate::VXReportingDefaults();
+  EXPECT_EQ(defaults.find("disable_reporting")->kind(), ValueKind::Boolean);
+  EXPECT_FALSE(defaults.contains("device_name"));
+}
+
+TEST_F(PreferencesTest, SessionsLearnBeforeTheSwitchMoves) {
+  auto& client = connect();
+  create(client, 1);
+  p.services.preferences = {{"disable_reporting", "true"}, {"device_name", "Pocket"}};
+  EXPECT_THAT(during([&] { notify(); }),
+              ElementsAre("log vxrs default re-reading sonik defaults",
+                          "log vxrs info defaults {device_name=Pocket,disable_reporting=1}"));
+  EXPECT_EQ(session(client, 1)->userInfo()->snapshot().text(),
+            "{device_name=Pocket,disable_reporting=1}");
+  create(client, 2);
+  EXPECT_EQ(session(client, 2)->userInfo()->snapshot().size(), 0u);  // until the next notification
+}
+
+TEST_F(PreferencesTest, OffRefusesMessagesAndHidesOthersSessions) {
+  auto& a = connect(200);
+  auto& b = connect(201);
+  started(b, 1);
+  p.services.preferences["disable_reporting"] = "true";
+  notify();
+  EXPECT_THAT(during([&] { send(a, message(), 1, 1); }),
+              ElementsAre("trace 0x21042824", "reply send com.quorvel.audio.reporting 1"));
+  EXPECT_EQ(service->findReportingSessionForID(1), nullptr);
+  EXPECT_NE(b.findReportingSessionForID(1, VXReportingServerInstance::Lookup::AcrossAllClients),
+            nullptr);
+  p.services.preferences.clear();
+  notify();
+  EXPECT_THAT(during([&] { send(a, message(), 1, 1); }, {"reply"}), ElementsAre("reply send"));
+}
+
+}  // namespace
+}  // namespace vx
