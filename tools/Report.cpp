@@ -1,8 +1,10 @@
 // vxreport: talks to the service from a shell. `vxreport help` lists the commands; `vxreport
 // script` reads them from standard input, one a line, over one connection.
+#include <cerrno>
 #include <cstdio>
 #include <cstdlib>
 #include <iostream>
+#include <limits>
 #include <sstream>
 #include <string>
 #include <vector>
@@ -35,9 +37,18 @@ class UsageError : public std::exception {};
 
 int64_t number(const std::string& text) {
   char* end = nullptr;
+  errno = 0;
   const long long value = std::strtoll(text.c_str(), &end, 0);
-  if (end == text.c_str() || *end != '\0') throw UsageError();
+  if (end == text.c_str() || *end != '\0' || errno == ERANGE) throw UsageError();
   return value;
+}
+
+// A code of the service: a service type, a category or a message type.
+template <class Code>
+Code codeOf(const std::string& text) {
+  const int64_t value = number(text);
+  if (value < 0 || value > int64_t{std::numeric_limits<Code>::max()}) throw UsageError();
+  return static_cast<Code>(value);
 }
 
 vx::Payload payload(const Words& words, std::size_t from) {
@@ -48,10 +59,11 @@ vx::Payload payload(const Words& words, std::size_t from) {
     const std::string key = words[i].substr(0, equals);
     const std::string value = words[i].substr(equals + 1);
     char* end = nullptr;
+    errno = 0;
     if (value == "true" || value == "false") {
       builder.set(key, value == "true");
     } else if (const long long whole = std::strtoll(value.c_str(), &end, 10);
-               !value.empty() && *end == '\0') {
+               !value.empty() && *end == '\0' && errno != ERANGE) {
       builder.set(key, int64_t{whole});
     } else if (const double real = std::strtod(value.c_str(), &end);
                !value.empty() && *end == '\0') {
@@ -84,8 +96,7 @@ int run(vx::ReportingClient& client, const Words& words) {
   const std::string& command = at(words, 0);
   if (command == "create") return answered(client.createReportingSession(number(at(words, 1))));
   if (command == "type") {
-    return answered(
-        client.setServiceType(static_cast<uint16_t>(number(at(words, 2))), number(at(words, 1))));
+    return answered(client.setServiceType(codeOf<uint16_t>(at(words, 2)), number(at(words, 1))));
   }
   if (command == "configure")
     return answered(client.setConfiguration(payload(words, 2), number(at(words, 1))));
@@ -100,16 +111,16 @@ int run(vx::ReportingClient& client, const Words& words) {
                   "started; answered when it stops");
   }
   if (command == "send") {
-    return report(client.sendMessage(payload(words, 3), static_cast<uint32_t>(number(at(words, 1))),
-                                     static_cast<uint16_t>(number(at(words, 2)))),
+    return report(client.sendMessage(payload(words, 3), codeOf<uint32_t>(at(words, 1)),
+                                     codeOf<uint16_t>(at(words, 2))),
                   "taken");
   }
   if (command == "sendto") {
     std::vector<int64_t> ids;
     std::stringstream list(at(words, 1));
     for (std::string id; std::getline(list, id, ',');) ids.push_back(number(id));
-    return report(client.sendMessage(payload(words, 4), static_cast<uint32_t>(number(at(words, 2))),
-                                     static_cast<uint16_t>(number(at(words, 3))), ids),
+    return report(client.sendMessage(payload(words, 4), codeOf<uint32_t>(at(words, 2)),
+                                     codeOf<uint16_t>(at(words, 3)), ids),
                   "taken");
   }
   if (command == "stop") return answered(client.stopReportingSession(number(at(words, 1))));
@@ -153,6 +164,8 @@ int runScript(vx::ReportingClient& client) {
 }  // namespace
 
 int main(int argc, char** argv) {
+  std::setvbuf(stdout, nullptr, _IOLBF,
+               0);  // a script's answers come one by one, through a pipe too
   const Words words(argv + 1, argv + argc);
   if (words.empty() || words[0] == "help" || words[0] == "--help") {
     std::fputs(kHelp, words.empty() ? stderr : stdout);

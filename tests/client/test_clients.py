@@ -1,0 +1,61 @@
+"""The client printed in docs/protocol.md and the vxreport tool, each with the real daemon."""
+import os
+import re
+import subprocess
+import sys
+
+from harness import DaemonTest
+
+VXREPORT = os.environ["VXREPORT"]
+PAGE = os.path.join(os.path.dirname(__file__), "../../docs/protocol.md")
+
+
+def run(daemon, *command, stdin=""):
+    return subprocess.run(command, input=stdin, capture_output=True, text=True, timeout=30,
+                          env=dict(os.environ, VXREPORTING_SOCKET=daemon.socket_path))
+
+
+class ClientsTest(DaemonTest):
+    def test_the_client_of_the_protocol_page_works_as_printed(self):
+        daemon = self.daemon()
+        with open(PAGE) as f:
+            program = re.search(r"```python\n(.*?)```", f.read(), re.S).group(1)
+        ended = run(daemon, sys.executable, "-c", program)
+        self.assertEqual((ended.stdout.split(), ended.stderr), (["True", "True", "None", "True", "True"], ""))
+
+    def test_the_frames_printed_on_the_protocol_page_are_answered_as_printed(self):
+        with open(PAGE) as f:
+            page = f.read()
+        frames = {text: bytes.fromhex(code) for code, text in
+                  re.findall(r"^ {4}((?:[0-9a-f]{2} +)+)(\[.*\])$", page, re.M)}
+        client = self.daemon().client()
+        client.raw(frames["[1, 3, 2, 7, 42]"] + frames['[1, 4, 1, "x"]'] + frames["[4]"])
+        client.until_closed()
+        self.assertEqual(client.answers[3], [[2, 3, True]])
+        self.assertEqual(client.answers[4][0][:3], [3, 4, 4])
+        self.assertIn(client.answers[4][0][3][:48], page)
+
+    def test_a_script_of_vxreport_holds_one_connection(self):
+        daemon = self.daemon()
+        script = ("create 7\ntype 7 2\nconfigure 7 HostApplicationDisplayID=org.example.shell\nstart 7\n"
+                  "# a remark\nsend 0x08000005 1 gain=0.5 frames=3 on=true route=Speaker\nreporters\n"
+                  "validate 7\nstop 7\n")
+        ended = run(daemon, VXREPORT, "script", stdin=script)
+        self.assertEqual(ended.stdout.splitlines(),
+                         ["true", "true", "true", "started; answered when it stops", "taken", "7",
+                          "reporterID=7 serviceType=2", "session 7: ended", "true"])
+        self.assertEqual((ended.returncode, ended.stderr), (0, ""))
+        self.assertEqual(daemon.stop(), 0)
+        self.assertEqual(daemon.rows("SELECT payload FROM analytics_events WHERE name LIKE '%Session_Setup.Start'"),
+                         [('{"gain":0.5,"frames":3,"on":true,"route":"Speaker",'
+                           '"HostApplicationDisplayID":"org.example.shell"}',)])
+
+    def test_vxreport_says_what_is_wrong(self):
+        daemon = self.daemon()
+        self.assertEqual(run(daemon, VXREPORT, "type", "7", "65536").returncode, 2)
+        self.assertIn("cannot use: fly 7", run(daemon, VXREPORT, "script", stdin="fly 7\n").stderr)
+        self.assertEqual(run(daemon, VXREPORT, "kill").returncode, 0)
+        self.assertEqual(daemon.process.wait(20), 2)
+        away = run(daemon, VXREPORT, "reporters")
+        self.assertEqual(away.returncode, 1)
+        self.assertIn(daemon.socket_path, away.stderr)
