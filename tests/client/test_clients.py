@@ -33,7 +33,7 @@ class ClientsTest(DaemonTest):
         client.until_closed()
         self.assertEqual(client.answers[3], [[2, 3, True]])
         self.assertEqual(client.answers[4][0][:3], [3, 4, 4])
-        self.assertIn(client.answers[4][0][3][:48], page)
+        self.assertIn(client.answers[4][0][3][:44], page)
 
     def test_a_script_of_vxreport_holds_one_connection(self):
         daemon = self.daemon()
