@@ -15,10 +15,8 @@ void VXReportingTallyhubBridge::handleEvent(const std::optional<Payload>& payloa
   platform().analytics.sendEventLazy(
       "com.quorvel.sonik." + messageKindName(messageKind(category, type), '.'),
       [payload = payload.value_or(Payload()), userInfo = std::move(userInfo)] {
-        PayloadBuilder event(payload);
-        VXReportingHostApplicationDisplayID(userInfo).storeUnder(kHostApplicationDisplayIDKey,
-                                                                 event);
-        return event.build();
+        return VXReportingHostApplicationDisplayID(userInfo).addedTo(payload,
+                                                                     kHostApplicationDisplayIDKey);
       });
 }
 

@@ -112,6 +112,11 @@ void HostApplicationDisplayID::storeUnder(std::string_view key, PayloadBuilder& 
     builder.set(key, "Unknown");
 }
 
+Payload HostApplicationDisplayID::addedTo(const Payload& dictionary, std::string_view key) const {
+  static const Payload unknown = PayloadBuilder().set("", "Unknown").build();
+  return dictionary.withEntry(key, value_ ? *value_ : *unknown.find(""));
+}
+
 HostApplicationDisplayID VXReportingHostApplicationDisplayID(
     const std::optional<Payload>& payload) {
   return payload ? HostApplicationDisplayID(*payload) : HostApplicationDisplayID();

@@ -56,6 +56,7 @@ class HostApplicationDisplayID {
   explicit HostApplicationDisplayID(const Payload& payload)
       : owner_(payload), value_(payload.find(kHostApplicationDisplayIDKey)) {}
   void storeUnder(std::string_view key, PayloadBuilder& builder) const;
+  Payload addedTo(const Payload& dictionary, std::string_view key) const;
   std::string text() const { return value_ ? value_->text() : "Unknown"; }
 
  private:

@@ -5,6 +5,7 @@
 #include <limits>
 
 #include "platform/CborReader.h"
+#include "platform/CborWriter.h"
 #include "platform/PayloadBlock.h"
 #include "platform/ValueText.h"
 
@@ -255,6 +256,28 @@ Payload Payload::copyOf(const Value& dictionary) {
   const std::span<const uint8_t> bytes = dictionary.encoded();
   Block* block = Block::allocate(bytes.size(), anyKeyHasSpace(head.next, head.argument));
   std::memcpy(block->bytes(), bytes.data(), bytes.size());
+  return Payload(block);
+}
+
+Payload Payload::withEntry(std::string_view key, const Value& value) const {
+  if (empty() || contains(key)) return PayloadBuilder(*this).set(key, value).build();
+  const std::span<const uint8_t> old = encoded();
+  const cbor::Head head = cbor::head(old.data());
+  const std::span<const uint8_t> body =
+      old.subspan(static_cast<std::size_t>(head.next - old.data()));
+  std::vector<uint8_t> edges;  // the new head, then the new key
+  edges.reserve(18 + key.size());
+  CborWriter writer(edges);
+  writer.dictionary(head.argument + 1);
+  const std::size_t headSize = edges.size();
+  writer.string(key);
+  const std::span<const uint8_t> item = value.encoded();
+  Block* block = Block::allocate(edges.size() + body.size() + item.size(),
+                                 hasSpaceInKeys() || key.find(' ') != std::string_view::npos);
+  uint8_t* out = std::copy_n(edges.data(), headSize, block->bytes());
+  out = std::copy(body.begin(), body.end(), out);
+  out = std::copy(edges.begin() + static_cast<std::ptrdiff_t>(headSize), edges.end(), out);
+  std::copy(item.begin(), item.end(), out);
   return Payload(block);
 }
 

@@ -187,6 +187,9 @@ class Payload {
   // Copies a dictionary that has been validated already (a dictionary argument of a decoded frame,
   // a nested one).
   static Payload copyOf(const Value& dictionary);
+  // This dictionary with one entry set, as PayloadBuilder::set would: one copy where the key is
+  // new.
+  Payload withEntry(std::string_view key, const Value& value) const;
 
   std::size_t size() const;
   bool empty() const { return size() == 0; }

@@ -60,12 +60,20 @@ bool isDirectory(const std::string& path) {
   return stat(path.c_str(), &status) == 0 && S_ISDIR(status.st_mode);
 }
 
-// Names in a folder, sorted, without those that start with a dot. False with errno when it cannot
-// be read.
+// False for folders, FIFOs, devices and sockets, which are never opened. What cannot be looked at
+// counts as a channel: sampling it will say why.
+bool mayBeCounter(const std::string& path) {
+  struct stat status {};
+  return stat(path.c_str(), &status) != 0 || S_ISREG(status.st_mode);
+}
+
+// Names in a folder, sorted, without those that start with a dot; just more than a subscription may
+// have when there are so many. False with errno when it cannot be read.
 bool listFolder(const std::string& path, std::set<std::string>& names) {
   DIR* folder = opendir(path.c_str());
   if (folder == nullptr) return false;
   while (const dirent* entry = readdir(folder)) {
+    if (names.size() > CounterChannels::kMaxChannels) break;
     if (entry->d_name[0] != '.') names.insert(entry->d_name);
   }
   closedir(folder);
@@ -87,7 +95,7 @@ class Collector {
     found = true;
     for (const std::string& name : names) {
       const std::string file = path + "/" + name;
-      if (!isDirectory(file)) add({name, file, ""});
+      if (mayBeCounter(file)) add({name, file, ""});
     }
   }
   void addSubFolders(const std::string& path) {
@@ -165,7 +173,6 @@ int statusValue(const std::string& text, const std::string& key, int64_t& value)
 
 // 0, or an errno value; ENOENT and ENODEV mean that the channel has vanished.
 int readChannel(const Channel& channel, int64_t& value) {
-  Error error;
   const std::size_t most = channel.statusKey.empty() ? kMaxCounterBytes : kMaxStatusBytes;
   // Files below /proc and /sys say 0 or 4096 of their size, whatever they hold.
   const int fd = open(channel.path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOCTTY);
@@ -217,15 +224,19 @@ ChannelDictionaryRef CounterChannels::copyChannelsInGroup(
   }
   Collector collector;
   const std::string& root = options_.root;
-  if (group && subGroup) {
-    collector.addFolder(root + "/" + *group + "/" + *subGroup);
-  } else if (group) {
-    collector.addFolder(root + "/" + *group);
-    collector.addSubFolders(root + "/" + *group);
-  } else if (subGroup) {
-    std::set<std::string> groups;
+  std::set<std::string> groups;
+  if (group)
+    groups.insert(*group);
+  else
     collector.list(root, groups);
-    for (const std::string& name : groups) collector.addFolder(root + "/" + name + "/" + *subGroup);
+  for (const std::string& name : groups) {
+    const std::string folder = root + "/" + name;
+    if (subGroup) {
+      collector.addFolder(folder + "/" + *subGroup);
+    } else {
+      collector.addFolder(folder);
+      collector.addSubFolders(folder);
+    }
   }
   for (const MappedChannelSource& source : options_.mapped) {
     if ((group && *group != source.group) || (subGroup && *subGroup != source.subGroup)) continue;

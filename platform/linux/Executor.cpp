@@ -23,7 +23,7 @@ namespace {
 constexpr std::size_t kItemsPerTurn = 64;  // of one queue before the next queue of the lane
 constexpr std::size_t kMaxThreadsPerLane = 1024;
 constexpr std::size_t kStackBytes = 256 << 10;
-constexpr std::chrono::milliseconds kLinger{1};
+constexpr std::chrono::milliseconds kLinger{5};
 
 Monotonic now() { return std::chrono::steady_clock::now(); }
 

@@ -57,6 +57,8 @@ class RenamedFile final : public AtomicFile {
       return posixError(errno, where_);
     }
     committed_ = true;
+    // EINVAL: a file system that cannot do this for folders.
+    if (fsync(directoryFd_) != 0 && errno != EINVAL) return posixError(errno, where_);
     return std::nullopt;
   }
 
@@ -69,11 +71,27 @@ class RenamedFile final : public AtomicFile {
   bool committed_ = false;
 };
 
+// One name, and neither this folder nor the one above.
+bool isPlainName(const std::string& name) {
+  return !name.empty() && name != "." && name != ".." && name.find('/') == std::string::npos &&
+         name.find('\0') == std::string::npos;
+}
+
+// Opens a folder below `at` without following a link. -1 and errno on failure; ELOOP for a link,
+// for which the kernel says ENOTDIR here.
+int openFolderAt(int at, const char* name) {
+  const int fd = openat(at, name, O_RDONLY | O_DIRECTORY | O_CLOEXEC | O_NOFOLLOW);
+  if (fd >= 0 || errno != ENOTDIR) return fd;
+  struct stat status {};
+  const bool link = fstatat(at, name, &status, AT_SYMLINK_NOFOLLOW) == 0 && S_ISLNK(status.st_mode);
+  errno = link ? ELOOP : ENOTDIR;
+  return -1;
+}
+
 }  // namespace
 
 int LinuxDiagnosticFiles::openDirectory(const std::string& path, const unsigned* mode,
                                         std::optional<Error>& error) const {
-  constexpr int kFlags = O_RDONLY | O_DIRECTORY | O_CLOEXEC | O_NOFOLLOW;
   const std::string& root = logsDirectory_;
   const bool below =
       path.rfind(root, 0) == 0 && (path.size() == root.size() || path[root.size()] == '/');
@@ -97,11 +115,17 @@ int LinuxDiagnosticFiles::openDirectory(const std::string& path, const unsigned*
   }
   std::string walked = root;
   for (const auto& component : std::filesystem::path(path.substr(root.size())).relative_path()) {
+    if (component.empty()) continue;  // a slash at the end
     walked += "/" + component.string();
+    if (!isPlainName(component)) {
+      error = posixError(EINVAL, walked);
+      close(at);
+      return -1;
+    }
     bool made = false;
     if (mode != nullptr) made = mkdirat(at, component.c_str(), static_cast<mode_t>(*mode)) == 0;
     const int mkdirErrno = errno;
-    const int next = openat(at, component.c_str(), kFlags);
+    const int next = openFolderAt(at, component.c_str());
     const int failure = errno;
     close(at);
     if (next < 0) {
@@ -109,8 +133,13 @@ int LinuxDiagnosticFiles::openDirectory(const std::string& path, const unsigned*
                          walked);
       return -1;
     }
-    if (made) fchmod(next, static_cast<mode_t>(*mode));  // whatever the umask took away
     at = next;
+    // Whatever the umask took away.
+    if (made && fchmod(at, static_cast<mode_t>(*mode)) != 0) {
+      error = posixError(errno, walked);
+      close(at);
+      return -1;
+    }
   }
   return at;
 }
@@ -125,9 +154,13 @@ std::optional<Error> LinuxDiagnosticFiles::createDirectory(const std::string& pa
 std::unique_ptr<AtomicFile> LinuxDiagnosticFiles::createAtomically(const std::string& directory,
                                                                    const std::string& name,
                                                                    std::optional<Error>& error) {
+  const std::string where = directory + "/" + name;
+  if (!isPlainName(name)) {
+    error = posixError(EINVAL, where);
+    return nullptr;
+  }
   const int directoryFd = openDirectory(directory, nullptr, error);
   if (directoryFd < 0) return nullptr;
-  const std::string where = directory + "/" + name;
   const std::string temporary = ".vx" + randomSuffix();
   const int fd = openat(directoryFd, temporary.c_str(),
                         O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC | O_NOFOLLOW, 0600);

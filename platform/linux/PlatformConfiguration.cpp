@@ -14,12 +14,11 @@ namespace vx::lnx {
 
 namespace {
 
-constexpr std::size_t kMaxFileBytes = 1 << 20;
-
 std::string directoryFrom(const char* variable, const char* fallback) {
   const char* value = std::getenv(variable);
-  std::string path = value != nullptr && *value != '\0' ? value : std::string(fallback) + "/vxreporting";
+  std::string path = value != nullptr ? value : "";
   path = path.substr(0, path.find(':'));  // the service manager may name several: the first is ours
+  if (path.empty()) path = std::string(fallback) + "/vxreporting";
   while (path.size() > 1 && path.back() == '/') path.pop_back();
   return path;
 }
@@ -32,10 +31,14 @@ std::optional<int64_t> sizeFromText(const std::string& text) {
   if (end == text.c_str() || errno != 0 || number < 0) return std::nullopt;
   const std::string unit = end;
   int shift = -1;
-  if (unit.empty() || unit == "B") shift = 0;
-  else if (unit == "KiB") shift = 10;
-  else if (unit == "MiB") shift = 20;
-  else if (unit == "GiB") shift = 30;
+  if (unit.empty() || unit == "B")
+    shift = 0;
+  else if (unit == "KiB")
+    shift = 10;
+  else if (unit == "MiB")
+    shift = 20;
+  else if (unit == "GiB")
+    shift = 30;
   if (shift < 0 || number > (std::numeric_limits<int64_t>::max() >> shift)) return std::nullopt;
   return int64_t{number} << shift;
 }
@@ -43,7 +46,8 @@ std::optional<int64_t> sizeFromText(const std::string& text) {
 // One table of the file: takes the keys it is asked for, and complains of all others.
 class Section {
  public:
-  Section(const toml::table& table, std::string name, std::string file, std::vector<std::string>& complaints)
+  Section(const toml::table& table, std::string name, std::string file,
+          std::vector<std::string>& complaints)
       : table_(table), name_(std::move(name)), file_(std::move(file)), complaints_(complaints) {}
   ~Section() {
     for (const auto& [key, node] : table_) {
@@ -56,32 +60,44 @@ class Section {
   void boolean(const char* key, bool& out) {
     const toml::node* node = find(key);
     if (node == nullptr) return;
-    if (const auto value = node->value_exact<bool>()) out = *value;
-    else complain(key, *node, "must be true or false");
+    if (const auto value = node->value_exact<bool>())
+      out = *value;
+    else
+      complain(key, *node, "must be true or false");
   }
   template <class T>
   void integer(const char* key, T& out, int64_t least, int64_t most) {
     const toml::node* node = find(key);
     if (node == nullptr) return;
     const auto value = node->value_exact<int64_t>();
-    if (value && *value >= least && *value <= most) out = static_cast<T>(*value);
-    else complain(key, *node, "must be an integer from " + std::to_string(least) + " to " + std::to_string(most));
+    if (value && *value >= least && *value <= most)
+      out = static_cast<T>(*value);
+    else
+      complain(key, *node,
+               "must be an integer from " + std::to_string(least) + " to " + std::to_string(most));
   }
   void size(const char* key, uint64_t& out, int64_t least) {
     const toml::node* node = find(key);
     if (node == nullptr) return;
     std::optional<int64_t> value = node->value_exact<int64_t>();
     if (const auto text = node->value_exact<std::string>()) value = sizeFromText(*text);
-    if (value && *value >= least) out = static_cast<uint64_t>(*value);
-    else complain(key, *node, "must be a number of bytes, or a text such as \"256MiB\", of at least " + std::to_string(least));
+    if (value && *value >= least)
+      out = static_cast<uint64_t>(*value);
+    else
+      complain(key, *node,
+               "must be a number of bytes, or a text such as \"256MiB\", of at least " +
+                   std::to_string(least));
   }
   void real(const char* key, double& out, double least, double most) {
     const toml::node* node = find(key);
     if (node == nullptr) return;
     std::optional<double> value = node->value_exact<double>();
     if (const auto whole = node->value_exact<int64_t>()) value = static_cast<double>(*whole);
-    if (value && *value >= least && *value <= most) out = *value;
-    else complain(key, *node, "must be a number from " + std::to_string(least) + " to " + std::to_string(most));
+    if (value && *value >= least && *value <= most)
+      out = *value;
+    else
+      complain(key, *node,
+               "must be a number from " + std::to_string(least) + " to " + std::to_string(most));
   }
   void milliseconds(const char* key, std::chrono::milliseconds& out, int64_t least, int64_t most) {
     int64_t value = out.count();
@@ -91,8 +107,10 @@ class Section {
   void text(const char* key, std::string& out) {
     const toml::node* node = find(key);
     if (node == nullptr) return;
-    if (const auto value = node->value_exact<std::string>()) out = *value;
-    else complain(key, *node, "must be a text");
+    if (const auto value = node->value_exact<std::string>())
+      out = *value;
+    else
+      complain(key, *node, "must be a text");
   }
   template <class E>
   void choice(const char* key, E& out, const std::map<std::string, E>& choices) {
@@ -105,7 +123,8 @@ class Section {
       return;
     }
     std::string names;
-    for (const auto& [name, choice] : choices) names += (names.empty() ? "\"" : ", \"") + name + "\"";
+    for (const auto& [name, choice] : choices)
+      names += (names.empty() ? "\"" : ", \"") + name + "\"";
     complain(key, *node, "must be one of " + names);
   }
   void texts(const char* key, std::vector<std::string>& out) {
@@ -115,13 +134,17 @@ class Section {
     const toml::array* array = node->as_array();
     if (array != nullptr) {
       for (const toml::node& element : *array) {
-        if (const auto value = element.value_exact<std::string>()) read.push_back(*value);
-        else array = nullptr;
+        if (const auto value = element.value_exact<std::string>())
+          read.push_back(*value);
+        else
+          array = nullptr;
         if (array == nullptr) break;
       }
     }
-    if (array != nullptr) out = std::move(read);
-    else complain(key, *node, "must be an array of texts");
+    if (array != nullptr)
+      out = std::move(read);
+    else
+      complain(key, *node, "must be an array of texts");
   }
   const toml::node* find(const char* key) {
     known_.insert(key);
@@ -161,7 +184,7 @@ class Reader {
                             {"info", Log::Level::Info},
                             {"default", Log::Level::Default},
                             {"error", Log::Level::Error}});
-      s.integer("burst", c.log.burst, 0, 1000000);
+      s.integer("burst", c.log.burst, 0, UINT16_MAX);
       s.real("refill_per_second", c.log.refillPerSecond, 0.001, 1000000);
     });
     section("relay", [&](Section& s) { s.texts("backends", c.relay.backends); });
@@ -177,7 +200,7 @@ class Reader {
       s.integer("max_connections_per_user", l.maxConnectionsPerUser, 1, 1000000);
       s.integer("max_sessions_per_connection", l.maxSessionsPerConnection, 1, 1000000);
       s.integer("max_calls_in_flight", l.maxCallsInFlight, 1, 1000000);
-      s.integer("max_frame_bytes", l.maxFrameBytes, 1024, 64 << 20);
+      s.integer("max_frame_bytes", l.maxFrameBytes, 1024, 1 << 20);
       s.integer("max_unread_reply_bytes", l.maxUnreadReplyBytes, 4096, 64 << 20);
       s.milliseconds("stalled_client_timeout_ms", l.stalledClientTimeout, 10, 3600000);
     });
@@ -209,7 +232,7 @@ class Reader {
     const toml::node* node = drivers.find("mapped");
     if (node == nullptr) return;
     const toml::array* array = node->as_array();
-    if (array == nullptr || !array->is_homogeneous(toml::node_type::table)) {
+    if (array == nullptr || (!array->empty() && !array->is_homogeneous(toml::node_type::table))) {
       return drivers.complain("mapped", *node, "must be written as [[drivers.mapped]] tables");
     }
     for (const toml::node& element : *array) {
@@ -219,12 +242,17 @@ class Reader {
         s.text("group", source.group);
         s.text("subgroup", source.subGroup);
         s.text("path", source.path);
-        s.choice<MappedChannelSource::Kind>("kind", source.kind,
-                                            {{"alsa", MappedChannelSource::Kind::AlsaProc},
-                                             {"statistics", MappedChannelSource::Kind::Statistics}});
+        s.choice<MappedChannelSource::Kind>(
+            "kind", source.kind,
+            {{"alsa", MappedChannelSource::Kind::AlsaProc},
+             {"statistics", MappedChannelSource::Kind::Statistics}});
       }
-      if (source.path.empty()) drivers.complain("mapped", element, "needs a path");
-      else out.push_back(std::move(source));
+      if (source.path.empty())
+        drivers.complain("mapped", element, "needs a path");
+      else if (source.group.empty() && source.subGroup.empty())
+        drivers.complain("mapped", element, "needs a group or a subgroup");
+      else
+        out.push_back(std::move(source));
     }
   }
 
@@ -247,7 +275,7 @@ PlatformConfiguration PlatformConfiguration::load(const Directories& directories
   PlatformConfiguration configuration;
   const std::string path = directories.configuration + "/platform.toml";
   Error error;
-  const std::optional<std::string> text = readRegularFile(path, kMaxFileBytes, error);
+  const std::optional<std::string> text = readTomlText(path, error);
   if (!text) {
     if (error.code != ENOENT && error.code != ENOTDIR) complaints.push_back(error.reason);
     return configuration;
@@ -257,7 +285,8 @@ PlatformConfiguration PlatformConfiguration::load(const Directories& directories
     Reader(root, path, complaints).read(configuration);
   } catch (const toml::parse_error& failure) {
     complaints.push_back(path + ":" + std::to_string(failure.source().begin.line) + ":" +
-                         std::to_string(failure.source().begin.column) + ": " + std::string(failure.description()));
+                         std::to_string(failure.source().begin.column) + ": " +
+                         std::string(failure.description()));
   }
   return configuration;
 }

@@ -171,10 +171,16 @@ bool SocketConnection::hasCompleteFrame() const {
 
 void SocketConnection::keepRest(std::span<const uint8_t> rest) {
   inOffset_ = 0;
-  if (rest.empty() && in_.capacity() != 0)
-    in_ = {};
-  else
+  std::vector<uint8_t>& spare = host_.spareBuffer();
+  if (!rest.empty()) {
+    if (in_.capacity() == 0) in_.swap(spare);
     in_.assign(rest.begin(), rest.end());
+    return;
+  }
+  // Most connections are idle most of the time: they keep no buffer.
+  in_.clear();
+  if (spare.capacity() < in_.capacity() && in_.capacity() <= 2 * kReadBytes) spare.swap(in_);
+  if (in_.capacity() != 0) in_ = std::vector<uint8_t>();
 }
 
 std::size_t SocketConnection::runFrames(std::span<const uint8_t> bytes) {

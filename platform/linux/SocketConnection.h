@@ -70,6 +70,8 @@ class ConnectionHost {
   // 64 KiB to read into behind as much room for what was left of the read before; shared by all
   // connections.
   virtual std::span<uint8_t> readBuffer() = 0;
+  // A buffer that a connection with nothing left over lends to the next one that has.
+  virtual std::vector<uint8_t>& spareBuffer() = 0;
   // True while what has been accepted must drain first. The connection then waits for
   // continueReading().
   virtual bool readingPaused() = 0;

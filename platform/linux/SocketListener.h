@@ -59,6 +59,7 @@ class SocketListener final : public ServiceListener,
   const PlatformConfiguration::Listener& limits() const override { return limits_; }
   ListenerCounters& counters() override { return counters_; }
   std::span<uint8_t> readBuffer() override { return readBuffer_; }
+  std::vector<uint8_t>& spareBuffer() override { return spareBuffer_; }
   bool readingPaused() override { return hooks_.congested(); }
   void waitForReading(const std::shared_ptr<SocketConnection>& connection) override;
   void flushAtPassEnd(const std::shared_ptr<SocketConnection>& connection) override {
@@ -95,6 +96,7 @@ class SocketListener final : public ServiceListener,
   bool listening_ = false;
   std::string path_;  // bound here, to be removed at the end; empty for an activated socket
   std::vector<uint8_t> readBuffer_;
+  std::vector<uint8_t> spareBuffer_;
   std::unordered_map<SocketConnection*, std::shared_ptr<SocketConnection>> connections_;
   std::unordered_map<uid_t, uint32_t> connectionsOfUser_;
   std::vector<std::shared_ptr<SocketConnection>> toFlush_;

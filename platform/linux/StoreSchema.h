@@ -1,4 +1,5 @@
-// The database file: opening it, its tables and views, and small wrappers around SQLite's C interface.
+// The database file: opening it, its tables and views, and small wrappers around SQLite's C
+// interface.
 #pragma once
 
 #include <sqlite3.h>
@@ -17,7 +18,8 @@ struct DatabaseCloser {
 };
 using Database = std::unique_ptr<sqlite3, DatabaseCloser>;
 
-// A prepared statement that is bound, stepped and reset over and over. Confined to its database's thread.
+// A prepared statement that is bound, stepped and reset over and over. Confined to its database's
+// thread.
 class Statement {
  public:
   Statement() = default;
@@ -29,7 +31,8 @@ class Statement {
   // The text must stay until run().
   Statement& bind(std::string_view text);
   Statement& bindNull();
-  // Steps a statement without rows and makes it ready for the next use. SQLITE_OK or SQLite's extended error code.
+  // Steps a statement without rows and makes it ready for the next use. SQLITE_OK or SQLite's
+  // extended error code.
   int run();
   // Steps to the next row; false at the end or on an error.
   bool row();
@@ -61,8 +64,8 @@ OpenOutcome openStoreDatabase(const std::string& path, Database& database, std::
 // True when `PRAGMA quick_check` finds nothing; what it found otherwise.
 bool quickCheck(sqlite3* database, std::string& found);
 
-// Moves the file and its companions out of the way, to "<path>.damaged-YYYYMMDD-HHMMSS[-n]". The new name, or empty and
-// a `problem`.
+// Moves the file and its companions out of the way, to "<path>.damaged-YYYYMMDD-HHMMSS[-n]". The
+// new name, or empty and a `problem`.
 std::string moveAside(const std::string& path, std::string& problem);
 
 }  // namespace vx::lnx

@@ -25,7 +25,9 @@ constexpr int kRemovalsPerCheck = 64;
 constexpr std::size_t kKeptRecords = 4096;  // capacity that an idle queue keeps
 constexpr int kWriterNiceness = 10;
 
-bool countsAsRow(const StoreRecord& record) { return !std::holds_alternative<FlushRecord>(record.what); }
+bool countsAsRow(const StoreRecord& record) {
+  return !std::holds_alternative<FlushRecord>(record.what);
+}
 
 template <class T>
 const T* infoValue(const VyrSessionInfo& info, std::string_view key) {
@@ -42,8 +44,8 @@ std::string textUnder(const Payload& payload, std::string_view key) {
 
 }  // namespace
 
-StoreWriter::StoreWriter(std::string path, Database database, const PlatformConfiguration::Store& options,
-                         Clock& clock)
+StoreWriter::StoreWriter(std::string path, Database database,
+                         const PlatformConfiguration::Store& options, Clock& clock)
     : path_(std::move(path)), options_(options), clock_(clock), database_(std::move(database)) {}
 
 StoreWriter::~StoreWriter() {
@@ -128,14 +130,15 @@ bool StoreWriter::waitForBatch() {
     if (pending_.empty()) {
       if (closing_) return false;
       if (pending_.capacity() > kKeptRecords) std::vector<StoreRecord>().swap(pending_);
+      if (batch_.capacity() > kKeptRecords) std::vector<StoreRecord>().swap(batch_);
       sleep_ = Sleep::UntilWork;
       wake_.wait(mutex_);
       sleep_ = Sleep::Awake;
       continue;
     }
     const Monotonic due = firstPending_ + options_.commitInterval;
-    if (closing_ || urgent_ || pending_.size() >= kRowsPerCommit || pendingBytes_ >= kBytesPerCommit ||
-        clock_.monotonic() >= due) {
+    if (closing_ || urgent_ || pending_.size() >= kRowsPerCommit ||
+        pendingBytes_ >= kBytesPerCommit || clock_.monotonic() >= due) {
       break;
     }
     sleep_ = Sleep::UntilCommit;
@@ -190,28 +193,33 @@ void StoreWriter::checkDatabase() {
   std::string problem;
   const std::string aside = moveAside(path_, problem);
   if (openStoreDatabase(path_, database_, problem) != OpenOutcome::Ready) {
-    VX_LOG(nullptr, Error, "the store failed its check (%s) and cannot be begun afresh: %s", found.c_str(),
-           problem.c_str());
+    VX_LOG(nullptr, Error, "the store failed its check (%s) and cannot be begun afresh: %s",
+           found.c_str(), problem.c_str());
     return;
   }
-  VX_LOG(nullptr, Error, "the store failed its check (%s); it was moved to %s and a fresh one begun", found.c_str(),
+  VX_LOG(nullptr, Error,
+         "the store failed its check (%s); it was moved to %s and a fresh one begun", found.c_str(),
          aside.c_str());
   note({"moved_aside", "", 0, "failed its check (" + found + "); now " + aside});
 }
 
 void StoreWriter::prepareStatements() {
   sqlite3* database = database_.get();
-  statements_.relaySession = Statement(
-      database,
-      "INSERT INTO relay_sessions(time, session_id, client_type, client_version, client_name, service_name,"
-      " batch_event, contains_realtime_events, user_info) VALUES(?,?,?,?,?,?,?,?,?)");
+  statements_.relaySession =
+      Statement(database,
+                "INSERT INTO relay_sessions(time, session_id, client_type, client_version, "
+                "client_name, service_name,"
+                " batch_event, contains_realtime_events, user_info) VALUES(?,?,?,?,?,?,?,?,?)");
   statements_.relayMessage = Statement(
-      database, "INSERT INTO relay_messages(time, relay_session, category, type, payload) VALUES(?,?,?,?,?)");
-  statements_.analytics = Statement(database, "INSERT INTO analytics_events(time, name, payload) VALUES(?,?,?)");
-  statements_.power =
-      Statement(database, "INSERT INTO power_records(time, client_identifier, name, record) VALUES(?,?,?,?)");
-  statements_.ledger =
-      Statement(database, "INSERT INTO store_ledger(time, event, table_name, rows, detail) VALUES(?,?,?,?,?)");
+      database,
+      "INSERT INTO relay_messages(time, relay_session, category, type, payload) VALUES(?,?,?,?,?)");
+  statements_.analytics =
+      Statement(database, "INSERT INTO analytics_events(time, name, payload) VALUES(?,?,?)");
+  statements_.power = Statement(
+      database, "INSERT INTO power_records(time, client_identifier, name, record) VALUES(?,?,?,?)");
+  statements_.ledger = Statement(
+      database,
+      "INSERT INTO store_ledger(time, event, table_name, rows, detail) VALUES(?,?,?,?,?)");
 }
 
 void StoreWriter::writeBatch() {
@@ -229,7 +237,8 @@ void StoreWriter::writeBatch() {
       const auto lost = static_cast<uint64_t>(std::count_if(
           batch_.begin() + static_cast<std::ptrdiff_t>(first), batch_.end(), countsAsRow));
       rowsLost_ += lost;
-      VX_LOG(nullptr, Error, "the store could not be written before the end: %llu rows are lost (%s)",
+      VX_LOG(nullptr, Error,
+             "the store could not be written before the end: %llu rows are lost (%s)",
              static_cast<unsigned long long>(lost), sqlite3_errstr(code));
       break;
     }
@@ -242,9 +251,11 @@ int StoreWriter::writeTransaction(std::size_t first, std::size_t last) {
   if (database_ == nullptr) return SQLITE_CANTOPEN;
   int code = execute(database_.get(), "BEGIN IMMEDIATE");
   for (std::size_t i = first; code == SQLITE_OK && i < last; ++i) code = writeRecord(batch_[i]);
-  for (std::size_t i = 0; code == SQLITE_OK && i < notes_.size(); ++i) code = writeLedger(notes_[i]);
+  for (std::size_t i = 0; code == SQLITE_OK && i < notes_.size(); ++i)
+    code = writeLedger(notes_[i]);
   if (code == SQLITE_OK) code = execute(database_.get(), "COMMIT");
-  if (code != SQLITE_OK && sqlite3_get_autocommit(database_.get()) == 0) execute(database_.get(), "ROLLBACK");
+  if (code != SQLITE_OK && sqlite3_get_autocommit(database_.get()) == 0)
+    execute(database_.get(), "ROLLBACK");
   return code;
 }
 
@@ -264,17 +275,23 @@ int StoreWriter::writeRecord(const StoreRecord& record) {
     try {
       appendJson(json_, event->builder());
     } catch (const std::exception& failure) {
-      VX_LOG(nullptr, Error, "the builder of event %s failed: %s", event->name.c_str(), failure.what());
+      VX_LOG(nullptr, Error, "the builder of event %s failed: %s", event->name.c_str(),
+             failure.what());
       ++writeFailures_;
       return SQLITE_OK;
     }
     return statements_.analytics.bind(record.time).bind(event->name).bind(json_).run();
   }
-  if (const auto* session = std::get_if<RelayOpenRecord>(&record.what)) return writeRelaySession(record.time, *session);
+  if (const auto* session = std::get_if<RelayOpenRecord>(&record.what))
+    return writeRelaySession(record.time, *session);
   if (const auto* power = std::get_if<PowerRecord>(&record.what)) {
     json_.clear();
     appendJson(json_, power->record);
-    return statements_.power.bind(record.time).bind(power->clientIdentifier).bind(power->name).bind(json_).run();
+    return statements_.power.bind(record.time)
+        .bind(power->clientIdentifier)
+        .bind(power->name)
+        .bind(json_)
+        .run();
   }
   return SQLITE_OK;  // a flush is answered after the commit
 }
@@ -293,15 +310,21 @@ int StoreWriter::writeRelaySession(double time, const RelayOpenRecord& record) {
     const auto* narrow = infoValue<int32_t>(info, kVyrReportingSessionInfoSessionID);
     insert.bind(int64_t{narrow != nullptr ? *narrow : 0});
   }
-  if (const auto* type = infoValue<int32_t>(info, kVyrReportingSessionInfoClientType)) insert.bind(int64_t{*type});
-  else insert.bindNull();
-  if (const auto* version = infoValue<float>(info, kVyrReportingSessionInfoClientVersion)) insert.bind(double{*version});
-  else insert.bindNull();
+  if (const auto* type = infoValue<int32_t>(info, kVyrReportingSessionInfoClientType))
+    insert.bind(int64_t{*type});
+  else
+    insert.bindNull();
+  if (const auto* version = infoValue<float>(info, kVyrReportingSessionInfoClientVersion))
+    insert.bind(double{*version});
+  else
+    insert.bindNull();
   insert.bind(clientName).bind(serviceName);
   for (const std::string_view key :
        {kVyrReportingSessionInfoBatchEvent, kVyrReportingSessionInfoContainsRealtimeEvents}) {
-    if (const auto* flag = infoValue<bool>(info, key)) insert.bind(int64_t{*flag});
-    else insert.bindNull();
+    if (const auto* flag = infoValue<bool>(info, key))
+      insert.bind(int64_t{*flag});
+    else
+      insert.bindNull();
   }
   const int code = insert.bind(json_).run();
   if (code == SQLITE_OK) record.row->id = sqlite3_last_insert_rowid(database_.get());
@@ -310,8 +333,10 @@ int StoreWriter::writeRelaySession(double time, const RelayOpenRecord& record) {
 
 int StoreWriter::writeLedger(const LedgerNote& entry) {
   statements_.ledger.bind(now()).bind(entry.event);
-  if (entry.table.empty()) statements_.ledger.bindNull();
-  else statements_.ledger.bind(entry.table);
+  if (entry.table.empty())
+    statements_.ledger.bindNull();
+  else
+    statements_.ledger.bind(entry.table);
   return statements_.ledger.bind(entry.rows).bind(entry.detail).run();
 }
 
@@ -326,15 +351,20 @@ void StoreWriter::committed(std::size_t first, std::size_t last) {
   std::vector<Function<void(std::optional<Error>)>> completions;
   uint64_t rows = 0;
   for (std::size_t i = first; i < last; ++i) {
-    if (auto* flush = std::get_if<FlushRecord>(&batch_[i].what)) completions.push_back(std::move(flush->completion));
-    else ++rows;
-    if (auto* message = std::get_if<RelayMessageRecord>(&batch_[i].what)) message->payload = Payload();
+    if (auto* flush = std::get_if<FlushRecord>(&batch_[i].what))
+      completions.push_back(std::move(flush->completion));
+    else
+      ++rows;
+    if (auto* message = std::get_if<RelayMessageRecord>(&batch_[i].what))
+      message->payload = Payload();
   }
   rowsCommitted_ += rows;
   bool drained = false;
   {
     MutexLock lock(mutex_);
-    const std::size_t share = last == batch_.size() ? batchBytes_ : batchBytes_ * (last - first) / (batch_.size() - first);
+    const std::size_t share = last == batch_.size()
+                                  ? batchBytes_
+                                  : batchBytes_ * (last - first) / (batch_.size() - first);
     batchBytes_ -= share;
     heldBytes_ -= share;
     if (congested_.load(std::memory_order_relaxed) && heldBytes_ <= options_.queueBytes / 2) {
@@ -352,13 +382,16 @@ bool StoreWriter::waitBeforeRetry(int code) {
   ++writeFailures_;
   if (!failing_) {
     failing_ = true;
-    VX_LOG(nullptr, Error, "cannot write %s: %s; what was accepted is kept and tried again", path_.c_str(),
+    VX_LOG(nullptr, Error, "cannot write %s: %s; what was accepted is kept and tried again",
+           path_.c_str(),
            database_ != nullptr ? sqlite3_errmsg(database_.get()) : sqlite3_errstr(code));
   }
   if (database_ == nullptr) {
     std::string problem;
-    if (openStoreDatabase(path_, database_, problem) == OpenOutcome::Ready) prepareStatements();
-    else database_.reset();
+    if (openStoreDatabase(path_, database_, problem) == OpenOutcome::Ready)
+      prepareStatements();
+    else
+      database_.reset();
   }
   backoff_ = std::clamp(backoff_ * 2, kFirstBackoff, kLastBackoff);
   const Monotonic until = clock_.monotonic() + backoff_;
@@ -375,7 +408,8 @@ bool StoreWriter::waitBeforeRetry(int code) {
     }
     if (time >= until) return true;
     if (jobs_.empty()) {
-      wake_.waitUntil(mutex_, std::chrono::time_point_cast<std::chrono::steady_clock::duration>(until));
+      wake_.waitUntil(mutex_,
+                      std::chrono::time_point_cast<std::chrono::steady_clock::duration>(until));
     }
   }
 }
@@ -396,9 +430,11 @@ int64_t StoreWriter::removeOldest(const char* table, std::optional<double> befor
 void StoreWriter::applyRetention() {
   commitsSinceRetention_ = 0;
   if (database_ == nullptr) return;
-  static constexpr const char* kTables[] = {"relay_messages", "analytics_events", "power_records", "relay_sessions"};
+  static constexpr const char* kTables[] = {"relay_messages", "analytics_events", "power_records",
+                                            "relay_sessions"};
   auto oldest = [this](const char* table) -> std::optional<double> {
-    Statement query(database_.get(), std::string("SELECT time FROM ") + table + " ORDER BY id LIMIT 1");
+    Statement query(database_.get(),
+                    std::string("SELECT time FROM ") + table + " ORDER BY id LIMIT 1");
     if (!query.row()) return std::nullopt;
     return query.real(0);
   };
@@ -412,8 +448,8 @@ void StoreWriter::applyRetention() {
   };
 
   int removals = kRemovalsPerCheck;
-  if (options_.maxAgeDays != 0 && (lastAgeCheck_ == Monotonic{} ||
-                                   clock_.monotonic() - lastAgeCheck_ >= kAgeCheckInterval)) {
+  if (options_.maxAgeDays != 0 &&
+      (lastAgeCheck_ == Monotonic{} || clock_.monotonic() - lastAgeCheck_ >= kAgeCheckInterval)) {
     lastAgeCheck_ = clock_.monotonic();
     const double before = now() - options_.maxAgeDays * 86400.0;
     for (const char* table : kTables) {
@@ -425,7 +461,8 @@ void StoreWriter::applyRetention() {
         --removals;
       }
       if (removed > 0) {
-        note({"removed_for_age", table, removed, "older than " + std::to_string(options_.maxAgeDays) + " days"});
+        note({"removed_for_age", table, removed,
+              "older than " + std::to_string(options_.maxAgeDays) + " days"});
       }
     }
   }
@@ -446,14 +483,17 @@ void StoreWriter::applyRetention() {
     if (rows == 0) break;
     removed[oldestTable] += rows;
   }
-  if (removed[0] > 0) {  // sessions whose every message is gone, and that came before the oldest message left
-    Statement orphans(database_.get(),
-                      "DELETE FROM relay_sessions WHERE id < (SELECT min(relay_session) FROM relay_messages)");
+  if (removed[0] >
+      0) {  // sessions whose every message is gone, and that came before the oldest message left
+    Statement orphans(
+        database_.get(),
+        "DELETE FROM relay_sessions WHERE id < (SELECT min(relay_session) FROM relay_messages)");
     if (orphans.run() == SQLITE_OK) removed[3] = sqlite3_changes64(database_.get());
   }
   for (std::size_t i = 0; i < std::size(kTables); ++i) {
     if (removed[i] > 0) {
-      note({"removed_for_size", kTables[i], removed[i], "above " + std::to_string(options_.maxBytes) + " bytes"});
+      note({"removed_for_size", kTables[i], removed[i],
+            "above " + std::to_string(options_.maxBytes) + " bytes"});
     }
   }
 }

@@ -54,11 +54,13 @@ struct StoreRecord {
   std::variant<RelayOpenRecord, RelayMessageRecord, AnalyticsRecord, PowerRecord, FlushRecord> what;
 };
 
-// Owned by the local store. append() and the questions are thread-safe; everything else belongs to the writer's thread.
-// What is not yet committed is bounded by queueBytes, by way of the listener: see LocalStore.
+// Owned by the local store. append() and the questions are thread-safe; everything else belongs to
+// the writer's thread. What is not yet committed is bounded by queueBytes, by way of the listener:
+// see LocalStore.
 class StoreWriter {
  public:
-  StoreWriter(std::string path, Database database, const PlatformConfiguration::Store& options, Clock& clock);
+  StoreWriter(std::string path, Database database, const PlatformConfiguration::Store& options,
+              Clock& clock);
   ~StoreWriter();
   StoreWriter(const StoreWriter&) = delete;
   StoreWriter& operator=(const StoreWriter&) = delete;
@@ -76,7 +78,9 @@ class StoreWriter {
   void setDrainedHandler(Function<void()> handler) { drained_ = std::move(handler); }
   bool close(Monotonic deadline);
   LocalStore::Counters counters() const;
-  double now() const { return std::chrono::duration<double>(clock_.now().time_since_epoch()).count(); }
+  double now() const {
+    return std::chrono::duration<double>(clock_.now().time_since_epoch()).count();
+  }
 
  private:
   struct Statements {
@@ -102,7 +106,8 @@ class StoreWriter {
   bool waitForBatch();  // false: closed and empty
   void runJobs();
   void writeBatch();
-  // Writes records [first, last) in one transaction. SQLITE_OK or the error after which everything was rolled back.
+  // Writes records [first, last) in one transaction. SQLITE_OK or the error after which everything
+  // was rolled back.
   int writeTransaction(std::size_t first, std::size_t last);
   int writeRecord(const StoreRecord& record);
   int writeRelaySession(double time, const RelayOpenRecord& record);

@@ -11,7 +11,9 @@ namespace vx::lnx {
 
 int32_t ProcProcessInfo::ownProcessIdentifier() { return getpid(); }
 
-std::string ProcProcessInfo::ownProcessName() { return shortCommandName(getpid()).value_or("vxreportingd"); }
+std::string ProcProcessInfo::ownProcessName() {
+  return shortCommandName(getpid()).value_or("vxreportingd");
+}
 
 std::optional<std::string> ProcProcessInfo::shortCommandName(int32_t processIdentifier) {
   if (processIdentifier < 1) return std::nullopt;
@@ -30,7 +32,8 @@ void ImmediateProcessControl::exit(int status) { std::_Exit(status); }
 
 uint32_t KernelRandom::below(uint32_t bound) {
   if (bound < 2) return 0;
-  const uint32_t limit = UINT32_MAX - UINT32_MAX % bound;  // above it the low values would be likelier
+  const uint32_t limit =
+      UINT32_MAX - UINT32_MAX % bound;  // above it the low values would be likelier
   uint32_t value = 0;
   do {
     if (getrandom(&value, sizeof value, 0) != sizeof value) return 0;

@@ -1,4 +1,5 @@
-// The small services of this machine: process names, process end, random numbers, trace points, device properties.
+// The small services of this machine: process names, process end, random numbers, trace points,
+// device properties.
 #pragma once
 
 #include <atomic>
@@ -40,8 +41,11 @@ class UsdtTracePoint final : public TracePoint {
 // Answers "InternalBuild" and "DeviceClassNumber" from the configuration. Immutable.
 class ConfiguredDeviceProperties final : public DevicePropertyQuery {
  public:
-  explicit ConfiguredDeviceProperties(const PlatformConfiguration::Device& device) : device_(device) {}
-  bool boolean(std::string_view name) override { return name == "InternalBuild" && device_.internalBuild; }
+  explicit ConfiguredDeviceProperties(const PlatformConfiguration::Device& device)
+      : device_(device) {}
+  bool boolean(std::string_view name) override {
+    return name == "InternalBuild" && device_.internalBuild;
+  }
   int32_t integer(std::string_view name, int32_t defaultValue) override {
     return name == "DeviceClassNumber" ? device_.deviceClassNumber : defaultValue;
   }

@@ -17,8 +17,6 @@ struct TomlPreferences::Values {
 
 namespace {
 
-constexpr std::size_t kMaxFileBytes = 1 << 20;
-
 class TomlDomain final : public PreferencesDomain {
  public:
   explicit TomlDomain(std::shared_ptr<const TomlPreferences::Values> values)
@@ -58,7 +56,7 @@ class TomlDomain final : public PreferencesDomain {
 std::shared_ptr<const TomlPreferences::Values> TomlPreferences::read(const std::string& path,
                                                                      std::string& complaint) const {
   Error error;
-  const std::optional<std::string> text = readRegularFile(path, kMaxFileBytes, error);
+  const std::optional<std::string> text = readTomlText(path, error);
   if (!text) {
     if (error.code == ENOENT || error.code == ENOTDIR) return std::make_shared<Values>();
     complaint = error.reason;

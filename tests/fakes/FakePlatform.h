@@ -71,7 +71,7 @@ class FakeWorkQueues final : public WorkQueues {
 // runThread() until `stop` says so.
 class FakeThreading final : public Threading {
  public:
-  FakeThreading(FakeClock& clock, FakeWorkQueues& queues) : clock_(clock), queues_(queues) {}
+  explicit FakeThreading(FakeClock& clock) : clock_(clock) {}
   std::unique_ptr<Condition> makeCondition() override;
   std::shared_ptr<OneShotTimer> makeTimer(std::chrono::nanoseconds delay,
                                           Function<void()> action) override;
@@ -91,7 +91,6 @@ class FakeThreading final : public Threading {
  private:
   friend class FakeCondition;
   FakeClock& clock_;
-  FakeWorkQueues& queues_;
   std::multimap<Monotonic, std::function<void()>> events_;
 };
 
@@ -341,7 +340,7 @@ class FakePlatform {
   Journal journal;
   FakeClock clock;
   FakeWorkQueues queues{clock};
-  FakeThreading threading{clock, queues};
+  FakeThreading threading{clock};
   FakeLog log{journal};
   FakeVyrReporting vyr{journal, threading};
   FakeServices services{journal};

@@ -1,0 +1,126 @@
+#include <fcntl.h>
+#include <gmock/gmock.h>
+#include <unistd.h>
+
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "platform/linux/SystemLog.h"
+
+namespace vx::lnx {
+namespace {
+
+PlatformConfiguration::Log toStderr(uint32_t burst, double refillPerSecond) {
+  PlatformConfiguration::Log options;
+  options.destination = PlatformConfiguration::Log::Destination::Stderr;
+  options.burst = burst;
+  options.refillPerSecond = refillPerSecond;
+  return options;
+}
+
+// Puts a pipe in the place of stderr.
+class StderrPipe {
+ public:
+  StderrPipe() : saved_(dup(STDERR_FILENO)) {
+    EXPECT_EQ(pipe2(ends_, O_CLOEXEC), 0);
+    EXPECT_EQ(fcntl(ends_[1], F_SETPIPE_SZ, 8192), 8192);  // two pages
+    fcntl(ends_[0], F_SETFL, O_NONBLOCK);
+    dup2(ends_[1], STDERR_FILENO);
+  }
+  ~StderrPipe() {
+    dup2(saved_, STDERR_FILENO);
+    for (const int fd : {saved_, ends_[0], ends_[1]}) close(fd);
+  }
+  std::string drain() {
+    std::string text;
+    char buffer[4096];
+    for (ssize_t got; (got = read(ends_[0], buffer, sizeof buffer)) > 0;)
+      text.append(buffer, static_cast<std::size_t>(got));
+    return text;
+  }
+
+ private:
+  int saved_;
+  int ends_[2] = {-1, -1};
+};
+
+TEST(SystemLogOnStderr, ClientsTextCannotForgeALine) {
+  SystemLog log;
+  const LogSite site{"F.cpp", 1, "f", 0};
+  StderrPipe pipe;
+  log.write(nullptr, LogLevel::Default, site, "a\n<0>b\x1B[m\tc\xC3\xA9", 0);
+  EXPECT_EQ(pipe.drain(), "<5>default: a\\n<0>b\\x1B[m\\tc\xC3\xA9\n");
+}
+
+TEST(SystemLogOnStderr, AReaderThatStoppedCostsLinesAndNoTime) {
+  SystemLog log;
+  const LogSite site{"F.cpp", 1, "f", 0};
+  StderrPipe pipe;
+  log.write(nullptr, LogLevel::Info, site, std::string(12000, 'x'), 0);  // more than the pipe holds
+  EXPECT_EQ(log.droppedLines(), 1u);
+  log.write(nullptr, LogLevel::Info, site, "dropped", 0);
+  EXPECT_EQ(log.droppedLines(), 2u);
+  EXPECT_EQ(pipe.drain(), "<6>default: " + std::string(8192 - 12, 'x'));
+  log.write(nullptr, LogLevel::Info, site, "next", 0);
+  EXPECT_EQ(pipe.drain(), "\n<6>default: next\n");  // a line of its own
+  EXPECT_EQ(log.droppedLines(), 2u);
+}
+
+TEST(SystemLogOnStderr, LongLinesAreCutBetweenCharacters) {
+  SystemLog log;
+  const LogSite site{"F.cpp", 1, "f", 0};
+  const std::string kept((16 << 10) - 1, 'x');
+  testing::internal::CaptureStderr();
+  log.write(nullptr, LogLevel::Error, site,
+            kept +
+                "\xC3\xA9"
+                "tail",
+            0);
+  EXPECT_EQ(testing::internal::GetCapturedStderr(), "<3>default: " + kept + "\xE2\x80\xA6\n");
+}
+
+// Threads read the coarse clock at slightly different moments; none of that may refill the bucket.
+TEST(SystemLogLimits, ThreadsShareOneStatementsAllowance) {
+  SystemLog log;
+  log.configure(toStderr(50, 0.001));
+  const LogSite site{"F.cpp", 1, "f", 0};
+  std::atomic<int> wanted{0};
+  std::vector<std::thread> threads;
+  for (int i = 0; i < 4; ++i) {
+    threads.emplace_back([&] {
+      for (int n = 0; n < 300'000; ++n)
+        wanted += log.wantsLine(nullptr, LogLevel::Error, site) ? 1 : 0;
+    });
+  }
+  for (std::thread& thread : threads) thread.join();
+  EXPECT_EQ(wanted.load(), 50);
+}
+
+TEST(SystemLogLimits, AnAllowanceComesBackButNeverBeyondTheBurst) {
+  SystemLog log;
+  log.configure(toStderr(3, 1e6));
+  // As left by a statement that last wrote long ago: no tokens, 2 left out, updated in ms 1.
+  const LogSite site{"F.cpp", 1, "f", uint64_t{2} << 32 | 1};
+  EXPECT_TRUE(log.wantsLine(nullptr, LogLevel::Error, site));
+  EXPECT_EQ(site.platformWord >> 48, 2u);
+  log.configure(toStderr(0, 1));
+  for (int i = 0; i < 200; ++i) EXPECT_TRUE(log.wantsLine(nullptr, LogLevel::Error, site));
+}
+
+TEST(SystemLogScopes, TheVerboseReaderMayLogAndRegister) {
+  SystemLog log;
+  const LogScope* inner = nullptr;
+  log.setVerboseReader([&](std::string_view, std::string_view key) {
+    if (key == "outer") inner = log.registerScope(true, 1, "in", "d", "inner", 31);
+    return key == "outer";
+  });
+  const LogScope* outer = log.registerScope(true, 1, "out", "d", "outer", 31);
+  ASSERT_NE(inner, nullptr);
+  EXPECT_TRUE(log.isLogEnabled(5, outer));
+  EXPECT_FALSE(log.isLogEnabled(5, inner));
+  EXPECT_EQ(log.registerScope(false, 1, "off", "d", "k", 31), nullptr);
+}
+
+}  // namespace
+}  // namespace vx::lnx
