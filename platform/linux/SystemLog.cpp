@@ -1,5 +1,8 @@
 #include "platform/linux/SystemLog.h"
 
+// The lines bring their own CODE_FILE, CODE_LINE and CODE_FUNC; the header would add its caller's.
+#define SD_JOURNAL_SUPPRESS_LOCATION
+
 #include <poll.h>
 #include <sys/uio.h>
 #include <syslog.h>
