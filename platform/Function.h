@@ -20,8 +20,9 @@ class Function<R(Args...)> {
   static constexpr std::size_t kInlineBytes = 48;
 
   Function() noexcept = default;
-  Function(std::nullptr_t) noexcept {
-  }  // NOLINT(google-explicit-constructor): reads as "no callable"
+  // Reads as "no callable".
+  // NOLINTNEXTLINE(google-explicit-constructor)
+  Function(std::nullptr_t) noexcept {}
   Function(Function&& other) noexcept { moveFrom(other); }
   Function& operator=(Function&& other) noexcept {
     if (this != &other) {
@@ -34,10 +35,12 @@ class Function<R(Args...)> {
     reset();
     return *this;
   }
+  // Lambdas convert; the constraint keeps copies and moves away from here.
+  // NOLINTBEGIN(google-explicit-constructor,bugprone-forwarding-reference-overload)
   template <class F, class D = std::decay_t<F>>
     requires(!std::is_same_v<D, Function> && !std::is_same_v<D, std::nullptr_t> &&
              std::is_invocable_r_v<R, D&, Args...>)
-  Function(F&& callable) {  // NOLINT(google-explicit-constructor): lambdas convert
+  Function(F&& callable) {
     if constexpr (fits<D>()) {
       ::new (static_cast<void*>(storage_)) D(std::forward<F>(callable));
       table_ = &kInlineTable<D>;
@@ -46,6 +49,7 @@ class Function<R(Args...)> {
       table_ = &kHeapTable<D>;
     }
   }
+  // NOLINTEND(google-explicit-constructor,bugprone-forwarding-reference-overload)
   Function(const Function&) = delete;
   Function& operator=(const Function&) = delete;
   ~Function() { reset(); }

@@ -1,6 +1,7 @@
 #include "platform/linux/LinuxPlatform.h"
 
 #include <fcntl.h>
+#include <malloc.h>
 #include <signal.h>
 #include <sys/resource.h>
 #include <sys/signalfd.h>
@@ -234,6 +235,8 @@ std::unique_ptr<LinuxPlatform> LinuxPlatform::start(std::string& problem) {
   signal(SIGPIPE, SIG_IGN);
   signal(SIGXFSZ, SIG_IGN);  // a file that may not grow is an error of its write
   raiseDescriptorLimit();
+  // Large buffers go back to the system when they are freed, whatever has been allocated since.
+  mallopt(M_MMAP_THRESHOLD, 256 << 10);
   const Directories directories = Directories::fromEnvironment();
   std::vector<std::string> complaints;
   const PlatformConfiguration configuration = PlatformConfiguration::load(directories, complaints);

@@ -23,7 +23,7 @@ constexpr std::chrono::minutes kAgeCheckInterval{10};
 constexpr int64_t kRowsPerRemoval = 500;
 constexpr int kRemovalsPerCheck = 64;
 constexpr std::size_t kKeptRecords = 4096;  // capacity that an idle queue keeps
-constexpr int kWriterNiceness = 10;
+constexpr int kWriterNiceness = 15;
 
 bool countsAsRow(const StoreRecord& record) {
   return !std::holds_alternative<FlushRecord>(record.what);
