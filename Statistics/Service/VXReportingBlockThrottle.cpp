@@ -122,7 +122,7 @@ void VXReportingBlockThrottleTimerWrapper::runBlock() {
 // The throttle
 
 std::shared_ptr<VXReportingBlockThrottle> VXReportingBlockThrottle::create() {
-  const std::shared_ptr<VXReportingBlockThrottle> throttle(new VXReportingBlockThrottle());
+  std::shared_ptr<VXReportingBlockThrottle> throttle(new VXReportingBlockThrottle());
   {
     MutexLock lock(throttle->unscheduledMutex_);
     throttle->unscheduledTimerKeys_.reserve(kUnscheduledCapacity);

@@ -38,7 +38,7 @@ std::shared_ptr<VXReportingServiceDelegate> VXReportingServiceDelegate::create()
   theServerLogScope.store(platform().log.registerScope(true, fourCharacterCode("vxrs"), "vxrs",
                                                        kDomain, "reporting_server_verbose", 31),
                           std::memory_order_release);
-  const std::shared_ptr<VXReportingServiceDelegate> delegate(new VXReportingServiceDelegate());
+  std::shared_ptr<VXReportingServiceDelegate> delegate(new VXReportingServiceDelegate());
   delegate->init();
   return delegate;
 }
