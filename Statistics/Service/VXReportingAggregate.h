@@ -37,8 +37,10 @@ class VXReportingAggregate {
     return size_ + front_.size();
   }
   // A new, empty array takes the place of the old one.
-  void renew() { exchange(true); }
-  void removeAll() { exchange(false); }
+  void renew() { (void)exchange(true); }
+  // What was there, for whoever has the time to let go of millions of entries.
+  using Contents = std::vector<std::vector<Entry>>;
+  [[nodiscard]] Contents removeAll() { return exchange(false); }
 
   // Dropped without a word when the array is absent.
   void append(Entry entry) {
@@ -76,14 +78,15 @@ class VXReportingAggregate {
   static constexpr std::size_t kFirstChunk = 16;
   static constexpr std::size_t kLargestChunk = 4096;
 
-  void exchange(bool present) {
-    std::vector<std::vector<Entry>> old;  // destroyed after the lock is released
+  Contents exchange(bool present) {
+    Contents old;  // destroyed after the lock is released
     std::vector<Payload> oldFront;
     MutexLock lock(mutex_);
     old.swap(chunks_);
     oldFront.swap(front_);
     size_ = 0;
     present_ = present;
+    return old;
   }
 
   mutable Mutex mutex_;

@@ -127,8 +127,13 @@ void VXReportingSession::stop() {
   }
   writeSummaryJson();
   vyrReportingQueue_->async([self = shared_from_this()] { self->flushRelay(); });
-  aggregatedPayloadData_.removeAll();
-  nestedAggregatedPayloadData_.removeAll();
+  auto flat = aggregatedPayloadData_.removeAll();
+  auto nested = nestedAggregatedPayloadData_.removeAll();
+  // Letting go of millions of messages takes its time: not on the queue that serves everybody.
+  vyrReportingQueue_->async([flat = std::move(flat), nested = std::move(nested)]() mutable {
+    flat.clear();
+    nested.clear();
+  });
   started_ = false;
 }
 
