@@ -69,7 +69,10 @@ class StoreRelaySession final : public VyrReportingSession {
   }
 
   void flushMessagesWithCompletion(Function<void(std::optional<Error>)> handler) override {
-    if (!writer_.append({writer_.now(), FlushRecord{std::move(handler)}}, 0)) handler(closed());
+    if (!handler) handler = [](std::optional<Error>) {};
+    const auto shared = std::make_shared<Function<void(std::optional<Error>)>>(std::move(handler));
+    FlushRecord flush{[shared](std::optional<Error> error) { (*shared)(std::move(error)); }};
+    if (!writer_.append({writer_.now(), std::move(flush)}, 0)) (*shared)(closed());
   }
 
  private:

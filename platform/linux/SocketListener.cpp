@@ -250,6 +250,7 @@ void SocketListener::resume() {
   stopListening();
   const Monotonic deadline = clock_.monotonic() + kShutdownTime;
   std::vector<std::shared_ptr<SocketConnection>> ending;
+  ending.reserve(connections_.size());
   for (const auto& [key, connection] : connections_) ending.push_back(connection);
   for (const auto& connection : ending) connection->shutDown();
   ending.clear();

@@ -26,7 +26,7 @@ class TomlDomain final : public PreferencesDomain {
   std::optional<std::string> string(std::string_view key) const override {
     const toml::node* node = find(key);
     if (node == nullptr || node->is_table() || node->is_array()) return std::nullopt;
-    if (const auto text = node->value_exact<std::string>()) return text;
+    if (auto text = node->value_exact<std::string>()) return text;
     if (const auto flag = node->value_exact<bool>()) return *flag ? "1" : "0";
     std::ostringstream out;
     out << toml::node_view<const toml::node>(*node);
