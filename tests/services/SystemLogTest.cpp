@@ -1,5 +1,6 @@
 #include <fcntl.h>
 #include <gmock/gmock.h>
+#include <time.h>
 #include <unistd.h>
 
 #include <string>
@@ -80,7 +81,6 @@ TEST(SystemLogOnStderr, LongLinesAreCutBetweenCharacters) {
   EXPECT_EQ(testing::internal::GetCapturedStderr(), "<3>default: " + kept + "\xE2\x80\xA6\n");
 }
 
-// Threads read the coarse clock at slightly different moments; none of that may refill the bucket.
 TEST(SystemLogLimits, ThreadsShareOneStatementsAllowance) {
   SystemLog log;
   log.configure(toStderr(50, 0.001));
@@ -95,6 +95,16 @@ TEST(SystemLogLimits, ThreadsShareOneStatementsAllowance) {
   }
   for (std::thread& thread : threads) thread.join();
   EXPECT_EQ(wanted.load(), 50);
+}
+
+TEST(SystemLogLimits, AClockReadATickEarlierRefillsNothing) {
+  SystemLog log;
+  log.configure(toStderr(50, 0.001));
+  timespec now{};
+  clock_gettime(CLOCK_MONOTONIC_COARSE, &now);
+  const auto ms = static_cast<uint32_t>(now.tv_sec * 1000 + now.tv_nsec / 1'000'000);
+  const LogSite site{"F.cpp", 1, "f", uint64_t{1} << 32 | (ms + 1000)};  // no tokens left
+  EXPECT_FALSE(log.wantsLine(nullptr, LogLevel::Error, site));
 }
 
 TEST(SystemLogLimits, AnAllowanceComesBackButNeverBeyondTheBurst) {
