@@ -69,7 +69,7 @@ class StoreRelaySession final : public VyrReportingSession {
   }
 
   void flushMessagesWithCompletion(Function<void(std::optional<Error>)> handler) override {
-    if (!handler) handler = [](std::optional<Error>) {};
+    if (!handler) handler = [](const std::optional<Error>&) {};
     const auto shared = std::make_shared<Function<void(std::optional<Error>)>>(std::move(handler));
     FlushRecord flush{[shared](const std::optional<Error>& error) { (*shared)(error); }};
     if (!writer_.append({writer_.now(), std::move(flush)}, 0)) (*shared)(closed());
