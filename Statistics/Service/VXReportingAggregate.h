@@ -17,8 +17,8 @@ namespace vx {
 // it.
 struct VXReportingNestedEntry {
   Payload payload;
-  uint32_t count = 0;
-  MessageKind kind = 0;
+  uint64_t count : 48 = 0;  // a thousand messages a second for some 9000 years
+  uint64_t kind : 16 = 0;
 };
 
 // An append-only array with its own lock, which may be absent. Grows by chunks that are never

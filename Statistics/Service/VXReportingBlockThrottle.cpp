@@ -28,7 +28,11 @@ constexpr std::size_t kUnscheduledCapacity = 6;
 
 bool isVerbose() { return platform().log.isLogEnabled(5, nullptr); }
 
+// A delay may be any number below 5 that a client wrote down; whatever lies long before now is as
+// good as a day ago.
 std::chrono::nanoseconds nanoseconds(double seconds) {
+  constexpr double kLongAgo = -86400;
+  if (!(seconds > kLongAgo)) seconds = kLongAgo;  // not a number included
   return std::chrono::duration_cast<std::chrono::nanoseconds>(
       std::chrono::duration<double>(seconds));
 }
@@ -43,7 +47,10 @@ std::string VXReportingBlockThrottle::buildMessageKey(const Payload& message, Re
   std::vector<std::string> excluded(kExcludedKeys.begin(), kExcludedKeys.end());
   if (const std::optional<Value> blacklist = message.find(kBlacklist);
       blacklist && blacklist->isArray()) {
-    for (const Value element : blacklist->asArray()) excluded.push_back(element.text());
+    for (const Value element : blacklist->asArray()) {
+      if (element.isString())
+        excluded.emplace_back(element.asString());  // nothing else names a key
+    }
   }
   if (message.contains(kVolume) && message.contains(kVolumeTime)) {
     excluded.emplace_back(kVolume);

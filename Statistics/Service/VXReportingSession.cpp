@@ -111,7 +111,7 @@ void VXReportingSession::start() {
   // by it.
   vyrReportingQueue_->async(
       [self = shared_from_this(), name = serviceName_, type = serviceType(),
-       done = vyrReportingSessionStarted_] { self->setUpRelay(name, type, done); });
+       done = vyrReportingSessionStarted()] { self->setUpRelay(name, type, done); });
 }
 
 void VXReportingSession::stop() {
@@ -150,7 +150,7 @@ VXReportingSession::KindCount VXReportingSession::nextIdentifier(MessageCategory
   return {kind, 1};
 }
 
-std::string VXReportingSession::identifierText(MessageKind kind, uint32_t count) {
+std::string VXReportingSession::identifierText(MessageKind kind, uint64_t count) {
   return messageKindName(kind, '_') + "_" + std::to_string(count);
 }
 
@@ -178,7 +178,8 @@ void VXReportingSession::sendMessage(const Payload& message, MessageCategory cat
   Payload normalised = normalizePayloadKeys(message);
   const KindCount identifier = nextIdentifier(category, type);
   aggregatedPayloadData_.append(normalised);
-  nestedAggregatedPayloadData_.append({normalised, identifier.count, identifier.kind});
+  nestedAggregatedPayloadData_.append(
+      {normalised, identifier.count & ((uint64_t{1} << 48) - 1), identifier.kind});
   platform().trace.emit(kTraceMessage, 0, 0, 0, 0);
   vyrReportingQueue_->async([self = shared_from_this(), normalised = std::move(normalised), message,
                              category, type, startedNow = started_] {
@@ -234,8 +235,10 @@ std::optional<std::vector<Payload>> VXReportingSession::nestedAggregatedPayloadD
   nestedAggregatedPayloadData_.forEach(
       [&](const Payload& header) { all.push_back(header); },
       [&](const VXReportingNestedEntry& entry) {
-        all.push_back(
-            PayloadBuilder().set(identifierText(entry.kind, entry.count), entry.payload).build());
+        all.push_back(PayloadBuilder()
+                          .set(identifierText(static_cast<MessageKind>(entry.kind), entry.count),
+                               entry.payload)
+                          .build());
       });
   return all;
 }

@@ -90,8 +90,12 @@ class VXReportingSession : public std::enable_shared_from_this<VXReportingSessio
   // Fields. Those that other queues see are guarded; the others belong to the service queue.
   bool started() const { return started_; }
   void setStarted(bool started) { started_ = started; }
-  bool vyrReportingSessionStarted() const { return vyrReportingSessionStarted_; }
-  void setVyrReportingSessionStarted(bool started) { vyrReportingSessionStarted_ = started; }
+  bool vyrReportingSessionStarted() const {
+    return vyrReportingSessionStarted_.load(std::memory_order_relaxed);
+  }
+  void setVyrReportingSessionStarted(bool started) {
+    vyrReportingSessionStarted_.store(started, std::memory_order_relaxed);
+  }
   ServiceType serviceType() const { return serviceType_.load(std::memory_order_relaxed); }
   std::string_view serviceName() const { return serviceName_; }
   const std::shared_ptr<VXReportingUserInfo>& userInfo() const { return userInfo_; }
@@ -122,14 +126,14 @@ class VXReportingSession : public std::enable_shared_from_this<VXReportingSessio
  private:
   struct KindCount {
     MessageKind kind;
-    uint32_t count;
+    uint64_t count;
   };
   struct RelayConfiguration;
 
   VXReportingSession(ReporterID reporterID, std::vector<int32_t> processIdentifiers);
   void mergeIntoUserInfo(const std::optional<Payload>& entries);
   KindCount nextIdentifier(MessageCategory category, MessageType type);
-  static std::string identifierText(MessageKind kind, uint32_t count);
+  static std::string identifierText(MessageKind kind, uint64_t count);
 
   void registerOrientationHandlers();
   void unregisterOrientationHandlers();
@@ -146,7 +150,7 @@ class VXReportingSession : public std::enable_shared_from_this<VXReportingSessio
   void setVyrReportingAgentToken(std::shared_ptr<const VyrSecureHierarchyToken> token);
 
   bool started_ = false;
-  bool vyrReportingSessionStarted_ = false;
+  std::atomic<bool> vyrReportingSessionStarted_{false};  // the relay queue writes it too
   std::atomic<ServiceType> serviceType_{kServiceTypeUnknown};
   const ReporterID reporterID_;
   const std::vector<int32_t> processIdentifiers_;

@@ -159,7 +159,8 @@ void VXReportingSession::writeSummaryJson() {
     nestedAggregatedPayloadData_.forEach(
         [&](const Payload& header) { writer.element(header); },
         [&](const VXReportingNestedEntry& entry) {
-          writer.namedElement(identifierText(entry.kind, entry.count), entry.payload);
+          writer.namedElement(identifierText(static_cast<MessageKind>(entry.kind), entry.count),
+                              entry.payload);
         });
     error = writer.finish();
   }

@@ -152,6 +152,7 @@ std::string SystemClock::formatLocal(Date date, const char* format) {
   const std::time_t seconds = std::chrono::system_clock::to_time_t(
       std::chrono::time_point_cast<std::chrono::system_clock::duration>(date));
   std::tm parts{};
+  tzset();  // localtime_r alone would keep the time zone of the first call for ever
   localtime_r(&seconds, &parts);
   char text[128];
   const std::size_t length = std::strftime(text, sizeof text, format, &parts);

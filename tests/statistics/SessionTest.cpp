@@ -282,5 +282,16 @@ TEST_F(OrientationTest, ChangesAreStampedToTheMillisecondInTheFlatAggregateOnly)
   EXPECT_EQ(s->aggregatedPayloadData(), std::nullopt);
 }
 
+TEST_F(OrientationTest, ClockSetBackMeanwhile) {
+  const auto s = make(42, 2);
+  s->start();
+  p.clock.wall -= std::chrono::seconds(90);
+  (*p.services.deviceHandlers.begin()->second)(3);
+  EXPECT_THAT(texts(s->aggregatedPayloadData()),
+              ElementsAre("{device_orientation=o3,device_orientation_time=-90}"));
+  s->stop();
+  EXPECT_EQ(p.services.files.size(), 1u);
+}
+
 }  // namespace
 }  // namespace vx

@@ -1,3 +1,4 @@
+#include <cmath>
 #include <stdexcept>
 
 #include "Statistics/Service/VXReportingBlockThrottle.h"
@@ -65,6 +66,12 @@ TEST_F(ThrottleTest, KeysTellMessagesApart) {
   EXPECT_NE(key(PayloadBuilder().set("_comparison_field_blacklist", "level").set("level", 1)),
             key(PayloadBuilder().set("_comparison_field_blacklist", "level").set("level", 2)));
   EXPECT_NE(key(PayloadBuilder().set("Volume", 1)), key(PayloadBuilder().set("Volume", 2)));
+  const auto number = [](int level) {
+    return PayloadBuilder()
+        .set("_comparison_field_blacklist", ArrayBuilder().add(5))
+        .set("5", level);
+  };
+  EXPECT_NE(key(number(1)), key(number(2)));  // a number is no key
   EXPECT_EQ(key(PayloadBuilder().set("Volume", 1).set("VolumeOperationTime", 1)),
             key(PayloadBuilder().set("Volume", 2).set("VolumeOperationTime", 3)));
 }
@@ -108,7 +115,10 @@ TEST_F(ThrottleTest, ZeroAndLessRunOnTheNextPassAndKeysMayComeAgain) {
   work(200ms);
   add("again", held(0));
   work(200ms);
-  EXPECT_THAT(ran, ElementsAre("now@200", "again@400"));
+  int a = 0;
+  for (const double absurd : {-1e300, -HUGE_VAL, std::nan("")}) add("absurd", held(absurd, ++a));
+  work(200ms);
+  EXPECT_THAT(ran, ElementsAre("now@200", "again@400", "absurd@600", "absurd@600", "absurd@600"));
 }
 
 TEST_F(ThrottleTest, KeysAddedWhileTheLoopIsBusyWaitForIt) {
