@@ -9,6 +9,7 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <atomic>
 #include <cerrno>
 #include <chrono>
 #include <cstring>
@@ -91,6 +92,9 @@ struct LinuxOrientation::State {
   Handlers interface;  // likewise
   std::string lastDevice;
   std::string lastInterface;
+  // What is missing is said once, and again only after it had been there.
+  std::atomic<bool> saidBusIsMissing{false};
+  std::atomic<bool> saidFolderIsMissing{false};
   bool running GUARDED_BY(mutex) = false;
   bool ending GUARDED_BY(mutex) = false;
 };
@@ -181,16 +185,15 @@ class Watcher {
                                        &Watcher::onPropertiesChanged, nullptr, this);
     }
     if (code < 0) {
-      if (!complained_) {
+      if (!state_->saidBusIsMissing.exchange(true)) {
         VX_LOG(nullptr, Info, "device orientation is off for now: no system bus (%s)",
                std::strerror(-code));
       }
-      complained_ = true;
       disconnect();
       retryLater(kLastConnectRetry);
       return;
     }
-    complained_ = false;
+    state_->saidBusIsMissing = false;
     backoff_ = {};
     claim();
   }
@@ -303,7 +306,7 @@ class Watcher {
     if (code < 0) {
       VX_LOG(nullptr, Info, "the system bus is gone (%s); device orientation waits for it",
              std::strerror(-code));
-      complained_ = true;
+      state_->saidBusIsMissing = true;
       disconnect();
       retryLater(kLastConnectRetry);
     }
@@ -311,20 +314,24 @@ class Watcher {
 
   // --- the state file ---
 
+  // Tried again whenever a handler comes or goes.
   void watchFile() {
-    if (inotifyFd_ >= 0 || fileGivenUp_) return;
+    if (inotifyFd_ >= 0) return;
     const std::filesystem::path folder =
         std::filesystem::path(state_->options.interfaceStateFile).parent_path();
     inotifyFd_ = inotify_init1(IN_NONBLOCK | IN_CLOEXEC);
     if (inotifyFd_ < 0 || inotify_add_watch(inotifyFd_, folder.c_str(),
                                             IN_CLOSE_WRITE | IN_MOVED_TO | IN_ONLYDIR) < 0) {
-      VX_LOG(nullptr, Info, "interface orientation is off: cannot watch %s (%s)", folder.c_str(),
-             std::strerror(errno));
+      const int failure = errno;
+      if (!state_->saidFolderIsMissing.exchange(true)) {
+        VX_LOG(nullptr, Info, "interface orientation is off for now: cannot watch %s (%s)",
+               folder.c_str(), std::strerror(failure));
+      }
       if (inotifyFd_ >= 0) close(inotifyFd_);
       inotifyFd_ = -1;
-      fileGivenUp_ = true;
       return;
     }
+    state_->saidFolderIsMissing = false;
     readFile();
   }
 
@@ -360,11 +367,9 @@ class Watcher {
   bool interfaceWanted_ = false;
   sd_bus* bus_ = nullptr;
   bool claimed_ = false;
-  bool complained_ = false;
   std::optional<SteadyClock::time_point> retryAt_;
   std::chrono::milliseconds backoff_{0};
   int inotifyFd_ = -1;
-  bool fileGivenUp_ = false;
 };
 
 void add(const std::shared_ptr<LinuxOrientation::State>& state,

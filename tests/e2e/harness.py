@@ -184,13 +184,15 @@ class Client:
 
 
 class Daemon:
-    def __init__(self, config="", environment=None, folder=None, wait=True, preexec=None):
+    def __init__(self, config="", environment=None, folder=None, wait=True, preexec=None,
+                 device_sensor=False):
         self.folder = folder or tempfile.mkdtemp(prefix="vx")
         for name in ("run", "state", "etc", "log", "drivers"):
             os.makedirs(f"{self.folder}/{name}", exist_ok=True)
         with open(f"{self.folder}/etc/platform.toml", "w") as f:
             f.write(f'[log]\ndestination = "stderr"\nlevel = "info"\nburst = 0\n'
-                    f'[drivers]\nroot = "{self.folder}/drivers"\n[orientation]\ndevice_sensor = false\n' + config)
+                    f'[drivers]\nroot = "{self.folder}/drivers"\n[orientation]\n'
+                    f'device_sensor = {str(device_sensor).lower()}\n' + config)
         self.environment = dict(
             os.environ, RUNTIME_DIRECTORY=f"{self.folder}/run", STATE_DIRECTORY=f"{self.folder}/state",
             CONFIGURATION_DIRECTORY=f"{self.folder}/etc", LOGS_DIRECTORY=f"{self.folder}/log", **(environment or {}))

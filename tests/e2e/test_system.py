@@ -2,6 +2,7 @@
 import json
 import os
 import re
+import resource
 import shutil
 import subprocess
 import time
@@ -166,10 +167,152 @@ class SummaryTest(DaemonTest):
         self.assertEqual(self.files(d), [])
         self.assertTrue(os.path.isdir(f"{d.folder}/log/Audio/Reporting"))
 
+    def test_full_and_unwritable_directories(self):
+        d = self.daemon(config=INTERNAL)
+        c = self.run_session(d)
+        whole = self.files(d)
+        c.started(4, 2)
+        for i in range(50):
+            c.call(SEND, {"text": "x" * 200}, 3, 1, [4])
+        # No file of the daemon may grow any more: to the writer that is a full disk.
+        resource.prlimit(d.process.pid, resource.RLIMIT_FSIZE, (4096, resource.RLIM_INFINITY))
+        self.assertIs(c.call(STOP, 4), True)
+        resource.prlimit(d.process.pid, resource.RLIMIT_FSIZE, (resource.RLIM_INFINITY, resource.RLIM_INFINITY))
+        self.assertRegex(d.log(), r"jsonOutput writeToURL: .*[Ff]ile too large")
+        self.assertEqual(self.files(d), whole)
+        shutil.rmtree(d.folder + "/log")
+        os.symlink("/proc/self", d.folder + "/log")  # nobody makes a folder or a file there, root included
+        c.started(5, 2)
+        c.call(SEND, {"a": 1}, 3, 1, [5])
+        self.assertIs(c.call(STOP, 5), True)
+        self.assertEqual(d.log().count("can't create logging directory at"), 1)
+        self.assertEqual(d.log().count("jsonOutput writeToURL:"), 2)
+        os.remove(d.folder + "/log")
+        self.run_session(d, reporter=6)
+        self.assertEqual(len(self.files(d)), 1)
+
+    def test_two_stops_in_one_second_leave_the_later_file_whole(self):
+        d = self.daemon(config=INTERNAL)
+        c = d.client()
+        for attempt in range(10):
+            for n in (1, 2):
+                c.started(n, 2)
+                c.call(SEND, {"n": n, "attempt": attempt}, 3, 1, [n])
+            c.answer([c.post(STOP, n) for n in (1, 2)][1])
+            mine = [f for f in map(self.content, self.files(d)) if f[1]["Playback_Start_%d" % (attempt + 1)]["attempt"] == attempt]
+            if len(mine) == 1:
+                break
+        self.assertEqual(mine[0][1]["Playback_Start_%d" % (attempt + 1)]["n"], 2)
+        self.assertEqual(len(mine[0]), 3)
+
+    def content(self, path):
+        with open(path) as f:
+            return json.load(f)
+
     def test_no_file_on_other_builds(self):
         d = self.daemon()
         self.run_session(d)
         self.assertEqual(os.listdir(d.folder + "/log"), [])
+
+
+HAVE_BUS = shutil.which("dbus-daemon") and subprocess.run(
+    ["/usr/bin/python3", "-c", "import dbus, gi"], stderr=subprocess.DEVNULL).returncode == 0
+
+
+class Sensor:
+    def __init__(self, address, refusals=0):
+        script = os.path.join(os.path.dirname(os.path.abspath(__file__)), "fake_sensor.py")
+        self.process = subprocess.Popen(["/usr/bin/python3", script, address, str(refusals)], stdin=subprocess.PIPE,
+                                        stdout=subprocess.PIPE, stderr=subprocess.DEVNULL, text=True)
+
+    def answers(self, n):
+        return [self.process.stdout.readline().strip() for _ in range(n)]
+
+    def turn(self, word):
+        self.process.stdin.write(word + "\n")
+        self.process.stdin.flush()
+
+    def leave(self):
+        self.process.stdin.close()
+        self.process.wait(PATIENCE)
+        self.process.stdout.close()
+
+
+@unittest.skipUnless(HAVE_BUS, "dbus-daemon, python3-dbus and python3-gi are not installed")
+class SensorFaultsTest(DaemonTest):
+    def setUp(self):
+        self.folder = tempfile.mkdtemp(prefix="vx")
+        self.address = f"unix:path={self.folder}/bus"
+        self.d = self.daemon(config=INTERNAL, folder=self.folder, device_sensor=True,
+                             environment={"DBUS_SYSTEM_BUS_ADDRESS": self.address})
+        self.c = self.d.client()
+
+    def start_bus(self):
+        bus = subprocess.Popen(["dbus-daemon", "--session", "--nofork", f"--address={self.address}"],
+                               stdout=subprocess.DEVNULL)
+        self.addCleanup(lambda: (bus.kill(), bus.wait()))
+        self.d.wait_until(lambda: os.path.exists(f"{self.folder}/bus"), "the bus listens")
+        return bus
+
+    def words(self):
+        """Stops the session, and what it was told of the device."""
+        self.c.call(SEND, {"a": 1}, 3, 1, [1])
+        self.c.call(STOP, 1)
+        (name,) = os.listdir(f"{self.folder}/log/Audio/Reporting")
+        with open(f"{self.folder}/log/Audio/Reporting/{name}") as f:
+            return list(json.load(f)[-1].values())[0]["device_orientation"].split(",")
+
+    def turn_until_told(self, sensor, words):
+        """The first word that is known is no change; those behind it are."""
+        self.assertEqual(sensor.answers(1), ["claimed"])
+        time.sleep(0.1)  # the question for the present word, right behind the claim
+        for word in words:
+            sensor.turn(word)
+        time.sleep(0.1)
+
+    def test_claim_refused_while_the_sensor_wakes_up_is_tried_again(self):
+        self.start_bus()
+        self.c.started(1, 7)
+        sensor = Sensor(self.address, refusals=2)
+        self.assertEqual(sensor.answers(2), ["refused", "refused"])
+        self.turn_until_told(sensor, ["normal", "left-up"])
+        self.assertEqual(self.words(), ["normal", "left-up"])
+        sensor.leave()
+
+    def test_sensor_that_vanishes_and_comes_back(self):
+        self.start_bus()
+        self.c.started(1, 7)
+        sensor = Sensor(self.address)
+        self.turn_until_told(sensor, ["normal"])
+        sensor.leave()
+        sensor = Sensor(self.address)
+        self.turn_until_told(sensor, ["left-up"])
+        self.assertEqual(self.words(), ["normal", "undefined", "left-up"])
+        sensor.leave()
+
+    def test_bus_that_dies_under_registered_handlers(self):
+        bus = self.start_bus()
+        self.c.started(1, 7)
+        sensor = Sensor(self.address)
+        self.turn_until_told(sensor, ["normal"])
+        bus.kill()
+        bus.wait()
+        self.d.wait_until(lambda: "the system bus is gone" in self.d.log(), "the loss is noticed")
+        self.assert_unharmed(self.d)
+        os.remove(f"{self.folder}/bus")
+        self.start_bus()
+        sensor.leave()
+        sensor = Sensor(self.address)
+        self.turn_until_told(sensor, ["left-up"])
+        self.assertEqual(self.words()[-1], "left-up")
+        sensor.leave()
+        self.assertEqual(self.d.stop(), 0)
+
+    def test_nothing_to_watch_is_said_once(self):
+        for i in range(3):
+            self.c.started(i + 1, 7)
+            self.c.call(STOP, i + 1)
+        self.assertEqual(self.d.log().count("device orientation is off for now"), 1)
 
 
 class OrientationTest(DaemonTest):
@@ -205,13 +348,7 @@ class OrientationTest(DaemonTest):
         self.addCleanup(lambda: (bus.kill(), bus.wait(), bus.stdout.close()))
         address = bus.stdout.readline().decode().strip()
         environment = dict(os.environ, DBUS_SYSTEM_BUS_ADDRESS=address, DBUS_SESSION_BUS_ADDRESS=address)
-        d = self.daemon(config=INTERNAL, environment={"DBUS_SYSTEM_BUS_ADDRESS": address})
-        with open(d.folder + "/etc/platform.toml") as f:
-            text = f.read().replace("device_sensor = false", "device_sensor = true")
-        d.stop()
-        with open(d.folder + "/etc/platform.toml", "w") as f:
-            f.write(text)
-        d.start()
+        d = self.daemon(config=INTERNAL, device_sensor=True, environment={"DBUS_SYSTEM_BUS_ADDRESS": address})
         c = d.client()
         c.started(1, 7)
         # The sensor appears after the session has begun.

@@ -1,4 +1,5 @@
 #include <gmock/gmock.h>
+#include <sys/resource.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -240,6 +241,39 @@ TEST_F(FilesTest, WatcherSettlesBeforeItFires) {
   watcher.onReadable();
   p.queues.runAll();
   EXPECT_GT(fired, before + 2);
+}
+
+TEST_F(FilesTest, WatcherPollsWhereInotifyCannotBeHad) {
+  fakes::FakeClock clock;
+  PlatformConfiguration::Preferences options;
+  PreferencesWatcher watcher(folder + "/preferences", folder + "/notify", {{"name", "d.toml"}},
+                             options, clock);
+  rlimit before{};
+  getrlimit(RLIMIT_NOFILE, &before);
+  const rlimit none{0, before.rlim_max};
+  setrlimit(RLIMIT_NOFILE, &none);
+  watcher.start();
+  setrlimit(RLIMIT_NOFILE, &before);
+  EXPECT_THAT(p.log.lines, ElementsAre(HasSubstr("looking every 3000 ms instead")));
+  EXPECT_EQ(watcher.fd(), -1);
+  int fired = 0;
+  int token = 0;
+  watcher.registerHandler("name", token, p.queues.makeSerial("q", QualityOfService::Utility),
+                          [&](int) { ++fired; });
+  auto pass = [&] {
+    for (int i = 0; i < 4; ++i) {  // a look, and the settling time behind it
+      clock.advance(1s);
+      if (*watcher.nextDue() <= clock.monotonic()) watcher.onDue();
+    }
+    p.queues.runAll();
+    return fired;
+  };
+  EXPECT_EQ(pass(), 0);
+  write("preferences/d.toml", "a = 1\n");
+  EXPECT_EQ(pass(), 1);
+  EXPECT_EQ(pass(), 1);
+  std::filesystem::remove(folder + "/preferences/d.toml");
+  EXPECT_EQ(pass(), 2);
 }
 
 TEST(SystemLogTest, LinesOfOneStatementAreLimitedAndCounted) {

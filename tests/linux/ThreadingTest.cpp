@@ -1,10 +1,14 @@
 #include <gtest/gtest.h>
 
+#include <atomic>
+#include <cstdlib>
 #include <stdexcept>
 #include <thread>
 #include <vector>
 
+#include "Statistics/Service/VXReportingBlockThrottle.h"
 #include "platform/linux/SystemThreading.h"
+#include "tests/fakes/FakePlatform.h"
 
 namespace vx::lnx {
 namespace {
@@ -71,6 +75,31 @@ TEST(SystemConditionTest, SignalEndsAWaitAndTheDeadlineDoesToo) {
   });
   EXPECT_TRUE(condition->waitUntil(clock.monotonic() + 30s));
   condition->unlock();
+}
+
+// The process may end while deliveries are pending: they do not happen, and nothing waits for them.
+[[noreturn]] void exitWithADeliveryPending() {
+  fakes::FakePlatform p;
+  SystemThreading threading;
+  SystemClock clock;
+  auto& s = p.services;
+  Platform real{p.listener, p.queues, clock, threading, s, s, s,     s, s,
+                p.vyr,      s,        s,     s,         s, s, p.log, s, s};
+  installPlatform(&real);
+  const auto throttle = VXReportingBlockThrottle::create();
+  std::atomic<bool> ran{false};
+  throttle->addMessageBlock([&] { ran = true; }, 1, Payload(), 1, 1);
+  throttle->waitForCompletion();
+  if (!ran) std::_Exit(2);
+  const Payload late = PayloadBuilder().set("_throttle_seconds", 4.9).build();
+  throttle->addMessageBlock([] { std::_Exit(3); }, 1, late, 1, 1);
+  std::this_thread::sleep_for(150ms);  // long enough for the worker to attach it
+  std::exit(0);
+}
+
+TEST(ThrottleAtExitDeathTest, PendingDeliveriesDoNotHoldTheProcess) {
+  GTEST_FLAG_SET(death_test_style, "threadsafe");
+  EXPECT_EXIT(exitWithADeliveryPending(), ::testing::ExitedWithCode(0), "");
 }
 
 }  // namespace
