@@ -321,30 +321,25 @@ ServiceConnection::Received ServiceConnection::runFrames() {
   return Received::Something;
 }
 
-bool ServiceConnection::runFrame(std::span<const uint8_t> frame) {
-  const std::optional<ArrayView> items = FrameDecoder::decode(frame);
-  if (!items || items->empty()) return false;
-  const std::size_t size = items->size();
-  auto at = items->begin();
-  const Value kind = *at;
+bool ServiceConnection::runFrame(std::span<const uint8_t> bytes) {
+  const std::optional<Frame> frame = Frame::decode(bytes);
+  if (!frame || frame->empty()) return false;
+  const std::size_t size = frame->size();
+  const Value kind = (*frame)[0];
   if (kind.kind() != ValueKind::Integer) return false;
   if (kind.asInt64() == kGoodbye) return goodbyeSeen_ = true;
   if (size < 2) return false;
-  ++at;
-  if (kind.asInt64() == kHello) return runHello(at, size);
-  const Value number = *at;
+  if (kind.asInt64() == kHello) return runHello(*frame);
+  const Value number = (*frame)[1];
   if (kind.asInt64() == kReply && helloSeen_ && size >= 3) {
-    ++at;
-    const Value value = *at;
+    const Value value = (*frame)[2];
     answer(number, {}, &value);
     return true;
   }
   if (kind.asInt64() != kError || size < 4) return false;
   ClientStatus status = failure(Code::Refused, "");
-  ++at;
-  status.wireCode = (*at).asInt64();
-  ++at;
-  status.text = (*at).asString();
+  status.wireCode = (*frame)[2].asInt64();
+  status.text = (*frame)[3].asString();
   if (number.kind() == ValueKind::Null)
     serviceError_ = "the service closed the connection: " + status.text;
   else
@@ -353,13 +348,13 @@ bool ServiceConnection::runFrame(std::span<const uint8_t> frame) {
 }
 
 // [0, version, limits]
-bool ServiceConnection::runHello(ArrayView::Iterator at, std::size_t size) {
-  if (helloSeen_ || (*at).kind() != ValueKind::Integer || (*at).asInt64() != kProtocolVersion)
+bool ServiceConnection::runHello(const Frame& frame) {
+  const Value version = frame[1];
+  if (helloSeen_ || version.kind() != ValueKind::Integer || version.asInt64() != kProtocolVersion)
     return false;
   helloSeen_ = true;
-  if (size < 3) return true;
-  ++at;
-  const std::optional<Value> limit = (*at).asDictionary().find("max_frame_bytes");
+  if (frame.size() < 3) return true;
+  const std::optional<Value> limit = frame[2].asDictionary().find("max_frame_bytes");
   if (limit && limit->kind() == ValueKind::Integer && limit->asInt64() > 0)
     largestFrame_ = std::min<uint64_t>(limit->asUInt64(), kLargestFrameBytes);
   return true;

@@ -99,8 +99,8 @@ class ServiceConnection : public std::enable_shared_from_this<ServiceConnection>
 
   Received receive(int flags);
   Received runFrames();
-  bool runFrame(std::span<const uint8_t> frame);
-  bool runHello(ArrayView::Iterator at, std::size_t size);
+  bool runFrame(std::span<const uint8_t> bytes);
+  bool runHello(const Frame& frame);
   void answer(const Value& number, const ClientStatus& status, const Value* value);
 
   std::size_t beginFrame();

@@ -1,5 +1,7 @@
 // Whatever bytes come: they are refused, or every view of them can be walked and a builder makes
 // the same property list of them again.
+#include <algorithm>
+
 #include "platform/JsonWriter.h"
 #include "platform/Payload.h"
 
@@ -26,8 +28,15 @@ void walk(const vx::Value& value) {
 }  // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
-  if (const auto frame = vx::FrameDecoder::decode({data, size}))
-    for (const vx::Value& element : *frame) walk(element);
+  if (const auto frame = vx::Frame::decode({data, size})) {
+    for (std::size_t i = 0; i < std::min(frame->size(), vx::Frame::kMaxElements); ++i) {
+      walk((*frame)[i]);
+      if (!(*frame)[i].isDictionary()) continue;
+      const vx::Payload copy = vx::Payload::copyOf((*frame)[i]);
+      require(frame->payload(i) == copy &&
+              frame->payload(i).hasSpaceInKeys() == copy.hasSpaceInKeys());
+    }
+  }
   const auto payload = vx::Payload::decode({data, size});
   if (!payload) return 0;
   for (const auto& [key, value] : *payload) walk(value);

@@ -1,4 +1,4 @@
-// Validation of bytes that come from outside: Payload::decode and FrameDecoder.
+// Validation of bytes that come from outside: Payload::decode and Frame.
 #include <algorithm>
 #include <array>
 #include <cmath>
@@ -63,14 +63,12 @@ class KeyStack {
 // Bounds: kMaxNesting levels; keys of open dictionaries, hence fewer than there are bytes.
 class Validator {
  public:
-  enum class Root { Payload, Frame };
-
-  Validator(std::span<const uint8_t> bytes, Root root)
-      : begin_(bytes.data()), at_(begin_), end_(begin_ + bytes.size()), root_(root) {}
+  // Of a payload, or of a frame, whose elements are noted as they pass.
+  explicit Validator(std::span<const uint8_t> bytes, Frame::Element* elements = nullptr)
+      : begin_(bytes.data()), at_(begin_), end_(begin_ + bytes.size()), elements_(elements) {}
 
   bool run();
   uint64_t rootCount() const { return rootCount_; }
-  const uint8_t* firstInRoot() const { return firstInRoot_; }
   bool spaceInKeys() const { return space_ != 0; }
   DecodeError takeError() { return std::move(error_); }
 
@@ -87,7 +85,7 @@ class Validator {
 
   // A frame's array does not count, so that every valid payload fits into a frame.
   int deepest() const {
-    return root_ == Root::Frame ? Payload::kMaxNesting : Payload::kMaxNesting - 1;
+    return elements_ != nullptr ? Payload::kMaxNesting : Payload::kMaxNesting - 1;
   }
   std::size_t bytesLeft() const { return static_cast<std::size_t>(end_ - at_); }
   bool fail(const uint8_t* at, std::string text) {
@@ -97,6 +95,7 @@ class Validator {
   bool failDuplicate(const OpenKey& key);
   bool failSimple(const cbor::Head& head, const uint8_t* at);
 
+  void endElement(uint64_t next);
   bool readHead(cbor::Head& head);
   bool open(const cbor::Head& head, const uint8_t* at);
   bool close(const Level& level);
@@ -108,10 +107,9 @@ class Validator {
   const uint8_t* begin_;
   const uint8_t* at_;
   const uint8_t* end_;
-  Root root_;
-  int depth_ = -1;  // index of the open level
+  Frame::Element* elements_;  // kMaxElements of them; null for a payload
+  int depth_ = -1;            // index of the open level
   uint64_t rootCount_ = 0;
-  const uint8_t* firstInRoot_ = nullptr;
   uint64_t space_ = 0;
   std::array<Level, Payload::kMaxNesting + 1> levels_;
   KeyStack keys_;
@@ -122,10 +120,9 @@ bool Validator::run() {
   if (end_ - begin_ > static_cast<std::ptrdiff_t>(0x7FFFFFFF)) return fail(begin_, "too large");
   cbor::Head head;
   if (!readHead(head)) return false;
-  if (root_ == Root::Payload && head.major() != cbor::kMap) return fail(begin_, "not a dictionary");
-  if (root_ == Root::Frame && head.major() != cbor::kArray) return fail(begin_, "not an array");
+  if (elements_ == nullptr && head.major() != cbor::kMap) return fail(begin_, "not a dictionary");
+  if (elements_ != nullptr && head.major() != cbor::kArray) return fail(begin_, "not an array");
   rootCount_ = head.argument;
-  firstInRoot_ = at_;
   if (!open(head, begin_)) return false;
   while (depth_ >= 0) {
     Level& level = levels_[static_cast<std::size_t>(depth_)];
@@ -134,11 +131,24 @@ bool Validator::run() {
       --depth_;
       continue;
     }
+    if (depth_ == 0 && elements_ != nullptr) endElement(level.count - level.left);
     --level.left;
     if (level.dictionary && !readKey(level)) return false;
     if (!readValue()) return false;
   }
+  if (elements_ != nullptr) endElement(rootCount_);
   return at_ == end_ || fail(at_, "bytes behind the end");
+}
+
+// The frame's element before number `next` ends here, and that one begins.
+inline void Validator::endElement(uint64_t next) {
+  if (next > 0 && next <= Frame::kMaxElements) {
+    Frame::Element& element = elements_[next - 1];
+    element.end = at_;
+    element.spaceInKeys = space_ != 0;
+  }
+  if (next < Frame::kMaxElements) elements_[next].begin = at_;
+  space_ = 0;
 }
 
 inline bool Validator::readHead(cbor::Head& head) {
@@ -202,7 +212,7 @@ inline bool Validator::readKey(const Level& level) {
   });
   if ((high & kHighBits) != 0 && !isUtf8Slowly(at_, at_ + head.argument))
     return fail(start, "invalid UTF-8");
-  if (depth_ == 0) space_ |= space;
+  if (depth_ == (elements_ != nullptr ? 1 : 0)) space_ |= space;
   const OpenKey key{print, at_, head.argument};
   at_ += head.argument;
   if (level.count <= kPairwise) {
@@ -260,7 +270,7 @@ bool Validator::readDate(const cbor::Head& tag, const uint8_t* at) {
 
 bool Validator::failSimple(const cbor::Head& head, const uint8_t* at) {
   if (head.initial == cbor::kNull) {
-    if (root_ == Root::Frame && depth_ == 0) return true;
+    if (elements_ != nullptr && depth_ == 0) return true;
     return fail(at, "null");
   }
   if (head.initial == 0xF7) return fail(at, "undefined");
@@ -281,7 +291,7 @@ bool Validator::failDuplicate(const OpenKey& key) {
 }  // namespace
 
 std::optional<Payload> Payload::decode(std::span<const uint8_t> bytes, DecodeError* error) {
-  Validator validator(bytes, Validator::Root::Payload);
+  Validator validator(bytes);
   if (!validator.run()) {
     if (error != nullptr) *error = validator.takeError();
     return std::nullopt;
@@ -292,16 +302,24 @@ std::optional<Payload> Payload::decode(std::span<const uint8_t> bytes, DecodeErr
   return Payload(block);
 }
 
-std::optional<ArrayView> FrameDecoder::decode(std::span<const uint8_t> bytes, DecodeError* error) {
-  Validator validator(bytes, Validator::Root::Frame);
+std::optional<Frame> Frame::decode(std::span<const uint8_t> bytes, DecodeError* error) {
+  std::optional<Frame> frame(std::in_place);
+  Validator validator(bytes, frame->elements_.data());
   if (!validator.run()) {
     if (error != nullptr) *error = validator.takeError();
     return std::nullopt;
   }
-  ArrayView view;
-  view.first_ = validator.firstInRoot();
-  view.count_ = validator.rootCount();
-  return view;
+  frame->size_ = validator.rootCount();
+  return frame;
+}
+
+Payload Frame::payload(std::size_t i) const {
+  const Element& element = elements_[i];
+  const auto size = static_cast<std::size_t>(element.end - element.begin);
+  if (size <= 1) return Payload();  // the empty dictionary
+  Payload::Block* block = Payload::Block::allocate(size, element.spaceInKeys);
+  std::memcpy(block->bytes(), element.begin, size);
+  return Payload(block);
 }
 
 }  // namespace vx

@@ -13,6 +13,7 @@ namespace vx::lnx {
 namespace {
 
 constexpr std::size_t kLengthBytes = 4;
+constexpr std::size_t kCallHead = 3;  // kind, number and operation, before the arguments
 constexpr std::size_t kReadBytes = 64 << 10;
 // Frames run before the replies they cause get their turn, which bounds how far replies overshoot
 // their limit.
@@ -211,9 +212,9 @@ std::size_t SocketConnection::runFrames(std::span<const uint8_t> bytes) {
 
 void SocketConnection::runFrame(std::span<const uint8_t> frame) {
   DecodeError error;
-  const std::optional<ArrayView> items = FrameDecoder::decode(frame, &error);
+  const std::optional<Frame> items = Frame::decode(frame, &error);
   std::optional<int64_t> kind;
-  if (items && !items->empty()) kind = wholeNumber(*items->begin());
+  if (items && !items->empty()) kind = wholeNumber((*items)[0]);
   if (!items || !kind) {
     ++host_.counters().malformedFrames;
     return fail(WireError::MalformedFrame,
@@ -231,10 +232,9 @@ void SocketConnection::runFrame(std::span<const uint8_t> frame) {
   fail(WireError::MalformedFrame, "unknown kind of frame " + std::to_string(*kind));
 }
 
-void SocketConnection::runHello(const ArrayView& frame) {
-  auto at = frame.begin();
+void SocketConnection::runHello(const Frame& frame) {
   std::optional<int64_t> version;
-  if (frame.size() >= 2) version = wholeNumber(*++at);
+  if (frame.size() >= 2) version = wholeNumber(frame[1]);
   if (version != kProtocolVersion) {
     ++host_.counters().unsupportedVersions;
     return fail(
@@ -266,15 +266,13 @@ void SocketConnection::runHello(const ArrayView& frame) {
 // ---------------------------------------------------------------------------------------------------------------------
 // Calls
 
-void SocketConnection::runCall(const ArrayView& frame) {
+void SocketConnection::runCall(const Frame& frame) {
   ++host_.counters().calls;
-  auto at = frame.begin();
   std::optional<int64_t> number;
   std::optional<int64_t> operationNumber;
-  if (frame.size() >= 3) {
-    number = wholeNumber(*++at);
-    operationNumber = wholeNumber(*++at);
-    ++at;
+  if (frame.size() >= kCallHead) {
+    number = wholeNumber(frame[1]);
+    operationNumber = wholeNumber(frame[2]);
   }
   if (!number || *number < 0 || !operationNumber) {
     ++host_.counters().malformedFrames;
@@ -291,7 +289,7 @@ void SocketConnection::runCall(const ArrayView& frame) {
       interface_->operations[static_cast<std::size_t>(*operationNumber - 1)];
   CallArguments arguments;
   std::string problem;
-  if (!readArguments(operation, at, frame.size() - 3, arguments, problem)) {
+  if (!readArguments(operation, frame, arguments, problem)) {
     ++host_.counters().wrongArguments;
     return sendError(callNumber, WireError::WrongArguments, problem);
   }
@@ -306,17 +304,18 @@ void SocketConnection::runCall(const ArrayView& frame) {
   operation.invoke(*object_, arguments, Reply(weak_from_this(), token));
 }
 
-bool SocketConnection::readArguments(const OperationDescription& operation, ArrayView::Iterator at,
-                                     std::size_t count, CallArguments& arguments,
-                                     std::string& problem) const {
+bool SocketConnection::readArguments(const OperationDescription& operation, const Frame& frame,
+                                     CallArguments& arguments, std::string& problem) const {
+  static_assert(kCallHead + CallArguments::kMaxArguments <= Frame::kMaxElements);
+  const std::size_t count = frame.size() - kCallHead;
   if (count != operation.arguments.size()) {
     problem = std::string(operation.name) + " takes " + std::to_string(operation.arguments.size()) +
               " arguments, not " + std::to_string(count);
     return false;
   }
   const char* wanted = nullptr;
-  for (std::size_t i = 0; i < count && wanted == nullptr; ++i, ++at) {
-    const Value value = *at;
+  for (std::size_t i = 0; i < count && wanted == nullptr; ++i) {
+    const Value value = frame[kCallHead + i];
     const ValueKind kind = value.kind();
     switch (operation.arguments[i]) {
       case ArgumentKind::Int64:
@@ -339,7 +338,7 @@ bool SocketConnection::readArguments(const OperationDescription& operation, Arra
       case ArgumentKind::Dictionary:
       case ArgumentKind::OptionalDictionary:
         if (kind == ValueKind::Dictionary) {
-          arguments.set(i, std::optional<Payload>(Payload::copyOf(value)));
+          arguments.set(i, std::optional<Payload>(frame.payload(kCallHead + i)));
         } else if (kind == ValueKind::Null &&
                    operation.arguments[i] == ArgumentKind::OptionalDictionary) {
           arguments.set(i, std::optional<Payload>());

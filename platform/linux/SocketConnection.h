@@ -158,10 +158,10 @@ class SocketConnection final : public ClientConnection,
   void keepRest(std::span<const uint8_t> rest);
   void pauseReading();
   void runFrame(std::span<const uint8_t> frame);
-  void runHello(const ArrayView& frame);
-  void runCall(const ArrayView& frame);
-  bool readArguments(const OperationDescription& operation, ArrayView::Iterator at,
-                     std::size_t count, CallArguments& arguments, std::string& problem) const;
+  void runHello(const Frame& frame);
+  void runCall(const Frame& frame);
+  bool readArguments(const OperationDescription& operation, const Frame& frame,
+                     CallArguments& arguments, std::string& problem) const;
   bool admitResource(const OperationDescription& operation, const CallArguments& arguments);
   uint64_t openSlot(uint64_t number, bool counted);
   Slot* slotFor(uint64_t token);

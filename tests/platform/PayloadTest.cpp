@@ -40,7 +40,7 @@ std::string refusal(const std::string& hex) {
 std::string frameRefusal(const std::string& hex) {
   DecodeError error;
   const Bytes bytes = fromHex(hex);
-  return FrameDecoder::decode(bytes, &error) ? "" : error.text;
+  return Frame::decode(bytes, &error) ? "" : error.text;
 }
 
 std::string repeated(int count, const std::string& text) {
@@ -380,14 +380,36 @@ TEST(PayloadBuilder, MergesAHundredThousandKeysTwice) {
   EXPECT_TRUE(Payload::decode(merged.encoded()).has_value());
 }
 
+TEST(Frame, ElementsAreWhereTheyWere) {
+  // [7, {"a b": 1}, {"n": {"c d": 1}}, [{"e f": 2}], {}, null, "x", {"g": 1}, 9, 10]
+  const Bytes bytes = fromHex(
+      "8a07a1636120620"
+      "1a1616ea16363206401"
+      "81a16365206602"
+      "a0"
+      "f6"
+      "6178"
+      "a1616701"
+      "09"
+      "0a");
+  const Frame frame = *Frame::decode(bytes);
+  EXPECT_EQ(frame.size(), 10u);
+  const char* texts[] = {"7", "{a b=1}", "{n={c d=1}}", "({e f=2})", "{}", "null", "x", "{g=1}"};
+  for (std::size_t i = 0; i < Frame::kMaxElements; ++i) EXPECT_EQ(frame[i].text(), texts[i]);
+  for (const std::size_t i : {1u, 2u, 4u, 7u}) {
+    EXPECT_EQ(frame.payload(i), Payload::copyOf(frame[i]));
+    EXPECT_EQ(frame.payload(i).hasSpaceInKeys(), i == 1);
+  }
+}
+
 TEST(PayloadBuilder, MakesAValidPayloadOfAnything) {
   Bytes frame = fromHex("82f601");
-  const ArrayView elements = *FrameDecoder::decode(frame);
+  const Value null = (*Frame::decode(frame))[0];
   const Payload p = PayloadBuilder()
                         .set("bad\xFFkey", "half\xE2\x82")
                         .set("bad\xFEkey", 1)  // the same key, once it is text
-                        .set("null", *elements.begin())
-                        .set("list", ArrayBuilder().add("\xC0").add(*elements.begin()))
+                        .set("null", null)
+                        .set("list", ArrayBuilder().add("\xC0").add(null))
                         .set("long", std::string(70000, 'x'))
                         .build();
   ASSERT_TRUE(Payload::decode(p.encoded()).has_value());
