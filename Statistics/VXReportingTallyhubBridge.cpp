@@ -1,23 +1,44 @@
 #include "Statistics/VXReportingTallyhubBridge.h"
 
+#include <array>
+#include <atomic>
+#include <string>
+
 #include "Statistics/Service/VXReportingSession.h"
 #include "platform/Platform.h"
 
 namespace vx {
 
-void VXReportingTallyhubBridge::handleEvent(const std::optional<Payload>& payload,
-                                            MessageCategory category, MessageType type,
-                                            const VXReportingSession* session) {
+namespace {
+
+// The event name of a kind, made when the kind is first met and kept for ever.
+std::string_view eventName(MessageKind kind) {
+  static std::array<std::atomic<const std::string*>, kMessageKinds> names{};
+  std::atomic<const std::string*>& name = names[kind];
+  if (const std::string* known = name.load(std::memory_order_acquire)) return *known;
+  const auto* made = new std::string("com.quorvel.sonik." + messageKindName(kind, '.'));
+  const std::string* before = nullptr;
+  if (name.compare_exchange_strong(before, made, std::memory_order_acq_rel)) return *made;
+  delete made;
+  return *before;
+}
+
+}  // namespace
+
+void VXReportingTallyhubBridge::handleEvent(const Payload* payload, MessageCategory category,
+                                            MessageType type, const VXReportingSession* session) {
   // Both dictionaries are immutable, so holding them is as good as copying them now: the event's
   // own dictionary is put together only if and when the service wants it.
   std::optional<Payload> userInfo;
   if (session != nullptr) userInfo = session->userInfo()->snapshot();
+  const Payload message = payload != nullptr ? *payload : Payload();
   platform().analytics.sendEventLazy(
-      "com.quorvel.sonik." + messageKindName(messageKind(category, type), '.'),
-      [payload = payload.value_or(Payload()), userInfo = std::move(userInfo)] {
-        return VXReportingHostApplicationDisplayID(userInfo).addedTo(payload,
+      eventName(messageKind(category, type)),
+      [message, userInfo = std::move(userInfo)] {
+        return VXReportingHostApplicationDisplayID(userInfo).addedTo(message,
                                                                      kHostApplicationDisplayIDKey);
-      });
+      },
+      message);
 }
 
 }  // namespace vx

@@ -14,9 +14,10 @@ class VXReportingSession;
 class VXReportingTallyhubBridge {
  public:
   // Publishes "com.quorvel.sonik.<category name>.<type name>" with the payload's entries and the
-  // session's "HostApplicationDisplayID", which wins over the client's. Filters nothing.
-  static void handleEvent(const std::optional<Payload>& payload, MessageCategory category,
-                          MessageType type, const VXReportingSession* session);
+  // session's "HostApplicationDisplayID", which wins over the client's. Filters nothing. A null
+  // payload stands for an absent one.
+  static void handleEvent(const Payload* payload, MessageCategory category, MessageType type,
+                          const VXReportingSession* session);
 };
 
 }  // namespace vx

@@ -43,6 +43,9 @@ constexpr std::size_t kNoPrefix = 0;
 constexpr std::size_t kNamelessPrefix = 1;
 constexpr std::size_t kFirstArea = 2;
 
+static_assert(kMessageKinds ==
+              (kFirstArea + kAreas.size()) * kKindNames.size() * kTypeNames.size());
+
 std::size_t prefixIndex(MessageCategory category) {
   if (category < 0x00010000 || category == kCategoryUndefined) return kNoPrefix;
   const uint32_t area = category & 0xFFFF0000;

@@ -16,9 +16,9 @@ constexpr std::string_view kTimestamp = "vxreporting_timestamp";
 
 }  // namespace
 
-void VXReportingWattmarkUtility::handleEvent(const std::optional<Payload>& payload, MessageCategory,
+void VXReportingWattmarkUtility::handleEvent(const Payload* payload, MessageCategory,
                                              MessageType type, const VXReportingSession* session) {
-  if (!payload || type != kRunningTimeType) return;
+  if (payload == nullptr || type != kRunningTimeType) return;
   if (const std::optional<Value> onTime = payload->find(kEngineOnTime)) {
     PayloadBuilder record;
     record.set("EngineOnDuration", *onTime);

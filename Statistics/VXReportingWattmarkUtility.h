@@ -12,9 +12,10 @@ class VXReportingSession;
 // No state; callable from any thread.
 class VXReportingWattmarkUtility {
  public:
-  // Handles messages of type 6, whatever their category; ignores all others without a word.
-  static void handleEvent(const std::optional<Payload>& payload, MessageCategory category,
-                          MessageType type, const VXReportingSession* session);
+  // Handles messages of type 6, whatever their category; ignores all others
+  // without a word, and so a null payload.
+  static void handleEvent(const Payload* payload, MessageCategory category, MessageType type,
+                          const VXReportingSession* session);
 };
 
 }  // namespace vx

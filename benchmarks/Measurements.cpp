@@ -67,7 +67,7 @@ class StoreReader {
   }
   void waitFor(int64_t relayRows, int64_t analyticsRows) {
     const auto end = SteadyClock::now() + std::chrono::seconds(120);
-    while (lastRow("relay_messages") < relayRows || lastRow("analytics_events") < analyticsRows) {
+    while (lastRow("relay_messages") < relayRows || lastRow("analytics_entries") < analyticsRows) {
       if (SteadyClock::now() > end)
         throw std::runtime_error("the store did not take every row in time");
       std::this_thread::sleep_for(std::chrono::milliseconds(2));

@@ -2,7 +2,6 @@
 #pragma once
 
 #include <cstdint>
-#include <string>
 #include <string_view>
 
 #include "platform/Function.h"
@@ -14,8 +13,11 @@ class AnalyticsEventService {
  public:
   virtual ~AnalyticsEventService() = default;
   // The builder is called only if the service wants the event, possibly later and on another
-  // thread.
-  virtual void sendEventLazy(std::string name, Function<Payload()> builder) = 0;
+  // thread. `name` stays where it is as long as the process lives. `message`: what the builder's
+  // dictionary will begin with, if that is a message that travels elsewhere too (empty otherwise);
+  // a hint for a service that would keep the common part once.
+  virtual void sendEventLazy(std::string_view name, Function<Payload()> builder,
+                             const Payload& message) = 0;
 };
 
 class PowerEventLog {

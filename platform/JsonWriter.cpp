@@ -139,6 +139,20 @@ class Emitter {
     }
   }
 
+  // Elements or entries [from, to) of a container, the first of which is at `at`.
+  const uint8_t* elements(const uint8_t* at, uint64_t from, uint64_t to, bool named) {
+    for (uint64_t i = from; i < to; ++i) {
+      if (i > 0) sink_.put(',');
+      newLine();
+      if (named) {
+        at = text(cbor::head(at));
+        sink_.put(layout_ == Layout::Pretty ? std::string_view(": ") : std::string_view(":"));
+      }
+      at = item(at);
+    }
+    return at;
+  }
+
  private:
   const uint8_t* text(const cbor::Head& head) {
     putString(sink_, {reinterpret_cast<const char*>(head.next), head.argument});
@@ -146,18 +160,9 @@ class Emitter {
   }
 
   const uint8_t* container(const cbor::Head& head, char opening, char closing) {
-    const uint8_t* at = head.next;
     sink_.put(opening);
     ++indent_;
-    for (uint64_t i = 0; i < head.argument; ++i) {
-      if (i > 0) sink_.put(',');
-      newLine();
-      if (head.major() == cbor::kMap) {
-        at = text(cbor::head(at));
-        sink_.put(layout_ == Layout::Pretty ? std::string_view(": ") : std::string_view(":"));
-      }
-      at = item(at);
-    }
+    const uint8_t* at = elements(head.next, 0, head.argument, head.major() == cbor::kMap);
     --indent_;
     if (head.argument > 0) newLine();
     sink_.put(closing);
@@ -266,6 +271,25 @@ void appendJson(std::string& out, const Payload& payload, NonFinite nonFinite) {
 
 void appendJson(std::string& out, const Value& value, NonFinite nonFinite) {
   appendCompact(out, value.encoded(), nonFinite);
+}
+
+bool appendJsonTail(std::string& out, const Payload& payload, const Payload& beginning,
+                    NonFinite nonFinite) {
+  const cbor::Head whole = cbor::head(payload.encoded().data());
+  const cbor::Head part = cbor::head(beginning.encoded().data());
+  const auto entries = [](const Payload& p, const cbor::Head& head) {
+    return p.encoded().subspan(static_cast<std::size_t>(head.next - p.encoded().data()));
+  };
+  const std::span<const uint8_t> wholeBytes = entries(payload, whole);
+  const std::span<const uint8_t> partBytes = entries(beginning, part);
+  if (wholeBytes.size() < partBytes.size() ||
+      !std::equal(partBytes.begin(), partBytes.end(), wholeBytes.begin()))
+    return false;
+  Sink sink(out, 2 * (wholeBytes.size() - partBytes.size()) + 64);
+  Emitter(sink, nonFinite, Emitter::Layout::Compact, 0)
+      .elements(wholeBytes.data() + partBytes.size(), part.argument, whole.argument, true);
+  sink.put('}');
+  return true;
 }
 
 void appendJsonString(std::string& out, std::string_view text) {

@@ -22,6 +22,11 @@ enum class NonFinite {
 // Compact: no white space.
 void appendJson(std::string& out, const Payload& payload, NonFinite nonFinite = NonFinite::AsText);
 void appendJson(std::string& out, const Value& value, NonFinite nonFinite = NonFinite::AsText);
+// For a payload that begins with all of `beginning`'s entries: what its text has behind theirs,
+// with the comma that separates them and the closing brace (`,"k":1}`). Otherwise false, and
+// nothing is appended.
+bool appendJsonTail(std::string& out, const Payload& payload, const Payload& beginning,
+                    NonFinite nonFinite = NonFinite::AsText);
 // Bytes that are not UTF-8 become U+FFFD.
 void appendJsonString(std::string& out, std::string_view text);
 // Pretty: two blanks a level, "key" : value separated as `"key": value`; the first line is not

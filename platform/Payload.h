@@ -10,6 +10,7 @@
 // Insertion order is the enumeration order; keys are unique strings.
 #pragma once
 
+#include <array>
 #include <atomic>
 #include <concepts>
 #include <cstddef>
@@ -81,7 +82,7 @@ class Value {
   friend class ArrayView;
   friend class DictionaryView;
   friend class Payload;
-  friend class FrameDecoder;
+  friend class Frame;
   Value(const uint8_t* begin, const uint8_t* end) : begin_(begin), end_(end) {}
   const uint8_t* begin_;
   const uint8_t* end_;
@@ -114,7 +115,6 @@ class ArrayView {
 
  private:
   friend class Value;
-  friend class FrameDecoder;
   const uint8_t* first_ = nullptr;
   std::size_t count_ = 0;
 };
@@ -205,6 +205,9 @@ class Payload {
   // The CBOR encoding. The empty dictionary encodes as one byte.
   std::span<const uint8_t> encoded() const;
   std::string text() const;  // as Value::text
+  // The same for all copies of one object, as long as one of them lives; null for the empty
+  // dictionary.
+  const void* identity() const { return block_; }
   // Same object, not merely equal content.
   bool isSameObject(const Payload& other) const { return block_ == other.block_; }
   // Equal encodings (so also equal order of entries).
@@ -212,6 +215,7 @@ class Payload {
 
  private:
   friend class PayloadBuilder;
+  friend class Frame;
   struct Block;
   explicit Payload(Block* adopted) : block_(adopted) {}
   void retain() const noexcept;
@@ -331,13 +335,29 @@ class ArrayBuilder {
   std::size_t count_ = 0;
 };
 
-// Decodes one frame of the socket protocol: exactly one definite-length CBOR array. Null may stand
-// as a direct element of the array (an absent argument), nowhere deeper. The views stay valid as
-// long as `bytes`.
-class FrameDecoder {
+// One frame of the socket protocol: exactly one definite-length CBOR array. Null may stand as a
+// direct element of the array (an absent argument), nowhere deeper. A view: valid as long as the
+// bytes it was decoded from.
+class Frame {
  public:
-  static std::optional<ArrayView> decode(std::span<const uint8_t> bytes,
-                                         DecodeError* error = nullptr);
+  static constexpr std::size_t kMaxElements = 8;  // that can be read; there may be more
+  struct Element {
+    const uint8_t* begin;
+    const uint8_t* end;
+    bool spaceInKeys;  // of a dictionary
+  };
+  Frame() {}  // empty; the elements are not initialised, they are set as they are decoded
+  static std::optional<Frame> decode(std::span<const uint8_t> bytes, DecodeError* error = nullptr);
+  std::size_t size() const { return size_; }
+  bool empty() const { return size_ == 0; }
+  // Both: i < size() and i < kMaxElements.
+  Value operator[](std::size_t i) const { return {elements_[i].begin, elements_[i].end}; }
+  // A copy of an element that is a dictionary; validation has noted what else is to be known of it.
+  Payload payload(std::size_t i) const;
+
+ private:
+  std::array<Element, kMaxElements> elements_;
+  std::size_t size_ = 0;
 };
 
 }  // namespace vx

@@ -33,9 +33,9 @@ std::string sessionsText(const VXReportingServerInstance::SessionMap& sessions) 
   return text + ")";
 }
 
-std::string sessionsText(const std::vector<std::shared_ptr<VXReportingSession>>& sessions) {
+std::string sessionsText(const std::vector<VXReportingSession*>& sessions) {
   std::string text = "(";
-  for (const auto& session : sessions)
+  for (const VXReportingSession* session : sessions)
     text += (text.size() > 1 ? ", " : "") + session->description();
   return text + ")";
 }
@@ -75,8 +75,8 @@ void VXReportingServerInstance::routeToListed(const Payload& message, MessageCat
     if (id == 0) continue;
     const auto session = findReportingSessionForID(id, Lookup::AcrossAllClients);
     if (session == nullptr) continue;
-    VXReportingTallyhubBridge::handleEvent(message, category, type, session.get());
-    VXReportingWattmarkUtility::handleEvent(message, category, type, session.get());
+    VXReportingTallyhubBridge::handleEvent(&message, category, type, session.get());
+    VXReportingWattmarkUtility::handleEvent(&message, category, type, session.get());
     session->sendMessage(message, category, type, nullptr);
   }
 }
@@ -85,26 +85,30 @@ void VXReportingServerInstance::routeToStarted(VXReportingServiceDelegateProtoco
                                                const Payload& message, MessageCategory category,
                                                MessageType type) {
   static constexpr const char* kFunction = "sendMessage";
-  std::vector<std::shared_ptr<VXReportingSession>> active;
+  // Nobody else changes the session maps while this work runs.
+  std::vector<VXReportingSession*>& active = activeSessions_;
+  active.clear();
   for (const auto& client : delegate.getAllClients()) {
     VX_LOG_AS(kFunction, serverLogScope(), Default, "sessions for client %i : %s",
               client->processIdentifier(),
               sessionsText(client->clientReportingSessionMap_).c_str());
     for (const auto& [id, session] : client->clientReportingSessionMap_) {
-      if (session->started()) active.push_back(session);
+      if (session->started()) active.push_back(session.get());
     }
   }
   VX_LOG_AS(kFunction, serverLogScope(), Default, "active reporting sessions %lu : %s",
             static_cast<unsigned long>(active.size()), sessionsText(active).c_str());
-  for (const auto& session : active) {
+  for (VXReportingSession* session : active) {
     session->sendMessage(message, category, type, nullptr);
-    VXReportingTallyhubBridge::handleEvent(message, category, type, session.get());
-    VXReportingWattmarkUtility::handleEvent(message, category, type, session.get());
+    VXReportingTallyhubBridge::handleEvent(&message, category, type, session);
+    VXReportingWattmarkUtility::handleEvent(&message, category, type, session);
   }
-  if (!active.empty()) return;
+  const bool delivered = !active.empty();
+  active.clear();
+  if (delivered) return;
   VX_LOG_AS(kFunction, serverLogScope(), Default,
             "no active reporting sessions found, sending as standalone");
-  VXReportingWattmarkUtility::handleEvent(message, category, type, nullptr);
+  VXReportingWattmarkUtility::handleEvent(&message, category, type, nullptr);
   VXReportingSession::sendSingleMessage(message, category, type, kServiceTypeStandalone,
                                         delegate.getDefaults(), nullptr);
 }
@@ -134,7 +138,7 @@ void VXReportingServerInstance::stopSession(ReporterID reporterID) {
             : std::nullopt;
     if (statistics) {
       session->sendMessage(*statistics, kCategoryChannelReporting, kMessageTypeGeneric, nullptr);
-      VXReportingTallyhubBridge::handleEvent(statistics, kCategoryChannelReporting,
+      VXReportingTallyhubBridge::handleEvent(&*statistics, kCategoryChannelReporting,
                                              kMessageTypeGeneric, session.get());
       VX_LOG_AS(kFunction, serverLogScope(), Default, "fetching driver logs %s",
                 statistics->text().c_str());

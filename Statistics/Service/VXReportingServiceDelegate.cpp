@@ -115,16 +115,18 @@ void VXReportingServiceDelegate::clientInvalidated(
     VX_LOG_AS(kFunction, serverLogScope(), Default, "clientProcessName is nil. clientpid=%d", pid);
     return;
   }
-  platform().analytics.sendEventLazy("com.quorvel.sonik.vxreportingclientuptime",
-                                     [name = *name, seconds] {
-                                       PayloadBuilder event;
-                                       event.set("processName", name);
-                                       if (seconds)
-                                         event.set("seconds", *seconds);
-                                       else
-                                         event.set("seconds", -1);
-                                       return event.build();
-                                     });
+  platform().analytics.sendEventLazy(
+      "com.quorvel.sonik.vxreportingclientuptime",
+      [name = *name, seconds] {
+        PayloadBuilder event;
+        event.set("processName", name);
+        if (seconds)
+          event.set("seconds", *seconds);
+        else
+          event.set("seconds", -1);
+        return event.build();
+      },
+      Payload());
 }
 
 void VXReportingServiceDelegate::removeClient(

@@ -109,6 +109,7 @@ class VXReportingServerInstance final
   const int32_t processIdentifier_;
   const std::weak_ptr<VXReportingServiceDelegateProtocol> delegate_;
   SessionMap clientReportingSessionMap_;
+  std::vector<VXReportingSession*> activeSessions_;  // those a message is being routed to
   mutable Mutex registrationMutex_;
   std::optional<Date> clientStartDate_ GUARDED_BY(registrationMutex_);
   std::optional<std::string> clientProcessName_ GUARDED_BY(registrationMutex_);

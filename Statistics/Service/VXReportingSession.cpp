@@ -181,9 +181,12 @@ void VXReportingSession::sendMessage(const Payload& message, MessageCategory cat
   nestedAggregatedPayloadData_.append(
       {normalised, identifier.count & ((uint64_t{1} << 48) - 1), identifier.kind});
   platform().trace.emit(kTraceMessage, 0, 0, 0, 0);
-  vyrReportingQueue_->async([self = shared_from_this(), normalised = std::move(normalised), message,
-                             category, type, startedNow = started_] {
-    self->relayMessage(normalised, message, category, type, startedNow);
+  // What the client sent goes along only where it is another object: a count less to keep.
+  std::optional<Payload> asSent;
+  if (!normalised.isSameObject(message)) asSent = message;
+  vyrReportingQueue_->async([self = shared_from_this(), normalised = std::move(normalised),
+                             asSent = std::move(asSent), category, type, startedNow = started_] {
+    self->relayMessage(normalised, asSent ? *asSent : normalised, category, type, startedNow);
   });
   if (reply) reply(std::nullopt);
 }

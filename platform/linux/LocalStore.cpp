@@ -158,11 +158,12 @@ class SqliteStore final : public LocalStore,
     return false;
   }
 
-  void sendEventLazy(std::string name, Function<Payload()> builder) override {
+  void sendEventLazy(std::string_view name, Function<Payload()> builder,
+                     const Payload& message) override {
     // The builder holds a message, most likely one that the relay holds too: counted by a typical
     // size.
     constexpr std::size_t kTypicalEventBytes = 128;
-    (void)writer_.append({writer_.now(), AnalyticsRecord{std::move(name), std::move(builder)}},
+    (void)writer_.append({writer_.now(), AnalyticsRecord{name, message, std::move(builder)}},
                          kTypicalEventBytes);
   }
 

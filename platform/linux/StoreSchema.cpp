@@ -6,6 +6,7 @@
 #include <cstdio>
 #include <cstring>
 #include <ctime>
+#include <initializer_list>
 
 namespace vx::lnx {
 
@@ -13,15 +14,13 @@ namespace {
 
 // Identifiers are given out in the order of arrival and never reused while the newest row is there,
 // so "oldest first" is the order of id.
-constexpr const char* kSchema = R"sql(
+constexpr const char* kTables = R"sql(
 CREATE TABLE relay_sessions(
   id INTEGER PRIMARY KEY, time REAL NOT NULL, session_id INTEGER NOT NULL, client_type INTEGER, client_version REAL,
   client_name TEXT, service_name TEXT, batch_event INTEGER, contains_realtime_events INTEGER, user_info TEXT NOT NULL);
 CREATE TABLE relay_messages(
   id INTEGER PRIMARY KEY, time REAL NOT NULL, relay_session INTEGER NOT NULL, category INTEGER NOT NULL,
   type INTEGER NOT NULL, payload TEXT NOT NULL);
-CREATE TABLE analytics_events(
-  id INTEGER PRIMARY KEY, time REAL NOT NULL, name TEXT NOT NULL, payload TEXT NOT NULL);
 CREATE TABLE power_records(
   id INTEGER PRIMARY KEY, time REAL NOT NULL, client_identifier INTEGER NOT NULL, name TEXT NOT NULL,
   record TEXT NOT NULL);
@@ -31,12 +30,48 @@ CREATE VIEW session_messages AS
   SELECT m.id, datetime(m.time, 'unixepoch', 'localtime') AS at, s.session_id, s.service_name,
          json_extract(s.user_info, '$.HostApplicationDisplayID') AS application, m.category, m.type, m.payload
   FROM relay_messages m JOIN relay_sessions s ON s.id = m.relay_session;
+)sql";
+
+// An event says what a relay message says and a little more. Its entry names that message and keeps
+// what its text has behind the message's (`,"k":1}`); without a message, it keeps the whole text.
+constexpr const char* kEvents = R"sql(
+CREATE TABLE event_names(id INTEGER PRIMARY KEY, name TEXT NOT NULL UNIQUE);
+CREATE TABLE analytics_entries(
+  id INTEGER PRIMARY KEY, time REAL NOT NULL, name INTEGER NOT NULL, message INTEGER, payload TEXT NOT NULL);
+CREATE VIEW analytics_events AS
+  SELECT e.id, e.time, (SELECT n.name FROM event_names n WHERE n.id = e.name) AS name,
+         CASE WHEN e.message IS NULL THEN e.payload
+              ELSE (SELECT substr(m.payload, 1, length(m.payload) - 1) FROM relay_messages m WHERE m.id = e.message)
+                   || e.payload END AS payload
+  FROM analytics_entries e;
 CREATE VIEW client_uptimes AS
   SELECT id, datetime(time, 'unixepoch', 'localtime') AS at, json_extract(payload, '$.processName') AS process,
          json_extract(payload, '$.seconds') AS seconds
   FROM analytics_events WHERE name = 'com.quorvel.sonik.vxreportingclientuptime';
-PRAGMA user_version = 1;
+PRAGMA user_version = 2;
 )sql";
+
+// Version 1 kept every event's name and text in a table of their own.
+constexpr const char* kEventsBefore = R"sql(
+DROP VIEW client_uptimes;
+ALTER TABLE analytics_events RENAME TO events_before;
+)sql";
+constexpr const char* kMoveEvents = R"sql(
+INSERT INTO event_names(name) SELECT DISTINCT name FROM events_before;
+INSERT INTO analytics_entries(id, time, name, payload)
+  SELECT b.id, b.time, n.id, b.payload FROM events_before b JOIN event_names n ON n.name = b.name ORDER BY b.id;
+DROP TABLE events_before;
+)sql";
+
+int executeInOrder(sqlite3* database, std::initializer_list<const char*> statements) {
+  int code = execute(database, "BEGIN IMMEDIATE");
+  for (const char* sql : statements) {
+    if (code == SQLITE_OK) code = execute(database, sql);
+  }
+  if (code == SQLITE_OK) return execute(database, "COMMIT");
+  execute(database, "ROLLBACK");
+  return code;
+}
 
 std::string sqliteProblem(const std::string& path, int code, const char* message) {
   return "cannot use " + path + ": " + (message != nullptr ? message : sqlite3_errstr(code));
@@ -136,12 +171,9 @@ OpenOutcome openStoreDatabase(const std::string& path, Database& database, std::
               std::to_string(version) + "); move it away or install that version";
     return OpenOutcome::Unusable;
   }
-  if (version == 0) {
-    code = execute(opened, "BEGIN IMMEDIATE");
-    if (code == SQLITE_OK) code = execute(opened, kSchema);
-    if (code == SQLITE_OK) code = execute(opened, "COMMIT");
-    if (code != SQLITE_OK) return fail(code);
-  }
+  if (version == 0) code = executeInOrder(opened, {kTables, kEvents});
+  if (version == 1) code = executeInOrder(opened, {kEventsBefore, kEvents, kMoveEvents});
+  if (code != SQLITE_OK) return fail(code);
   return OpenOutcome::Ready;
 }
 

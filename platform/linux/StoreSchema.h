@@ -11,7 +11,7 @@
 
 namespace vx::lnx {
 
-inline constexpr int kStoreSchemaVersion = 1;
+inline constexpr int kStoreSchemaVersion = 2;
 
 struct DatabaseCloser {
   void operator()(sqlite3* database) const { sqlite3_close_v2(database); }

@@ -7,6 +7,8 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <array>
+#include <bit>
 #include <exception>
 
 #include "platform/JsonWriter.h"
@@ -25,8 +27,17 @@ constexpr int kRemovalsPerCheck = 64;
 constexpr std::size_t kKeptRecords = 4096;  // capacity that an idle queue keeps
 constexpr int kWriterNiceness = 15;
 
-bool countsAsRow(const StoreRecord& record) {
-  return !std::holds_alternative<FlushRecord>(record.what);
+constexpr double kHoldSeconds = 0.05;  // how far the relay may be behind analytics
+constexpr std::size_t kKnownNames = 4096;
+
+bool isUnwrittenRow(const StoreRecord& record) {
+  return !std::holds_alternative<FlushRecord>(record.what) &&
+         record.sharing != StoreRecord::Sharing::Written;
+}
+
+std::size_t slotOf(const void* identity, std::size_t slots) {
+  const auto bits = static_cast<uint64_t>(reinterpret_cast<uintptr_t>(identity));
+  return static_cast<std::size_t>((bits >> 4) * 0x9E3779B97F4A7C15u >> 32) & (slots - 1);
 }
 
 template <class T>
@@ -127,16 +138,18 @@ bool StoreWriter::waitForBatch() {
   MutexLock lock(mutex_);
   for (;;) {
     if (!jobs_.empty()) return true;
-    if (pending_.empty()) {
+    if (pending_.empty() && heldEvents_.empty()) {
       if (closing_) return false;
-      if (pending_.capacity() > kKeptRecords) std::vector<StoreRecord>().swap(pending_);
-      if (batch_.capacity() > kKeptRecords) std::vector<StoreRecord>().swap(batch_);
+      if (messageSlots_.capacity() > kKeptRecords) std::vector<uint32_t>().swap(messageSlots_);
+      pending_.shrink(kKeptRecords);
+      batch_.shrink(kKeptRecords);
       sleep_ = Sleep::UntilWork;
       wake_.wait(mutex_);
       sleep_ = Sleep::Awake;
       continue;
     }
-    const Monotonic due = firstPending_ + options_.commitInterval;
+    const Monotonic due =
+        (heldEvents_.empty() ? firstPending_ : heldSince_) + options_.commitInterval;
     if (closing_ || urgent_ || pending_.size() >= kRowsPerCommit ||
         pendingBytes_ >= kBytesPerCommit || clock_.monotonic() >= due) {
       break;
@@ -146,12 +159,10 @@ bool StoreWriter::waitForBatch() {
     sleep_ = Sleep::Awake;
   }
   batch_.clear();
-  if (batch_.capacity() > kKeptRecords && pending_.size() < kRowsPerCommit) {
-    std::vector<StoreRecord>().swap(batch_);
-  }
   batch_.swap(pending_);
   batchBytes_ = pendingBytes_;
   pendingBytes_ = 0;
+  mayHold_ = !urgent_ && !closing_;
   urgent_ = false;
   return true;
 }
@@ -177,6 +188,10 @@ void StoreWriter::threadMain() {
   applyRetention();
   while (waitForBatch()) {
     runJobs();
+    for (StoreRecord& event : heldEvents_) batch_.push_back(std::move(event));
+    heldEvents_.clear();
+    pairEventsWithMessages();
+    if (mayHold_) holdUnpairedEvents();
     writeBatch();
   }
   statements_ = {};
@@ -213,8 +228,11 @@ void StoreWriter::prepareStatements() {
   statements_.relayMessage = Statement(
       database,
       "INSERT INTO relay_messages(time, relay_session, category, type, payload) VALUES(?,?,?,?,?)");
-  statements_.analytics =
-      Statement(database, "INSERT INTO analytics_events(time, name, payload) VALUES(?,?,?)");
+  statements_.analytics = Statement(
+      database, "INSERT INTO analytics_entries(time, name, message, payload) VALUES(?,?,?,?)");
+  statements_.addName = Statement(database, "INSERT OR IGNORE INTO event_names(name) VALUES(?)");
+  statements_.findName = Statement(database, "SELECT id FROM event_names WHERE name = ?");
+  nameRows_.clear();
   statements_.power = Statement(
       database, "INSERT INTO power_records(time, client_identifier, name, record) VALUES(?,?,?,?)");
   statements_.ledger = Statement(
@@ -234,8 +252,8 @@ void StoreWriter::writeBatch() {
       continue;
     }
     if (!waitBeforeRetry(code)) {
-      const auto lost = static_cast<uint64_t>(std::count_if(
-          batch_.begin() + static_cast<std::ptrdiff_t>(first), batch_.end(), countsAsRow));
+      uint64_t lost = 0;
+      for (std::size_t i = first; i < batch_.size(); ++i) lost += isUnwrittenRow(batch_[i]) ? 1 : 0;
       rowsLost_ += lost;
       VX_LOG(nullptr, Error,
              "the store could not be written before the end: %llu rows are lost (%s)",
@@ -247,41 +265,142 @@ void StoreWriter::writeBatch() {
   if (++commitsSinceRetention_ >= kCommitsPerRetentionCheck) applyRetention();
 }
 
+void StoreWriter::pairEventsWithMessages() {
+  std::size_t messages = 0;
+  for (std::size_t i = 0; i < batch_.size(); ++i)
+    messages += std::holds_alternative<RelayMessageRecord>(batch_[i].what) ? 1 : 0;
+  if (messages == 0 || messages == batch_.size()) return;
+  const std::size_t slots = std::bit_ceil(2 * messages);
+  messageSlots_.assign(slots, StoreRecord::kNone);
+  auto find = [&](const void* identity) -> uint32_t& {
+    std::size_t at = slotOf(identity, slots);
+    while (messageSlots_[at] != StoreRecord::kNone &&
+           std::get<RelayMessageRecord>(batch_[messageSlots_[at]].what).payload.identity() !=
+               identity)
+      at = (at + 1) & (slots - 1);
+    return messageSlots_[at];
+  };
+  for (std::size_t i = 0; i < batch_.size(); ++i) {
+    const auto* message = std::get_if<RelayMessageRecord>(&batch_[i].what);
+    if (message == nullptr || message->payload.identity() == nullptr) continue;
+    uint32_t& slot = find(message->payload.identity());
+    if (slot == StoreRecord::kNone) slot = static_cast<uint32_t>(i);
+  }
+  // Backwards, so that the events behind one message keep their order.
+  for (std::size_t i = batch_.size(); i-- > 0;) {
+    const auto* event = std::get_if<AnalyticsRecord>(&batch_[i].what);
+    if (event == nullptr || event->message.identity() == nullptr) continue;
+    const uint32_t slot = find(event->message.identity());
+    if (slot == StoreRecord::kNone) continue;
+    batch_[i].sharing = StoreRecord::Sharing::Shares;
+    batch_[i].nextSharer = std::exchange(batch_[slot].nextSharer, static_cast<uint32_t>(i));
+  }
+}
+
+void StoreWriter::holdUnpairedEvents() {
+  const double young = now() - kHoldSeconds;
+  for (std::size_t i = 0; i < batch_.size(); ++i) {
+    StoreRecord& record = batch_[i];
+    const auto* event = std::get_if<AnalyticsRecord>(&record.what);
+    if (event == nullptr || event->message.identity() == nullptr ||
+        record.sharing != StoreRecord::Sharing::No || record.time < young)
+      continue;
+    record.sharing = StoreRecord::Sharing::Held;  // once
+    heldEvents_.push_back(std::move(record));
+    record.what = FlushRecord{};  // nothing, for nobody
+  }
+  if (!heldEvents_.empty()) heldSince_ = clock_.monotonic();
+}
+
 int StoreWriter::writeTransaction(std::size_t first, std::size_t last) {
   if (database_ == nullptr) return SQLITE_CANTOPEN;
+  rowsInTransaction_ = 0;
   int code = execute(database_.get(), "BEGIN IMMEDIATE");
   for (std::size_t i = first; code == SQLITE_OK && i < last; ++i) code = writeRecord(batch_[i]);
   for (std::size_t i = 0; code == SQLITE_OK && i < notes_.size(); ++i)
     code = writeLedger(notes_[i]);
   if (code == SQLITE_OK) code = execute(database_.get(), "COMMIT");
-  if (code != SQLITE_OK && sqlite3_get_autocommit(database_.get()) == 0)
-    execute(database_.get(), "ROLLBACK");
+  if (code != SQLITE_OK) {
+    nameRows_.clear();  // the names that were added are not there
+    if (sqlite3_get_autocommit(database_.get()) == 0) execute(database_.get(), "ROLLBACK");
+  }
   return code;
+}
+
+int StoreWriter::writeRelayMessage(const StoreRecord& record, const RelayMessageRecord& message) {
+  json_.clear();
+  appendJson(json_, message.payload);
+  int code = statements_.relayMessage.bind(record.time)
+                 .bind(message.row->id)
+                 .bind(int64_t{message.category})
+                 .bind(int64_t{message.type})
+                 .bind(json_)
+                 .run();
+  if (record.nextSharer == StoreRecord::kNone) return code;
+  const int64_t row = sqlite3_last_insert_rowid(database_.get());
+  for (uint32_t i = record.nextSharer; code == SQLITE_OK && i != StoreRecord::kNone;
+       i = batch_[i].nextSharer) {
+    code = writeEvent(batch_[i].time, std::get<AnalyticsRecord>(batch_[i].what), row,
+                      &message.payload);
+    ++rowsInTransaction_;
+  }
+  return code;
+}
+
+int StoreWriter::writeEvent(double time, const AnalyticsRecord& event, int64_t messageRow,
+                            const Payload* message) {
+  json_.clear();
+  bool shares = false;
+  try {
+    const Payload built = event.builder();
+    shares = message != nullptr && appendJsonTail(json_, built, *message);
+    if (!shares) appendJson(json_, built);
+  } catch (const std::exception& failure) {
+    VX_LOG(nullptr, Error, "the builder of event %s failed: %s", std::string(event.name).c_str(),
+           failure.what());
+    ++writeFailures_;
+    return SQLITE_OK;
+  }
+  int64_t name = 0;
+  if (const int code = nameRow(event.name, name); code != SQLITE_OK) return code;
+  statements_.analytics.bind(time).bind(name);
+  if (shares)
+    statements_.analytics.bind(messageRow);
+  else
+    statements_.analytics.bindNull();
+  return statements_.analytics.bind(json_).run();
+}
+
+int StoreWriter::nameRow(std::string_view name, int64_t& row) {
+  if (const auto known = nameRows_.find(name); known != nameRows_.end()) {
+    row = known->second;
+    return SQLITE_OK;
+  }
+  if (const int code = statements_.addName.bind(name).run(); code != SQLITE_OK) return code;
+  Statement& find = statements_.findName.bind(name);
+  const bool found = find.row();
+  row = found ? find.integer(0) : 0;
+  find.reset();
+  if (!found) return SQLITE_INTERNAL;
+  if (nameRows_.size() >= kKnownNames) nameRows_.clear();
+  nameRows_.emplace(name, row);
+  return SQLITE_OK;
 }
 
 int StoreWriter::writeRecord(const StoreRecord& record) {
   if (const auto* message = std::get_if<RelayMessageRecord>(&record.what)) {
-    json_.clear();
-    appendJson(json_, message->payload);
-    return statements_.relayMessage.bind(record.time)
-        .bind(message->row->id)
-        .bind(int64_t{message->category})
-        .bind(int64_t{message->type})
-        .bind(json_)
-        .run();
+    ++rowsInTransaction_;
+    return writeRelayMessage(record, *message);
   }
   if (const auto* event = std::get_if<AnalyticsRecord>(&record.what)) {
-    json_.clear();
-    try {
-      appendJson(json_, event->builder());
-    } catch (const std::exception& failure) {
-      VX_LOG(nullptr, Error, "the builder of event %s failed: %s", event->name.c_str(),
-             failure.what());
-      ++writeFailures_;
-      return SQLITE_OK;
-    }
-    return statements_.analytics.bind(record.time).bind(event->name).bind(json_).run();
+    if (record.sharing == StoreRecord::Sharing::Shares ||
+        record.sharing == StoreRecord::Sharing::Written)
+      return SQLITE_OK;  // has its place behind a message
+    ++rowsInTransaction_;
+    return writeEvent(record.time, *event, 0, nullptr);
   }
+  if (std::holds_alternative<FlushRecord>(record.what)) return SQLITE_OK;  // answered afterwards
+  ++rowsInTransaction_;
   if (const auto* session = std::get_if<RelayOpenRecord>(&record.what))
     return writeRelaySession(record.time, *session);
   if (const auto* power = std::get_if<PowerRecord>(&record.what)) {
@@ -293,7 +412,7 @@ int StoreWriter::writeRecord(const StoreRecord& record) {
         .bind(json_)
         .run();
   }
-  return SQLITE_OK;  // a flush is answered after the commit
+  return SQLITE_INTERNAL;  // there is no other kind
 }
 
 int StoreWriter::writeRelaySession(double time, const RelayOpenRecord& record) {
@@ -349,16 +468,16 @@ void StoreWriter::committed(std::size_t first, std::size_t last) {
   notes_.clear();
   ++commits_;
   std::vector<Function<void(std::optional<Error>)>> completions;
-  uint64_t rows = 0;
   for (std::size_t i = first; i < last; ++i) {
     if (auto* flush = std::get_if<FlushRecord>(&batch_[i].what))
       completions.push_back(std::move(flush->completion));
-    else
-      ++rows;
-    if (auto* message = std::get_if<RelayMessageRecord>(&batch_[i].what))
-      message->payload = Payload();
+    auto* message = std::get_if<RelayMessageRecord>(&batch_[i].what);
+    if (message == nullptr) continue;
+    message->payload = Payload();
+    for (uint32_t k = batch_[i].nextSharer; k != StoreRecord::kNone; k = batch_[k].nextSharer)
+      batch_[k].sharing = StoreRecord::Sharing::Written;
   }
-  rowsCommitted_ += rows;
+  rowsCommitted_ += rowsInTransaction_;
   bool drained = false;
   {
     MutexLock lock(mutex_);
@@ -417,24 +536,58 @@ bool StoreWriter::waitBeforeRetry(int code) {
 // ---------------------------------------------------------------------------------------------------------------------
 // Retention
 
-// Removes up to kRowsPerRemoval of the oldest rows, those before a time if one is given; how many.
-int64_t StoreWriter::removeOldest(const char* table, std::optional<double> before) {
-  const std::string name = table;
-  Statement remove(database_.get(), "DELETE FROM " + name + " WHERE id IN (SELECT id FROM " + name +
-                                        " ORDER BY id LIMIT ?) AND time < ?");
-  remove.bind(kRowsPerRemoval).bind(before.value_or(1e18));
-  if (remove.run() != SQLITE_OK) return 0;
+// The identifier of the last of the kRowsPerRemoval oldest rows, or of the last there is.
+int64_t StoreWriter::lastOfOldest(const std::string& table) {
+  Statement query(database_.get(), "SELECT max(id) FROM (SELECT id FROM " + table +
+                                       " ORDER BY id LIMIT " + std::to_string(kRowsPerRemoval) +
+                                       ")");
+  return query.row() ? query.integer(0) : 0;
+}
+
+// Removes rows up to an identifier, those before a time if one is given; how many.
+int64_t StoreWriter::removeUpTo(const std::string& table, int64_t last,
+                                std::optional<double> before) {
+  Statement remove(database_.get(), "DELETE FROM " + table + " WHERE id <= ? AND time < ?");
+  if (remove.bind(last).bind(before.value_or(1e18)).run() != SQLITE_OK) return 0;
   return sqlite3_changes64(database_.get());
+}
+
+// Removes messages, and with them the events that share their text. These lie at the beginning of
+// their table: both tables name messages in the same order.
+StoreWriter::Removed StoreWriter::removeMessagesUpTo(int64_t last, std::optional<double> before) {
+  Removed removed;
+  if (execute(database_.get(), "BEGIN IMMEDIATE") != SQLITE_OK) return removed;
+  removed.rows = removeUpTo("relay_messages", last, before);
+  Statement events(database_.get(),
+                   "DELETE FROM analytics_entries AS e WHERE e.message <= ?1"
+                   " AND e.id < ifnull((SELECT id FROM analytics_entries WHERE message > ?1"
+                   " ORDER BY id LIMIT 1), 9e18)"
+                   " AND NOT EXISTS (SELECT 1 FROM relay_messages m WHERE m.id = e.message)");
+  int code = events.bind(last).run();
+  if (code == SQLITE_OK) removed.sharers = sqlite3_changes64(database_.get());
+  if (code == SQLITE_OK) code = execute(database_.get(), "COMMIT");
+  if (code == SQLITE_OK) return removed;
+  execute(database_.get(), "ROLLBACK");
+  return {};
 }
 
 void StoreWriter::applyRetention() {
   commitsSinceRetention_ = 0;
   if (database_ == nullptr) return;
-  static constexpr const char* kTables[] = {"relay_messages", "analytics_events", "power_records",
-                                            "relay_sessions"};
-  auto oldest = [this](const char* table) -> std::optional<double> {
-    Statement query(database_.get(),
-                    std::string("SELECT time FROM ") + table + " ORDER BY id LIMIT 1");
+  struct Table {
+    const char* name;
+    const char* shownAs;
+  };
+  static constexpr Table kTables[] = {{"relay_messages", "relay_messages"},
+                                      {"analytics_entries", "analytics_events"},
+                                      {"power_records", "power_records"},
+                                      {"relay_sessions", "relay_sessions"}};
+  constexpr std::size_t kMessages = 0;
+  constexpr std::size_t kEvents = 1;
+  constexpr std::size_t kSessions = 3;
+  auto oldest = [this](std::size_t table) -> std::optional<double> {
+    Statement query(database_.get(), std::string("SELECT time FROM ") + kTables[table].name +
+                                         " ORDER BY id LIMIT 1");
     if (!query.row()) return std::nullopt;
     return query.real(0);
   };
@@ -446,56 +599,58 @@ void StoreWriter::applyRetention() {
     return static_cast<uint64_t>((pragma("PRAGMA page_count") - pragma("PRAGMA freelist_count")) *
                                  pragma("PRAGMA page_size"));
   };
+  using Counts = std::array<int64_t, std::size(kTables)>;
+  auto removeFrom = [this](std::size_t table, std::optional<double> before, Counts& removed) {
+    const int64_t last = lastOfOldest(kTables[table].name);
+    const Removed now = table == kMessages
+                            ? removeMessagesUpTo(last, before)
+                            : Removed{removeUpTo(kTables[table].name, last, before), 0};
+    removed[table] += now.rows;
+    removed[kEvents] += now.sharers;
+    return now.rows > 0;
+  };
+  auto tell = [this](const char* event, const Counts& removed, const std::string& why) {
+    for (std::size_t i = 0; i < removed.size(); ++i) {
+      if (removed[i] > 0) note({event, kTables[i].shownAs, removed[i], why});
+    }
+  };
 
   int removals = kRemovalsPerCheck;
   if (options_.maxAgeDays != 0 &&
       (lastAgeCheck_ == Monotonic{} || clock_.monotonic() - lastAgeCheck_ >= kAgeCheckInterval)) {
     lastAgeCheck_ = clock_.monotonic();
     const double before = now() - options_.maxAgeDays * 86400.0;
-    for (const char* table : kTables) {
-      int64_t removed = 0;
+    Counts removed{};
+    for (std::size_t table = 0; table < std::size(kTables); ++table) {
       while (removals > 0 && oldest(table).value_or(before) < before) {
-        const int64_t rows = removeOldest(table, before);
-        if (rows == 0) break;
-        removed += rows;
+        if (!removeFrom(table, before, removed)) break;
         --removals;
       }
-      if (removed > 0) {
-        note({"removed_for_age", table, removed,
-              "older than " + std::to_string(options_.maxAgeDays) + " days"});
-      }
     }
+    tell("removed_for_age", removed, "older than " + std::to_string(options_.maxAgeDays) + " days");
   }
 
-  int64_t removed[std::size(kTables)] = {};
+  Counts removed{};
   while (removals-- > 0 && usedBytes() > options_.maxBytes) {
     std::size_t oldestTable = 0;
     std::optional<double> oldestTime;
-    for (std::size_t i = 0; i < 3; ++i) {  // sessions go with their messages
-      const std::optional<double> time = oldest(kTables[i]);
+    for (std::size_t i = 0; i < kSessions; ++i) {  // sessions go with their messages
+      const std::optional<double> time = oldest(i);
       if (time && (!oldestTime || *time < *oldestTime)) {
         oldestTime = time;
         oldestTable = i;
       }
     }
-    if (!oldestTime) break;
-    const int64_t rows = removeOldest(kTables[oldestTable], std::nullopt);
-    if (rows == 0) break;
-    removed[oldestTable] += rows;
+    if (!oldestTime || !removeFrom(oldestTable, std::nullopt, removed)) break;
   }
-  if (removed[0] >
-      0) {  // sessions whose every message is gone, and that came before the oldest message left
+  if (removed[kMessages] > 0) {
+    // Sessions whose every message is gone, and that came before the oldest message left.
     Statement orphans(
         database_.get(),
         "DELETE FROM relay_sessions WHERE id < (SELECT min(relay_session) FROM relay_messages)");
-    if (orphans.run() == SQLITE_OK) removed[3] = sqlite3_changes64(database_.get());
+    if (orphans.run() == SQLITE_OK) removed[kSessions] = sqlite3_changes64(database_.get());
   }
-  for (std::size_t i = 0; i < std::size(kTables); ++i) {
-    if (removed[i] > 0) {
-      note({"removed_for_size", kTables[i], removed[i],
-            "above " + std::to_string(options_.maxBytes) + " bytes"});
-    }
-  }
+  tell("removed_for_size", removed, "above " + std::to_string(options_.maxBytes) + " bytes");
 }
 
 }  // namespace vx::lnx

@@ -6,7 +6,9 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <string_view>
 #include <thread>
+#include <unordered_map>
 #include <utility>
 #include <variant>
 #include <vector>
@@ -16,6 +18,7 @@
 #include "platform/Mutex.h"
 #include "platform/Payload.h"
 #include "platform/VyrReporting.h"
+#include "platform/linux/ChunkList.h"
 #include "platform/linux/LocalStore.h"
 #include "platform/linux/StoreSchema.h"
 
@@ -37,7 +40,8 @@ struct RelayMessageRecord {
   uint16_t type = 0;
 };
 struct AnalyticsRecord {
-  std::string name;
+  std::string_view name;  // of unlimited life
+  Payload message;        // what the built dictionary is expected to begin with; may be empty
   Function<Payload()> builder;
 };
 struct PowerRecord {
@@ -52,11 +56,21 @@ struct FlushRecord {
 struct StoreRecord {
   double time = 0;  // seconds since 1970
   std::variant<RelayOpenRecord, RelayMessageRecord, AnalyticsRecord, PowerRecord, FlushRecord> what;
+
+  // An event whose message is in the same batch as a relay message is written right behind that
+  // one, and shares its text. A relay message names the first such event, each event the next one.
+  static constexpr uint32_t kNone = UINT32_MAX;
+  uint32_t nextSharer = kNone;
+  enum class Sharing : uint8_t { No, Held, Shares, Written } sharing = Sharing::No;
 };
 
 // Owned by the local store. append() and the questions are thread-safe; everything else belongs to
 // the writer's thread. What is not yet committed is bounded by queueBytes, by way of the listener:
 // see LocalStore.
+//
+// A message goes to the relay and, with one entry more, to analytics: the text they have in common
+// is written once, with the relay's row (see the view analytics_events). That is nearly half of
+// what would reach the flash otherwise.
 class StoreWriter {
  public:
   StoreWriter(std::string path, Database database, const PlatformConfiguration::Store& options,
@@ -87,6 +101,8 @@ class StoreWriter {
     Statement relaySession;
     Statement relayMessage;
     Statement analytics;
+    Statement addName;
+    Statement findName;
     Statement power;
     Statement ledger;
   };
@@ -97,6 +113,8 @@ class StoreWriter {
     std::string detail;
   };
 
+  using Records = ChunkList<StoreRecord, 256>;
+
   static constexpr std::size_t kRowsPerCommit = 1000;
   static constexpr std::size_t kBytesPerCommit = 1 << 20;
 
@@ -106,17 +124,33 @@ class StoreWriter {
   bool waitForBatch();  // false: closed and empty
   void runJobs();
   void writeBatch();
+  // Finds the relay message of each event of the batch.
+  void pairEventsWithMessages();
+  // Young events without one: it is likely to come with the next batch.
+  void holdUnpairedEvents();
   // Writes records [first, last) in one transaction. SQLITE_OK or the error after which everything
   // was rolled back.
   int writeTransaction(std::size_t first, std::size_t last);
   int writeRecord(const StoreRecord& record);
+  int writeRelayMessage(const StoreRecord& record, const RelayMessageRecord& message);
+  // Behind `message` in row `messageRow`, whose text it shares; or by itself, when there is none.
+  int writeEvent(double time, const AnalyticsRecord& event, int64_t messageRow,
+                 const Payload* message);
+  // The identifier of an event name. SQLITE_OK or an error.
+  int nameRow(std::string_view name, int64_t& row);
   int writeRelaySession(double time, const RelayOpenRecord& record);
   int writeLedger(const LedgerNote& note);
   // False: the store is closing and time is up.
   bool waitBeforeRetry(int code);
   void committed(std::size_t first, std::size_t last);
   void applyRetention();
-  int64_t removeOldest(const char* table, std::optional<double> before);
+  struct Removed {
+    int64_t rows = 0;
+    int64_t sharers = 0;  // events that went with their messages
+  };
+  int64_t lastOfOldest(const std::string& table);
+  int64_t removeUpTo(const std::string& table, int64_t last, std::optional<double> before);
+  Removed removeMessagesUpTo(int64_t last, std::optional<double> before);
   void note(LedgerNote note) { notes_.push_back(std::move(note)); }
 
   const std::string path_;
@@ -132,7 +166,7 @@ class StoreWriter {
   Mutex mutex_;
   CondVar wake_;
   CondVar ended_;
-  std::vector<StoreRecord> pending_ GUARDED_BY(mutex_);
+  Records pending_ GUARDED_BY(mutex_);
   std::size_t pendingBytes_ GUARDED_BY(mutex_) = 0;
   std::size_t heldBytes_ GUARDED_BY(mutex_) = 0;  // all that is not committed, pending_ included
   Monotonic firstPending_ GUARDED_BY(mutex_);
@@ -147,11 +181,16 @@ class StoreWriter {
   // The writer's thread.
   Database database_;
   Statements statements_;
-  std::vector<StoreRecord> batch_;
+  Records batch_;
   std::size_t batchBytes_ = 0;
+  std::vector<StoreRecord> heldEvents_;  // join the next batch
+  Monotonic heldSince_{};
+  bool mayHold_ = false;                // nobody waits for the end of this batch
+  std::vector<uint32_t> messageSlots_;  // open addressing: index in batch_ by a payload's identity
+  std::unordered_map<std::string_view, int64_t> nameRows_;  // as many as there are event names
+  uint64_t rowsInTransaction_ = 0;
   std::vector<LedgerNote> notes_;
   std::string json_;
-  std::string moreJson_;
   bool failing_ = false;
   std::chrono::milliseconds backoff_{0};
   std::size_t commitsSinceRetention_ = 0;

@@ -291,9 +291,10 @@ bool FakeVyrReporting::sendOneMessageWithSessionInfo(const VyrSessionInfo& sessi
   return true;
 }
 
-void FakeServices::sendEventLazy(std::string name, Function<Payload()> builder) {
-  journal_.push_back("event " + name);
-  events.push_back({std::move(name), std::make_shared<Function<Payload()>>(std::move(builder))});
+void FakeServices::sendEventLazy(std::string_view name, Function<Payload()> builder,
+                                 const Payload&) {
+  journal_.push_back("event " + std::string(name));
+  events.push_back({std::string(name), std::make_shared<Function<Payload()>>(std::move(builder))});
 }
 
 void FakeServices::logRegisteredEvent(int64_t client, std::string_view name, const Payload& record,

@@ -218,7 +218,8 @@ class FakeServices final : public AnalyticsEventService,
     bool nameless = false;  // its channels have no names
   };
 
-  void sendEventLazy(std::string name, Function<Payload()> builder) override;
+  void sendEventLazy(std::string_view name, Function<Payload()> builder,
+                     const Payload& message) override;
   void logRegisteredEvent(int64_t client, std::string_view name, const Payload& record,
                           const Payload*) override;
   void emit(uint32_t code, uint64_t, uint64_t, uint64_t, uint64_t) override;

@@ -79,6 +79,14 @@ class LocalStoreTest : public ::testing::Test {
             .build(),
         {});
   }
+  void event(std::string_view name, const Payload& built, const Payload& message = Payload()) {
+    store->analytics().sendEventLazy(
+        name, [built] { return built; }, message);
+  }
+  // The payload with one entry more, as its event has it.
+  static Payload tagged(const Payload& payload) {
+    return PayloadBuilder(payload).set("app", "x\"y").build();
+  }
   static Payload numbered(int i) { return PayloadBuilder().set("i", i).build(); }
 
   fakes::FakePlatform p;  // for the log
@@ -94,8 +102,9 @@ TEST_F(LocalStoreTest, RowsAsTheyWereSent) {
   const auto relay = session(42);
   EXPECT_TRUE(relay->sendMessageWithCategory(
       5, 1, PayloadBuilder().set("x", 0.5).set("t", true).build(), error));
-  store->analytics().sendEventLazy("name", [] { return numbered(1); });
-  store->analytics().sendEventLazy("bad", []() -> Payload { throw std::runtime_error("builder"); });
+  event("name", numbered(1));
+  store->analytics().sendEventLazy(
+      "bad", []() -> Payload { throw std::runtime_error("builder"); }, Payload());
   store->power().logRegisteredEvent(28, "Lumo_Haptics", numbered(2), nullptr);
   EXPECT_TRUE(store->relay().sendOneMessageWithSessionInfo(
       {{kVyrReportingSessionInfoSessionID, int32_t{-1}}}, Payload(), 7, 2, numbered(3), error));
@@ -112,6 +121,52 @@ TEST_F(LocalStoreTest, RowsAsTheyWereSent) {
   EXPECT_THAT(query("SELECT client_identifier, name, record FROM power_records"),
               ElementsAre("28|Lumo_Haptics|{\"i\":2}"));
   EXPECT_FALSE(relay->sendMessageWithCategory(5, 1, numbered(1), error));
+}
+
+TEST_F(LocalStoreTest, EventsShareTheTextOfTheirMessages) {
+  open();
+  std::optional<Error> error;
+  const auto relay = session(1);
+  const Payload own = PayloadBuilder().set("app", "client's").set("i", 5).build();
+  const Payload messages[] = {numbered(1), numbered(2), numbered(3), Payload(), own};
+  event("before", tagged(messages[0]), messages[0]);
+  for (const Payload& message : messages) relay->sendMessageWithCategory(1, 1, message, error);
+  event("behind", tagged(messages[1]), messages[1]);
+  event("again", tagged(messages[1]), messages[1]);
+  event("same", messages[2], messages[2]);
+  event("empty", tagged(Payload()), Payload());
+  event("replaced", tagged(own), own);
+  event("alone", tagged(numbered(6)), numbered(6));
+  EXPECT_TRUE(close());
+  EXPECT_THAT(
+      query("SELECT name, payload FROM analytics_events ORDER BY name"),
+      ElementsAre("again|{\"i\":2,\"app\":\"x\\\"y\"}", "alone|{\"i\":6,\"app\":\"x\\\"y\"}",
+                  "before|{\"i\":1,\"app\":\"x\\\"y\"}", "behind|{\"i\":2,\"app\":\"x\\\"y\"}",
+                  "empty|{\"app\":\"x\\\"y\"}", "replaced|{\"app\":\"x\\\"y\",\"i\":5}",
+                  "same|{\"i\":3}"));
+  EXPECT_THAT(query("SELECT message FROM analytics_entries WHERE message IS NOT NULL ORDER BY id"),
+              ElementsAre("1", "2", "2", "3"));
+}
+
+TEST_F(LocalStoreTest, YoungEventWaitsOneBatchForItsMessage) {
+  options.commitInterval = 20ms;
+  open();
+  std::optional<Error> error;
+  const auto relay = session(1);
+  const Payload late = numbered(1);
+  event("late", tagged(late), late);
+  for (int i = 0; i < 1000; ++i) store->power().logRegisteredEvent(1, "n", numbered(i), nullptr);
+  EXPECT_TRUE(eventually([&] { return store->counters().rowsCommitted >= 1000; }));
+  relay->sendMessageWithCategory(1, 1, late, error);
+  const Payload never = numbered(2);  // whose message does not come
+  event("never", tagged(never), never);
+  for (int i = 0; i < 1000; ++i) store->power().logRegisteredEvent(1, "n", numbered(i), nullptr);
+  EXPECT_TRUE(eventually(
+      [&] { return query("SELECT payload FROM analytics_events ORDER BY payload").size() == 2; }));
+  EXPECT_THAT(query("SELECT payload FROM analytics_events ORDER BY payload"),
+              ElementsAre("{\"i\":1,\"app\":\"x\\\"y\"}", "{\"i\":2,\"app\":\"x\\\"y\"}"));
+  EXPECT_TRUE(close());
+  EXPECT_EQ(store->counters().rowsCommitted, 2004u);
 }
 
 TEST_F(LocalStoreTest, FlushIsAnsweredOnceItsMessagesAreCommitted) {
@@ -163,11 +218,15 @@ TEST_F(LocalStoreTest, ConfigurationAnswersTheNamedBackEnds) {
   store->setBackends({});
   std::atomic<int> answers{0};
   session(1)->startConfigurationWithCompletionHandler(
-      [&](auto backends) { answers += backends ? 100 : 1; });
+      [&](const std::optional<VyrReportingSession::BackendList>& backends) {
+        answers += backends ? 100 : 1;
+      });
   store->setBackends({"elsewhere"});
   const auto relay = session(1);
   relay->startConfigurationWithCompletionHandler(
-      [&](auto backends) { answers += backends->size() == 1 ? 10 : 100; });
+      [&](const std::optional<VyrReportingSession::BackendList>& backends) {
+        answers += backends->size() == 1 ? 10 : 100;
+      });
   EXPECT_TRUE(eventually([&] { return answers == 11; }));
   std::optional<Error> error;
   EXPECT_FALSE(relay->sendMessageWithCategory(1, 1, numbered(1), error));
@@ -214,6 +273,60 @@ TEST_F(LocalStoreTest, OldestRowsGoFirstAndTheLedgerSaysSo) {
                   "table_name = 'power_records'")
                 .at(0),
             std::to_string(40000 - kept));
+}
+
+TEST_F(LocalStoreTest, EventsGoWithTheMessagesWhoseTextTheyShare) {
+  options.maxBytes = 1 << 20;
+  open();
+  const auto relay = session(1);
+  std::optional<Error> error;
+  for (int i = 0; i < 100; ++i) {
+    for (int k = 0; k < 200; ++k) {
+      const Payload message =
+          PayloadBuilder().set("i", i * 200 + k).set("f", std::string(100, 'x')).build();
+      relay->sendMessageWithCategory(1, 1, message, error);
+      event("e", tagged(message), message);
+    }
+    std::atomic<bool> flushed{false};
+    relay->flushMessagesWithCompletion([&](auto) { flushed = true; });
+    ASSERT_TRUE(eventually([&] { return flushed.load(); }));
+  }
+  EXPECT_TRUE(close());
+  const int kept = std::stoi(query("SELECT count(*) FROM analytics_events").at(0));
+  EXPECT_LT(kept, 19000);
+  EXPECT_GT(kept, 1000);
+  EXPECT_EQ(query("SELECT count(*) FROM analytics_events WHERE json_valid(payload)").at(0),
+            std::to_string(kept));
+  EXPECT_EQ(query("SELECT sum(rows) FROM store_ledger WHERE table_name = 'analytics_events'").at(0),
+            std::to_string(20000 - kept));
+}
+
+TEST_F(LocalStoreTest, EventsOfTheFirstSchemaAreKept) {
+  sqlite3* database = nullptr;
+  sqlite3_open((folder + "/telemetry.db").c_str(), &database);
+  EXPECT_EQ(sqlite3_exec(database,
+                         "CREATE TABLE relay_sessions(id INTEGER PRIMARY KEY, time REAL);"
+                         "CREATE TABLE relay_messages(id INTEGER PRIMARY KEY, time REAL NOT NULL, "
+                         "relay_session INTEGER, category INTEGER, type INTEGER, payload TEXT);"
+                         "CREATE TABLE analytics_events(id INTEGER PRIMARY KEY, time REAL NOT NULL,"
+                         " name TEXT NOT NULL, payload TEXT NOT NULL);"
+                         "CREATE TABLE power_records(id INTEGER PRIMARY KEY, time REAL,"
+                         " client_identifier INTEGER, name TEXT, record TEXT);"
+                         "CREATE TABLE store_ledger(id INTEGER PRIMARY KEY, time REAL, event TEXT,"
+                         " table_name TEXT, rows INTEGER, detail TEXT);"
+                         "CREATE VIEW client_uptimes AS SELECT id FROM analytics_events;"
+                         "INSERT INTO analytics_events VALUES(3, 4e9, 'a', '{\"i\":1}'),"
+                         "(7, 4e9, 'b', '{\"i\":2}'), (9, 4e9, 'a', '{\"i\":3}');"
+                         "PRAGMA user_version = 1",
+                         nullptr, nullptr, nullptr),
+            SQLITE_OK);
+  sqlite3_close(database);
+  open();
+  event("b", numbered(4));
+  EXPECT_TRUE(close());
+  EXPECT_THAT(query("SELECT id, name, payload FROM analytics_events ORDER BY id"),
+              ElementsAre("3|a|{\"i\":1}", "7|b|{\"i\":2}", "9|a|{\"i\":3}", "10|b|{\"i\":4}"));
+  EXPECT_THAT(query("SELECT count(*) FROM client_uptimes"), ElementsAre("0"));
 }
 
 TEST_F(LocalStoreTest, SecondOpenerAndNewerSchemaAreRefused) {

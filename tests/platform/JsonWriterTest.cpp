@@ -56,6 +56,33 @@ TEST(JsonWriter, EscapesWhereverTheCharacterStands) {
   EXPECT_EQ(asJson("a\xFF"), "\"a\xEF\xBF\xBD\"") << "the file must stay UTF-8";
 }
 
+TEST(JsonWriter, TailIsWhatIsMissingBehindTheBeginning) {
+  const Payload empty;
+  const Payload one = PayloadBuilder().set("a", 1).build();
+  const Payload two = PayloadBuilder().set("a", 1).set("b", ArrayBuilder().add("x")).build();
+  PayloadBuilder many;
+  for (int i = 0; i < 23; ++i) many.set("k" + std::to_string(i), i);
+  const Payload full = many.build();  // one more entry makes the head longer
+  const Payload fuller = many.set("last", true).build();
+  for (const auto& [whole, beginning] : {std::pair(one, empty),
+                                         {two, one},
+                                         {two, empty},
+                                         {two, two},
+                                         {empty, empty},
+                                         {fuller, full},
+                                         {fuller, empty}}) {
+    std::string text = compact(beginning);
+    text.pop_back();
+    EXPECT_TRUE(appendJsonTail(text, whole, beginning));
+    EXPECT_EQ(text, compact(whole));
+  }
+  std::string untouched = "x";
+  EXPECT_FALSE(appendJsonTail(untouched, one, two));
+  EXPECT_FALSE(appendJsonTail(untouched, two, PayloadBuilder().set("a", 2).build()));
+  EXPECT_FALSE(appendJsonTail(untouched, PayloadBuilder().set("a", 2).set("b", 1).build(), one));
+  EXPECT_EQ(untouched, "x");
+}
+
 TEST(JsonWriter, AppendsToWhatIsThere) {
   std::string out = "[";
   appendJson(out, PayloadBuilder().set("a", 1).build());
