@@ -115,4 +115,14 @@ inline double floatingOf(const Head& h) {
                               : static_cast<double>(singleOf(h));
 }
 
+// Whether a number inside [at, end), which holds whole items, is infinite or not a number.
+inline bool anyNonFinite(const uint8_t* at, const uint8_t* end) {
+  while (at < end) {
+    const Head h = head(at);
+    if (isFloating(h) && !std::isfinite(floatingOf(h))) return true;
+    at = h.next + (h.major() == kText ? h.argument : 0);
+  }
+  return false;
+}
+
 }  // namespace vx::cbor

@@ -20,8 +20,9 @@ class CborWriter {
   void doubleFloat(double value);
   void boolean(bool value) { out_.push_back(value ? 0xF5 : 0xF4); }
   void null() { out_.push_back(0xF6); }
-  void string(std::string_view value);  // bytes that are not UTF-8 become U+FFFD
-  void date(double secondsSince1970);   // 1970 when not finite
+  void string(std::string_view value);                    // bytes that are not UTF-8 become U+FFFD
+  void stringHead(uint64_t bytes) { head(0x60, bytes); }  // the bytes follow, from the caller
+  void date(double secondsSince1970);                     // 1970 when not finite
   void encoded(std::span<const uint8_t> item) { out_.insert(out_.end(), item.begin(), item.end()); }
 
  private:

@@ -34,7 +34,6 @@ class Sink {
     ++at_;
   }
   void put(std::string_view text) { wrote(std::copy(text.begin(), text.end(), room(text.size()))); }
-  void put(std::size_t count, char c) { wrote(std::fill_n(room(count), count, c)); }
 
  private:
   void grow(std::size_t more) {
@@ -200,8 +199,9 @@ class Emitter {
 
   void newLine() {
     if (layout_ == Layout::Compact) return;
-    sink_.put('\n');
-    sink_.put(2 * indent_, ' ');
+    char* const out = sink_.room(1 + indent_);
+    *out = '\n';
+    sink_.wrote(std::fill_n(out + 1, indent_, ' '));
   }
 
   Sink& sink_;
@@ -305,7 +305,15 @@ void appendPrettyJson(std::string& out, const Payload& payload, int indent) {
       .item(payload.encoded().data());
 }
 
+void appendPrettyJson(std::string& out, const Value& value, int indent) {
+  Sink sink(out, value.encoded().size() + 64);
+  Emitter(sink, NonFinite::Refuse, Emitter::Layout::Pretty,
+          static_cast<std::size_t>(std::max(indent, 0)))
+      .item(value.encoded().data());
+}
+
 std::optional<Error> checkJson(const Payload& payload) {
+  if (!payload.mayHoldNonFinite()) return std::nullopt;
   FiniteCheck check;
   check.item(payload.encoded().data());
   if (!check.failed()) return std::nullopt;

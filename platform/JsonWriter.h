@@ -29,9 +29,10 @@ bool appendJsonTail(std::string& out, const Payload& payload, const Payload& beg
                     NonFinite nonFinite = NonFinite::AsText);
 // Bytes that are not UTF-8 become U+FFFD.
 void appendJsonString(std::string& out, std::string_view text);
-// Pretty: two blanks a level, "key" : value separated as `"key": value`; the first line is not
+// Pretty: one blank a level, "key" : value separated as `"key": value`; the first line is not
 // indented, the others by `indent` levels at least.
 void appendPrettyJson(std::string& out, const Payload& payload, int indent);
+void appendPrettyJson(std::string& out, const Value& value, int indent);
 // The error that a strict JSON serialisation would report: a non-finite number, named by its key
 // path. None when fine.
 std::optional<Error> checkJson(const Payload& payload);

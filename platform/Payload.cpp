@@ -218,22 +218,27 @@ ArrayView::Iterator ArrayView::begin() const {
   return iterator;
 }
 
-DictionaryEntry DictionaryView::Iterator::operator*() const {
-  const std::string_view key = cbor::text(at_);
-  const uint8_t* value = bytesOf(key) + key.size();
-  return {key, Value(value, cbor::skip(value))};
+DictionaryEntry DictionaryView::Iterator::operator*() const { return {key_, Value(value_, next_)}; }
+
+// The entry that begins at next_.
+void DictionaryView::Iterator::readEntry() {
+  if (left_ == 0) return;
+  key_ = cbor::text(next_);
+  value_ = bytesOf(key_) + key_.size();
+  next_ = cbor::skip(value_);
 }
 
 DictionaryView::Iterator& DictionaryView::Iterator::operator++() {
-  at_ = cbor::skip(cbor::skip(at_));
   --left_;
+  readEntry();
   return *this;
 }
 
 DictionaryView::Iterator DictionaryView::begin() const {
   Iterator iterator;
-  iterator.at_ = first_;
+  iterator.next_ = first_;
   iterator.left_ = count_;
+  iterator.readEntry();
   return iterator;
 }
 
@@ -254,7 +259,9 @@ Payload Payload::copyOf(const Value& dictionary) {
   const cbor::Head head = cbor::head(dictionary.begin_);
   if (head.major() != cbor::kMap || head.argument == 0) return Payload();
   const std::span<const uint8_t> bytes = dictionary.encoded();
-  Block* block = Block::allocate(bytes.size(), anyKeyHasSpace(head.next, head.argument));
+  Block* block =
+      Block::allocate(bytes.size(), {anyKeyHasSpace(head.next, head.argument),
+                                     cbor::anyNonFinite(dictionary.begin_, dictionary.end_)});
   std::memcpy(block->bytes(), bytes.data(), bytes.size());
   return Payload(block);
 }
@@ -272,8 +279,10 @@ Payload Payload::withEntry(std::string_view key, const Value& value) const {
   const std::size_t headSize = edges.size();
   writer.string(key);
   const std::span<const uint8_t> item = value.encoded();
-  Block* block = Block::allocate(edges.size() + body.size() + item.size(),
-                                 hasSpaceInKeys() || key.find(' ') != std::string_view::npos);
+  Block* block =
+      Block::allocate(edges.size() + body.size() + item.size(),
+                      {hasSpaceInKeys() || key.find(' ') != std::string_view::npos,
+                       mayHoldNonFinite() || cbor::anyNonFinite(value.begin_, value.end_)});
   uint8_t* out = std::copy_n(edges.data(), headSize, block->bytes());
   out = std::copy(body.begin(), body.end(), out);
   out = std::copy(edges.begin() + static_cast<std::ptrdiff_t>(headSize), edges.end(), out);
@@ -296,6 +305,7 @@ DictionaryView Payload::view() const {
 }
 
 bool Payload::hasSpaceInKeys() const { return block_ != nullptr && block_->spaceInKeys(); }
+bool Payload::mayHoldNonFinite() const { return block_ != nullptr && block_->mayHoldNonFinite(); }
 
 std::span<const uint8_t> Payload::encoded() const {
   if (block_ == nullptr) return kEmptyDictionary;

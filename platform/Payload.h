@@ -137,7 +137,10 @@ class DictionaryView {
 
    private:
     friend class DictionaryView;
-    const uint8_t* at_ = nullptr;
+    void readEntry();
+    std::string_view key_;
+    const uint8_t* value_ = nullptr;
+    const uint8_t* next_ = nullptr;  // behind the value
     std::size_t left_ = 0;
   };
   DictionaryView() = default;
@@ -202,6 +205,8 @@ class Payload {
   // True when a key of this dictionary (not of nested ones) holds a space. Known since validation:
   // costs a flag test.
   bool hasSpaceInKeys() const;
+  // False only when every number in it is finite: costs a flag test.
+  bool mayHoldNonFinite() const;
   // The CBOR encoding. The empty dictionary encodes as one byte.
   std::span<const uint8_t> encoded() const;
   std::string text() const;  // as Value::text
@@ -235,7 +240,7 @@ class ArrayBuilder;
 // What is put in always makes a valid Payload: bytes that are not UTF-8 become U+FFFD, a date that
 // is not finite becomes 1970, a Null value changes nothing. Nesting is the caller's affair: one
 // deeper than Payload::kMaxNesting can be built and written, but no peer will accept it.
-// std::length_error beyond 2 GiB.
+// std::length_error beyond 1 GiB.
 class PayloadBuilder {
  public:
   PayloadBuilder() = default;
@@ -270,6 +275,13 @@ class PayloadBuilder {
 
   std::size_t size() const { return entries_.size(); }
   Payload build() const;
+  // For a dictionary of long texts that would be put together first and then copied: each is given
+  // in pieces, which must be UTF-8 as a whole. The keys must be UTF-8 and unique.
+  struct JoinedText {
+    std::string_view key;
+    std::vector<std::string_view> pieces;
+  };
+  static Payload joined(std::span<const JoinedText> texts);
 
  private:
   // Where an entry lies in body_. The value follows its key, unless a replaced value of another
@@ -303,6 +315,7 @@ class PayloadBuilder {
   std::size_t deadBytes_ = 0;
   bool inOrder_ = true;  // body_ is the dictionary's encoding as it stands
   bool spaceInKeys_ = false;
+  bool nonFinite_ = false;
 };
 
 class ArrayBuilder {
@@ -345,6 +358,7 @@ class Frame {
     const uint8_t* begin;
     const uint8_t* end;
     bool spaceInKeys;  // of a dictionary
+    bool nonFinite;    // some number inside is
   };
   Frame() {}  // empty; the elements are not initialised, they are set as they are decoded
   static std::optional<Frame> decode(std::span<const uint8_t> bytes, DecodeError* error = nullptr);

@@ -1,4 +1,5 @@
 #include <algorithm>
+#include <cmath>
 #include <random>
 
 #include "platform/CborReader.h"
@@ -46,9 +47,11 @@ PayloadBuilder& PayloadBuilder::set(std::string_view key, std::string_view value
   return put(key, [&](CborWriter& out) { out.string(value); });
 }
 PayloadBuilder& PayloadBuilder::set(std::string_view key, float value) {
+  nonFinite_ = nonFinite_ || !std::isfinite(value);
   return put(key, [&](CborWriter& out) { out.singleFloat(value); });
 }
 PayloadBuilder& PayloadBuilder::set(std::string_view key, double value) {
+  nonFinite_ = nonFinite_ || !std::isfinite(value);
   return put(key, [&](CborWriter& out) { out.doubleFloat(value); });
 }
 PayloadBuilder& PayloadBuilder::set(std::string_view key, PayloadDate value) {
@@ -56,12 +59,17 @@ PayloadBuilder& PayloadBuilder::set(std::string_view key, PayloadDate value) {
 }
 PayloadBuilder& PayloadBuilder::set(std::string_view key, const Value& value) {
   if (isNull(value)) return *this;
-  return put(key, [&](CborWriter& out) { out.encoded(value.encoded()); });
+  const std::span<const uint8_t> item = value.encoded();
+  nonFinite_ = nonFinite_ || cbor::anyNonFinite(item.data(), item.data() + item.size());
+  return put(key, [&](CborWriter& out) { out.encoded(item); });
 }
 PayloadBuilder& PayloadBuilder::set(std::string_view key, const Payload& dictionary) {
+  nonFinite_ = nonFinite_ || dictionary.mayHoldNonFinite();
   return put(key, [&](CborWriter& out) { out.encoded(dictionary.encoded()); });
 }
 PayloadBuilder& PayloadBuilder::set(std::string_view key, const ArrayBuilder& array) {
+  const std::vector<uint8_t>& items = array.body_;
+  nonFinite_ = nonFinite_ || cbor::anyNonFinite(items.data(), items.data() + items.size());
   return put(key, [&](CborWriter& out) {
     out.array(array.count_);
     out.encoded(array.body_);
@@ -86,7 +94,7 @@ PayloadBuilder& PayloadBuilder::merge(const Payload& from) {
 Payload PayloadBuilder::build() const {
   if (entries_.empty()) return Payload();
   const std::size_t size = headSize(entries_.size()) + body_.size() - deadBytes_;
-  Payload::Block* block = Payload::Block::allocate(size, spaceInKeys_);
+  Payload::Block* block = Payload::Block::allocate(size, {spaceInKeys_, nonFinite_});
   uint8_t* out = block->bytes();
   std::vector<uint8_t> head;
   CborWriter(head).dictionary(entries_.size());
@@ -100,6 +108,35 @@ Payload PayloadBuilder::build() const {
     const std::string_view key = keyOf(entry);
     out = std::copy(body + entry.key, bytesOf(key) + key.size(), out);
     out = std::copy(body + entry.value, body + entry.valueEnd, out);
+  }
+  return Payload(block);
+}
+
+Payload PayloadBuilder::joined(std::span<const JoinedText> texts) {
+  if (texts.empty()) return Payload();
+  std::vector<uint8_t> heads;  // all that is not a piece: heads and keys, one after the other
+  std::vector<std::size_t> headEnds;
+  CborWriter writer(heads);
+  writer.dictionary(texts.size());
+  std::size_t size = 0;
+  bool space = false;
+  for (const JoinedText& text : texts) {
+    std::size_t length = 0;
+    for (const std::string_view piece : text.pieces) length += piece.size();
+    writer.string(text.key);
+    writer.stringHead(length);
+    headEnds.push_back(heads.size());
+    size += length;
+    space = space || text.key.find(' ') != std::string_view::npos;
+  }
+  Payload::Block* block = Payload::Block::allocate(heads.size() + size, {space, false});
+  uint8_t* out = block->bytes();
+  std::size_t begin = 0;
+  for (std::size_t i = 0; i < texts.size(); ++i) {
+    out = std::copy(heads.data() + begin, heads.data() + headEnds[i], out);
+    begin = headEnds[i];
+    for (const std::string_view piece : texts[i].pieces)
+      out = std::copy(piece.begin(), piece.end(), out);
   }
   return Payload(block);
 }
@@ -118,7 +155,7 @@ PayloadBuilder& PayloadBuilder::put(std::string_view key, Write write) {
   write(out);
   if (body_.size() > Payload::Block::kMaxSize - 9) {
     body_.resize(start);
-    throw std::length_error("a property list is limited to 2 GiB");
+    throw std::length_error("a property list is limited to 1 GiB");
   }
   if (old == nullptr)
     add(key, {offset(start), offset(value), offset(body_.size()), hash});

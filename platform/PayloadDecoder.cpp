@@ -70,6 +70,7 @@ class Validator {
   bool run();
   uint64_t rootCount() const { return rootCount_; }
   bool spaceInKeys() const { return space_ != 0; }
+  bool nonFinite() const { return nonFinite_; }
   DecodeError takeError() { return std::move(error_); }
 
  private:
@@ -111,6 +112,7 @@ class Validator {
   int depth_ = -1;            // index of the open level
   uint64_t rootCount_ = 0;
   uint64_t space_ = 0;
+  bool nonFinite_ = false;
   std::array<Level, Payload::kMaxNesting + 1> levels_;
   KeyStack keys_;
   DecodeError error_;
@@ -146,9 +148,11 @@ inline void Validator::endElement(uint64_t next) {
     Frame::Element& element = elements_[next - 1];
     element.end = at_;
     element.spaceInKeys = space_ != 0;
+    element.nonFinite = nonFinite_;
   }
   if (next < Frame::kMaxElements) elements_[next].begin = at_;
   space_ = 0;
+  nonFinite_ = false;
 }
 
 inline bool Validator::readHead(cbor::Head& head) {
@@ -252,8 +256,11 @@ inline bool Validator::readValue() {
     default:
       break;
   }
-  if (cbor::isFloating(head) || head.initial == cbor::kFalse || head.initial == cbor::kTrue)
+  if (cbor::isFloating(head)) {
+    nonFinite_ = nonFinite_ || !std::isfinite(cbor::floatingOf(head));
     return true;
+  }
+  if (head.initial == cbor::kFalse || head.initial == cbor::kTrue) return true;
   return failSimple(head, start);
 }
 
@@ -297,7 +304,7 @@ std::optional<Payload> Payload::decode(std::span<const uint8_t> bytes, DecodeErr
     return std::nullopt;
   }
   if (validator.rootCount() == 0) return Payload();
-  Block* block = Block::allocate(bytes.size(), validator.spaceInKeys());
+  Block* block = Block::allocate(bytes.size(), {validator.spaceInKeys(), validator.nonFinite()});
   std::memcpy(block->bytes(), bytes.data(), bytes.size());
   return Payload(block);
 }
@@ -317,7 +324,7 @@ Payload Frame::payload(std::size_t i) const {
   const Element& element = elements_[i];
   const auto size = static_cast<std::size_t>(element.end - element.begin);
   if (size <= 1) return Payload();  // the empty dictionary
-  Payload::Block* block = Payload::Block::allocate(size, element.spaceInKeys);
+  Payload::Block* block = Payload::Block::allocate(size, {element.spaceInKeys, element.nonFinite});
   std::memcpy(block->bytes(), element.begin, size);
   return Payload(block);
 }

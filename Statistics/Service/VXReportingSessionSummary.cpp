@@ -1,8 +1,10 @@
 // What a session leaves behind when it stops: the summary event, and on internal builds the summary
 // file.
+#include <algorithm>
 #include <deque>
 #include <string_view>
 #include <unordered_map>
+#include <vector>
 
 #include "Statistics/Service/VXReportingSession.h"
 #include "platform/FileNames.h"
@@ -19,6 +21,37 @@ constexpr const char* kDateFormat = "%Y%m%d-%H%M%S%z";
 constexpr unsigned kDirectoryMode = 0777;
 constexpr std::size_t kWriteBytes = 64 << 10;
 
+// A text that grows without ever being moved: in pieces, each larger than the one before up to
+// kLargestPiece.
+class LongText {
+ public:
+  // Where to append next; what is there may move on the next call.
+  std::string& tail() {
+    if (tail_.size() + kSlack > tail_.capacity()) beginPiece();
+    return tail_;
+  }
+  std::vector<std::string_view> pieces() const {
+    std::vector<std::string_view> all(sealed_.begin(), sealed_.end());
+    all.push_back(tail_);
+    return all;
+  }
+
+ private:
+  static constexpr std::size_t kFirstPiece = 128;
+  static constexpr std::size_t kLargestPiece = 64 << 10;
+  static constexpr std::size_t kSlack = 64;  // room for most values
+
+  void beginPiece() {
+    const std::size_t next = std::clamp(2 * tail_.capacity(), kFirstPiece, kLargestPiece);
+    if (!tail_.empty()) sealed_.push_back(std::move(tail_));
+    tail_ = std::string();
+    tail_.reserve(next);
+  }
+
+  std::deque<std::string> sealed_;
+  std::string tail_;
+};
+
 // The texts found under each key, joined by ",". Messages of one kind tend to hold the same keys in
 // the same order, so the group behind the one used last is tried before the index is asked.
 class Grouping {
@@ -27,25 +60,28 @@ class Grouping {
     next_ = first_;
     atFirst_ = true;
   }
+  // Where to append the next value of a key.
   std::string& textFor(std::string_view key) {
     if (next_ >= groups_.size() || groups_[next_].key != key) next_ = indexOf(key);
     if (atFirst_) first_ = next_;
     atFirst_ = false;
     Group& group = groups_[next_++];
-    if (group.any) group.text += ',';
+    std::string& tail = group.text.tail();
+    if (group.any) tail += ',';
     group.any = true;
-    return group.text;
+    return tail;
   }
   Payload build() const {
-    PayloadBuilder event;
-    for (const Group& group : groups_) event.set(group.key, group.text);
-    return event.build();
+    std::vector<PayloadBuilder::JoinedText> texts;
+    texts.reserve(groups_.size());
+    for (const Group& group : groups_) texts.push_back({group.key, group.text.pieces()});
+    return PayloadBuilder::joined(texts);
   }
 
  private:
   struct Group {
     std::string key;
-    std::string text;
+    LongText text;
     bool any = false;
   };
   std::size_t indexOf(std::string_view key) {
@@ -71,16 +107,15 @@ class ArrayFileWriter {
   explicit ArrayFileWriter(AtomicFile& file) : file_(file) {}
   void element(const Payload& payload) {
     separate();
-    appendPrettyJson(text_, payload, 1);
-    writeWhenFull();
+    dictionary(payload, 1);
   }
   void namedElement(const std::string& name, const Payload& payload) {
     separate();
-    text_ += "{\n    ";
+    text_ += "{\n  ";
     appendJsonString(text_, name);
     text_ += ": ";
-    appendPrettyJson(text_, payload, 2);
-    text_ += "\n  }";
+    dictionary(payload, 2);
+    text_ += "\n }";
     writeWhenFull();
   }
   std::optional<Error> finish() {
@@ -91,8 +126,26 @@ class ArrayFileWriter {
 
  private:
   void separate() {
-    text_ += first_ ? "[\n  " : ",\n  ";
+    text_ += first_ ? "[\n " : ",\n ";
     first_ = false;
+  }
+  // A large one entry by entry: a summary of millions of values is one dictionary.
+  void dictionary(const Payload& payload, int indent) {
+    if (payload.encoded().size() < kWriteBytes) {
+      appendPrettyJson(text_, payload, indent);
+      return writeWhenFull();
+    }
+    const std::string newLine = "\n" + std::string(static_cast<std::size_t>(indent), ' ');
+    const char* before = "{";
+    for (const auto& [key, value] : payload) {
+      text_ += before + newLine + ' ';
+      before = ",";
+      appendJsonString(text_, key);
+      text_ += ": ";
+      appendPrettyJson(text_, value, indent + 1);
+      writeWhenFull();
+    }
+    text_ += newLine + '}';
   }
   void writeWhenFull() {
     if (text_.size() >= kWriteBytes) write();

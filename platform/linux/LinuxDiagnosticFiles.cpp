@@ -45,6 +45,13 @@ class RenamedFile final : public AtomicFile {
       if (written < 0 && errno == EINTR) continue;
       if (written < 0) return posixError(errno, where_);
       text.remove_prefix(static_cast<std::size_t>(written));
+      size_ += written;
+    }
+    // A large file starts on its way to the disk while it is being written, so that commit() has
+    // less to wait for. A hint: what comes of it is commit()'s to find out.
+    if (size_ - handedOver_ >= kHandOverBytes) {
+      (void)sync_file_range(fd_, handedOver_, size_ - handedOver_, SYNC_FILE_RANGE_WRITE);
+      handedOver_ = size_;
     }
     return std::nullopt;
   }
@@ -63,8 +70,12 @@ class RenamedFile final : public AtomicFile {
   }
 
  private:
+  static constexpr off_t kHandOverBytes = 4 << 20;
+
   const int directoryFd_;
   const int fd_;
+  off_t size_ = 0;
+  off_t handedOver_ = 0;
   const std::string name_;
   const std::string temporary_;
   const std::string where_;

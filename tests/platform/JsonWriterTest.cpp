@@ -99,16 +99,12 @@ TEST(JsonWriter, PrettyIndentsAllButTheFirstLine) {
                               .build();
   std::string out;
   appendPrettyJson(out, payload, 1);
-  EXPECT_EQ(out, R"({
-    "a": [
-      1,
-      2
-    ],
-    "e": {},
-    "d": {
-      "x": true
-    }
-  })");
+  const std::string lines =
+      "{\n  \"a\": [\n   1,\n   2\n  ],\n  \"e\": {},\n  \"d\": {\n   \"x\": true\n  }\n }";
+  EXPECT_EQ(out, lines);
+  out.clear();
+  appendPrettyJson(out, *PayloadBuilder().set("k", payload).build().find("k"), 1);
+  EXPECT_EQ(out, lines);
 }
 
 TEST(JsonWriter, NonFiniteNumbersAreTextOrRefusedByName) {

@@ -418,6 +418,42 @@ TEST(PayloadBuilder, MakesAValidPayloadOfAnything) {
   EXPECT_EQ(p.find("list")->text(), "(\uFFFD)");
 }
 
+TEST(PayloadBuilder, JoinsTextsFromPieces) {
+  const std::string large(70000, 'x');
+  const PayloadBuilder::JoinedText texts[] = {
+      {"a b", {"1", ",", "\xC3", "\xBC"}}, {"none", {}}, {"large", {large, ",", large}}};
+  const Payload joined = PayloadBuilder::joined(texts);
+  EXPECT_EQ(joined, PayloadBuilder()
+                        .set("a b", "1,\u00FC")
+                        .set("none", "")
+                        .set("large", large + "," + large)
+                        .build());
+  EXPECT_TRUE(joined.hasSpaceInKeys());
+  EXPECT_TRUE(PayloadBuilder::joined({}).empty());
+}
+
+TEST(Payload, KnowsWhetherANumberMayNotBeFinite) {
+  const Payload finite = PayloadBuilder().set("a", ArrayBuilder().add(1.5)).build();
+  const Payload nested =
+      PayloadBuilder().set("n", PayloadBuilder().set("x", std::nanf("")).build()).build();
+  const Payload listed = PayloadBuilder().set("l", ArrayBuilder().add(HUGE_VAL)).build();
+  EXPECT_FALSE(finite.mayHoldNonFinite());
+  for (const Payload& payload :
+       {nested, listed, PayloadBuilder(nested).set("b", 1).build(),
+        finite.withEntry("n", *nested.find("n")),
+        Payload::copyOf(*PayloadBuilder().set("w", listed).build().find("w")),
+        *Payload::decode(nested.encoded())}) {
+    EXPECT_TRUE(payload.mayHoldNonFinite()) << payload.text();
+  }
+  Bytes frame = fromHex("83");  // [nested, finite, finite]
+  for (const Payload& payload : {nested, finite, finite})
+    frame.insert(frame.end(), payload.encoded().begin(), payload.encoded().end());
+  const Frame decoded = *Frame::decode(frame);
+  EXPECT_TRUE(decoded.payload(0).mayHoldNonFinite());
+  EXPECT_FALSE(decoded.payload(1).mayHoldNonFinite());
+  EXPECT_FALSE(decoded.payload(2).mayHoldNonFinite());
+}
+
 TEST(PayloadBuilder, KeepsTheKindsApart) {
   const Payload p = PayloadBuilder()
                         .set("0", false)

@@ -52,10 +52,10 @@ TEST_F(SummaryTest, EventThenFileThenFlush) {
                                   "trace 0x21042838", "mkdir /logs/Audio/Reporting 777",
                                   "file " + path, "relay 65535 65535", "flush"));
   EXPECT_EQ(p.services.files[path],
-            "[\n  {\n    \"HostApplicationDisplayID\": \"com.example\"\n  },\n  {\n    "
-            "\"Playback_Start_1\": {\n"
-            "      \"a_b\": 1\n    }\n  },\n  {\n    \"Undefined_Unknown_1\": {\n"
-            "      \"VX_Session_Summary_Event\": \"3\",\n      \"a_b\": \"1\"\n    }\n  }\n]\n");
+            "[\n {\n  \"HostApplicationDisplayID\": \"com.example\"\n },\n"
+            " {\n  \"Playback_Start_1\": {\n   \"a_b\": 1\n  }\n },\n"
+            " {\n  \"Undefined_Unknown_1\": {\n   \"VX_Session_Summary_Event\": \"3\",\n"
+            "   \"a_b\": \"1\"\n  }\n }\n]\n");
 }
 
 TEST_F(SummaryTest, LaterOfTwoWithTheSameNameStays) {
