@@ -15,7 +15,13 @@ namespace vx {
 class AtomicFile {
  public:
   virtual ~AtomicFile() = default;
-  virtual std::optional<Error> write(std::string_view text) = 0;
+  // Takes the text and leaves `text` empty, with as much room as there is to spare. What cannot be
+  // written may become known only with a later call, or with commit().
+  virtual std::optional<Error> take(std::string& text) = 0;
+  std::optional<Error> write(std::string_view text) {
+    std::string copy(text);
+    return take(copy);
+  }
   // Makes it durable and puts it in the place of whatever has its name. None on success.
   virtual std::optional<Error> commit() = 0;
 };

@@ -317,6 +317,15 @@ void appendJsonString(std::string& out, std::string_view text) {
   putString(sink, text);
 }
 
+void appendJsonText(std::string& out, std::string_view part) {
+  Sink sink(out, part.size());
+  char* const at = sink.room(part.size());
+  if (copyText(at, part))
+    putEscaping(sink, part);
+  else
+    sink.wrote(at + part.size());
+}
+
 void appendPrettyJson(std::string& out, const Payload& payload, int indent) {
   Sink sink(out, 3 * payload.encoded().size() + 64);
   Emitter(sink, NonFinite::Refuse, Emitter::Layout::Pretty,

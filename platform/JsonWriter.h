@@ -29,6 +29,9 @@ bool appendJsonTail(std::string& out, const Payload& payload, const Payload& beg
                     NonFinite nonFinite = NonFinite::AsText);
 // Bytes that are not UTF-8 become U+FFFD.
 void appendJsonString(std::string& out, std::string_view text);
+// What stands between the quotes of a JSON string. For parts of a long text, one after the other;
+// the whole must be UTF-8.
+void appendJsonText(std::string& out, std::string_view part);
 // Pretty: one blank a level, "key" : value separated as `"key": value`; the first line is not
 // indented, the others by `indent` levels at least.
 void appendPrettyJson(std::string& out, const Payload& payload, int indent);

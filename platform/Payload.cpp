@@ -33,6 +33,15 @@ cbor::Head numberHead(const uint8_t* at) {
   return head.major() == cbor::kTag ? cbor::head(head.next) : head;
 }
 
+char* writeScalar(char* out, const cbor::Head& head) {
+  if (head.initial == cbor::kFalse || head.initial == cbor::kTrue) {
+    *out = head.initial == cbor::kTrue ? '1' : '0';
+    return out + 1;
+  }
+  if (head.initial == cbor::kNull) return std::copy_n("null", 4, out);
+  return writeNumber(out, head);
+}
+
 const uint8_t* appendTextOf(std::string& out, const uint8_t* at);
 
 const uint8_t* appendArrayText(std::string& out, const cbor::Head& head) {
@@ -75,14 +84,8 @@ const uint8_t* appendTextOf(std::string& out, const uint8_t* at) {
     default:
       break;
   }
-  if (head.initial == cbor::kFalse || head.initial == cbor::kTrue) {
-    out += head.initial == cbor::kTrue ? '1' : '0';
-  } else if (head.initial == cbor::kNull) {
-    out += "null";
-  } else {
-    char text[kMaxScalarText];
-    out.append(text, writeNumber(text, head));
-  }
+  char text[kMaxScalarText];
+  out.append(text, writeScalar(text, head));
   return cbor::skip(at);
 }
 
@@ -200,6 +203,9 @@ DictionaryView Value::asDictionary() const {
 }
 
 void Value::appendText(std::string& out) const { appendTextOf(out, begin_); }
+
+static_assert(Value::kMaxScalarText == kMaxScalarText);
+char* Value::writeScalarText(char* out) const { return writeScalar(out, cbor::head(begin_)); }
 
 // ------------------------------------------------------------------------------------------ views
 

@@ -72,6 +72,10 @@ class Value {
   // their seconds), arrays as (a,b,c), dictionaries as {key=value,key=value}. Equal values have
   // equal text.
   void appendText(std::string& out) const;
+  // The same for a value that is no string, array or dictionary: at most kMaxScalarText characters;
+  // returns the first place behind them.
+  static constexpr std::size_t kMaxScalarText = 48;
+  char* writeScalarText(char* out) const;
   std::string text() const {
     std::string out;
     appendText(out);

@@ -2,6 +2,7 @@
 // file.
 #include <algorithm>
 #include <deque>
+#include <memory>
 #include <string_view>
 #include <unordered_map>
 #include <vector>
@@ -25,31 +26,44 @@ constexpr std::size_t kWriteBytes = 64 << 10;
 // kLargestPiece.
 class LongText {
  public:
-  // Where to append next; what is there may move on the next call.
-  std::string& tail() {
-    if (tail_.size() + kSlack > tail_.capacity()) beginPiece();
-    return tail_;
+  // Room for `count` characters behind what is there; wrote() says where they end.
+  char* room(std::size_t count) {
+    if (count > static_cast<std::size_t>(end_ - at_)) beginPiece(count);
+    return at_;
   }
+  void wrote(char* end) { at_ = end; }
   std::vector<std::string_view> pieces() const {
-    std::vector<std::string_view> all(sealed_.begin(), sealed_.end());
-    all.push_back(tail_);
+    std::vector<std::string_view> all;
+    for (const Piece& piece : pieces_) all.emplace_back(piece.text.get(), piece.size);
+    if (!all.empty())
+      all.back() = {all.back().data(), static_cast<std::size_t>(at_ - all.back().data())};
     return all;
   }
 
  private:
   static constexpr std::size_t kFirstPiece = 128;
   static constexpr std::size_t kLargestPiece = 64 << 10;
-  static constexpr std::size_t kSlack = 64;  // room for most values
+  struct Piece {
+    std::unique_ptr<char[]> text;
+    std::size_t size;  // room; of all but the last, what is used of it
+  };
 
-  void beginPiece() {
-    const std::size_t next = std::clamp(2 * tail_.capacity(), kFirstPiece, kLargestPiece);
-    if (!tail_.empty()) sealed_.push_back(std::move(tail_));
-    tail_ = std::string();
-    tail_.reserve(next);
+  void beginPiece(std::size_t count) {
+    std::size_t next = kFirstPiece;
+    if (!pieces_.empty()) {
+      Piece& last = pieces_.back();
+      next = std::min(2 * last.size, kLargestPiece);
+      last.size = static_cast<std::size_t>(at_ - last.text.get());
+    }
+    next = std::max(next, count);
+    pieces_.push_back({std::unique_ptr<char[]>(new char[next]), next});
+    at_ = pieces_.back().text.get();
+    end_ = at_ + next;
   }
 
-  std::deque<std::string> sealed_;
-  std::string tail_;
+  std::vector<Piece> pieces_;
+  char* at_ = nullptr;
+  char* end_ = nullptr;
 };
 
 // The texts found under each key, joined by ",". Messages of one kind tend to hold the same keys in
@@ -60,17 +74,24 @@ class Grouping {
     next_ = first_;
     atFirst_ = true;
   }
-  // Where to append the next value of a key.
-  std::string& textFor(std::string_view key) {
+  void add(std::string_view key, const Value& value) {
     if (next_ >= groups_.size() || groups_[next_].key != key) next_ = indexOf(key);
     if (atFirst_) first_ = next_;
     atFirst_ = false;
     Group& group = groups_[next_++];
-    std::string& tail = group.text.tail();
-    if (group.any) tail += ',';
-    group.any = true;
-    return tail;
+    switch (value.kind()) {
+      case ValueKind::String:
+        return append(group, value.asString());
+      case ValueKind::Array:
+      case ValueKind::Dictionary:
+        return append(group, value.text());
+      default:
+        break;
+    }
+    char* out = begin(group, Value::kMaxScalarText);
+    group.text.wrote(value.writeScalarText(out));
   }
+  void add(std::string_view key, std::string_view text) { append(groups_[indexOf(key)], text); }
   Payload build() const {
     std::vector<PayloadBuilder::JoinedText> texts;
     texts.reserve(groups_.size());
@@ -84,6 +105,18 @@ class Grouping {
     LongText text;
     bool any = false;
   };
+  // Where a value of at most `count` characters goes, behind the comma that parts it from the one
+  // before.
+  static char* begin(Group& group, std::size_t count) {
+    char* out = group.text.room(count + 1);
+    if (group.any) *out++ = ',';
+    group.any = true;
+    return out;
+  }
+  static void append(Group& group, std::string_view text) {
+    char* const out = begin(group, text.size());
+    group.text.wrote(std::copy(text.begin(), text.end(), out));
+  }
   std::size_t indexOf(std::string_view key) {
     const auto found = index_.find(key);
     if (found != index_.end()) return found->second;
@@ -142,16 +175,27 @@ class ArrayFileWriter {
       before = ",";
       appendJsonString(text_, key);
       text_ += ": ";
-      appendPrettyJson(text_, value, indent + 1);
+      if (value.isString())
+        string(value.asString());
+      else
+        appendPrettyJson(text_, value, indent + 1);
       writeWhenFull();
     }
     text_ += newLine + '}';
+  }
+  void string(std::string_view text) {
+    text_ += '"';
+    for (; !text.empty(); text.remove_prefix(std::min(text.size(), kWriteBytes))) {
+      appendJsonText(text_, text.substr(0, kWriteBytes));
+      writeWhenFull();
+    }
+    text_ += '"';
   }
   void writeWhenFull() {
     if (text_.size() >= kWriteBytes) write();
   }
   void write() {
-    if (!failed_) failed_ = file_.write(text_);
+    if (!failed_) failed_ = file_.take(text_);
     text_.clear();
   }
 
@@ -167,10 +211,10 @@ std::optional<Payload> VXReportingSession::createSummaryEventForSession() const 
   if (aggregatedPayloadData_.size() == 0) return std::nullopt;
   Grouping groups;
   // A payload that holds this key too appends to the service type: nothing prevents it.
-  groups.textFor(kSummaryEventKey) += std::to_string(serviceType());
+  groups.add(kSummaryEventKey, std::to_string(serviceType()));
   aggregatedPayloadData_.forEach([&](const Payload& payload) {
     groups.beginDictionary();
-    for (const auto& [key, value] : payload) value.appendText(groups.textFor(key));
+    for (const auto& [key, value] : payload) groups.add(key, value);
   });
   return groups.build();
 }

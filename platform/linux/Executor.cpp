@@ -1,7 +1,6 @@
 #include "platform/linux/Executor.h"
 
 #include <pthread.h>
-#include <signal.h>
 #include <sys/resource.h>
 #include <sys/syscall.h>
 #include <unistd.h>
@@ -15,6 +14,7 @@
 #include <vector>
 
 #include "platform/Mutex.h"
+#include "platform/linux/Threads.h"
 
 namespace vx::lnx {
 
@@ -377,11 +377,7 @@ void Lane::startThread() {
   pthread_attr_init(&attributes);
   pthread_attr_setstacksize(&attributes, kStackBytes);
   pthread_attr_setdetachstate(&attributes, PTHREAD_CREATE_DETACHED);
-  // Signals belong to the event loop's signalfd.
-  sigset_t all;
-  sigset_t before;
-  sigfillset(&all);
-  pthread_sigmask(SIG_SETMASK, &all, &before);
+  const SignalsBlocked blocked;
   auto* self = new std::shared_ptr<Lane>(shared_from_this());
   pthread_t thread{};
   const int failed = pthread_create(
@@ -393,7 +389,6 @@ void Lane::startThread() {
         return nullptr;
       },
       self);
-  pthread_sigmask(SIG_SETMASK, &before, nullptr);
   pthread_attr_destroy(&attributes);
   if (failed != 0) {
     delete self;

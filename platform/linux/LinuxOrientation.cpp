@@ -1,8 +1,6 @@
 #include "platform/linux/LinuxOrientation.h"
 
 #include <poll.h>
-#include <pthread.h>
-#include <signal.h>
 #include <sys/eventfd.h>
 #include <sys/inotify.h>
 #include <systemd/sd-bus.h>
@@ -16,12 +14,12 @@
 #include <filesystem>
 #include <map>
 #include <optional>
-#include <thread>
 #include <vector>
 
 #include "platform/Log.h"
 #include "platform/Mutex.h"
 #include "platform/linux/FileReading.h"
+#include "platform/linux/Threads.h"
 
 namespace vx::lnx {
 
@@ -382,15 +380,7 @@ void add(const std::shared_ptr<LinuxOrientation::State>& state,
     if (state->running) return state->wake();
     state->running = true;
   }
-  sigset_t all;
-  sigset_t before;
-  sigfillset(&all);
-  pthread_sigmask(SIG_SETMASK, &all, &before);  // signals belong to the event loop
-  std::thread([state] {
-    pthread_setname_np(pthread_self(), "vx-orientation");
-    Watcher(state).run();
-  }).detach();
-  pthread_sigmask(SIG_SETMASK, &before, nullptr);
+  startThread("vx-orientation", [state] { Watcher(state).run(); }).detach();
 }
 
 void remove(LinuxOrientation::State& state,

@@ -1,7 +1,5 @@
 #include "platform/linux/StoreWriter.h"
 
-#include <pthread.h>
-#include <signal.h>
 #include <sys/resource.h>
 #include <sys/syscall.h>
 #include <unistd.h>
@@ -13,6 +11,7 @@
 
 #include "platform/JsonWriter.h"
 #include "platform/Log.h"
+#include "platform/linux/Threads.h"
 
 namespace vx::lnx {
 
@@ -71,12 +70,7 @@ void StoreWriter::noteAtStart(std::string event, std::string detail) {
 }
 
 void StoreWriter::start() {
-  sigset_t all;
-  sigset_t before;
-  sigfillset(&all);
-  pthread_sigmask(SIG_SETMASK, &all, &before);  // signals belong to the event loop
-  thread_ = std::thread([this] { threadMain(); });
-  pthread_sigmask(SIG_SETMASK, &before, nullptr);
+  thread_ = startThread("vx-store", [this] { threadMain(); });
 }
 
 LocalStore::Counters StoreWriter::counters() const {
@@ -180,7 +174,6 @@ void StoreWriter::runJobs() {
 // The thread
 
 void StoreWriter::threadMain() {
-  pthread_setname_np(pthread_self(), "vx-store");
   setpriority(PRIO_PROCESS, static_cast<id_t>(syscall(SYS_gettid)), kWriterNiceness);
   runJobs();
   checkDatabase();

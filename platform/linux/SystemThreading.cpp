@@ -1,13 +1,11 @@
 #include "platform/linux/SystemThreading.h"
 
-#include <pthread.h>
-#include <signal.h>
-
 #include <ctime>
 #include <thread>
 #include <vector>
 
 #include "platform/Mutex.h"
+#include "platform/linux/Threads.h"
 
 namespace vx::lnx {
 
@@ -173,16 +171,7 @@ std::unique_ptr<RunLoop> SystemThreading::makeRunLoop() {
 }
 
 std::unique_ptr<Thread> SystemThreading::startThread(std::string_view name, Function<void()> body) {
-  // Signals belong to the event loop's signalfd.
-  sigset_t all;
-  sigset_t before;
-  sigfillset(&all);
-  pthread_sigmask(SIG_SETMASK, &all, &before);
-  std::thread([threadName = std::string(name.substr(0, 15)), body = std::move(body)] {
-    pthread_setname_np(pthread_self(), threadName.c_str());
-    body();
-  }).detach();
-  pthread_sigmask(SIG_SETMASK, &before, nullptr);
+  vx::lnx::startThread(name, std::move(body)).detach();
   return std::make_unique<SystemThread>();
 }
 

@@ -387,8 +387,9 @@ std::unique_ptr<AtomicFile> FakeServices::createAtomically(const std::string& di
   class File final : public AtomicFile {
    public:
     File(FakeServices& owner, std::string path) : owner_(owner), path_(std::move(path)) {}
-    std::optional<Error> write(std::string_view text) override {
+    std::optional<Error> take(std::string& text) override {
       content_ += text;
+      text.clear();
       return std::nullopt;
     }
     std::optional<Error> commit() override {

@@ -1,15 +1,18 @@
 #include <gmock/gmock.h>
+#include <sys/resource.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <cerrno>
 #include <climits>
+#include <csignal>
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
 #include <iterator>
 #include <map>
+#include <sstream>
 #include <string>
 
 #include "platform/linux/CounterChannels.h"
@@ -265,6 +268,40 @@ TEST_F(ServicesTest, DiagnosticFilesAppearWholeOrNotAtAll) {
   struct stat status {};
   ASSERT_EQ(stat(target.c_str(), &status), 0);
   EXPECT_EQ(status.st_mode & 07777, 0644u);
+}
+
+TEST_F(ServicesTest, LargeDiagnosticFilesAreWrittenBesides) {
+  LinuxDiagnosticFiles files(folder + "/log");
+  ASSERT_EQ(files.createDirectory(folder + "/log/Audio", 0777), std::nullopt);
+  std::optional<Error> error;
+  std::string expected;
+  const auto file = files.createAtomically(folder + "/log/Audio", "a.json", error);
+  const auto abandoned = files.createAtomically(folder + "/log/Audio", "b.json", error);
+  for (int i = 0; i < 500; ++i) {
+    std::string piece(17000, static_cast<char>('a' + i % 26));
+    expected += piece;
+    (void)abandoned->write(piece);
+    ASSERT_EQ(file->take(piece), std::nullopt);
+    ASSERT_TRUE(piece.empty());
+  }
+  ASSERT_EQ(file->commit(), std::nullopt);
+  std::stringstream text;
+  text << std::ifstream(folder + "/log/Audio/a.json").rdbuf();
+  EXPECT_TRUE(text.str() == expected);
+
+  // A disk that is full after two megabytes.
+  rlimit before{};
+  getrlimit(RLIMIT_FSIZE, &before);
+  const rlimit small{2 << 20, before.rlim_max};
+  signal(SIGXFSZ, SIG_IGN);
+  setrlimit(RLIMIT_FSIZE, &small);
+  const auto full = files.createAtomically(folder + "/log/Audio", "c.json", error);
+  for (int i = 0; i < 500 && !error; ++i) error = full->write(std::string(17000, 'x'));
+  if (!error) error = full->commit();
+  setrlimit(RLIMIT_FSIZE, &before);
+  ASSERT_TRUE(error);
+  EXPECT_EQ(error->code, EFBIG);
+  EXPECT_FALSE(std::filesystem::exists(folder + "/log/Audio/c.json"));
 }
 
 TEST_F(ServicesTest, DiagnosticPathsStayBelowTheLogs) {
