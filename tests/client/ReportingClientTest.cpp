@@ -113,48 +113,6 @@ TEST_F(ReportingClientTest, AHeldStartOutlivesManyLaterCalls) {
   EXPECT_TRUE(ended);
 }
 
-TEST_F(ReportingClientTest, BytesMayArriveOneAtATime) {
-  connect();
-  createThree();
-  for (const int number : {1, 2, 3}) {
-    for (const uint8_t byte : trueReply(number)) {
-      service.write({byte});
-      ASSERT_TRUE(client->process().ok());
-    }
-  }
-  EXPECT_THAT(outcomes, ElementsAre("ok", "ok", "ok"));
-}
-
-TEST_F(ReportingClientTest, AnAnswerLargerThanTheReadBufferArrivesWhole) {
-  connect();
-  std::vector<int64_t> ids;
-  client->getAllReportersAsync([&](const auto& result) { ids = result.value; });
-  constexpr int64_t kCount = 30000;  // at 5 bytes each
-  const Bytes reply = replyFrame(1, [](CborWriter& w) {
-    w.array(kCount);
-    for (int64_t i = 0; i < kCount; ++i) w.integer(100000 + i);
-  });
-  for (std::size_t at = 0; at < reply.size(); at += 10000) {
-    const std::size_t end = std::min(reply.size(), at + 10000);
-    service.write(Bytes(reply.begin() + static_cast<std::ptrdiff_t>(at),
-                        reply.begin() + static_cast<std::ptrdiff_t>(end)));
-    ASSERT_TRUE(client->process().ok());
-  }
-  ASSERT_EQ(ids.size(), static_cast<std::size_t>(kCount));
-  EXPECT_EQ(ids.back(), 100000 + kCount - 1);
-}
-
-TEST_F(ReportingClientTest, AnswersToNobodyAreCountedAndIgnored) {
-  connect();
-  createThree();
-  for (const int64_t number : {0L, 4L, 1L, 1L, -5L}) service.write(trueReply(number));
-  service.write(replyFrame(2, [](CborWriter& w) { w.string("of another kind"); }));
-  EXPECT_TRUE(client->process().ok());
-  EXPECT_THAT(outcomes, ElementsAre("ok", HasSubstr("another kind")));
-  EXPECT_EQ(client->unknownAnswers(), 4U);
-  EXPECT_EQ(client->pendingCalls(), 1U);
-}
-
 TEST_F(ReportingClientTest, ASwitchedOffServiceRefusesWithDomainAndCode) {
   connect();
   service.write(replyFrame(1, [](CborWriter& w) {
@@ -348,39 +306,6 @@ TEST_F(ReportingClientTest, ACallbackMayReadOn) {
   EXPECT_EQ(client->unknownAnswers(), 0U);
 }
 
-TEST_F(ReportingClientTest, ACallbackMayReconnect) {
-  TemporaryListener listener;
-  std::unique_ptr<FakeService> accepted;
-  auto acceptOne = [&] {
-    return std::thread([&] {
-      accepted = std::make_unique<FakeService>(listener.accept());
-      accepted->write(helloFrame());
-    });
-  };
-  client = std::make_unique<ReportingClient>();
-  std::thread first = acceptOne();
-  ASSERT_TRUE(client->connect(listener.path()).ok());
-  first.join();
-  client->createReportingSessionAsync(1, [&](const auto& result) {
-    EXPECT_EQ(result.status.code, Code::Disconnected);
-    std::thread second = acceptOne();
-    EXPECT_TRUE(client->reconnect().ok());
-    second.join();
-    create(10);
-  });
-  create(2);
-  client->flush();
-  accepted->close();
-  while (outcomes.empty()) client->process();
-  EXPECT_THAT(outcomes, ElementsAre(HasSubstr("the service")));
-  ASSERT_TRUE(client->isConnected());
-  client->flush();
-  ASSERT_EQ(accepted->read().size(), 2U);  // a hello and the call
-  accepted->write(trueReply(3));
-  client->process();
-  EXPECT_EQ(outcomes.back(), "ok");
-}
-
 TEST_F(ReportingClientTest, ConnectingSaysWhereAndWhatToDo) {
   ReportingClient lone;
   const ClientStatus missing = lone.connect("/nonexistent/service.socket");
@@ -391,16 +316,6 @@ TEST_F(ReportingClientTest, ConnectingSaysWhereAndWhatToDo) {
   setenv("VXREPORTING_SOCKET", "/nonexistent/named.socket", 1);
   EXPECT_THAT(lone.connect().text, HasSubstr("/nonexistent/named.socket"));
   unsetenv("VXREPORTING_SOCKET");
-}
-
-TEST_F(ReportingClientTest, AServiceThatAcceptsNobodyDoesNotHoldTheCaller) {
-  TemporaryListener listener;  // with room for one waiting connection
-  ReportingClient first;
-  EXPECT_EQ(first.connect(listener.path(), kShort).code, Code::TimedOut) << "no hello comes";
-  ReportingClient second;
-  const ClientStatus status = second.connect(listener.path(), kShort);
-  EXPECT_EQ(status.code, Code::NotConnected);
-  EXPECT_THAT(status.text, HasSubstr("takes no connections"));
 }
 
 }  // namespace

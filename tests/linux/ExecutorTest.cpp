@@ -60,15 +60,6 @@ TEST_F(ExecutorTest, InteractiveWorkRunsOnlyWhenDrainedAndInOrder) {
   EXPECT_TRUE(executor.prepareToSleep());
 }
 
-TEST_F(ExecutorTest, BudgetLeavesTheRestReady) {
-  const auto a = executor.makeSerial("a", QualityOfService::UserInteractive);
-  int ran = 0;
-  for (int i = 0; i < 200; ++i) a->async([&] { ++ran; });
-  EXPECT_TRUE(executor.runInteractive(100));
-  EXPECT_EQ(ran, 100);
-  EXPECT_FALSE(executor.runInteractive(100));
-}
-
 TEST_F(ExecutorTest, SleepingLoopIsWokenOncePerSleep) {
   std::atomic<int> wakes{0};
   executor.setInteractiveWaker([&] { ++wakes; });

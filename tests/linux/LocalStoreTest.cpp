@@ -12,26 +12,16 @@
 
 #include "platform/linux/LocalStore.h"
 #include "platform/linux/SystemThreading.h"
-#include "tests/fakes/FakePlatform.h"
+#include "tests/linux/FolderTest.h"
 
 namespace vx::lnx {
 namespace {
 
 using namespace std::chrono_literals;
 using Rows = std::vector<std::string>;
-using ::testing::ElementsAre;
-using ::testing::HasSubstr;
 
-class LocalStoreTest : public ::testing::Test {
+class LocalStoreTest : public FolderTest {
  protected:
-  LocalStoreTest() {
-    std::string pattern = "/tmp/vxstore-XXXXXX";
-    folder = mkdtemp(pattern.data());
-  }
-  ~LocalStoreTest() override {
-    store.reset();
-    std::filesystem::remove_all(folder);
-  }
   void open() {
     std::string problem;
     store = LocalStore::open({"", folder, "", ""}, options, clock, problem);
@@ -89,8 +79,6 @@ class LocalStoreTest : public ::testing::Test {
   }
   static Payload numbered(int i) { return PayloadBuilder().set("i", i).build(); }
 
-  fakes::FakePlatform p;  // for the log
-  std::string folder;
   SystemClock clock;
   PlatformConfiguration::Store options;
   std::unique_ptr<LocalStore> store;

@@ -78,13 +78,6 @@ TEST_F(ClientTest, MissingStartDateGivesMinusOneAsAnInteger) {
   EXPECT_THAT(p.services.events, IsEmpty());
 }
 
-TEST_F(ClientTest, NamelessClientSendsNoUptime) {
-  connect(555);
-  connections[0]->invalidation();
-  EXPECT_THAT(p.log.lines, Contains("vxrs default clientProcessName is nil. clientpid=555"));
-  EXPECT_THAT(p.services.events, IsEmpty());
-}
-
 TEST_F(ClientTest, LostConnectionStopsStartedSessionsAndKeepsTheirReplies) {
   auto& client = connect();
   started(client, 1);
@@ -208,17 +201,6 @@ TEST_F(ClientTest, KillEndsWithStatus2AndNoReply) {
   auto& client = connect();
   const auto gained = during([&] { client.killService(booleans("kill")); });
   EXPECT_THAT(gained, ElementsAre("log vxrs default DESTROYING SERVICE", "exit 2"));
-}
-
-TEST_F(ClientTest, ClientsOutliveTheServiceHarmlessly) {
-  auto& client = connect();
-  started(client, 1);
-  const auto kept = clients[0];
-  service.reset();
-  send(*kept, message(), kSetup, 1);
-  EXPECT_EQ(p.journal.back(), "reply send com.quorvel.audio.reporting 1");
-  kept->handleConnectionError();
-  p.queues.runAll();
 }
 
 }  // namespace

@@ -1,0 +1,171 @@
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <climits>
+#include <map>
+
+#include "platform/linux/CounterChannels.h"
+#include "platform/linux/SystemServices.h"
+#include "tests/linux/FolderTest.h"
+
+namespace vx::lnx {
+namespace {
+
+using ::testing::Pair;
+using Counters = std::multimap<std::string, int64_t>;
+using Name = std::optional<std::string>;
+
+class ChannelsTest : public FolderTest {
+ protected:
+  ChannelsTest() { drivers.root = folder + "/drivers"; }
+  PlatformConfiguration::Drivers drivers;
+};
+
+// One driver group, from the channels it has to their samples.
+class Group {
+ public:
+  Group(CounterChannels& channels, const Name& group, const Name& subGroup) : channels_(channels) {
+    const ChannelDictionaryRef set = channels.copyChannelsInGroup(group, subGroup, 0, error);
+    if (set == nullptr) return;
+    count = channels.channelCount(*set);
+    subscription_ = channels.createSubscription(set, subscribed_);
+  }
+  ChannelDictionaryRef sample() {
+    return channels_.createSamples(subscription_, subscribed_, error);
+  }
+  Counters values(const ChannelDictionaryRef& samples) {
+    Counters found;
+    if (samples == nullptr) return found;
+    channels_.iterateSamples(*samples, [&](const ChannelSample& sample) {
+      found.emplace(*channels_.channelName(sample), channels_.simpleIntegerValue(sample, 0));
+      return 0;
+    });
+    return found;
+  }
+  std::optional<Error> error;
+  int count = -1;  // no channel set
+
+ private:
+  CounterChannels& channels_;
+  ChannelSubscription* subscription_ = nullptr;
+  ChannelDictionaryRef subscribed_;
+};
+
+TEST_F(ChannelsTest, CountersAreReadStrictly) {
+  auto parsed = [](std::string_view text) {
+    int64_t value = 0;
+    const int code = parseCounter(text, value);
+    return code != 0 ? std::to_string(code) : "=" + std::to_string(value);
+  };
+  EXPECT_EQ(parsed("17\n"), "=17");
+  EXPECT_EQ(parsed("-3"), "=-3");
+  EXPECT_EQ(parsed("0x1F"), "=31");
+  EXPECT_EQ(parsed("9223372036854775807"), "=9223372036854775807");
+  EXPECT_EQ(parsed("9223372036854775808"), std::to_string(ERANGE));
+  for (const char* bad : {"", "\n", "x", "1 2", "1\n\n", "0x", "0x-1", "+-1", "1.5"}) {
+    EXPECT_EQ(parsed(bad), std::to_string(EINVAL)) << bad;
+  }
+}
+
+TEST_F(ChannelsTest, CountersMoveVanishAndWrap) {
+  write("drivers/Speaker/kept", "0x10\n");
+  write("drivers/Speaker/gone", "1");
+  write("drivers/Speaker/wraps", std::to_string(INT64_MAX));
+  write("drivers/Speaker/L/kept", "5");
+  CounterChannels channels(drivers);
+  Group group(channels, "Speaker", std::nullopt);
+  EXPECT_EQ(group.count, 4);
+  const auto before = group.sample();
+  write("drivers/Speaker/kept", "12");
+  write("drivers/Speaker/wraps", std::to_string(INT64_MIN));
+  write("drivers/Speaker/L/kept", "8");
+  std::filesystem::remove(folder + "/drivers/Speaker/gone");
+  const auto after = group.sample();
+  EXPECT_THAT(group.values(channels.createSamplesDelta(before, after, group.error)),
+              testing::UnorderedElementsAre(Pair("kept", -4), Pair("kept", 3), Pair("wraps", 1)));
+  EXPECT_FALSE(group.error);
+  EXPECT_EQ(channels.createSamplesDelta(nullptr, after, group.error), nullptr);
+  EXPECT_TRUE(group.error);
+  write("drivers/Speaker/kept", "99999999999999999999");
+  group.error.reset();
+  EXPECT_EQ(group.sample(), nullptr);
+  ASSERT_TRUE(group.error);
+  EXPECT_EQ(group.error->code, ERANGE);
+  std::optional<Error> error;
+  EXPECT_EQ(channels.createSamples(nullptr, before, error), nullptr);
+  EXPECT_TRUE(error);
+}
+
+TEST_F(ChannelsTest, ChannelsComeFromRegularFilesOfTheGroupAlone) {
+  CounterChannels channels(drivers);
+  EXPECT_EQ(Group(channels, std::nullopt, "MCA").count, -1);  // not even a root
+  write("drivers/README", "text");
+  write("drivers/A/MCA/x", "1");
+  write("drivers/B/MCA/x", "2");
+  write("drivers/B/Other/y", "3");
+  write("drivers/B/.hidden", "4");
+  ASSERT_EQ(mkfifo((folder + "/drivers/A/MCA/fifo").c_str(), 0666), 0);
+  std::filesystem::create_directories(folder + "/drivers/Empty");
+  Group mca(channels, std::nullopt, "MCA");
+  EXPECT_THAT(mca.values(mca.sample()), ElementsAre(Pair("x", 1), Pair("x", 2)));
+  EXPECT_EQ(Group(channels, "B", std::nullopt).count, 2);
+  EXPECT_EQ(Group(channels, "Empty", std::nullopt).count, 0);
+  EXPECT_EQ(Group(channels, std::nullopt, std::nullopt).count, 3);
+  const Group missing(channels, "Missing", std::nullopt);
+  EXPECT_EQ(missing.count, -1);
+  EXPECT_FALSE(missing.error);
+  std::filesystem::create_symlink(folder + "/drivers/Loop", folder + "/drivers/Loop");
+  const Group loop(channels, "Loop", std::nullopt);
+  ASSERT_TRUE(loop.error);
+  EXPECT_EQ(loop.error->code, ELOOP);
+}
+
+TEST_F(ChannelsTest, ChannelsAreBounded) {
+  for (std::size_t i = 0; i < CounterChannels::kMaxChannels; ++i)
+    write("drivers/G/" + std::to_string(i), "1");
+  CounterChannels channels(drivers);
+  EXPECT_EQ(Group(channels, "G", std::nullopt).count, 4096);
+  EXPECT_THAT(p.log.lines, IsEmpty());
+  for (const char* name : {"more", "and more"}) write(std::string("drivers/G/") + name, "1");
+  EXPECT_EQ(Group(channels, "G", std::nullopt).count, 4096);
+  EXPECT_THAT(p.log.lines, ElementsAre(HasSubstr("more than 4096 channels")));
+}
+
+// A stream that is opened and closed while a session runs, and a real folder of kernel counters.
+TEST_F(ChannelsTest, MappedSourcesFollowTheKernel) {
+  const std::string status = "asound/card0/pcm0p/sub0/status";
+  write(status, "closed\n");
+  drivers.mapped = {
+      {"Alsa", "", MappedChannelSource::Kind::AlsaProc, folder + "/asound"},
+      {"Codec", "MCA", MappedChannelSource::Kind::Statistics, "/sys/class/net/lo/statistics"}};
+  CounterChannels channels(drivers);
+  Group alsa(channels, "Alsa", std::nullopt);
+  EXPECT_EQ(alsa.count, 5);
+  const auto closed = alsa.sample();
+  EXPECT_THAT(alsa.values(closed), IsEmpty());
+  write(status, "state: RUNNING\ndelay       : -5\nhw_ptr      : 4096\n");
+  const auto open = alsa.sample();
+  EXPECT_THAT(alsa.values(open), ElementsAre(Pair("card0_pcm0p_sub0_delay", -5),
+                                             Pair("card0_pcm0p_sub0_hw_ptr", 4096)));
+  EXPECT_THAT(alsa.values(channels.createSamplesDelta(closed, open, alsa.error)), IsEmpty());
+  EXPECT_FALSE(alsa.error);
+  Group codec(channels, std::nullopt, "MCA");
+  EXPECT_EQ(codec.values(codec.sample()).count("rx_packets"), 1u);
+}
+
+TEST(ProcessNames, OfOwnLiveAndGoneProcesses) {
+  ProcProcessInfo processes;
+  EXPECT_EQ(processes.shortCommandName(getpid()), processes.ownProcessName());
+  EXPECT_EQ(processes.ownProcessName(), "linux_test");
+  EXPECT_EQ(processes.shortCommandName(0), std::nullopt);
+  EXPECT_EQ(processes.shortCommandName(-1), std::nullopt);
+  const pid_t child = fork();
+  if (child == 0) _exit(0);
+  waitpid(child, nullptr, 0);
+  EXPECT_EQ(processes.shortCommandName(child), std::nullopt);
+}
+
+}  // namespace
+}  // namespace vx::lnx
