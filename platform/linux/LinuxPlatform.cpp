@@ -122,7 +122,7 @@ class RunningPlatform final : public LinuxPlatform {
   Platform& services() override { return *services_; }
 
   void begin() override {
-    watcher_->start();
+    watcher_->start(PreferencesWatcher::openInotify());
     store_->start();
     connect();
   }

@@ -40,8 +40,10 @@ PreferencesWatcher::PreferencesWatcher(std::string preferencesFolder, std::strin
   }
 }
 
-void PreferencesWatcher::start() {
-  fd_ = inotify_init1(IN_NONBLOCK | IN_CLOEXEC);
+int PreferencesWatcher::openInotify() { return inotify_init1(IN_NONBLOCK | IN_CLOEXEC); }
+
+void PreferencesWatcher::start(int inotifyFd) {
+  fd_ = inotifyFd;
   if (fd_ < 0) return startPolling(std::strerror(errno));
   mkdir(postFolder_.c_str(), 0755);
   postWatch_ = inotify_add_watch(fd_, postFolder_.c_str(), kPostEvents);

@@ -37,8 +37,10 @@ class PreferencesWatcher final : public SystemNotify {
   PreferencesWatcher(const PreferencesWatcher&) = delete;
   PreferencesWatcher& operator=(const PreferencesWatcher&) = delete;
 
-  // Begins to watch. Logs, so the platform must be installed.
-  void start();
+  // Begins to watch with a fresh inotify descriptor, which it takes; without one (-1, errno says
+  // why) it polls. Logs, so the platform must be installed.
+  void start(int inotifyFd);
+  static int openInotify();
 
   uint32_t registerHandler(std::string_view name, int& token, std::shared_ptr<WorkQueue> queue,
                            Function<void(int token)> handler) override;

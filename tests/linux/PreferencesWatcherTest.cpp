@@ -1,4 +1,4 @@
-#include <sys/resource.h>
+#include <cerrno>
 
 #include "platform/linux/PreferencesWatcher.h"
 #include "tests/linux/FolderTest.h"
@@ -14,7 +14,7 @@ TEST_F(PreferencesWatcherTest, SettlesBeforeItFires) {
   PlatformConfiguration::Preferences options;
   PreferencesWatcher watcher(folder + "/preferences", folder + "/notify", {{"name", "d.toml"}},
                              options, clock);
-  watcher.start();
+  watcher.start(PreferencesWatcher::openInotify());
   int fired = 0;
   int token = 0;
   EXPECT_EQ(
@@ -67,13 +67,10 @@ TEST_F(PreferencesWatcherTest, PollsWhereInotifyCannotBeHad) {
   PlatformConfiguration::Preferences options;
   PreferencesWatcher watcher(folder + "/preferences", folder + "/notify", {{"name", "d.toml"}},
                              options, clock);
-  rlimit before{};
-  getrlimit(RLIMIT_NOFILE, &before);
-  const rlimit none{0, before.rlim_max};
-  setrlimit(RLIMIT_NOFILE, &none);
-  watcher.start();
-  setrlimit(RLIMIT_NOFILE, &before);
-  EXPECT_THAT(p.log.lines, ElementsAre(HasSubstr("looking every 3000 ms instead")));
+  errno = EMFILE;
+  watcher.start(-1);
+  EXPECT_THAT(p.log.lines,
+              ElementsAre(HasSubstr("(Too many open files); looking every 3000 ms instead")));
   EXPECT_EQ(watcher.fd(), -1);
   int fired = 0;
   int token = 0;
