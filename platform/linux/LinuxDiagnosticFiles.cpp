@@ -1,5 +1,6 @@
 #include "platform/linux/LinuxDiagnosticFiles.h"
 
+#include <dirent.h>
 #include <fcntl.h>
 #include <sys/random.h>
 #include <sys/stat.h>
@@ -25,6 +26,11 @@ namespace {
 
 constexpr mode_t kFileMode = 0644;
 
+constexpr std::string_view kTemporaryPrefix = ".vx";
+constexpr std::string_view kTemporarySuffix = ".tmp";
+constexpr std::size_t kTemporaryLength = 3 + 1 + 16 + 4;
+
+// "." and 16 hexadecimal digits, and kTemporarySuffix.
 std::string randomSuffix() {
   uint64_t bits = 0;
   if (getrandom(&bits, sizeof bits, 0) != sizeof bits) bits = static_cast<uint64_t>(getpid());
@@ -318,8 +324,31 @@ int LinuxDiagnosticFiles::openDirectory(const std::string& path, const unsigned*
 std::optional<Error> LinuxDiagnosticFiles::createDirectory(const std::string& path, unsigned mode) {
   std::optional<Error> error;
   const int fd = openDirectory(path, &mode, error);
-  if (fd >= 0) close(fd);
+  if (fd >= 0) {
+    removeLeftovers(fd, path);
+    close(fd);
+  }
   return error;
+}
+
+// Before this process has written anything there, so every temporary file is of one that ended.
+void LinuxDiagnosticFiles::removeLeftovers(int directoryFd, const std::string& path) {
+  constexpr int kMostEntries = 10000;  // anybody may have filled the folder
+  {
+    MutexLock lock(mutex_);
+    if (!tidied_.insert(path).second) return;
+  }
+  DIR* const directory = fdopendir(fcntl(directoryFd, F_DUPFD_CLOEXEC, 0));
+  if (directory == nullptr) return;
+  for (int i = 0; i < kMostEntries; ++i) {
+    const dirent* const entry = readdir(directory);
+    if (entry == nullptr) break;
+    const std::string_view name = entry->d_name;
+    if (name.size() == kTemporaryLength && name.starts_with(kTemporaryPrefix) &&
+        name.ends_with(kTemporarySuffix))
+      unlinkat(directoryFd, entry->d_name, 0);
+  }
+  closedir(directory);
 }
 
 std::unique_ptr<AtomicFile> LinuxDiagnosticFiles::createAtomically(const std::string& directory,
@@ -332,7 +361,7 @@ std::unique_ptr<AtomicFile> LinuxDiagnosticFiles::createAtomically(const std::st
   }
   const int directoryFd = openDirectory(directory, nullptr, error);
   if (directoryFd < 0) return nullptr;
-  const std::string temporary = ".vx" + randomSuffix();
+  const std::string temporary = std::string(kTemporaryPrefix) + randomSuffix();
   const int fd = openat(directoryFd, temporary.c_str(),
                         O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC | O_NOFOLLOW, 0600);
   if (fd < 0) {

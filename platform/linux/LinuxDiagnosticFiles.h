@@ -1,16 +1,19 @@
 // The diagnostic-logs directory on disk.
 #pragma once
 
+#include <set>
 #include <string>
 
 #include "platform/DiagnosticFiles.h"
+#include "platform/Mutex.h"
 
 namespace vx::lnx {
 
 // Everything below the logs directory is hostile ground: folders of mode 0777, in which anybody may
 // plant links, FIFOs or folders. Each component is opened by itself without following links, files
 // are made under a fresh random name (O_EXCL) and renamed over whatever stands there, so nothing
-// planted is ever opened, written or truncated. Stateless.
+// planted is ever opened, written or truncated. What a crash left half-written goes the first time
+// a folder is asked for. Thread-safe.
 class LinuxDiagnosticFiles final : public DiagnosticFiles {
  public:
   explicit LinuxDiagnosticFiles(std::string logsDirectory)
@@ -26,7 +29,11 @@ class LinuxDiagnosticFiles final : public DiagnosticFiles {
   // given.
   int openDirectory(const std::string& path, const unsigned* mode,
                     std::optional<Error>& error) const;
+  void removeLeftovers(int directoryFd, const std::string& path);
+
   const std::string logsDirectory_;
+  Mutex mutex_;
+  std::set<std::string> tidied_ GUARDED_BY(mutex_);  // the few folders the service writes to
 };
 
 }  // namespace vx::lnx

@@ -52,6 +52,7 @@ TEST_F(DiagnosticFilesTest, DiagnosticFilesAppearWholeOrNotAtAll) {
   LinuxDiagnosticFiles files(folder + "/log");
   const std::string directory = folder + "/log/Audio";
   const std::string target = directory + "/a.json";
+  write("log/Audio/.vx.0123456789abcdef.tmp", "of a process that crashed");
   ASSERT_EQ(files.createDirectory(directory + "/", 0777), std::nullopt);
   auto names = [&] { return std::distance(std::filesystem::directory_iterator(directory), {}); };
   std::optional<Error> error;
