@@ -45,7 +45,8 @@ std::string_view VXReportingMessageTypeName(MessageType type);
 // A category and type by their names: pairs with the same names are the same kind. There are few of
 // them, so a kind is a small number, and its text is made only when somebody reads it.
 using MessageKind = uint16_t;
-inline constexpr std::size_t kMessageKinds = 7 * 12 * 8;  // prefixes, kind names and type names
+inline constexpr std::size_t kMessageKinds =
+    std::size_t{7} * 12 * 8;  // prefixes, kind names and type names
 MessageKind messageKind(MessageCategory category, MessageType type);
 // "<category name><separator><type name>".
 std::string messageKindName(MessageKind kind, char separator);

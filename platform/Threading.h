@@ -58,6 +58,9 @@ class Threading {
   virtual std::unique_ptr<RunLoop> makeRunLoop() = 0;
   virtual std::unique_ptr<Thread> startThread(std::string_view name, Function<void()> body) = 0;
   virtual void sleepFor(std::chrono::nanoseconds duration) = 0;
+  // Says that the caller has just let go of memory by the megabyte, in small pieces: the platform
+  // may want to give it back to the system, which takes its time.
+  virtual void memoryWasFreed() = 0;
 };
 
 }  // namespace vx

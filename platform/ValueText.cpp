@@ -81,7 +81,9 @@ char* writeShortDecimal(char* out, double value) {
   const double magnitude = std::abs(value);
   if (!(magnitude >= 1e-3 && magnitude < 1e9)) return nullptr;
   const int64_t unit = magnitude < 1e3 ? 1000000000000 : magnitude < 1e6 ? 1000000000 : 1000000;
-  const auto scaled = static_cast<int64_t>(magnitude * static_cast<double>(unit) + 0.5);
+  const double product = magnitude * static_cast<double>(unit);
+  auto scaled = static_cast<int64_t>(product);
+  if (product - static_cast<double>(scaled) >= 0.5) ++scaled;
   if (static_cast<double>(scaled) / static_cast<double>(unit) != magnitude) return nullptr;
   if (value < 0) *out++ = '-';
   out = writeInteger(out, scaled / unit);

@@ -13,6 +13,8 @@ constexpr uint32_t kTraceStarted = 0x2104282C;
 constexpr uint32_t kTraceStopped = 0x21042830;
 constexpr uint32_t kTraceGone = 0x21042834;
 constexpr uint32_t kTraceMessage = 0x21042838;
+constexpr std::size_t kManyMessages = 4096;  // a megabyte or so
+constexpr std::chrono::seconds kUntilStored{2};
 
 Mutex scopeMutex;
 bool scopeRegistered GUARDED_BY(scopeMutex) = false;
@@ -127,13 +129,17 @@ void VXReportingSession::stop() {
   }
   writeSummaryJson();
   vyrReportingQueue_->async([self = shared_from_this()] { self->flushRelay(); });
+  const bool many = aggregatedPayloadData_.size() >= kManyMessages;
   auto flat = aggregatedPayloadData_.removeAll();
   auto nested = nestedAggregatedPayloadData_.removeAll();
   // Letting go of millions of messages takes its time: not on the queue that serves everybody.
   vyrReportingQueue_->async([flat = std::move(flat), nested = std::move(nested)]() mutable {
-    flat.clear();
-    nested.clear();
+    flat = {};
+    nested = {};
   });
+  // The platform lets go of the last of them a moment later, when they are where they belong.
+  if (many)
+    vyrReportingQueue_->asyncAfter(kUntilStored, [] { platform().threading.memoryWasFreed(); });
   started_ = false;
 }
 

@@ -34,6 +34,7 @@ class LongText {
   void wrote(char* end) { at_ = end; }
   std::vector<std::string_view> pieces() const {
     std::vector<std::string_view> all;
+    all.reserve(pieces_.size());
     for (const Piece& piece : pieces_) all.emplace_back(piece.text.get(), piece.size);
     if (!all.empty())
       all.back() = {all.back().data(), static_cast<std::size_t>(at_ - all.back().data())};

@@ -23,7 +23,8 @@ constexpr std::size_t kCommitsPerRetentionCheck = 64;
 constexpr std::chrono::minutes kAgeCheckInterval{10};
 constexpr int64_t kRowsPerRemoval = 500;
 constexpr int kRemovalsPerCheck = 64;
-constexpr std::size_t kKeptRecords = 4096;  // capacity that an idle queue keeps
+constexpr std::size_t kKeptRecords = 1024;    // capacity that an idle queue keeps
+constexpr std::size_t kKeptText = 256 << 10;  // a session's summary may be megabytes
 constexpr int kWriterNiceness = 15;
 
 constexpr double kHoldSeconds = 0.05;  // how far the relay may be behind analytics
@@ -255,6 +256,7 @@ void StoreWriter::writeBatch() {
     }
   }
   batch_.clear();
+  if (json_.capacity() > kKeptText) std::string().swap(json_);
   if (++commitsSinceRetention_ >= kCommitsPerRetentionCheck) applyRetention();
 }
 
@@ -299,8 +301,8 @@ void StoreWriter::holdUnpairedEvents() {
         record.sharing != StoreRecord::Sharing::No || record.time < young)
       continue;
     record.sharing = StoreRecord::Sharing::Held;  // once
-    heldEvents_.push_back(std::move(record));
-    record.what = FlushRecord{};  // nothing, for nobody
+    // Nothing, for nobody, stays in its place.
+    heldEvents_.push_back(std::exchange(record, StoreRecord{record.time, FlushRecord{}}));
   }
   if (!heldEvents_.empty()) heldSince_ = clock_.monotonic();
 }

@@ -54,15 +54,20 @@ struct FlushRecord {
 };
 
 struct StoreRecord {
-  double time = 0;  // seconds since 1970
-  std::variant<RelayOpenRecord, RelayMessageRecord, AnalyticsRecord, PowerRecord, FlushRecord> what;
-
+  using What =
+      std::variant<RelayOpenRecord, RelayMessageRecord, AnalyticsRecord, PowerRecord, FlushRecord>;
   // An event whose message is in the same batch as a relay message is written right behind that
   // one, and shares its text. A relay message names the first such event, each event the next one.
+  enum class Sharing : uint8_t { No, Held, Shares, Written };
   static constexpr uint32_t kNone = UINT32_MAX;
+
+  StoreRecord(double when, What whatever) : time(when), what(std::move(whatever)) {}
+  double time;  // seconds since 1970
   uint32_t nextSharer = kNone;
-  enum class Sharing : uint8_t { No, Held, Shares, Written } sharing = Sharing::No;
+  Sharing sharing = Sharing::No;
+  What what;
 };
+static_assert(sizeof(StoreRecord) <= 128, "a record a message: two cache lines");
 
 // Owned by the local store. append() and the questions are thread-safe; everything else belongs to
 // the writer's thread. What is not yet committed is bounded by queueBytes, by way of the listener:
@@ -157,7 +162,6 @@ class StoreWriter {
   const PlatformConfiguration::Store options_;
   Clock& clock_;
   Function<void()> drained_;
-  std::atomic<bool> congested_{false};
   std::atomic<uint64_t> rowsCommitted_{0};
   std::atomic<uint64_t> commits_{0};
   std::atomic<uint64_t> writeFailures_{0};
@@ -176,6 +180,7 @@ class StoreWriter {
   Sleep sleep_ GUARDED_BY(mutex_) = Sleep::Awake;
   bool closing_ GUARDED_BY(mutex_) = false;
   bool finished_ GUARDED_BY(mutex_) = false;
+  std::atomic<bool> congested_{false};
   Monotonic closeDeadline_ GUARDED_BY(mutex_);
 
   // The writer's thread.
@@ -185,13 +190,13 @@ class StoreWriter {
   std::size_t batchBytes_ = 0;
   std::vector<StoreRecord> heldEvents_;  // join the next batch
   Monotonic heldSince_{};
-  bool mayHold_ = false;                // nobody waits for the end of this batch
   std::vector<uint32_t> messageSlots_;  // open addressing: index in batch_ by a payload's identity
   std::unordered_map<std::string_view, int64_t> nameRows_;  // as many as there are event names
   uint64_t rowsInTransaction_ = 0;
   std::vector<LedgerNote> notes_;
   std::string json_;
   bool failing_ = false;
+  bool mayHold_ = false;  // nobody waits for the end of this batch
   std::chrono::milliseconds backoff_{0};
   std::size_t commitsSinceRetention_ = 0;
   Monotonic lastAgeCheck_{};

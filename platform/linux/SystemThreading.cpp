@@ -1,5 +1,7 @@
 #include "platform/linux/SystemThreading.h"
 
+#include <malloc.h>
+
 #include <ctime>
 #include <thread>
 #include <vector>
@@ -174,6 +176,9 @@ std::unique_ptr<Thread> SystemThreading::startThread(std::string_view name, Func
   vx::lnx::startThread(name, std::move(body)).detach();
   return std::make_unique<SystemThread>();
 }
+
+// The allocator gives back only what lies at the end of its heap by itself.
+void SystemThreading::memoryWasFreed() { malloc_trim(0); }
 
 void SystemThreading::sleepFor(std::chrono::nanoseconds duration) {
   std::this_thread::sleep_for(duration);

@@ -28,6 +28,7 @@ class SystemThreading final : public Threading {
   std::unique_ptr<RunLoop> makeRunLoop() override;
   std::unique_ptr<Thread> startThread(std::string_view name, Function<void()> body) override;
   void sleepFor(std::chrono::nanoseconds duration) override;
+  void memoryWasFreed() override;
 };
 
 }  // namespace vx::lnx
