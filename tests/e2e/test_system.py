@@ -311,6 +311,8 @@ class SensorFaultsTest(DaemonTest):
     def test_nothing_to_watch_is_said_once(self):
         for i in range(3):
             self.c.started(i + 1, 7)
+            self.d.wait_until(lambda: "device orientation is off for now" in self.d.log(), "the bus is looked for")
+            time.sleep(0.1)  # the watcher of a later session looks in its own time
             self.c.call(STOP, i + 1)
         self.assertEqual(self.d.log().count("device orientation is off for now"), 1)
 
