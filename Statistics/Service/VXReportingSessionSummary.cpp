@@ -3,6 +3,7 @@
 #include <algorithm>
 #include <deque>
 #include <memory>
+#include <stdexcept>
 #include <string_view>
 #include <unordered_map>
 #include <vector>
@@ -217,7 +218,13 @@ std::optional<Payload> VXReportingSession::createSummaryEventForSession() const 
     groups.beginDictionary();
     for (const auto& [key, value] : payload) groups.add(key, value);
   });
-  return groups.build();
+  try {
+    return groups.build();
+  } catch (const std::length_error& tooLarge) {
+    VX_LOG(sessionLogScope(), Error, "no summary event for reporter %lli: %s",
+           static_cast<long long>(reporterID_), tooLarge.what());
+    return std::nullopt;
+  }
 }
 
 void VXReportingSession::writeSummaryJson() {

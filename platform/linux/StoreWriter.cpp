@@ -25,6 +25,9 @@ constexpr int64_t kRowsPerRemoval = 500;
 constexpr int kRemovalsPerCheck = 64;
 constexpr std::size_t kKeptRecords = 1024;    // capacity that an idle queue keeps
 constexpr std::size_t kKeptText = 256 << 10;  // a session's summary may be megabytes
+// Of one payload, below what SQLite can hold. One that is larger could never be written, and
+// nothing behind it either.
+constexpr uint64_t kMostText = 512u << 20;
 constexpr int kWriterNiceness = 15;
 
 constexpr double kHoldSeconds = 0.05;  // how far the relay may be behind analytics
@@ -57,7 +60,11 @@ std::string textUnder(const Payload& payload, std::string_view key) {
 
 StoreWriter::StoreWriter(std::string path, Database database,
                          const PlatformConfiguration::Store& options, Clock& clock)
-    : path_(std::move(path)), options_(options), clock_(clock), database_(std::move(database)) {}
+    : path_(std::move(path)),
+      options_(options),
+      mostText_(static_cast<std::size_t>(std::min<uint64_t>(options.maxBytes / 4, kMostText))),
+      clock_(clock),
+      database_(std::move(database)) {}
 
 StoreWriter::~StoreWriter() {
   if (thread_.joinable()) {
@@ -310,6 +317,7 @@ void StoreWriter::holdUnpairedEvents() {
 int StoreWriter::writeTransaction(std::size_t first, std::size_t last) {
   if (database_ == nullptr) return SQLITE_CANTOPEN;
   rowsInTransaction_ = 0;
+  const std::size_t notesBefore = notes_.size();
   int code = execute(database_.get(), "BEGIN IMMEDIATE");
   for (std::size_t i = first; code == SQLITE_OK && i < last; ++i) code = writeRecord(batch_[i]);
   for (std::size_t i = 0; code == SQLITE_OK && i < notes_.size(); ++i)
@@ -317,9 +325,21 @@ int StoreWriter::writeTransaction(std::size_t first, std::size_t last) {
   if (code == SQLITE_OK) code = execute(database_.get(), "COMMIT");
   if (code != SQLITE_OK) {
     nameRows_.clear();  // the names that were added are not there
+    notes_.resize(std::min(notes_.size(), notesBefore));
     if (sqlite3_get_autocommit(database_.get()) == 0) execute(database_.get(), "ROLLBACK");
   }
   return code;
+}
+
+const std::string& StoreWriter::storable(const char* table) {
+  if (json_.size() <= mostText_) return json_;
+  const std::string bytes = std::to_string(json_.size());
+  VX_LOG(nullptr, Error,
+         "a payload of %s bytes is left out of %s; a row may hold %zu, a quarter of max_bytes",
+         bytes.c_str(), table, mostText_);
+  note({"left_out", table, 1, "a payload of " + bytes + " bytes"});
+  json_ = "{\"left_out_bytes\":" + bytes + "}";
+  return json_;
 }
 
 int StoreWriter::writeRelayMessage(const StoreRecord& record, const RelayMessageRecord& message) {
@@ -329,7 +349,7 @@ int StoreWriter::writeRelayMessage(const StoreRecord& record, const RelayMessage
                  .bind(message.row->id)
                  .bind(int64_t{message.category})
                  .bind(int64_t{message.type})
-                 .bind(json_)
+                 .bind(storable("relay_messages"))
                  .run();
   if (record.nextSharer == StoreRecord::kNone) return code;
   const int64_t row = sqlite3_last_insert_rowid(database_.get());
@@ -363,7 +383,7 @@ int StoreWriter::writeEvent(double time, const AnalyticsRecord& event, int64_t m
     statements_.analytics.bind(messageRow);
   else
     statements_.analytics.bindNull();
-  return statements_.analytics.bind(json_).run();
+  return statements_.analytics.bind(storable("analytics_events")).run();
 }
 
 int StoreWriter::nameRow(std::string_view name, int64_t& row) {
@@ -404,7 +424,7 @@ int StoreWriter::writeRecord(const StoreRecord& record) {
     return statements_.power.bind(record.time)
         .bind(power->clientIdentifier)
         .bind(power->name)
-        .bind(json_)
+        .bind(storable("power_records"))
         .run();
   }
   return SQLITE_INTERNAL;  // there is no other kind
@@ -440,7 +460,7 @@ int StoreWriter::writeRelaySession(double time, const RelayOpenRecord& record) {
     else
       insert.bindNull();
   }
-  const int code = insert.bind(json_).run();
+  const int code = insert.bind(storable("relay_sessions")).run();
   if (code == SQLITE_OK) record.row->id = sqlite3_last_insert_rowid(database_.get());
   return code;
 }

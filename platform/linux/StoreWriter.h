@@ -138,6 +138,8 @@ class StoreWriter {
   int writeTransaction(std::size_t first, std::size_t last);
   int writeRecord(const StoreRecord& record);
   int writeRelayMessage(const StoreRecord& record, const RelayMessageRecord& message);
+  // json_ as it may be stored in a table: a text larger than mostText_ is left out and noted.
+  const std::string& storable(const char* table);
   // Behind `message` in row `messageRow`, whose text it shares; or by itself, when there is none.
   int writeEvent(double time, const AnalyticsRecord& event, int64_t messageRow,
                  const Payload* message);
@@ -160,6 +162,7 @@ class StoreWriter {
 
   const std::string path_;
   const PlatformConfiguration::Store options_;
+  const std::size_t mostText_;  // of one payload
   Clock& clock_;
   Function<void()> drained_;
   std::atomic<uint64_t> rowsCommitted_{0};

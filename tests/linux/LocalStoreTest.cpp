@@ -263,6 +263,25 @@ TEST_F(LocalStoreTest, OldestRowsGoFirstAndTheLedgerSaysSo) {
             std::to_string(40000 - kept));
 }
 
+TEST_F(LocalStoreTest, PayloadTooLargeForTheStoreHoldsUpNothing) {
+  options.maxBytes = 1 << 20;  // of which one payload may have a quarter
+  open();
+  const auto relay = session(1);
+  std::optional<Error> error;
+  const Payload large = PayloadBuilder().set("f", std::string(300000, 'x')).build();
+  for (const Payload& message : {numbered(1), large, numbered(2)}) {
+    relay->sendMessageWithCategory(1, 1, message, error);
+    event("e", tagged(message), message);
+  }
+  EXPECT_TRUE(close());
+  EXPECT_THAT(query("SELECT payload FROM relay_messages"),
+              ElementsAre("{\"i\":1}", "{\"left_out_bytes\":300008}", "{\"i\":2}"));
+  EXPECT_THAT(query("SELECT json_extract(payload, '$.app') FROM analytics_events"),
+              ElementsAre("x\"y", "x\"y", "x\"y"));
+  EXPECT_THAT(query("SELECT event, table_name, rows FROM store_ledger"),
+              ElementsAre("left_out|relay_messages|1"));
+}
+
 TEST_F(LocalStoreTest, EventsGoWithTheMessagesWhoseTextTheyShare) {
   options.maxBytes = 1 << 20;
   open();
