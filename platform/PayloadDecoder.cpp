@@ -323,7 +323,7 @@ std::optional<Frame> Frame::decode(std::span<const uint8_t> bytes, DecodeError* 
 Payload Frame::payload(std::size_t i) const {
   const Element& element = elements_[i];
   const auto size = static_cast<std::size_t>(element.end - element.begin);
-  if (size <= 1) return Payload();  // the empty dictionary
+  if (cbor::head(element.begin).argument == 0) return Payload();  // however long its head
   Payload::Block* block = Payload::Block::allocate(size, {element.spaceInKeys, element.nonFinite});
   std::memcpy(block->bytes(), element.begin, size);
   return Payload(block);
