@@ -3,6 +3,7 @@
 #include <fcntl.h>
 #include <malloc.h>
 #include <signal.h>
+#include <sys/mman.h>
 #include <sys/resource.h>
 #include <sys/signalfd.h>
 #include <systemd/sd-daemon.h>
@@ -65,6 +66,30 @@ PlatformConfiguration::Orientation withDefaults(PlatformConfiguration::Orientati
   }
   return orientation;
 }
+
+// Messages that sessions keep make the heap grow, and each of its pages is missing when it is first
+// touched: one message in sixteen would wait for the kernel to find one. So the heap grows in
+// steps, and a step's pages are asked for at once, between two passes of the event loop. Confined
+// to the loop's thread, whose allocations the heap is.
+class HeapPages {
+ public:
+  static constexpr int kStep = 512 << 10;
+
+  void askForNew() {
+    char* const end = heapEnd();
+    if (end > known_) {
+      char* const begin = known_ - reinterpret_cast<uintptr_t>(known_) % kPage;
+      // A hint: a kernel that does not know it brings the pages one by one, as ever.
+      (void)madvise(begin, static_cast<std::size_t>(end - begin), MADV_POPULATE_WRITE);
+    }
+    known_ = end;
+  }
+
+ private:
+  static constexpr uintptr_t kPage = 4096;
+  static char* heapEnd() { return static_cast<char*>(sbrk(0)); }
+  char* known_ = heapEnd();
+};
 
 class RunningPlatform final : public LinuxPlatform {
  public:
@@ -170,6 +195,7 @@ class RunningPlatform final : public LinuxPlatform {
     signalFd_ = signalfd(-1, &signals, SFD_CLOEXEC | SFD_NONBLOCK);
     (void)loop_.add(signalFd_, EPOLLIN, signalSource_);
 
+    loop_.addPassEndHook([this] { heapPages_.askForNew(); });
     watcher_->setBeforeFire([this](std::string_view) { log_.refreshVerbose(); });
     if (watcher_->fd() >= 0) (void)loop_.add(watcher_->fd(), EPOLLIN, watcherSource_);
     loop_.addDeadline([this] { return watcher_->nextDue(); }, [this] { watcher_->onDue(); });
@@ -214,6 +240,7 @@ class RunningPlatform final : public LinuxPlatform {
   CounterChannels channels_;
   ConfiguredDeviceProperties properties_;
   LinuxOrientation orientation_;
+  HeapPages heapPages_;
   LinuxDiagnosticFiles diagnosticFiles_;
   ProcProcessInfo processInfo_;
   ImmediateProcessControl processControl_;
@@ -237,6 +264,7 @@ std::unique_ptr<LinuxPlatform> LinuxPlatform::start(std::string& problem) {
   raiseDescriptorLimit();
   // Large buffers go back to the system when they are freed, whatever has been allocated since.
   mallopt(M_MMAP_THRESHOLD, 256 << 10);
+  mallopt(M_TOP_PAD, HeapPages::kStep);
   const Directories directories = Directories::fromEnvironment();
   std::vector<std::string> complaints;
   const PlatformConfiguration configuration = PlatformConfiguration::load(directories, complaints);
