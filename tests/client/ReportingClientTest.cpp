@@ -181,17 +181,6 @@ TEST_F(ReportingClientTest, WhatIsNotTheProtocolEndsTheConnection) {
   }
 }
 
-TEST_F(ReportingClientTest, AServiceOfAnotherVersionOrWithoutAHelloIsNotConnectedTo) {
-  ReportingClient other;
-  EXPECT_EQ(other.adopt(service.pair(helloFrame(2))).code, Code::Disconnected);
-  EXPECT_EQ(other.adopt(service.pair(trueReply(1))).code, Code::Disconnected);
-  EXPECT_EQ(other.adopt(service.pair(Bytes()), kShort).code, Code::TimedOut);
-  const ClientStatus refused =
-      other.adopt(service.pair(errorFrame(-1, 6, "too many connections")), kShort);
-  EXPECT_EQ(refused.code, Code::TimedOut) << "an error without a close is not yet an end";
-  EXPECT_FALSE(other.isConnected());
-}
-
 TEST_F(ReportingClientTest, AFullBufferRefusesWholeCallsAndRecovers) {
   ReportingClient::Options options;
   options.maxBufferedBytes = 64 << 10;
@@ -213,30 +202,6 @@ TEST_F(ReportingClientTest, AFullBufferRefusesWholeCallsAndRecovers) {
   }
   EXPECT_EQ(arrived, taken + 1);
   EXPECT_FALSE(service.holdsHalfAFrame());
-}
-
-TEST_F(ReportingClientTest, CallsThatNeverFitAreRefusedAndHarmNothing) {
-  ReportingClient::Options options;
-  options.maxPendingCalls = 2;
-  client = std::make_unique<ReportingClient>(options);
-  ASSERT_TRUE(client->adopt(service.pair(helloFrame(1, 100))).ok());
-  service.read();
-  // The frame of a call to sendMessage with one string is 16 bytes longer than the string.
-  auto sendString = [&](std::size_t size) {
-    return client->sendMessageAsync(PayloadBuilder().set("k", std::string(size, 'x')).build(),
-                                    kCategory, 1);
-  };
-  EXPECT_EQ(sendString(85).code, Code::TooLarge);
-  EXPECT_TRUE(sendString(84).ok());
-  EXPECT_TRUE(sendString(84).ok());
-  EXPECT_EQ(sendString(1).code, Code::BufferFull) << "two calls wait already";
-  service.write(nullReply(1));
-  client->process();
-  EXPECT_TRUE(sendString(1).ok());
-  client->flush();
-  const std::vector<Bytes> frames = service.read();
-  ASSERT_EQ(frames.size(), 3U);
-  EXPECT_EQ(frames[0].size(), 100U);
 }
 
 TEST_F(ReportingClientTest, BlockingFormsWaitForTheirAnswerAndNoLonger) {

@@ -49,25 +49,6 @@ class PreferencesTest(DaemonTest):
         os.remove(self.file)
         self.assert_switched(off=False)
 
-    def test_what_is_stored_before_the_start_has_no_effect_until_it_changes(self):
-        self.write("disable_reporting = true\n")
-        self.assert_switched(off=True)
-        self.d.stop()
-        self.d.start()
-        self.c = self.d.client()
-        self.assertIsNone(self.send())
-        self.write("disable_reporting = true\n# again\n")
-        self.assert_switched(off=True)
-
-    def test_other_clients_sessions_are_hidden_while_off(self):
-        other = self.d.client()
-        other.started(7, 2)
-        self.write("disable_reporting = true\n")
-        self.assert_switched(off=True)
-        self.assertEqual(self.c.call(VALIDATE, 7), {"reporterID": 0, "serviceType": 65535})
-        self.assertEqual(other.call(VALIDATE, 7), {"reporterID": 7, "serviceType": 2})
-        self.assertEqual(self.c.call(REPORTERS), [7])
-
     def test_defaults_reach_sessions_and_verbose_keys_take_effect(self):
         self.assertNotIn("creating session for reporter", self.d.log())
         self.c.call(CREATE, 1)
@@ -159,13 +140,6 @@ class SummaryTest(DaemonTest):
         shutil.rmtree(d.folder + "/log")
         self.run_session(d, reporter=5)
         self.assertEqual(len(self.files(d)), 1)
-
-    def test_unserialisable_user_information(self):
-        d = self.daemon(config=INTERNAL)
-        self.run_session(d, extra={"bad": float("nan")})
-        self.assertIn("dataWithJSONObject:", d.log())
-        self.assertEqual(self.files(d), [])
-        self.assertTrue(os.path.isdir(f"{d.folder}/log/Audio/Reporting"))
 
     def test_full_and_unwritable_directories(self):
         d = self.daemon(config=INTERNAL)

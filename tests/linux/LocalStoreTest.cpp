@@ -173,14 +173,6 @@ TEST_F(LocalStoreTest, FlushIsAnsweredOnceItsMessagesAreCommitted) {
   EXPECT_EQ(seen, "1");
 }
 
-TEST_F(LocalStoreTest, ALoneRowIsCommittedAfterTheInterval) {
-  options.commitInterval = 20ms;
-  open();
-  store->power().logRegisteredEvent(1, "n", numbered(1), nullptr);
-  EXPECT_TRUE(eventually([&] { return query("SELECT count(*) FROM power_records").at(0) == "1"; }));
-  EXPECT_EQ(store->counters().commits, 1u);
-}
-
 TEST_F(LocalStoreTest, FullQueueIsCongestedUntilHalfIsWritten) {
   options.queueBytes = 64 << 10;
   options.commitInterval = 1h;

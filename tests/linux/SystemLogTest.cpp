@@ -117,17 +117,6 @@ TEST(SystemLogLimits, ThreadsShareOneStatementsAllowance) {
   EXPECT_EQ(wanted.load(), 50);
 }
 
-TEST(SystemLogLimits, AnAllowanceComesBackButNeverBeyondTheBurst) {
-  SystemLog log;
-  log.configure(toStderr(3, 1e6));
-  // As left by a statement that last wrote long ago: no tokens, 2 left out, updated in ms 1.
-  const LogSite site{"F.cpp", 1, "f", uint64_t{2} << 32 | 1};
-  EXPECT_TRUE(log.wantsLine(nullptr, LogLevel::Error, site));
-  EXPECT_EQ(site.platformWord >> 48, 2u);
-  log.configure(toStderr(0, 1));
-  for (int i = 0; i < 200; ++i) EXPECT_TRUE(log.wantsLine(nullptr, LogLevel::Error, site));
-}
-
 TEST(SystemLogScopes, TheVerboseReaderMayLogAndRegister) {
   SystemLog log;
   const LogScope* inner = nullptr;

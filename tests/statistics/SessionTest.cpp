@@ -19,19 +19,6 @@ class SessionTest : public ServiceTest {
   }
 };
 
-TEST_F(SessionTest, IsBornUnknownEmptyAndWithAQueueOfItsOwn) {
-  const auto s = make(1, kServiceTypeUnknown);
-  const auto other = make(2, kServiceTypeUnknown);
-  EXPECT_EQ(s->serviceType(), 65535);
-  EXPECT_EQ(s->serviceName(), "unknown");
-  EXPECT_TRUE(s->aggregatedPayloadData() && s->aggregatedPayloadData()->empty());
-  EXPECT_NE(s->vyrReportingQueue(), other->vyrReportingQueue());
-  EXPECT_EQ(p.queues.made.back().second, QualityOfService::Utility);
-  EXPECT_EQ(std::count_if(p.log.registrations.begin(), p.log.registrations.end(),
-                          [](const std::string& r) { return r.rfind("vxrr ", 0) == 0; }),
-            1);
-}
-
 TEST_F(SessionTest, NumbersPerKindAcrossRestartsAndStates) {
   const auto s = make();
   EXPECT_EQ(s->messageIdForCategory(kSetup, 1), "Session_Setup_Start_1");

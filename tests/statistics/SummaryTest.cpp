@@ -58,16 +58,6 @@ TEST_F(SummaryTest, EventThenFileThenFlush) {
             "   \"a_b\": \"1\"\n  }\n }\n]\n");
 }
 
-TEST_F(SummaryTest, LaterOfTwoWithTheSameNameStays) {
-  for (const int value : {1, 2}) {
-    const auto s = startedSession();
-    s->sendMessage(PayloadBuilder().set("a", value).build(), 3, 1, nullptr);
-    s->stop();
-  }
-  ASSERT_EQ(p.services.files.size(), 1u);
-  EXPECT_THAT(p.services.files.begin()->second, HasSubstr("\"a\": 2"));
-}
-
 TEST_F(SummaryTest, NothingReceivedLeavesNothingBehind) {
   const auto s = startedSession();
   EXPECT_THAT(during([&] {
