@@ -8,17 +8,12 @@
 
 #include <cerrno>
 #include <cstdio>
-#include <cstdlib>
-#include <cstring>
-#include <deque>
 #include <filesystem>
+#include <memory>
 #include <system_error>
-#include <thread>
-#include <vector>
 
-#include "platform/Mutex.h"
+#include "platform/linux/BackgroundWriter.h"
 #include "platform/linux/FileReading.h"
-#include "platform/linux/Threads.h"
 
 namespace vx::lnx {
 
@@ -38,149 +33,6 @@ std::string randomSuffix() {
   std::snprintf(text, sizeof text, ".%016llx.tmp", static_cast<unsigned long long>(bits));
   return text;
 }
-
-// 0, or the errno that kept some of it from being written.
-int writeAll(int fd, std::string_view text) {
-  while (!text.empty()) {
-    const ssize_t written = ::write(fd, text.data(), text.size());
-    if (written < 0 && errno == EINTR) continue;
-    if (written < 0) return errno;
-    text.remove_prefix(static_cast<std::size_t>(written));
-  }
-  return 0;
-}
-
-// Writes the rest of a large file with a thread of its own while the caller makes it, past the page
-// cache where the file system can do that: tens of megabytes that nobody on the device reads would
-// only push out what somebody does. Owned by the file, which outlives it; used by one thread. At
-// most kMostPieces wait, then so does the caller.
-class BackgroundWriter {
- public:
-  BackgroundWriter(int fd, std::size_t offset)
-      : fd_(fd), offset_(offset), thread_(startThread("vx-file", [this] { run(); })) {}
-  ~BackgroundWriter() { (void)finish(); }
-  BackgroundWriter(const BackgroundWriter&) = delete;
-  BackgroundWriter& operator=(const BackgroundWriter&) = delete;
-
-  // Leaves `text` empty, with the room of a piece that is done with. 0, or the errno that an
-  // earlier piece met; nothing more is written then.
-  int push(std::string& text) {
-    MutexLock lock(mutex_);
-    while (waiting_.size() >= kMostPieces && code_ == 0) changed_.wait(mutex_);
-    if (code_ != 0) return code_;
-    waiting_.push_back(std::move(text));
-    text = std::string();
-    if (!done_.empty()) {
-      text.swap(done_.back());
-      done_.pop_back();
-    }
-    changed_.notifyAll();
-    return 0;
-  }
-  // Once everything is written: 0, or the errno that prevented it.
-  int finish() {
-    {
-      MutexLock lock(mutex_);
-      ending_ = true;
-      changed_.notifyAll();
-    }
-    if (thread_.joinable()) thread_.join();
-    MutexLock lock(mutex_);
-    return code_;
-  }
-
- private:
-  static constexpr std::size_t kMostPieces = 16;
-  static constexpr std::size_t kBlock =
-      4096;  // what direct writing wants everything to be a multiple of
-  static constexpr std::size_t kStagingBytes = 1 << 20;
-
-  void run() {
-    staging_.reset(static_cast<char*>(std::aligned_alloc(kBlock, kStagingBytes)));
-    std::string piece;
-    while (next(piece)) {
-      if (const int code = stage(piece); code != 0) return fail(code);
-    }
-    if (const int code = writeStaged(); code != 0) fail(code);
-  }
-  int stage(std::string_view text) {
-    // Up to the next whole block the file goes on as it began.
-    if (const std::size_t odd = offset_ % kBlock; odd != 0 && staged_ == 0) {
-      const std::string_view first = text.substr(0, kBlock - odd);
-      if (const int code = writeAll(fd_, first); code != 0) return code;
-      offset_ += first.size();
-      text.remove_prefix(first.size());
-    }
-    while (!text.empty()) {
-      const std::size_t count = std::min(text.size(), kStagingBytes - staged_);
-      std::memcpy(staging_.get() + staged_, text.data(), count);
-      staged_ += count;
-      text.remove_prefix(count);
-      if (staged_ < kStagingBytes) continue;
-      if (const int code = writeStaged(); code != 0) return code;
-    }
-    return 0;
-  }
-  // Whole blocks directly, the rest (only at the end of the file) through the cache.
-  int writeStaged() {
-    std::size_t direct = offset_ % kBlock == 0 ? staged_ / kBlock * kBlock : 0;
-    if (direct > 0 && !isDirect_) isDirect_ = setDirect(true);
-    if (!isDirect_) direct = 0;
-    if (direct > 0) {
-      const ssize_t written = ::write(fd_, staging_.get(), direct);
-      if (written < 0 && errno != EINVAL) return errno;
-      // Less than all of it, or a file system that changed its mind: the rest goes the usual way.
-      direct = written > 0 ? static_cast<std::size_t>(written) : 0;
-    }
-    if (direct < staged_) {
-      if (isDirect_) isDirect_ = setDirect(false);
-      const int code = writeAll(fd_, {staging_.get() + direct, staged_ - direct});
-      if (code != 0) return code;
-    }
-    offset_ += staged_;
-    staged_ = 0;
-    return 0;
-  }
-  bool setDirect(bool direct) const {
-    const int flags = fcntl(fd_, F_GETFL);
-    return fcntl(fd_, F_SETFL, direct ? flags | O_DIRECT : flags & ~O_DIRECT) == 0 && direct;
-  }
-  bool next(std::string& piece) {
-    MutexLock lock(mutex_);
-    piece.clear();
-    if (piece.capacity() != 0) done_.push_back(std::move(piece));
-    while (waiting_.empty() && !ending_) changed_.wait(mutex_);
-    if (waiting_.empty()) return false;
-    piece = std::move(waiting_.front());
-    waiting_.pop_front();
-    changed_.notifyAll();
-    return true;
-  }
-  void fail(int code) {
-    MutexLock lock(mutex_);
-    code_ = code;
-    waiting_.clear();
-    changed_.notifyAll();
-  }
-
-  struct Free {
-    void operator()(void* room) const { std::free(room); }
-  };
-  const int fd_;
-  // The thread's, once it runs.
-  std::size_t offset_;
-  std::unique_ptr<char, Free> staging_;
-  std::size_t staged_ = 0;
-  bool isDirect_ = false;
-
-  Mutex mutex_;
-  CondVar changed_;
-  std::deque<std::string> waiting_ GUARDED_BY(mutex_);
-  std::vector<std::string> done_ GUARDED_BY(mutex_);  // at most as many as may wait, and one
-  bool ending_ GUARDED_BY(mutex_) = false;
-  int code_ GUARDED_BY(mutex_) = 0;
-  std::thread thread_;  // last: it uses the others
-};
 
 class RenamedFile final : public AtomicFile {
  public:
