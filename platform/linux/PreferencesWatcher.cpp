@@ -58,9 +58,14 @@ PreferencesWatcher::~PreferencesWatcher() {
   if (fd_ >= 0) close(fd_);
 }
 
+void PreferencesWatcher::watchFolders() {
+  watchFolder();
+  for (Watched& watched : watched_) followLink(watched);
+}
+
 // Watches the preferences folder, or as long as it is not there, the closest folder above it that
 // is.
-void PreferencesWatcher::watchFolders() {
+void PreferencesWatcher::watchFolder() {
   folderWatch_ = inotify_add_watch(fd_, folder_.c_str(), kFolderEvents);
   if (folderWatch_ < 0 && errno == ENOSPC)
     return startPolling("no more watches allowed (fs.inotify.max_user_watches)");
@@ -76,6 +81,23 @@ void PreferencesWatcher::watchFolders() {
   } while (ancestorWatch_ < 0 && ancestor.has_relative_path());
   // Made between the two looks.
   folderWatch_ = inotify_add_watch(fd_, folder_.c_str(), kFolderEvents);
+}
+
+// Looks again where the file really is.
+void PreferencesWatcher::followLink(Watched& watched) {
+  const std::filesystem::path path = folder_ + "/" + watched.notification.fileName;
+  std::error_code failure;
+  std::filesystem::path real;
+  if (std::filesystem::is_symlink(path, failure)) real = std::filesystem::canonical(path, failure);
+  int watch = -1;
+  if (!real.empty() && !polling_) {
+    watch = inotify_add_watch(fd_, real.parent_path().c_str(), kFolderEvents);
+    if (watch == folderWatch_) watch = -1;
+  }
+  if (watched.targetWatch >= 0 && watched.targetWatch != watch)
+    inotify_rm_watch(fd_, watched.targetWatch);
+  watched.targetWatch = watch;
+  watched.targetName = real.filename();
 }
 
 void PreferencesWatcher::startPolling(const char* why) {
@@ -115,8 +137,15 @@ void PreferencesWatcher::onReadable() {
         foldersMoved = foldersMoved || event->wd == folderWatch_ || event->wd == ancestorWatch_;
       } else if (event->wd == folderWatch_) {
         for (Watched& watched : watched_) {
-          if (watched.notification.fileName == name) changed(watched);
+          if (name == watched.notification.fileName ||
+              (!name.empty() && name == watched.targetName))
+            changed(watched);
         }
+      } else if (const auto target = std::find_if(
+                     watched_.begin(), watched_.end(),
+                     [&](const Watched& watched) { return watched.targetWatch == event->wd; });
+                 target != watched_.end()) {
+        if (name == target->targetName) changed(*target);
       } else if (event->wd == ancestorWatch_) {
         foldersMoved = true;
       }
@@ -170,6 +199,7 @@ void PreferencesWatcher::onDue() {
     if (now < watched.lastChange + options_.settle && now < *watched.firstChange + kLongestWait)
       continue;
     watched.firstChange.reset();
+    followLink(watched);
     fire(watched.notification.name);
   }
 }

@@ -20,6 +20,8 @@ namespace vx::lnx {
 // touched in <runtime>/notify, which is how a tool posts it: `touch
 // /run/vxreporting/notify/com.quorvel.sonik.reporting`.
 //
+// Where the file is a symbolic link, the file that it leads to is watched as well.
+//
 // Driven by the event loop, on its thread: no thread of its own, no timer while nothing has
 // changed. Where inotify cannot be had, the file is looked at every few seconds, and one log line
 // says so.
@@ -57,7 +59,9 @@ class PreferencesWatcher final : public SystemNotify {
     Notification notification;
     std::optional<Monotonic> firstChange;
     Monotonic lastChange{};
-    std::string signature;  // while polling: what the file looked like
+    std::string signature;   // while polling: what the file looked like
+    int targetWatch = -1;    // the folder of the file that a link leads to, when it is another one
+    std::string targetName;  // that file's name; empty while the file is no link
   };
   struct Registration {
     std::string name;
@@ -67,6 +71,8 @@ class PreferencesWatcher final : public SystemNotify {
   };
 
   void watchFolders();
+  void watchFolder();
+  void followLink(Watched& watched);
   void startPolling(const char* why);
   void changed(Watched& watched);
   void fire(const std::string& name);

@@ -62,6 +62,52 @@ TEST_F(PreferencesWatcherTest, SettlesBeforeItFires) {
   EXPECT_GT(fired, before + 2);
 }
 
+TEST_F(PreferencesWatcherTest, FollowsALinkToTheFileBehindIt) {
+  fakes::FakeClock clock;
+  PlatformConfiguration::Preferences options;
+  write("here/d.toml", "a = 1\n");
+  write("there/d.toml", "a = 1\n");
+  std::filesystem::create_directory(folder + "/preferences");
+  const std::string link = folder + "/preferences/d.toml";
+  std::filesystem::create_symlink(folder + "/here/d.toml", link);
+  PreferencesWatcher watcher(folder + "/preferences", folder + "/notify", {{"name", "d.toml"}},
+                             options, clock);
+  watcher.start(PreferencesWatcher::openInotify());
+  int fired = 0;
+  int token = 0;
+  watcher.registerHandler("name", token, p.queues.makeSerial("q", QualityOfService::Utility),
+                          [&](int) { ++fired; });
+  auto pass = [&] {
+    watcher.onReadable();
+    clock.advance(1s);
+    if (watcher.nextDue()) watcher.onDue();
+    p.queues.runAll();
+    return fired;
+  };
+  EXPECT_EQ(pass(), 0);
+  write("here/d.toml", "a = 2\n");
+  EXPECT_EQ(pass(), 1);
+  write("here/other.toml", "a = 2\n");
+  EXPECT_EQ(pass(), 1);
+  std::filesystem::create_symlink(folder + "/there/d.toml", link + ".new");
+  std::filesystem::rename(link + ".new", link);
+  EXPECT_EQ(pass(), 2);
+  write("here/d.toml", "a = 3\n");
+  EXPECT_EQ(pass(), 2);
+  write("there/d.toml", "a = 3\n");
+  EXPECT_EQ(pass(), 3);
+  write("preferences/real.toml", "a = 3\n");
+  std::filesystem::create_symlink("real.toml", link + ".new");
+  std::filesystem::rename(link + ".new", link);
+  EXPECT_EQ(pass(), 4);
+  for (int i = 5; i < 8; ++i) {
+    write("preferences/real.toml", "a = 4\n");
+    EXPECT_EQ(pass(), i);
+  }
+  std::filesystem::remove(link);
+  EXPECT_EQ(pass(), 8);
+}
+
 TEST_F(PreferencesWatcherTest, PollsWhereInotifyCannotBeHad) {
   fakes::FakeClock clock;
   PlatformConfiguration::Preferences options;
