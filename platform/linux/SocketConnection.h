@@ -160,6 +160,7 @@ class SocketConnection final : public ClientConnection,
   void runFrame(std::span<const uint8_t> frame);
   void runHello(const Frame& frame);
   void runCall(const Frame& frame);
+  static std::optional<int64_t> readInteger(const Value& value);  // none for other kinds
   bool readArguments(const OperationDescription& operation, const Frame& frame,
                      CallArguments& arguments, std::string& problem) const;
   bool admitResource(const OperationDescription& operation, const CallArguments& arguments);
