@@ -4,8 +4,8 @@
 #include <atomic>
 #include <chrono>
 
+#include "base/Mutex.h"
 #include "platform/Log.h"
-#include "platform/Mutex.h"
 
 namespace vx {
 

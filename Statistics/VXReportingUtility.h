@@ -9,9 +9,9 @@
 #include <string>
 #include <string_view>
 
-#include "platform/Payload.h"
 #include "platform/ScopedLog.h"
 #include "platform/Threading.h"
+#include "propertylist/Payload.h"
 
 namespace vx {
 

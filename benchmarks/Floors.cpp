@@ -14,7 +14,7 @@
 #include <thread>
 
 #include "benchmarks/Workload.h"
-#include "platform/JsonWriter.h"
+#include "propertylist/JsonWriter.h"
 
 namespace vx::bench {
 

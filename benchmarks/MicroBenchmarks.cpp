@@ -6,10 +6,10 @@
 #include <vector>
 
 #include "benchmarks/Workload.h"
-#include "platform/CborWriter.h"
-#include "platform/JsonWriter.h"
-#include "platform/Payload.h"
-#include "platform/linux/Executor.h"
+#include "platform/linux/execution/Executor.h"
+#include "propertylist/CborWriter.h"
+#include "propertylist/JsonWriter.h"
+#include "propertylist/Payload.h"
 
 namespace vx::bench {
 namespace {

@@ -8,7 +8,7 @@
 #include <cstring>
 #include <stdexcept>
 
-#include "platform/CborWriter.h"
+#include "propertylist/CborWriter.h"
 
 namespace vx::bench {
 

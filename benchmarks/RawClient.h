@@ -7,7 +7,7 @@
 #include <string>
 #include <vector>
 
-#include "platform/Payload.h"
+#include "propertylist/Payload.h"
 
 namespace vx::bench {
 

@@ -7,7 +7,7 @@
 #include <sstream>
 #include <stdexcept>
 
-#include "platform/JsonWriter.h"
+#include "propertylist/JsonWriter.h"
 
 namespace vx::bench {
 

@@ -6,7 +6,7 @@
 #include <cstdint>
 #include <vector>
 
-#include "platform/Payload.h"
+#include "propertylist/Payload.h"
 
 namespace vx::bench {
 

@@ -5,7 +5,7 @@
 #include <utility>
 
 #include "client/ServiceConnection.h"
-#include "platform/CborWriter.h"
+#include "propertylist/CborWriter.h"
 
 namespace vx {
 

@@ -20,8 +20,8 @@
 #include <variant>
 #include <vector>
 
-#include "platform/Function.h"
-#include "platform/Payload.h"
+#include "base/Function.h"
+#include "propertylist/Payload.h"
 
 namespace vx {
 

@@ -14,7 +14,7 @@
 
 #include "client/PendingCalls.h"
 #include "client/ReportingClient.h"
-#include "platform/CborWriter.h"
+#include "propertylist/CborWriter.h"
 
 namespace vx {
 

@@ -1,6 +1,10 @@
-# vx_options: what every target of the project is compiled with.
+# vx_options: what every target of the project is compiled with. Linked privately, so that nobody else inherits it.
 add_library(vx_options INTERFACE)
+target_compile_features(vx_options INTERFACE cxx_std_20)
 target_include_directories(vx_options INTERFACE ${PROJECT_SOURCE_DIR})
+if(VX_CHECKS)
+  target_compile_definitions(vx_options INTERFACE VX_CHECKS)
+endif()
 target_compile_options(vx_options INTERFACE -Wall -Wextra -Wnon-virtual-dtor -Wold-style-cast
                                             -Wcast-qual -Wformat=2 -Wno-format-nonliteral
                                             $<$<CXX_COMPILER_ID:GNU>:-Wno-restrict> $<$<CXX_COMPILER_ID:GNU>:-Wshadow=local>
@@ -24,5 +28,22 @@ endif()
 function(vx_library name)
   cmake_parse_arguments(ARG "" "" "SOURCES;LINK;PRIVATE_LINK" ${ARGN})
   add_library(${name} STATIC ${ARG_SOURCES})
-  target_link_libraries(${name} PUBLIC vx_options ${ARG_LINK} PRIVATE ${ARG_PRIVATE_LINK})
+  set_target_properties(${name} PROPERTIES CXX_EXTENSIONS OFF)
+  target_compile_features(${name} PUBLIC cxx_std_20)
+  target_include_directories(${name} PUBLIC ${PROJECT_SOURCE_DIR})
+  target_link_libraries(${name} PUBLIC ${ARG_LINK} PRIVATE vx_options ${ARG_PRIVATE_LINK})
+endfunction()
+
+# Adds a program.
+function(vx_program name)
+  cmake_parse_arguments(ARG "" "" "SOURCES;LINK" ${ARGN})
+  add_executable(${name} ${ARG_SOURCES})
+  set_target_properties(${name} PROPERTIES CXX_EXTENSIONS OFF)
+  target_link_libraries(${name} PRIVATE vx_options ${ARG_LINK})
+endfunction()
+
+# The TOML parser is compiled in: one shared library less to load, and no other one that is C++.
+function(vx_uses_toml name)
+  target_include_directories(${name} SYSTEM PRIVATE ${TOMLPP_INCLUDE_DIRS})
+  target_compile_definitions(${name} PRIVATE TOML_HEADER_ONLY=1)
 endfunction()

@@ -2,8 +2,8 @@
 // the same property list of them again.
 #include <algorithm>
 
-#include "platform/JsonWriter.h"
-#include "platform/Payload.h"
+#include "propertylist/JsonWriter.h"
+#include "propertylist/Payload.h"
 
 namespace {
 

@@ -7,8 +7,8 @@
 #include <string>
 #include <string_view>
 
-#include "platform/Error.h"
-#include "platform/Function.h"
+#include "base/Error.h"
+#include "base/Function.h"
 
 namespace vx {
 

@@ -6,7 +6,7 @@
 #include <string>
 #include <string_view>
 
-#include "platform/Error.h"
+#include "base/Error.h"
 
 namespace vx {
 

@@ -4,8 +4,8 @@
 #include <cstdint>
 #include <string_view>
 
-#include "platform/Function.h"
-#include "platform/Payload.h"
+#include "base/Function.h"
+#include "propertylist/Payload.h"
 
 namespace vx {
 

@@ -5,7 +5,7 @@
 #include <string>
 #include <string_view>
 
-#include "platform/Function.h"
+#include "base/Function.h"
 
 namespace vx {
 

@@ -2,8 +2,8 @@
 // the system.
 #pragma once
 
+#include "base/Clock.h"
 #include "platform/ChannelReportService.h"
-#include "platform/Clock.h"
 #include "platform/DevicePropertyQuery.h"
 #include "platform/DiagnosticFiles.h"
 #include "platform/EventServices.h"

@@ -7,7 +7,7 @@
 #include <string>
 #include <string_view>
 
-#include "platform/Function.h"
+#include "base/Function.h"
 #include "platform/WorkQueue.h"
 
 namespace vx {

@@ -5,8 +5,8 @@
 #include <memory>
 #include <string_view>
 
-#include "platform/Clock.h"
-#include "platform/Function.h"
+#include "base/Clock.h"
+#include "base/Function.h"
 
 namespace vx {
 

@@ -11,9 +11,9 @@
 #include <variant>
 #include <vector>
 
-#include "platform/Error.h"
-#include "platform/Function.h"
-#include "platform/Payload.h"
+#include "base/Error.h"
+#include "base/Function.h"
+#include "propertylist/Payload.h"
 
 namespace vx {
 

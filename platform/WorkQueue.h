@@ -5,8 +5,9 @@
 #include <memory>
 #include <string_view>
 
-#include "platform/Function.h"
-#include "platform/ThreadAnnotations.h"
+#include "base/Check.h"
+#include "base/Function.h"
+#include "base/ThreadAnnotations.h"
 
 namespace vx {
 
@@ -29,12 +30,8 @@ class CAPABILITY("queue") WorkQueue {
   virtual void asyncAfter(std::chrono::nanoseconds delay, Work work) = 0;
   virtual bool isCurrent() const = 0;
   virtual std::string_view label() const = 0;
-  // Fails the process when the caller is not running on this queue (debug builds).
-  void assertIsCurrent() const ASSERT_CAPABILITY(this) {
-#ifndef NDEBUG
-    if (!isCurrent()) __builtin_trap();
-#endif
-  }
+  // Fails the process when the caller is not running on this queue (development builds).
+  void assertIsCurrent() const ASSERT_CAPABILITY(this) { VX_DCHECK(isCurrent()); }
 };
 
 class WorkQueues {

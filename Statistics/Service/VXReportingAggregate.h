@@ -9,7 +9,7 @@
 #include <vector>
 
 #include "Statistics/VXReportingUtility.h"
-#include "platform/Mutex.h"
+#include "base/Mutex.h"
 
 namespace vx {
 

@@ -10,8 +10,8 @@
 #include <vector>
 
 #include "Statistics/VXReportingUtility.h"
-#include "platform/Function.h"
-#include "platform/Mutex.h"
+#include "base/Function.h"
+#include "base/Mutex.h"
 #include "platform/Threading.h"
 
 namespace vx {

@@ -14,7 +14,7 @@
 #include "Statistics/Service/VXReportingSession.h"
 #include "Statistics/VXReportingDriverUtility.h"
 #include "Statistics/VXReportingUtility.h"
-#include "platform/Mutex.h"
+#include "base/Mutex.h"
 #include "platform/ScopedLog.h"
 #include "platform/ServiceListener.h"
 #include "platform/WorkQueue.h"

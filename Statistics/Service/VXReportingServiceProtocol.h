@@ -6,9 +6,9 @@
 #include <vector>
 
 #include "Statistics/VXReportingUtility.h"
+#include "base/Error.h"
+#include "base/Function.h"
 #include "platform/ClientConnection.h"
-#include "platform/Error.h"
-#include "platform/Function.h"
 
 namespace vx {
 

@@ -9,9 +9,9 @@
 #include <vector>
 
 #include "Statistics/Service/VXReportingSession.h"
-#include "platform/FileNames.h"
-#include "platform/JsonWriter.h"
 #include "platform/Log.h"
+#include "propertylist/FileNames.h"
+#include "propertylist/JsonWriter.h"
 
 namespace vx {
 

@@ -14,19 +14,19 @@
 #include <vector>
 
 #include "platform/Log.h"
-#include "platform/linux/CounterChannels.h"
-#include "platform/linux/EventLoop.h"
-#include "platform/linux/Executor.h"
-#include "platform/linux/LinuxDiagnosticFiles.h"
-#include "platform/linux/LinuxOrientation.h"
-#include "platform/linux/LocalStore.h"
 #include "platform/linux/PlatformConfiguration.h"
-#include "platform/linux/PreferencesWatcher.h"
-#include "platform/linux/SocketListener.h"
-#include "platform/linux/SystemLog.h"
-#include "platform/linux/SystemServices.h"
-#include "platform/linux/SystemThreading.h"
-#include "platform/linux/TomlPreferences.h"
+#include "platform/linux/device/CounterChannels.h"
+#include "platform/linux/device/LinuxOrientation.h"
+#include "platform/linux/device/SystemServices.h"
+#include "platform/linux/diagnostics/LinuxDiagnosticFiles.h"
+#include "platform/linux/diagnostics/SystemLog.h"
+#include "platform/linux/execution/EventLoop.h"
+#include "platform/linux/execution/Executor.h"
+#include "platform/linux/execution/SystemThreading.h"
+#include "platform/linux/ipc/SocketListener.h"
+#include "platform/linux/settings/PreferencesWatcher.h"
+#include "platform/linux/settings/TomlPreferences.h"
+#include "platform/linux/store/LocalStore.h"
 
 namespace vx::lnx {
 
@@ -59,8 +59,7 @@ void raiseDescriptorLimit() {
   setrlimit(RLIMIT_NOFILE, &limit);
 }
 
-PlatformConfiguration::Orientation withDefaults(PlatformConfiguration::Orientation orientation,
-                                                const Directories& directories) {
+OrientationOptions withDefaults(OrientationOptions orientation, const Directories& directories) {
   if (orientation.interfaceStateFile.empty()) {
     orientation.interfaceStateFile = directories.runtime + "/interface-orientation";
   }
@@ -113,12 +112,12 @@ class RunningPlatform final : public LinuxPlatform {
   }
 
   bool open(const Directories& directories, std::string& problem) {
-    if (!listener_.open(directories, problem)) return false;
+    if (!listener_.open(directories.runtime, problem)) return false;
     watcher_.emplace(directories.configuration + "/preferences", directories.runtime + "/notify",
                      std::vector<PreferencesWatcher::Notification>{
                          {std::string(kPreferencesNotification), std::string(kPreferencesFile)}},
                      configuration_.preferences, clock_);
-    store_ = LocalStore::open(directories, configuration_.store, clock_, problem);
+    store_ = LocalStore::open(directories.state, configuration_.store, clock_, problem);
     if (store_ == nullptr) return false;
     store_->setBackends(configuration_.relay.backends);
     services_.emplace(Platform{

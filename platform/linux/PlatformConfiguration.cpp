@@ -8,7 +8,7 @@
 #include <optional>
 #include <set>
 
-#include "platform/linux/FileReading.h"
+#include "platform/linux/settings/TomlText.h"
 
 namespace vx::lnx {
 
@@ -174,7 +174,7 @@ class Reader {
       s.integer("device_class_number", c.device.deviceClassNumber, INT32_MIN, INT32_MAX);
     });
     section("log", [&](Section& s) {
-      using Log = PlatformConfiguration::Log;
+      using Log = LogOptions;
       s.choice<Log::Destination>("destination", c.log.destination,
                                  {{"auto", Log::Destination::Auto},
                                   {"journal", Log::Destination::Journal},
@@ -274,10 +274,10 @@ PlatformConfiguration PlatformConfiguration::load(const Directories& directories
                                                   std::vector<std::string>& complaints) {
   PlatformConfiguration configuration;
   const std::string path = directories.configuration + "/platform.toml";
-  Error error;
-  const std::optional<std::string> text = readTomlText(path, error);
-  if (!text) {
-    if (error.code != ENOENT && error.code != ENOTDIR) complaints.push_back(error.reason);
+  const Result<std::string> text = readTomlText(path);
+  if (!text.ok()) {
+    const int code = text.status().code();
+    if (code != ENOENT && code != ENOTDIR) complaints.push_back(text.status().text());
     return configuration;
   }
   try {

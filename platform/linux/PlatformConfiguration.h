@@ -2,12 +2,14 @@
 // works with no file.
 #pragma once
 
-#include <chrono>
-#include <cstdint>
-#include <map>
 #include <string>
-#include <string_view>
 #include <vector>
+
+#include "platform/linux/device/DeviceOptions.h"
+#include "platform/linux/diagnostics/LogOptions.h"
+#include "platform/linux/ipc/ListenerOptions.h"
+#include "platform/linux/settings/PreferencesOptions.h"
+#include "platform/linux/store/StoreOptions.h"
 
 namespace vx::lnx {
 
@@ -20,68 +22,17 @@ struct Directories {
   static Directories fromEnvironment();
 };
 
-// A source of driver counters beside the counter tree: a group and subgroup mapped onto something
-// the kernel publishes.
-struct MappedChannelSource {
-  enum class Kind {
-    AlsaProc,    // path: /proc/asound or a folder like it; channels from the cards' pcm sub-stream
-                 // status files
-    Statistics,  // path: a folder with one counter per file, as /sys/class/net/lo/statistics
-  };
-  std::string group;     // empty: none
-  std::string subGroup;  // empty: none
-  Kind kind = Kind::Statistics;
-  std::string path;
-};
-
 struct PlatformConfiguration {
-  struct Device {
-    bool internalBuild = false;     // "InternalBuild"
-    int32_t deviceClassNumber = 0;  // "DeviceClassNumber"
-  } device;
-  struct Log {
-    enum class Destination { Auto, Journal, Stderr };
-    enum class Level {
-      Debug,
-      Info,
-      Default,
-      Error
-    };  // lines below it are not written (verbose ones always are)
-    Destination destination = Destination::Auto;
-    Level level = Level::Default;
-    uint32_t burst = 100;         // lines of one log statement at once; 0: no limit
-    double refillPerSecond = 10;  // and how fast its allowance comes back
-  } log;
+  DevicePropertyOptions device;
+  LogOptions log;
   struct Relay {
     std::vector<std::string> backends{"store"};
   } relay;
-  struct Store {
-    uint64_t maxBytes = 256u << 20;   // of the database file
-    uint32_t maxAgeDays = 30;         // 0: no limit
-    uint64_t queueBytes = 32u << 20;  // not yet committed; reading from clients pauses above it
-    std::chrono::milliseconds commitInterval{200};
-  } store;
-  struct Listener {
-    uint32_t maxConnections = 1024;
-    uint32_t maxConnectionsPerUser = 256;
-    uint32_t maxSessionsPerConnection = 1024;
-    uint32_t maxCallsInFlight = 1024;
-    uint32_t maxFrameBytes = 1u << 20;
-    uint32_t maxUnreadReplyBytes = 256u << 10;
-    std::chrono::milliseconds stalledClientTimeout{10000};
-  } listener;
-  struct Drivers {
-    std::string root = "/run/vxreporting-drivers";  // <root>/<group>[/<subgroup>]/<channel>
-    std::vector<MappedChannelSource> mapped;
-  } drivers;
-  struct Orientation {
-    bool deviceSensor = true;        // net.hadess.SensorProxy on the system bus
-    std::string interfaceStateFile;  // empty: <runtime>/interface-orientation
-  } orientation;
-  struct Preferences {
-    std::chrono::milliseconds settle{100};  // quiet time after a change before it is announced
-    std::chrono::milliseconds pollInterval{3000};  // only while inotify is unavailable
-  } preferences;
+  StoreOptions store;
+  ListenerOptions listener;
+  DriverOptions drivers;
+  OrientationOptions orientation;
+  PreferencesOptions preferences;
 
   // Reads <configuration>/platform.toml. A missing file gives the defaults. Every unknown key,
   // wrong type or value out of range keeps the default and adds one line "file:line: key: what is

@@ -11,8 +11,8 @@
 #include <string>
 #include <vector>
 
-#include "platform/CborWriter.h"
-#include "platform/Payload.h"
+#include "propertylist/CborWriter.h"
+#include "propertylist/Payload.h"
 
 namespace vx {
 

@@ -6,8 +6,8 @@
 #include <climits>
 #include <map>
 
-#include "platform/linux/CounterChannels.h"
-#include "platform/linux/SystemServices.h"
+#include "platform/linux/device/CounterChannels.h"
+#include "platform/linux/device/SystemServices.h"
 #include "tests/linux/FolderTest.h"
 
 namespace vx::lnx {
@@ -20,7 +20,7 @@ using Name = std::optional<std::string>;
 class ChannelsTest : public FolderTest {
  protected:
   ChannelsTest() { drivers.root = folder + "/drivers"; }
-  PlatformConfiguration::Drivers drivers;
+  DriverOptions drivers;
 };
 
 // One driver group, from the channels it has to their samples.

@@ -3,7 +3,7 @@
 #include <cstdlib>
 
 #include "platform/linux/PlatformConfiguration.h"
-#include "platform/linux/TomlPreferences.h"
+#include "platform/linux/settings/TomlPreferences.h"
 #include "tests/linux/FolderTest.h"
 
 namespace vx::lnx {

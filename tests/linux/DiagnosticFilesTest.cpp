@@ -6,7 +6,7 @@
 #include <csignal>
 #include <iterator>
 
-#include "platform/linux/LinuxDiagnosticFiles.h"
+#include "platform/linux/diagnostics/LinuxDiagnosticFiles.h"
 #include "tests/linux/FolderTest.h"
 
 namespace vx::lnx {

@@ -5,8 +5,8 @@
 #include <thread>
 #include <vector>
 
-#include "platform/Mutex.h"
-#include "platform/linux/Executor.h"
+#include "base/Mutex.h"
+#include "platform/linux/execution/Executor.h"
 
 namespace vx::lnx {
 namespace {

@@ -10,8 +10,8 @@
 #include <thread>
 #include <vector>
 
-#include "platform/linux/LocalStore.h"
-#include "platform/linux/SystemThreading.h"
+#include "platform/linux/execution/SystemThreading.h"
+#include "platform/linux/store/LocalStore.h"
 #include "tests/linux/FolderTest.h"
 
 namespace vx::lnx {
@@ -24,7 +24,7 @@ class LocalStoreTest : public FolderTest {
  protected:
   void open() {
     std::string problem;
-    store = LocalStore::open({"", folder, "", ""}, options, clock, problem);
+    store = LocalStore::open(folder, options, clock, problem);
     ASSERT_NE(store, nullptr) << problem;
     store->start();
   }
@@ -80,7 +80,7 @@ class LocalStoreTest : public FolderTest {
   static Payload numbered(int i) { return PayloadBuilder().set("i", i).build(); }
 
   SystemClock clock;
-  PlatformConfiguration::Store options;
+  StoreOptions options;
   std::unique_ptr<LocalStore> store;
 };
 
@@ -331,7 +331,7 @@ TEST_F(LocalStoreTest, EventsOfTheFirstSchemaAreKept) {
 TEST_F(LocalStoreTest, SecondOpenerAndNewerSchemaAreRefused) {
   open();
   std::string problem;
-  EXPECT_EQ(LocalStore::open({"", folder, "", ""}, options, clock, problem), nullptr);
+  EXPECT_EQ(LocalStore::open(folder, options, clock, problem), nullptr);
   EXPECT_THAT(problem, HasSubstr(folder));
   EXPECT_TRUE(close());
   store.reset();
@@ -339,7 +339,7 @@ TEST_F(LocalStoreTest, SecondOpenerAndNewerSchemaAreRefused) {
   sqlite3_open((folder + "/telemetry.db").c_str(), &database);
   sqlite3_exec(database, "PRAGMA user_version = 99", nullptr, nullptr, nullptr);
   sqlite3_close(database);
-  EXPECT_EQ(LocalStore::open({"", folder, "", ""}, options, clock, problem), nullptr);
+  EXPECT_EQ(LocalStore::open(folder, options, clock, problem), nullptr);
   EXPECT_THAT(problem, HasSubstr("newer version"));
 }
 

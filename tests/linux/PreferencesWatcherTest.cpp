@@ -1,6 +1,6 @@
 #include <cerrno>
 
-#include "platform/linux/PreferencesWatcher.h"
+#include "platform/linux/settings/PreferencesWatcher.h"
 #include "tests/linux/FolderTest.h"
 
 namespace vx::lnx {
@@ -11,7 +11,7 @@ using PreferencesWatcherTest = FolderTest;
 
 TEST_F(PreferencesWatcherTest, SettlesBeforeItFires) {
   fakes::FakeClock clock;
-  PlatformConfiguration::Preferences options;
+  PreferencesOptions options;
   PreferencesWatcher watcher(folder + "/preferences", folder + "/notify", {{"name", "d.toml"}},
                              options, clock);
   watcher.start(PreferencesWatcher::openInotify());
@@ -64,7 +64,7 @@ TEST_F(PreferencesWatcherTest, SettlesBeforeItFires) {
 
 TEST_F(PreferencesWatcherTest, FollowsALinkToTheFileBehindIt) {
   fakes::FakeClock clock;
-  PlatformConfiguration::Preferences options;
+  PreferencesOptions options;
   write("here/d.toml", "a = 1\n");
   write("there/d.toml", "a = 1\n");
   std::filesystem::create_directory(folder + "/preferences");
@@ -110,7 +110,7 @@ TEST_F(PreferencesWatcherTest, FollowsALinkToTheFileBehindIt) {
 
 TEST_F(PreferencesWatcherTest, PollsWhereInotifyCannotBeHad) {
   fakes::FakeClock clock;
-  PlatformConfiguration::Preferences options;
+  PreferencesOptions options;
   PreferencesWatcher watcher(folder + "/preferences", folder + "/notify", {{"name", "d.toml"}},
                              options, clock);
   errno = EMFILE;

@@ -7,14 +7,14 @@
 #include <thread>
 #include <vector>
 
-#include "platform/linux/SystemLog.h"
+#include "platform/linux/diagnostics/SystemLog.h"
 
 namespace vx::lnx {
 namespace {
 
-PlatformConfiguration::Log toStderr(uint32_t burst, double refillPerSecond) {
-  PlatformConfiguration::Log options;
-  options.destination = PlatformConfiguration::Log::Destination::Stderr;
+LogOptions toStderr(uint32_t burst, double refillPerSecond) {
+  LogOptions options;
+  options.destination = LogOptions::Destination::Stderr;
   options.burst = burst;
   options.refillPerSecond = refillPerSecond;
   return options;
@@ -83,8 +83,8 @@ TEST(SystemLogOnStderr, LongLinesAreCutBetweenCharacters) {
 
 TEST(SystemLogLimits, LinesOfOneStatementAreLimitedAndCounted) {
   SystemLog log;
-  PlatformConfiguration::Log options;
-  options.destination = PlatformConfiguration::Log::Destination::Stderr;
+  LogOptions options;
+  options.destination = LogOptions::Destination::Stderr;
   options.burst = 3;
   options.refillPerSecond = 0.001;
   log.configure(options);

@@ -7,7 +7,7 @@
 #include <vector>
 
 #include "Statistics/Service/VXReportingBlockThrottle.h"
-#include "platform/linux/SystemThreading.h"
+#include "platform/linux/execution/SystemThreading.h"
 #include "tests/fakes/FakePlatform.h"
 
 namespace vx::lnx {

@@ -1,0 +1,21 @@
+// What the service endpoint may be told.
+#pragma once
+
+#include <chrono>
+#include <cstdint>
+
+#include "wire/Protocol.h"
+
+namespace vx::lnx {
+
+struct ListenerOptions {
+  uint32_t maxConnections = 1024;
+  uint32_t maxConnectionsPerUser = 256;
+  uint32_t maxSessionsPerConnection = 1024;
+  uint32_t maxCallsInFlight = 1024;
+  uint32_t maxFrameBytes = wire::kMaxFrameBytes;
+  uint32_t maxUnreadReplyBytes = 256u << 10;
+  std::chrono::milliseconds stalledClientTimeout{10000};
+};
+
+}  // namespace vx::lnx

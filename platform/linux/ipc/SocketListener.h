@@ -1,0 +1,106 @@
+// The service endpoint: a Unix stream socket, the connections made to it, and the loop that serves
+// them.
+#pragma once
+
+#include <sys/types.h>
+
+#include <cstdint>
+#include <memory>
+#include <string>
+#include <unordered_map>
+#include <unordered_set>
+#include <vector>
+
+#include "platform/ServiceListener.h"
+#include "platform/linux/execution/EventLoop.h"
+#include "platform/linux/ipc/ListenerOptions.h"
+#include "platform/linux/ipc/SocketConnection.h"
+
+namespace vx::lnx {
+
+// Owned by LinuxPlatform; lives on the interactive thread. Holds at most maxConnections
+// connections, and maxConnectionsPerUser of one user; those above are answered with an error and
+// closed.
+class SocketListener final : public ServiceListener,
+                             public ConnectionHost,
+                             private EventLoop::Source {
+ public:
+  // What lies behind the service: whether it is congested, and how to wait for what it has
+  // accepted.
+  struct Hooks {
+    Function<bool()> congested;  // cheap; asked before every frame
+    Function<void()> listening;  // the endpoint accepts clients now
+    Function<void()> stopping;   // it no longer does
+  };
+
+  SocketListener(EventLoop& loop, Executor& executor, Clock& clock, const ListenerOptions& limits);
+  ~SocketListener() override;
+
+  // Takes the activated socket, or locks the runtime directory and binds <runtime>/service.socket.
+  // False and one clear sentence in `problem` when that cannot be.
+  [[nodiscard]] bool open(const std::string& runtimeDirectory, std::string& problem);
+  void setHooks(Hooks hooks) { hooks_ = std::move(hooks); }
+
+  // ServiceListener
+  void setDelegate(std::weak_ptr<ServiceListenerDelegate> delegate) override {
+    delegate_ = std::move(delegate);
+  }
+  // Serves until the loop is stopped, then ends every connection in order, within kShutdownTime.
+  void resume() override;
+
+  // From any thread: what was congested no longer is.
+  void congestionEnded();
+
+  // ConnectionHost
+  EventLoop& loop() override { return loop_; }
+  Executor& executor() override { return executor_; }
+  Clock& clock() override { return clock_; }
+  const ListenerOptions& limits() const override { return limits_; }
+  ListenerCounters& counters() override { return counters_; }
+  std::span<uint8_t> readBuffer() override { return readBuffer_; }
+  std::vector<uint8_t>& spareBuffer() override { return spareBuffer_; }
+  bool readingPaused() override { return hooks_.congested(); }
+  void waitForReading(const std::shared_ptr<SocketConnection>& connection) override;
+  void flushAtPassEnd(const std::shared_ptr<SocketConnection>& connection) override {
+    toFlush_.push_back(connection);
+  }
+  void unreadChanged(SocketConnection& connection, bool unread) override;
+  void closed(SocketConnection& connection) override;
+
+ private:
+  static constexpr std::chrono::seconds kShutdownTime{2};
+  static constexpr int kAcceptsPerPass = 64;
+
+  void onReady(uint32_t events) override;
+  bool acceptOne();
+  // Accepts and turns away one connection with the descriptor kept for that. False when there is
+  // none to spare.
+  bool turnAwayForLackOfDescriptors();
+  void turnAway(int fd, const std::string& why);
+  void runPassEnd();
+  void cutStalled();
+  void stopListening();
+
+  EventLoop& loop_;
+  Executor& executor_;
+  Clock& clock_;
+  const ListenerOptions limits_;
+  Hooks hooks_;
+  ListenerCounters counters_;
+  std::weak_ptr<ServiceListenerDelegate> delegate_;
+  std::shared_ptr<WorkQueue> queue_;
+  int fd_ = -1;
+  int lockFd_ = -1;
+  int spareFd_ = -1;  // given up for a moment to turn a client away when descriptors have run out
+  bool listening_ = false;
+  std::string path_;  // bound here, to be removed at the end; empty for an activated socket
+  std::vector<uint8_t> readBuffer_;
+  std::vector<uint8_t> spareBuffer_;
+  std::unordered_map<SocketConnection*, std::shared_ptr<SocketConnection>> connections_;
+  std::unordered_map<uid_t, uint32_t> connectionsOfUser_;
+  std::vector<std::shared_ptr<SocketConnection>> toFlush_;
+  std::vector<std::weak_ptr<SocketConnection>> waiting_;
+  std::unordered_set<SocketConnection*> unread_;
+};
+
+}  // namespace vx::lnx

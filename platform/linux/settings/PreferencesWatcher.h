@@ -1,0 +1,97 @@
+// Named notifications, fired when a preferences file changed or when somebody posts them.
+#pragma once
+
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "base/Clock.h"
+#include "platform/Preferences.h"
+#include "platform/linux/settings/PreferencesOptions.h"
+
+namespace vx::lnx {
+
+// A notification fires when its file in the preferences folder changed, however it was edited, once
+// it has been left alone for the settle time (at the latest two seconds after the first change), so
+// never on a file that is being written. And it fires when a file of its own name is created or
+// touched in <runtime>/notify, which is how a tool posts it: `touch
+// /run/vxreporting/notify/com.quorvel.sonik.reporting`.
+//
+// Where the file is a symbolic link, the file that it leads to is watched as well.
+//
+// Driven by the event loop, on its thread: no thread of its own, no timer while nothing has
+// changed. Where inotify cannot be had, the file is looked at every few seconds, and one log line
+// says so.
+class PreferencesWatcher final : public SystemNotify {
+ public:
+  struct Notification {
+    std::string name;
+    std::string fileName;  // in the preferences folder
+  };
+
+  PreferencesWatcher(std::string preferencesFolder, std::string postFolder,
+                     std::vector<Notification> notifications, const PreferencesOptions& options,
+                     Clock& clock);
+  ~PreferencesWatcher() override;
+  PreferencesWatcher(const PreferencesWatcher&) = delete;
+  PreferencesWatcher& operator=(const PreferencesWatcher&) = delete;
+
+  // Begins to watch with a fresh inotify descriptor, which it takes; without one (-1, errno says
+  // why) it polls. Logs, so the platform must be installed.
+  void start(int inotifyFd);
+  static int openInotify();
+
+  uint32_t registerHandler(std::string_view name, int& token, std::shared_ptr<WorkQueue> queue,
+                           Function<void(int token)> handler) override;
+
+  // Called before the handlers of a notification are told.
+  void setBeforeFire(Function<void(std::string_view name)> hook) { beforeFire_ = std::move(hook); }
+  int fd() const { return fd_; }  // -1 when inotify cannot be had
+  void onReadable();
+  std::optional<Monotonic> nextDue() const;
+  void onDue();
+
+ private:
+  struct Watched {
+    Notification notification;
+    std::optional<Monotonic> firstChange;
+    Monotonic lastChange{};
+    std::string signature;   // while polling: what the file looked like
+    int targetWatch = -1;    // the folder of the file that a link leads to, when it is another one
+    std::string targetName;  // that file's name; empty while the file is no link
+  };
+  struct Registration {
+    std::string name;
+    int token;
+    std::shared_ptr<WorkQueue> queue;
+    std::shared_ptr<Function<void(int)>> handler;
+  };
+
+  void watchFolders();
+  void watchFolder();
+  void followLink(Watched& watched);
+  void startPolling(const char* why);
+  void changed(Watched& watched);
+  void fire(const std::string& name);
+  std::string signatureOf(const Watched& watched) const;
+
+  const std::string folder_;
+  const std::string postFolder_;
+  const PreferencesOptions options_;
+  Clock& clock_;
+  Function<void(std::string_view)> beforeFire_;
+  std::vector<Watched> watched_;
+  std::vector<Registration> registrations_;  // a handful, made at start-up
+  int nextToken_ = 1;
+  int fd_ = -1;
+  int folderWatch_ = -1;
+  int ancestorWatch_ = -1;
+  int postWatch_ = -1;
+  bool polling_ = false;
+  Monotonic nextPoll_{};
+};
+
+}  // namespace vx::lnx

@@ -1,0 +1,32 @@
+// The socket protocol's constants: what a frame may be, and the numbers in it. docs/protocol.md is
+// the same for authors of clients.
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+
+namespace vx::wire {
+
+inline constexpr int64_t kProtocolVersion = 1;
+
+// A frame: its length as 32 bits, little-endian, and that many bytes of CBOR.
+inline constexpr std::size_t kLengthBytes = 4;
+// The most that a service may be configured to take, and what it takes by default.
+inline constexpr uint32_t kMaxFrameBytes = 1u << 20;
+
+enum class FrameKind : uint8_t { Hello = 0, Call = 1, Reply = 2, Error = 3, Goodbye = 4 };
+
+// Codes of error frames.
+enum class ErrorCode : uint8_t {
+  MalformedFrame = 1,
+  FrameTooLarge = 2,
+  UnknownOperation = 3,
+  WrongArguments = 4,
+  TooManySessions = 5,
+  TooManyConnections = 6,
+  UnsupportedVersion = 7,
+  Abandoned = 8,
+  ReadsTooSlowly = 10,
+};
+
+}  // namespace vx::wire
