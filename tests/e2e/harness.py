@@ -1,10 +1,9 @@
-"""Starts the real daemon in a temporary folder and talks to it over its socket, with nothing but the standard library.
+"""Starts the real daemon in a temporary folder and talks to it over its socket.
 
 The protocol is spoken here from its description (docs/protocol.md), not through the client library, so that the two
 are checked against each other.
 """
 import os
-import select
 import shutil
 import signal
 import socket
@@ -15,77 +14,22 @@ import tempfile
 import time
 import unittest
 
+from cbor2 import dumps, loads
+
 DAEMON = os.environ["VXREPORTINGD"]
-PATIENCE = 20.0  # seconds; a bound on waiting for something that must happen, never a measurement
+# In seconds: a bound on waiting for something that must happen, never a measurement.
+PATIENCE = float(os.environ.get("VX_PATIENCE", 60))
 
 (CREATE, SET_TYPE, GET_TYPE, CONFIGURE, START, SEND, STOP, DESTROY, VALIDATE, REPORTERS, KILL) = range(1, 12)
 HELLO, CALL, REPLY, ERROR, GOODBYE = range(5)
 
 
-class F32(float):
-    """A number to be sent in single precision."""
-
-
-def head(major, n):
-    if n < 24:
-        return bytes([major << 5 | n])
-    for code, size in ((24, 1), (25, 2), (26, 4), (27, 8)):
-        if n < 1 << 8 * size:
-            return bytes([major << 5 | code]) + n.to_bytes(size, "big")
-    raise ValueError(n)
-
-
-def encode(v):
-    if v is None:
-        return b"\xf6"
-    if v is True:
-        return b"\xf5"
-    if v is False:
-        return b"\xf4"
-    if isinstance(v, int):
-        return head(0, v) if v >= 0 else head(1, -1 - v)
-    if isinstance(v, F32):
-        return b"\xfa" + struct.pack(">f", v)
-    if isinstance(v, float):
-        return b"\xfb" + struct.pack(">d", v)
-    if isinstance(v, str):
-        return head(3, len(v.encode())) + v.encode()
-    if isinstance(v, (list, tuple)):
-        return head(4, len(v)) + b"".join(encode(x) for x in v)
-    if isinstance(v, dict):
-        return head(5, len(v)) + b"".join(encode(k) + encode(x) for k, x in v.items())
-    raise TypeError(type(v))
-
-
-def decode(b, i=0):
-    major, low = b[i] >> 5, b[i] & 31
-    i += 1
-    if major == 7:
-        if low < 24:
-            return {20: False, 21: True, 22: None}[low], i
-        size = {26: 4, 27: 8}[low]
-        return struct.unpack({4: ">f", 8: ">d"}[size], b[i:i + size])[0], i + size
-    n = low
-    if low >= 24:
-        size = 1 << low - 24
-        n = int.from_bytes(b[i:i + size], "big")
-        i += size
-    if major == 0:
-        return n, i
-    if major == 1:
-        return -1 - n, i
-    if major == 3:
-        return b[i:i + n].decode(), i + n
-    items = []
-    for _ in range(n * (2 if major == 5 else 1)):
-        item, i = decode(b, i)
-        items.append(item)
-    return (dict(zip(items[::2], items[1::2])) if major == 5 else items), i
+def framed(body):
+    return struct.pack("<I", len(body)) + body
 
 
 def frame(*items):
-    body = encode(items)
-    return struct.pack("<I", len(body)) + body
+    return framed(dumps(items))
 
 
 class Client:
@@ -99,7 +43,7 @@ class Client:
         self.data = b""
         self.answers = {}
         self.connection_error = None
-        self.goodbye = self.closed = False
+        self.goodbye = False
         if hello:
             self.raw(frame(HELLO, 1))
             self.hello = self.next_frame()
@@ -119,13 +63,12 @@ class Client:
                 n = struct.unpack("<I", self.data[:4])[0]
                 if len(self.data) >= 4 + n:
                     body, self.data = self.data[4:4 + n], self.data[4 + n:]
-                    return decode(body)[0]
+                    return loads(body)
             try:
                 got = self.socket.recv(1 << 16)
             except ConnectionResetError:
                 got = b""
             if not got:
-                self.closed = True
                 return None
             self.data += got
 
@@ -160,15 +103,6 @@ class Client:
             pass
         return self
 
-    def is_answered(self, number, within=0.2):
-        """Whether an answer has come; waits a little for one that should not come."""
-        while number not in self.answers:
-            if len(self.data) < 4 and not select.select([self.socket], [], [], within)[0]:
-                return False
-            if not self.pump():
-                return False
-        return True
-
     def started(self, reporter, service_type=7, configuration=None):
         """Creates, sets up and starts a session; returns the number of the held start call."""
         self.call(CREATE, reporter)
@@ -184,21 +118,21 @@ class Client:
 
 
 class Daemon:
-    def __init__(self, config="", environment=None, folder=None, wait=True, preexec=None,
-                 device_sensor=False):
+    def __init__(self, config="", environment=None, folder=None, wait=True, preexec=None, program=DAEMON):
         self.folder = folder or tempfile.mkdtemp(prefix="vx")
         for name in ("run", "state", "etc", "log", "drivers"):
             os.makedirs(f"{self.folder}/{name}", exist_ok=True)
+        sensor = "" if "[orientation]" in config else "[orientation]\ndevice_sensor = false\n"
         with open(f"{self.folder}/etc/platform.toml", "w") as f:
             f.write(f'[log]\ndestination = "stderr"\nlevel = "info"\nburst = 0\n'
-                    f'[drivers]\nroot = "{self.folder}/drivers"\n[orientation]\n'
-                    f'device_sensor = {str(device_sensor).lower()}\n' + config)
+                    f'[drivers]\nroot = "{self.folder}/drivers"\n{sensor}{config}')
         self.environment = dict(
             os.environ, RUNTIME_DIRECTORY=f"{self.folder}/run", STATE_DIRECTORY=f"{self.folder}/state",
             CONFIGURATION_DIRECTORY=f"{self.folder}/etc", LOGS_DIRECTORY=f"{self.folder}/log", **(environment or {}))
         for name in ("NOTIFY_SOCKET", "WATCHDOG_USEC", "LISTEN_FDS"):
             if name not in (environment or {}):
                 self.environment.pop(name, None)
+        self.program = program
         self.socket_path = f"{self.folder}/run/service.socket"
         self.database = f"{self.folder}/state/telemetry.db"
         self.log_path = f"{self.folder}/daemon.log"
@@ -207,13 +141,14 @@ class Daemon:
         self.start(wait)
 
     def start(self, wait=True):
+        before = len(self.log()) if os.path.exists(self.log_path) else 0
         with open(self.log_path, "ab") as log:
-            self.process = subprocess.Popen([DAEMON], env=self.environment, stderr=log, stdin=subprocess.DEVNULL,
+            self.process = subprocess.Popen([self.program], env=self.environment, stderr=log, stdin=subprocess.DEVNULL,
                                             preexec_fn=self.preexec, close_fds=self.preexec is None)
         if wait:
             self.wait_until(self.listening, "the daemon listens")
             # The probe above was a client too; what follows starts from a clean list.
-            self.wait_until(lambda: "dealloc" in self.log(), "the probe is gone")
+            self.wait_until(lambda: "dealloc" in self.log()[before:], "the probe is gone")
             self.quiet_before = len(self.log())
 
     def listening(self):
@@ -222,10 +157,11 @@ class Daemon:
         try:
             s = socket.socket(socket.AF_UNIX, socket.SOCK_STREAM)
             s.connect(self.socket_path)
-            s.close()
             return True
         except OSError:
             return False
+        finally:
+            s.close()
 
     def wait_until(self, condition, what):
         end = time.monotonic() + PATIENCE
@@ -248,10 +184,14 @@ class Daemon:
         with open(self.log_path, errors="replace") as f:
             return f.read()
 
-    def stop(self, signal_number=signal.SIGTERM):
+    def summaries(self):
+        """The summary files' paths, oldest first."""
+        folder = f"{self.folder}/log/Audio/Reporting"
+        return sorted(f"{folder}/{n}" for n in os.listdir(folder)) if os.path.isdir(folder) else []
+
+    def stop(self):
         """Ends the daemon in order and returns its exit status."""
-        if self.process.poll() is None:
-            self.process.send_signal(signal_number)
+        self.process.send_signal(signal.SIGTERM)
         try:
             return self.process.wait(PATIENCE)
         except subprocess.TimeoutExpired:
