@@ -48,7 +48,7 @@ class Actor {
     return status.ok();
   }
   ReportingClient& client() { return client_; }
-  bool goesOn() const { return SteadyClock::now() < end_; }
+  bool goesOn() const { return client_.isConnected() && SteadyClock::now() < end_; }
 
   void begin(int64_t reporter, uint16_t serviceType, const std::string& application) {
     check(client_.createReportingSession(reporter).status);
