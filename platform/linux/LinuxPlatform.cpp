@@ -13,8 +13,10 @@
 #include <optional>
 #include <vector>
 
+#include "base/UniqueFd.h"
 #include "platform/Log.h"
 #include "platform/linux/PlatformConfiguration.h"
+#include "platform/linux/RelayReporting.h"
 #include "platform/linux/device/CounterChannels.h"
 #include "platform/linux/device/LinuxOrientation.h"
 #include "platform/linux/device/SystemServices.h"
@@ -107,19 +109,20 @@ class RunningPlatform final : public LinuxPlatform {
     });
   }
 
-  ~RunningPlatform() override {
-    if (signalFd_ >= 0) ::close(signalFd_);
-  }
-
   bool open(const Directories& directories, std::string& problem) {
     if (!listener_.open(directories.runtime, problem)) return false;
     watcher_.emplace(directories.configuration + "/preferences", directories.runtime + "/notify",
                      std::vector<PreferencesWatcher::Notification>{
                          {std::string(kPreferencesNotification), std::string(kPreferencesFile)}},
                      configuration_.preferences, clock_);
-    store_ = LocalStore::open(directories.state, configuration_.store, clock_, problem);
-    if (store_ == nullptr) return false;
-    store_->setBackends(configuration_.relay.backends);
+    Result<std::unique_ptr<LocalStore>> opened =
+        LocalStore::open(directories.state, configuration_.store, clock_);
+    if (!opened.ok()) {
+      problem = opened.status().text();
+      return false;
+    }
+    store_ = std::move(*opened);
+    relay_.emplace(backends(), [this](Function<void()> job) { store_->runSoon(std::move(job)); });
     services_.emplace(Platform{
         .serviceListener = listener_,
         .workQueues = executor_,
@@ -130,9 +133,9 @@ class RunningPlatform final : public LinuxPlatform {
         .random = random_,
         .preferences = preferences_,
         .systemNotify = *watcher_,
-        .vyrReporting = store_->relay(),
-        .analytics = store_->analytics(),
-        .powerLog = store_->power(),
+        .vyrReporting = *relay_,
+        .analytics = *store_,
+        .powerLog = *store_,
         .channelReports = channels_,
         .deviceProperties = properties_,
         .orientation = orientation_,
@@ -174,6 +177,15 @@ class RunningPlatform final : public LinuxPlatform {
   }
 
  private:
+  // Those that the configuration names, in its order.
+  std::vector<RelayBackend*> backends() {
+    std::vector<RelayBackend*> named;
+    for (const std::string& name : configuration_.relay.backends) {
+      if (name == store_->relayBackend().name()) named.push_back(&store_->relayBackend());
+    }
+    return named;
+  }
+
   // Everything that the event loop looks after besides connections.
   void connect() {
     store_->setDrainedHandler([this] { listener_.congestionEnded(); });
@@ -191,8 +203,8 @@ class RunningPlatform final : public LinuxPlatform {
     sigemptyset(&signals);
     for (const int number : {SIGTERM, SIGINT, SIGUSR1}) sigaddset(&signals, number);
     pthread_sigmask(SIG_BLOCK, &signals, nullptr);
-    signalFd_ = signalfd(-1, &signals, SFD_CLOEXEC | SFD_NONBLOCK);
-    (void)loop_.add(signalFd_, EPOLLIN, signalSource_);
+    signalFd_.reset(signalfd(-1, &signals, SFD_CLOEXEC | SFD_NONBLOCK));
+    (void)loop_.add(signalFd_.get(), EPOLLIN, signalSource_);
 
     loop_.addPassEndHook([this] { heapPages_.askForNew(); });
     watcher_->setBeforeFire([this](std::string_view) { log_.refreshVerbose(); });
@@ -213,7 +225,7 @@ class RunningPlatform final : public LinuxPlatform {
 
   void onSignal() {
     signalfd_siginfo info{};
-    while (read(signalFd_, &info, sizeof info) == static_cast<ssize_t>(sizeof info)) {
+    while (read(signalFd_.get(), &info, sizeof info) == static_cast<ssize_t>(sizeof info)) {
       if (info.ssi_signo != SIGUSR1) {
         loop_.stop();
         continue;
@@ -247,8 +259,9 @@ class RunningPlatform final : public LinuxPlatform {
   UsdtTracePoint trace_;
   std::optional<PreferencesWatcher> watcher_;
   std::unique_ptr<LocalStore> store_;
+  std::optional<RelayReporting> relay_;
   std::optional<Platform> services_;
-  int signalFd_ = -1;
+  UniqueFd signalFd_;
   CallOnReady signalSource_{[this] { onSignal(); }};
   CallOnReady watcherSource_{[this] { watcher_->onReadable(); }};
   std::chrono::nanoseconds watchdogInterval_{0};

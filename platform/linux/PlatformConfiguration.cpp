@@ -2,12 +2,15 @@
 
 #include <toml++/toml.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstdlib>
 #include <limits>
 #include <optional>
 #include <set>
+#include <span>
 
+#include "platform/linux/RelayBackend.h"
 #include "platform/linux/settings/TomlText.h"
 
 namespace vx::lnx {
@@ -41,6 +44,13 @@ std::optional<int64_t> sizeFromText(const std::string& text) {
     shift = 30;
   if (shift < 0 || number > (std::numeric_limits<int64_t>::max() >> shift)) return std::nullopt;
   return int64_t{number} << shift;
+}
+
+std::string quoted(std::span<const std::string_view> names) {
+  std::string text;
+  for (const std::string_view name : names)
+    text += (text.empty() ? "\"" : ", \"") + std::string(name) + "\"";
+  return text;
 }
 
 // One table of the file: takes the keys it is asked for, and complains of all others.
@@ -122,29 +132,26 @@ class Section {
       out = found->second;
       return;
     }
-    std::string names;
-    for (const auto& [name, choice] : choices)
-      names += (names.empty() ? "\"" : ", \"") + name + "\"";
-    complain(key, *node, "must be one of " + names);
+    std::vector<std::string_view> known;
+    for (const auto& [name, choice] : choices) known.push_back(name);
+    complain(key, *node, "must be one of " + quoted(known));
   }
-  void texts(const char* key, std::vector<std::string>& out) {
+  // Those of an array's texts that are known, each once; the others are complained of.
+  void names(const char* key, std::vector<std::string>& out,
+             std::span<const std::string_view> known) {
     const toml::node* node = find(key);
     if (node == nullptr) return;
-    std::vector<std::string> read;
     const toml::array* array = node->as_array();
-    if (array != nullptr) {
-      for (const toml::node& element : *array) {
-        if (const auto value = element.value_exact<std::string>())
-          read.push_back(*value);
-        else
-          array = nullptr;
-        if (array == nullptr) break;
-      }
+    if (array == nullptr || (!array->empty() && !array->is_homogeneous(toml::node_type::string)))
+      return complain(key, *node, "must be an array of texts");
+    out.clear();
+    for (const toml::node& element : *array) {
+      const std::string name = element.value_or(std::string());
+      if (std::find(known.begin(), known.end(), name) == known.end())
+        complain(key, element, "\"" + name + "\" is not known; must be one of " + quoted(known));
+      else if (std::find(out.begin(), out.end(), name) == out.end())
+        out.push_back(name);
     }
-    if (array != nullptr)
-      out = std::move(read);
-    else
-      complain(key, *node, "must be an array of texts");
   }
   const toml::node* find(const char* key) {
     known_.insert(key);
@@ -187,12 +194,13 @@ class Reader {
       s.integer("burst", c.log.burst, 0, UINT16_MAX);
       s.real("refill_per_second", c.log.refillPerSecond, 0.001, 1000000);
     });
-    section("relay", [&](Section& s) { s.texts("backends", c.relay.backends); });
+    section("relay",
+            [&](Section& s) { s.names("backends", c.relay.backends, kRelayBackendNames); });
     section("store", [&](Section& s) {
       s.size("max_bytes", c.store.maxBytes, 1 << 20);
       s.integer("max_age_days", c.store.maxAgeDays, 0, 36500);
       s.size("queue_bytes", c.store.queueBytes, 64 << 10);
-      s.milliseconds("commit_interval_ms", c.store.commitInterval, 1, 60000);
+      s.milliseconds("commit_interval_ms", c.store.commit.interval, 1, 60000);
     });
     section("listener", [&](Section& s) {
       auto& l = c.listener;

@@ -26,7 +26,7 @@ struct PlatformConfiguration {
   DevicePropertyOptions device;
   LogOptions log;
   struct Relay {
-    std::vector<std::string> backends{"store"};
+    std::vector<std::string> backends{"store"};  // of kRelayBackendNames
   } relay;
   StoreOptions store;
   ListenerOptions listener;

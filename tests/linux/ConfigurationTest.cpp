@@ -72,6 +72,22 @@ TEST_F(ConfigurationTest, ConfigurationRangesEndWhereTheySay) {
   EXPECT_THAT(configuration.drivers.mapped, IsEmpty());
 }
 
+TEST_F(ConfigurationTest, BackEndsThatAreNotKnownAreLeftOut) {
+  EXPECT_THAT(complaintsOf("[relay]\nbackends = [\n\"stoer\",\n\"store\", \"store\"]\n"),
+              ElementsAre(folder + "/platform.toml:3: relay.backends: \"stoer\" is not known; "
+                                   "must be one of \"store\""));
+  EXPECT_THAT(configuration.relay.backends, ElementsAre("store"));
+  EXPECT_EQ(complaintsOf("[relay]\nbackends = [\"elsewhere\"]\n").size(), 1u);
+  EXPECT_THAT(configuration.relay.backends, IsEmpty());
+  EXPECT_THAT(complaintsOf("[relay]\nbackends = []\n[store]\nmax_age_days = 3\n"
+                           "commit_interval_ms = 5\nqueue_bytes = 65536\n"),
+              IsEmpty());
+  EXPECT_THAT(configuration.relay.backends, IsEmpty());
+  EXPECT_EQ(configuration.store.maxAgeDays, 3u);
+  EXPECT_EQ(configuration.store.commit.interval.count(), 5);
+  EXPECT_EQ(configuration.store.queueBytes, 65536u);
+}
+
 TEST_F(ConfigurationTest, WhatIsNoConfigurationFileIsOneComplaint) {
   const std::string path = folder + "/platform.toml";
   auto complaints = [&] {

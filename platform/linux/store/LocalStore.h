@@ -1,59 +1,68 @@
 // The local store: one SQLite file, written by one thread, fed through one bounded queue.
 #pragma once
 
-#include <chrono>
-#include <cstdint>
 #include <memory>
-#include <optional>
 #include <string>
-#include <vector>
 
 #include "base/Clock.h"
 #include "base/Function.h"
+#include "base/Status.h"
+#include "base/UniqueFd.h"
 #include "platform/EventServices.h"
-#include "platform/VyrReporting.h"
+#include "platform/linux/RelayBackend.h"
+#include "platform/linux/store/Database.h"
+#include "platform/linux/store/StoreBackend.h"
 #include "platform/linux/store/StoreOptions.h"
+#include "platform/linux/store/StoreWriter.h"
 
 namespace vx::lnx {
 
 // Thread-safe. Owned by the platform. Appending never blocks and never drops: past its byte bound
 // the store reports itself congested, and the listener stops reading from clients until it has
 // drained.
-class LocalStore {
+class LocalStore final : public AnalyticsEventService, public PowerEventLog {
  public:
-  struct Counters {
-    uint64_t rowsCommitted = 0;
-    uint64_t commits = 0;
-    uint64_t writeFailures = 0;
-    uint64_t rowsLost = 0;  // only at an end with a store that cannot be written
-  };
+  using Counters = StoreCounters;
 
-  // Opens or creates <state>/telemetry.db and locks <state>/telemetry.lock. Null and one clear
-  // sentence in `problem` when another process has it or the folder cannot be used. The quick check
-  // runs on the writer's thread before its first write, so start-up does not wait for it.
-  static std::unique_ptr<LocalStore> open(const std::string& stateDirectory,
-                                          const StoreOptions& options, Clock& clock,
-                                          std::string& problem);
-  virtual ~LocalStore() = default;
+  // Opens or creates <state>/telemetry.db and locks <state>/telemetry.lock. A failure when another
+  // process has it or the folder cannot be used. The quick check runs on the writer's thread before
+  // its first write, so start-up does not wait for it.
+  static Result<std::unique_ptr<LocalStore>> open(const std::string& stateDirectory,
+                                                  const StoreOptions& options, Clock& clock);
 
   // Starts the writer. Logs, so the platform must be installed; what is appended before is kept.
-  virtual void start() = 0;
+  void start();
 
-  virtual VyrReporting& relay() = 0;
-  virtual AnalyticsEventService& analytics() = 0;
-  virtual PowerEventLog& power() = 0;
+  RelayBackend& relayBackend() { return backend_; }
+  void sendEventLazy(std::string_view name, Function<Payload()> builder,
+                     const Payload& message) override;
+  void logRegisteredEvent(int64_t clientIdentifier, std::string_view eventName,
+                          const Payload& record, const Payload* options) override;
 
-  virtual bool isCongested() const = 0;  // cheap: one atomic load
+  // Runs a job on the writer's thread, before anything that waits to be written.
+  void runSoon(Function<void()> job) { writer_.queue().runSoon(std::move(job)); }
+  bool isCongested() const { return writer_.queue().isCongested(); }  // cheap: one atomic load
   // Called on the writer's thread when a congested store has drained to half its bound. Set before
   // any traffic.
-  virtual void setDrainedHandler(Function<void()> handler) = 0;
-  // What startConfigurationWithCompletionHandler answers; the handler runs on the writer's thread.
-  virtual void setBackends(std::vector<std::string> backends) = 0;
+  void setDrainedHandler(Function<void()> handler) {
+    writer_.setDrainedHandler(std::move(handler));
+  }
 
   // Commits what is queued and ends the writer. False when rows were lost because the store could
   // not be written by the deadline; counters() and the log say how many.
-  virtual bool close(Monotonic deadline) = 0;
-  virtual Counters counters() const = 0;
+  bool close(Monotonic deadline) { return writer_.close(deadline); }
+  Counters counters() const { return writer_.counters(); }
+
+ private:
+  LocalStore(UniqueFd lock, std::string path, Database database, std::string damage,
+             const StoreOptions& options, Clock& clock);
+  double now() const;
+
+  Clock& clock_;
+  const UniqueFd lock_;
+  const std::string damage_;  // what was found and moved aside when the store was opened
+  StoreWriter writer_;
+  StoreBackend backend_;
 };
 
 }  // namespace vx::lnx

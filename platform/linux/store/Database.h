@@ -1,0 +1,57 @@
+// Small wrappers around SQLite's C interface.
+#pragma once
+
+#include <sqlite3.h>
+
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+
+namespace vx::lnx {
+
+struct DatabaseCloser {
+  void operator()(sqlite3* database) const { sqlite3_close_v2(database); }
+};
+using Database = std::unique_ptr<sqlite3, DatabaseCloser>;
+
+// A prepared statement that is bound, stepped and reset over and over. Owned by whoever prepared
+// it; confined to its database's thread.
+class Statement {
+ public:
+  Statement() = default;
+  Statement(sqlite3* database, std::string_view sql);
+
+  Statement& bind(int64_t value);
+  Statement& bind(double value);
+  // The text must stay until run().
+  Statement& bind(std::string_view text);
+  Statement& bindNull();
+  // NULL for none.
+  template <class T>
+  Statement& bind(const std::optional<T>& value) {
+    return value ? bind(*value) : bindNull();
+  }
+  // Steps a statement without rows and makes it ready for the next use. SQLITE_OK or SQLite's
+  // extended error code.
+  int run();
+  // Steps to the next row; false at the end or on an error.
+  bool row();
+  int64_t integer(int column) const { return sqlite3_column_int64(statement_.get(), column); }
+  double real(int column) const { return sqlite3_column_double(statement_.get(), column); }
+  std::string text(int column) const;
+  void reset();
+
+ private:
+  struct Finalizer {
+    void operator()(sqlite3_stmt* statement) const { sqlite3_finalize(statement); }
+  };
+  std::unique_ptr<sqlite3_stmt, Finalizer> statement_;
+  int next_ = 1;
+  int code_ = SQLITE_OK;  // of the preparation
+};
+
+int execute(sqlite3* database, const char* sql);
+
+}  // namespace vx::lnx

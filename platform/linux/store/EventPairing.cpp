@@ -1,0 +1,95 @@
+#include "platform/linux/store/EventPairing.h"
+
+#include <bit>
+#include <utility>
+
+namespace vx::lnx {
+
+namespace {
+
+constexpr std::size_t kKeptSlots = 4096;
+
+}  // namespace
+
+// The slot of a message, or the empty one where it would be.
+uint32_t& EventPairing::slotOf(const StoreRecords& batch, const void* identity) {
+  const auto bits = static_cast<uint64_t>(reinterpret_cast<uintptr_t>(identity));
+  const std::size_t mask = slots_.size() - 1;
+  std::size_t at = static_cast<std::size_t>((bits >> 4) * 0x9E3779B97F4A7C15u >> 32) & mask;
+  while (slots_[at] != StoreRecord::kNone &&
+         std::get<RelayMessageRecord>(batch[slots_[at]].what).payload.identity() != identity)
+    at = (at + 1) & mask;
+  return slots_[at];
+}
+
+void EventPairing::pair(StoreRecords& batch) {
+  thread_.assertIsCurrent();
+  std::size_t messages = 0;
+  for (std::size_t i = 0; i < batch.size(); ++i)
+    messages += std::holds_alternative<RelayMessageRecord>(batch[i].what) ? 1 : 0;
+  if (messages == 0 || messages == batch.size()) return;
+  slots_.assign(std::bit_ceil(2 * messages), StoreRecord::kNone);
+  for (std::size_t i = 0; i < batch.size(); ++i) {
+    const auto* message = std::get_if<RelayMessageRecord>(&batch[i].what);
+    if (message == nullptr || message->payload.identity() == nullptr) continue;
+    uint32_t& slot = slotOf(batch, message->payload.identity());
+    if (slot == StoreRecord::kNone) slot = static_cast<uint32_t>(i);
+  }
+  // Backwards, so that the events behind one message keep their order.
+  for (std::size_t i = batch.size(); i-- > 0;) {
+    const auto* event = std::get_if<AnalyticsRecord>(&batch[i].what);
+    if (event == nullptr || event->message.identity() == nullptr) continue;
+    const uint32_t slot = slotOf(batch, event->message.identity());
+    if (slot == StoreRecord::kNone) continue;
+    batch[i].sharing = StoreRecord::Sharing::Shares;
+    batch[i].nextSharer = std::exchange(batch[slot].nextSharer, static_cast<uint32_t>(i));
+  }
+  if (slots_.capacity() > kKeptSlots) std::vector<uint32_t>().swap(slots_);
+}
+
+void EventPairing::hold(StoreRecords& batch, double youngerThan, Monotonic now) {
+  thread_.assertIsCurrent();
+  for (std::size_t i = 0; i < batch.size(); ++i) {
+    StoreRecord& record = batch[i];
+    const auto* event = std::get_if<AnalyticsRecord>(&record.what);
+    if (event == nullptr || event->message.identity() == nullptr ||
+        record.sharing != StoreRecord::Sharing::No || record.time < youngerThan)
+      continue;
+    record.sharing = StoreRecord::Sharing::Held;  // once
+    held_.push_back(std::exchange(record, StoreRecord{record.time, std::monostate()}));
+  }
+  if (!held_.empty()) heldSince_ = now;
+}
+
+void EventPairing::join(StoreRecords& batch) {
+  thread_.assertIsCurrent();
+  for (StoreRecord& event : held_) batch.push_back(std::move(event));
+  held_.clear();
+}
+
+std::optional<Monotonic> EventPairing::heldSince() const {
+  return held_.empty() ? std::nullopt : std::optional<Monotonic>(heldSince_);
+}
+
+void EventPairing::markWritten(StoreRecords& batch, std::size_t first, std::size_t last) {
+  for (std::size_t i = first; i < last; ++i) {
+    auto* message = std::get_if<RelayMessageRecord>(&batch[i].what);
+    if (message == nullptr) continue;
+    message->payload = Payload();
+    for (uint32_t k = batch[i].nextSharer; k != StoreRecord::kNone; k = batch[k].nextSharer)
+      batch[k].sharing = StoreRecord::Sharing::Written;
+  }
+}
+
+uint64_t EventPairing::unwrittenRows(const StoreRecords& batch, std::size_t first) {
+  uint64_t rows = 0;
+  for (std::size_t i = first; i < batch.size(); ++i) {
+    rows += !std::holds_alternative<std::monostate>(batch[i].what) &&
+                    batch[i].sharing != StoreRecord::Sharing::Written
+                ? 1
+                : 0;
+  }
+  return rows;
+}
+
+}  // namespace vx::lnx

@@ -1,0 +1,158 @@
+#include "platform/linux/store/StoreQueue.h"
+
+#include <algorithm>
+#include <utility>
+
+namespace vx::lnx {
+
+namespace {
+
+constexpr std::size_t kKeptRecords = 1024;  // capacity that an idle queue keeps
+constexpr std::chrono::milliseconds kRetryWhileClosing{50};
+
+std::chrono::steady_clock::time_point steady(Monotonic time) {
+  return std::chrono::time_point_cast<std::chrono::steady_clock::duration>(time);
+}
+
+}  // namespace
+
+void StoreBatch::clear() {
+  records.clear();
+  flushes.clear();
+  bytes = 0;
+  urgent = false;
+}
+
+// Told once: whoever was woken looks at everything.
+bool StoreQueue::mustWake(bool urgent) {
+  const bool wake = sleep_ == Sleep::UntilWork || (sleep_ == Sleep::UntilCommit && urgent);
+  if (wake) sleep_ = Sleep::Awake;
+  return wake;
+}
+
+bool StoreQueue::append(StoreRecord record, std::size_t bytes) {
+  const std::size_t size = sizeof(StoreRecord) + bytes;
+  bool wake = false;
+  {
+    MutexLock lock(mutex_);
+    if (closing_) return false;
+    if (pending_.records.empty()) firstPending_ = clock_.monotonic();
+    pending_.records.push_back(std::move(record));
+    pending_.bytes += size;
+    heldBytes_ += size;
+    if (heldBytes_ > options_.queueBytes) congested_.store(true, std::memory_order_relaxed);
+    wake = mustWake(options_.commit.isFull(pending_.records.size(), pending_.bytes));
+  }
+  if (wake) wake_.notifyOne();
+  return true;
+}
+
+bool StoreQueue::appendFlush(FlushHandler& handler) {
+  bool wake = false;
+  {
+    MutexLock lock(mutex_);
+    if (closing_) return false;
+    pending_.flushes.push_back({pending_.records.size(), std::move(handler)});
+    pending_.urgent = true;
+    wake = mustWake(true);
+  }
+  if (wake) wake_.notifyOne();
+  return true;
+}
+
+void StoreQueue::runSoon(Function<void()> job) {
+  {
+    MutexLock lock(mutex_);
+    jobs_.push_back(std::move(job));
+  }
+  wake_.notifyOne();
+}
+
+void StoreQueue::close(Monotonic deadline) {
+  {
+    MutexLock lock(mutex_);
+    if (closing_) return;
+    closing_ = true;
+    closeDeadline_ = deadline;
+  }
+  wake_.notifyOne();
+}
+
+// None: nothing waits.
+std::optional<Monotonic> StoreQueue::dueTime(std::optional<Monotonic> heldSince) const {
+  if (heldSince) return *heldSince + options_.commit.interval;
+  if (pending_.records.empty() && pending_.flushes.empty()) return std::nullopt;
+  return firstPending_ + options_.commit.interval;
+}
+
+bool StoreQueue::isDue(std::optional<Monotonic> heldSince) const {
+  const std::optional<Monotonic> due = dueTime(heldSince);
+  return due && (closing_ || pending_.urgent ||
+                 options_.commit.isFull(pending_.records.size(), pending_.bytes) ||
+                 clock_.monotonic() >= *due);
+}
+
+StoreQueue::Turn StoreQueue::takeLocked(StoreBatch& batch, std::optional<Monotonic> heldSince) {
+  if (!jobs_.empty()) return Turn::Jobs;
+  if (!isDue(heldSince)) return closing_ ? Turn::End : Turn::Nothing;
+  batch.clear();
+  batch.records.swap(pending_.records);
+  batch.flushes.swap(pending_.flushes);
+  batch.bytes = std::exchange(pending_.bytes, 0);
+  batch.urgent = std::exchange(pending_.urgent, false) || closing_;
+  return Turn::Batch;
+}
+
+StoreQueue::Turn StoreQueue::tryTake(StoreBatch& batch, std::optional<Monotonic> heldSince) {
+  MutexLock lock(mutex_);
+  return takeLocked(batch, heldSince);
+}
+
+StoreQueue::Turn StoreQueue::take(StoreBatch& batch, std::optional<Monotonic> heldSince) {
+  MutexLock lock(mutex_);
+  for (;;) {
+    const Turn turn = takeLocked(batch, heldSince);
+    if (turn != Turn::Nothing) return turn;
+    if (const std::optional<Monotonic> due = dueTime(heldSince)) {
+      sleep_ = Sleep::UntilCommit;
+      wake_.waitUntil(mutex_, steady(*due));
+    } else {
+      pending_.records.shrink(kKeptRecords);
+      batch.records.shrink(kKeptRecords);
+      sleep_ = Sleep::UntilWork;
+      wake_.wait(mutex_);
+    }
+    sleep_ = Sleep::Awake;
+  }
+}
+
+std::vector<Function<void()>> StoreQueue::takeJobs() {
+  MutexLock lock(mutex_);
+  return std::exchange(jobs_, {});
+}
+
+bool StoreQueue::release(std::size_t bytes) {
+  MutexLock lock(mutex_);
+  heldBytes_ -= bytes;
+  if (!congested_.load(std::memory_order_relaxed) || heldBytes_ > options_.queueBytes / 2)
+    return false;
+  congested_.store(false, std::memory_order_relaxed);
+  return true;
+}
+
+StoreQueue::Retry StoreQueue::waitBeforeRetry(Monotonic until) {
+  MutexLock lock(mutex_);
+  for (;;) {
+    if (!jobs_.empty()) return Retry::JobsFirst;
+    const Monotonic time = clock_.monotonic();
+    if (closing_) {
+      if (time >= closeDeadline_) return Retry::NoMore;
+      wake_.waitUntil(mutex_, steady(std::min(closeDeadline_, time + kRetryWhileClosing)));
+      return Retry::Now;
+    }
+    if (time >= until) return Retry::Now;
+    wake_.waitUntil(mutex_, steady(until));
+  }
+}
+
+}  // namespace vx::lnx

@@ -1,0 +1,99 @@
+// The store's queue: what has been accepted and is not yet committed.
+#pragma once
+
+#include <atomic>
+#include <chrono>
+#include <cstddef>
+#include <cstdint>
+#include <optional>
+#include <vector>
+
+#include "base/Clock.h"
+#include "base/Error.h"
+#include "base/Function.h"
+#include "base/Mutex.h"
+#include "platform/linux/store/StoreOptions.h"
+#include "platform/linux/store/StoreRecord.h"
+
+namespace vx::lnx {
+
+using FlushHandler = Function<void(std::optional<Error>)>;
+
+// Somebody who waits until the first `records` records of a batch are committed.
+struct StoreFlush {
+  std::size_t records = 0;
+  FlushHandler handler;
+};
+
+struct StoreBatch {
+  StoreRecords records;
+  std::vector<StoreFlush> flushes;  // in order
+  std::size_t bytes = 0;            // charged to the queue until release()
+  bool urgent = false;              // somebody waits for its end
+
+  void clear();
+};
+
+// Owned by the store's writer. Thread-safe; one thread takes. Appending never blocks and never
+// drops: past `queueBytes` the queue is congested, and whoever feeds it is expected to stop until
+// half of that is left (see LocalStore).
+class StoreQueue {
+ public:
+  StoreQueue(const StoreOptions& options, Clock& clock) : options_(options), clock_(clock) {}
+  StoreQueue(const StoreQueue&) = delete;
+  StoreQueue& operator=(const StoreQueue&) = delete;
+
+  // `bytes`: what the record holds besides itself. False once closed.
+  bool append(StoreRecord record, std::size_t bytes);
+  // False once closed; the handler is moved from only on success. It makes what waits due at once.
+  bool appendFlush(FlushHandler& handler);
+  // Work for the taking thread, before anything that waits to be written.
+  void runSoon(Function<void()> job);
+  bool isCongested() const { return congested_.load(std::memory_order_relaxed); }
+  // Nothing is accepted any more, and what waits is due. The first deadline counts.
+  void close(Monotonic deadline);
+
+  enum class Turn : uint8_t {
+    Nothing,  // not yet
+    Jobs,     // takeJobs() has some
+    Batch,    // `batch` is filled; it may be empty when only held events are due
+    End,      // closed and empty
+  };
+  // `heldSince`: since when the taker holds events of an earlier batch back, which are due as if
+  // they waited here.
+  Turn tryTake(StoreBatch& batch, std::optional<Monotonic> heldSince);
+  // The same, after waiting for it: never Nothing.
+  Turn take(StoreBatch& batch, std::optional<Monotonic> heldSince);
+  std::vector<Function<void()>> takeJobs();
+  // Bytes of a batch that are committed or lost. True: the queue was congested and no longer is.
+  bool release(std::size_t bytes);
+  enum class Retry : uint8_t {
+    Now,
+    JobsFirst,  // runSoon() has some; then ask again
+    NoMore,     // closed, and its deadline has passed
+  };
+  // Waits until `until`, or for a shorter while when closed.
+  Retry waitBeforeRetry(Monotonic until);
+
+ private:
+  bool isDue(std::optional<Monotonic> heldSince) const REQUIRES(mutex_);
+  std::optional<Monotonic> dueTime(std::optional<Monotonic> heldSince) const REQUIRES(mutex_);
+  Turn takeLocked(StoreBatch& batch, std::optional<Monotonic> heldSince) REQUIRES(mutex_);
+  bool mustWake(bool urgent) REQUIRES(mutex_);
+
+  const StoreOptions options_;
+  Clock& clock_;
+  Mutex mutex_;
+  CondVar wake_;
+  StoreBatch pending_ GUARDED_BY(mutex_);
+  std::size_t heldBytes_ GUARDED_BY(mutex_) = 0;  // all that is not released, pending_ included
+  Monotonic firstPending_ GUARDED_BY(mutex_);
+  std::vector<Function<void()>> jobs_ GUARDED_BY(mutex_);
+  enum class Sleep : uint8_t { Awake, UntilCommit, UntilWork };
+  Sleep sleep_ GUARDED_BY(mutex_) = Sleep::Awake;
+  bool closing_ GUARDED_BY(mutex_) = false;
+  Monotonic closeDeadline_ GUARDED_BY(mutex_);
+  std::atomic<bool> congested_{false};
+};
+
+}  // namespace vx::lnx

@@ -1,0 +1,207 @@
+#include <atomic>
+#include <fstream>
+#include <future>
+#include <thread>
+
+#include "platform/linux/execution/SystemThreading.h"
+#include "platform/linux/store/LocalStore.h"
+#include "tests/store/StoreTest.h"
+
+namespace vx::lnx {
+namespace {
+
+// The store as a whole, on its own thread and the machine's clock.
+class LocalStoreTest : public StoreTest {
+ protected:
+  LocalStoreTest() { options.commit.interval = 1h; }
+  void open() {
+    Result<std::unique_ptr<LocalStore>> opened = LocalStore::open(folder, options, clock);
+    ASSERT_TRUE(opened.ok()) << opened.status().text();
+    store = std::move(*opened);
+    store->start();
+  }
+  bool close(std::chrono::seconds within = 60s) { return store->close(clock.monotonic() + within); }
+  void reopen() {
+    close();
+    store.reset();
+    open();
+  }
+  std::unique_ptr<RelayBackend::Session> session(int64_t id = 1) {
+    return store->relayBackend().open(sessionInfo(id), userInfo());
+  }
+  void power(int i, const std::string& name = "n") {
+    store->logRegisteredEvent(28, name, numbered(i), nullptr);
+  }
+  // Until everything before it is committed, or with the error that prevents it.
+  std::future<std::optional<Error>> flush() {
+    auto told = std::make_shared<std::promise<std::optional<Error>>>();
+    session()->flush([told](std::optional<Error> error) { told->set_value(std::move(error)); });
+    return told->get_future();
+  }
+  // Makes the rows of a table impossible to write, from outside.
+  void refusePower() {
+    query(
+        "CREATE TRIGGER refuse BEFORE INSERT ON power_records BEGIN SELECT RAISE(FAIL, 'no'); "
+        "END");
+  }
+  static void waitUntil(const std::function<bool()>& condition) {
+    while (!condition()) std::this_thread::yield();
+  }
+
+  SystemClock clock;
+  StoreOptions options;
+  std::unique_ptr<LocalStore> store;
+};
+
+TEST_F(LocalStoreTest, WhatWasSentIsThereAfterTheClose) {
+  open();
+  const auto relay = session(42);
+  EXPECT_EQ(relay->send(5, 1, numbered(1)), std::nullopt);
+  store->sendEventLazy(
+      "e", [] { return tagged(numbered(1)); }, Payload());
+  power(2);
+  EXPECT_EQ(store->relayBackend().sendOne({{kVyrReportingSessionInfoSessionID, int32_t{-1}}},
+                                          Payload(), 7, 2, numbered(3)),
+            std::nullopt);
+  EXPECT_TRUE(close());
+  EXPECT_THAT(query("SELECT s.session_id, m.category, m.type, m.payload FROM relay_messages m "
+                    "JOIN relay_sessions s ON s.id = m.relay_session"),
+              ElementsAre("42|5|1|{\"i\":1}", "-1|7|2|{\"i\":3}"));
+  EXPECT_THAT(query("SELECT name, payload FROM analytics_events"),
+              ElementsAre("e|{\"i\":1,\"app\":\"x\\\"y\"}"));
+  EXPECT_THAT(query("SELECT client_identifier, name, record, abs(time - strftime('%s')) < 600 "
+                    "FROM power_records"),
+              ElementsAre("28|n|{\"i\":2}|1"));
+  EXPECT_EQ(store->counters().rowsCommitted, 6u);
+  EXPECT_EQ(relay->send(5, 1, numbered(1))->code, kRelayErrorClosed);
+  EXPECT_TRUE(store->relayBackend().sendOne({}, Payload(), 1, 1, Payload()));
+  EXPECT_EQ(flush().get()->code, kRelayErrorClosed);
+}
+
+TEST_F(LocalStoreTest, RowsAreCommittedAfterTheInterval) {
+  options.commit.interval = 1ms;
+  open();
+  power(1);
+  waitUntil([&] { return store->counters().rowsCommitted == 1; });
+  EXPECT_THAT(query("SELECT count(*) FROM power_records"), ElementsAre("1"));
+}
+
+TEST_F(LocalStoreTest, FlushIsAnsweredOnceItsMessagesAreCommitted) {
+  open();
+  const auto relay = session();
+  relay->send(1, 1, numbered(1));
+  std::promise<std::string> seen;
+  relay->flush([&](const std::optional<Error>&) {
+    seen.set_value(query("SELECT count(*) FROM relay_messages").at(0));
+  });
+  EXPECT_EQ(seen.get_future().get(), "1");
+  EXPECT_EQ(flush().get(), std::nullopt);
+}
+
+TEST_F(LocalStoreTest, EventWaitsForAMessageOfTheNextBatch) {
+  options.commit.rows = 2;
+  open();
+  const Payload late = numbered(1);
+  store->sendEventLazy(
+      "late", [late] { return tagged(late); }, late);
+  power(1);
+  waitUntil([&] { return store->counters().rowsCommitted >= 1; });
+  const auto relay = session();
+  relay->send(1, 1, late);
+  EXPECT_TRUE(close());
+  EXPECT_THAT(query("SELECT payload FROM analytics_events"),
+              ElementsAre("{\"i\":1,\"app\":\"x\\\"y\"}"));
+  EXPECT_EQ(store->counters().rowsCommitted, 4u);
+}
+
+TEST_F(LocalStoreTest, CongestedStoreTellsWhenItHasDrained) {
+  options.queueBytes = 64 << 10;
+  open();
+  std::promise<void> drained;
+  store->setDrainedHandler([&] { drained.set_value(); });
+  int rows = 0;
+  while (!store->isCongested()) power(++rows);
+  EXPECT_LT(rows, 600);
+  const auto flushed = flush();
+  drained.get_future().get();
+  EXPECT_FALSE(store->isCongested());
+  EXPECT_TRUE(close());
+  EXPECT_EQ(query("SELECT count(*) FROM power_records").at(0), std::to_string(rows));
+}
+
+TEST_F(LocalStoreTest, FailedWriteIsRepeatedInOrderAndLosesNothing) {
+  options.commit.rows = 2;  // several transactions
+  open();
+  EXPECT_EQ(flush().get(), std::nullopt);
+  refusePower();
+  for (int i = 0; i < 5; ++i) power(i);
+  auto flushed = flush();
+  std::promise<void> answered;
+  waitUntil([&] { return store->counters().writeFailures > 0; });
+  store->runSoon([&] { answered.set_value(); });
+  answered.get_future().get();  // jobs do not wait for the disk
+  EXPECT_EQ(flushed.wait_for(0s), std::future_status::timeout);
+  query("DROP TRIGGER refuse");
+  EXPECT_EQ(flushed.get(), std::nullopt);
+  EXPECT_TRUE(close());
+  EXPECT_THAT(query("SELECT record FROM power_records"),
+              ElementsAre("{\"i\":0}", "{\"i\":1}", "{\"i\":2}", "{\"i\":3}", "{\"i\":4}"));
+  EXPECT_EQ(store->counters().rowsLost, 0u);
+}
+
+TEST_F(LocalStoreTest, RowsThatCannotBeWrittenByTheDeadlineAreCountedAndTold) {
+  options.commit.rows = 2;
+  open();
+  EXPECT_EQ(flush().get(), std::nullopt);
+  refusePower();
+  for (int i = 0; i < 5; ++i) power(i);
+  auto flushed = flush();
+  EXPECT_FALSE(close(0s));
+  EXPECT_TRUE(flushed.get());
+  waitUntil([&] { return store->counters().rowsLost == 6; });  // with the flush's session
+}
+
+TEST_F(LocalStoreTest, DamageIsMovedAsideWithALedgerRow) {
+  write("telemetry.db", std::string(20000, 'x'));
+  open();
+  for (int i = 0; i < 500; ++i) power(i, std::string(1000, 'n'));
+  reopen();
+  EXPECT_THAT(query("SELECT event FROM store_ledger"), ElementsAre("moved_aside"));
+  EXPECT_TRUE(close());
+  store.reset();
+  {
+    std::fstream file(folder + "/telemetry.db", std::ios::in | std::ios::out | std::ios::binary);
+    file.seekp(16384 * 12);  // found by the check alone
+    file << std::string(16384, '\x5A');
+  }
+  open();
+  power(1, "fresh");
+  EXPECT_TRUE(close());
+  EXPECT_THAT(query("SELECT name FROM power_records"), ElementsAre("fresh"));
+  EXPECT_THAT(query("SELECT event, detail LIKE 'failed its check (%); now %damaged-%' "
+                    "FROM store_ledger"),
+              ElementsAre("moved_aside|1"));
+}
+
+TEST_F(LocalStoreTest, WhatIsRemovedIsInTheLedgerEvenAtTheEnd) {
+  open();
+  reopen();
+  query("INSERT INTO power_records(time, client_identifier, name, record) VALUES(1, 1, 'n', '{}')");
+  reopen();
+  EXPECT_TRUE(close());
+  EXPECT_THAT(query("SELECT event, table_name, rows FROM store_ledger"),
+              ElementsAre("removed_for_age|power_records|1"));
+}
+
+TEST_F(LocalStoreTest, SecondOpenerAndNewerSchemaAreRefused) {
+  open();
+  EXPECT_FALSE(LocalStore::open(folder, options, clock).ok());
+  EXPECT_TRUE(close());
+  store.reset();
+  query("PRAGMA user_version = 99");
+  const auto refused = LocalStore::open(folder, options, clock);
+  EXPECT_THAT(refused.status().text(), HasSubstr("newer version"));
+}
+
+}  // namespace
+}  // namespace vx::lnx

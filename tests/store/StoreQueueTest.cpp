@@ -1,0 +1,135 @@
+#include "platform/linux/store/StoreQueue.h"
+#include "tests/store/StoreTest.h"
+
+namespace vx::lnx {
+namespace {
+
+using Turn = StoreQueue::Turn;
+
+class StoreQueueTest : public StoreTest {
+ protected:
+  static constexpr std::size_t kRecord = sizeof(StoreRecord);
+  StoreQueueTest() {
+    options.commit = {.rows = 3, .bytes = 1000000, .interval = 200ms};
+    options.queueBytes = 20 * kRecord;
+    p.clock.steady = Monotonic(1s);  // past for the machine: nothing really waits
+  }
+  bool append(std::size_t bytes = 0) { return queue().append({1.0, power(1)}, bytes); }
+  Turn take() { return queue().tryTake(batch, heldSince); }
+  bool flush() {
+    FlushHandler handler = [this](const std::optional<Error>&) { ++flushed; };
+    const bool taken = queue().appendFlush(handler);
+    EXPECT_EQ(static_cast<bool>(handler), !taken);
+    return taken;
+  }
+  StoreQueue& queue() {
+    if (!made) made.emplace(options, p.clock);
+    return *made;
+  }
+  StoreOptions options;
+  std::optional<StoreQueue> made;
+  std::optional<Monotonic> heldSince;
+  StoreBatch batch;
+  int flushed = 0;
+};
+
+TEST_F(StoreQueueTest, BatchIsDueByRowsBytesOrTime) {
+  EXPECT_EQ(take(), Turn::Nothing);
+  append();
+  append();
+  EXPECT_EQ(take(), Turn::Nothing);
+  append();
+  EXPECT_EQ(take(), Turn::Batch);
+  EXPECT_EQ(batch.records.size(), 3u);
+  EXPECT_EQ(batch.bytes, 3 * kRecord);
+  append(1000000 - kRecord - 1);
+  EXPECT_EQ(take(), Turn::Nothing);
+  append();
+  EXPECT_EQ(take(), Turn::Batch);
+  p.clock.advance(10s);
+  append();
+  p.clock.advance(199ms);
+  append();  // the first one's time counts
+  EXPECT_EQ(take(), Turn::Nothing);
+  p.clock.advance(1ms);
+  EXPECT_EQ(take(), Turn::Batch);
+  EXPECT_FALSE(batch.urgent);
+  EXPECT_EQ(take(), Turn::Nothing);
+}
+
+TEST_F(StoreQueueTest, FlushIsDueAtOnceAndKnowsItsPlace) {
+  append();
+  EXPECT_TRUE(flush());
+  append();
+  EXPECT_EQ(take(), Turn::Batch);
+  EXPECT_TRUE(batch.urgent);
+  ASSERT_EQ(batch.flushes.size(), 1u);
+  EXPECT_EQ(batch.flushes[0].records, 1u);
+  append();
+  EXPECT_EQ(take(), Turn::Nothing);  // the hurry is over
+  take();
+  EXPECT_TRUE(flush());
+  EXPECT_EQ(take(), Turn::Batch);
+}
+
+TEST_F(StoreQueueTest, HeldEventsAreDueWhenTheyWouldBeInTheQueue) {
+  heldSince = p.clock.monotonic();
+  p.clock.advance(199ms);
+  append();
+  EXPECT_EQ(take(), Turn::Nothing);
+  p.clock.advance(1ms);
+  EXPECT_EQ(take(), Turn::Batch);
+  queue().close({});
+  EXPECT_EQ(take(), Turn::Batch);  // empty, for the held ones
+  EXPECT_EQ(batch.records.size(), 0u);
+  EXPECT_TRUE(batch.urgent);
+}
+
+TEST_F(StoreQueueTest, ClosedQueueGivesWhatItHasAndTakesNothing) {
+  append();
+  queue().close({});
+  EXPECT_FALSE(append());
+  EXPECT_FALSE(flush());
+  EXPECT_EQ(take(), Turn::Batch);
+  EXPECT_EQ(batch.records.size(), 1u);
+  EXPECT_EQ(take(), Turn::End);
+}
+
+TEST_F(StoreQueueTest, CongestedAboveTheBoundUntilHalfIsReleased) {
+  append(19 * kRecord);
+  EXPECT_FALSE(queue().isCongested());
+  take();
+  append(0);
+  EXPECT_TRUE(queue().isCongested());
+  EXPECT_FALSE(queue().release(11 * kRecord - 1));
+  EXPECT_TRUE(queue().isCongested());
+  EXPECT_TRUE(queue().release(1));
+  EXPECT_FALSE(queue().isCongested());
+  EXPECT_FALSE(queue().release(kRecord));
+}
+
+TEST_F(StoreQueueTest, JobsComeFirstEvenWhileAWriteIsTriedAgain) {
+  append();
+  flush();
+  int ran = 0;
+  queue().runSoon([&] { ++ran; });
+  const Monotonic now = p.clock.monotonic();
+  EXPECT_EQ(queue().waitBeforeRetry(now + 1h), StoreQueue::Retry::JobsFirst);
+  EXPECT_EQ(take(), Turn::Jobs);
+  for (const auto& job : queue().takeJobs()) job();
+  EXPECT_EQ(ran, 1);
+  EXPECT_EQ(take(), Turn::Batch);
+}
+
+TEST_F(StoreQueueTest, RetriesEndWithTheDeadlineOfTheClose) {
+  const Monotonic now = p.clock.monotonic();
+  EXPECT_EQ(queue().waitBeforeRetry(now), StoreQueue::Retry::Now);
+  queue().close(now + 1s);
+  queue().close(now + 2s);  // the first one counts
+  EXPECT_EQ(queue().waitBeforeRetry(now + 1h), StoreQueue::Retry::Now);
+  p.clock.advance(1s);
+  EXPECT_EQ(queue().waitBeforeRetry(now + 1h), StoreQueue::Retry::NoMore);
+}
+
+}  // namespace
+}  // namespace vx::lnx
