@@ -4,6 +4,7 @@ import json
 import os
 import re
 import resource
+import select
 import shutil
 import subprocess
 import time
@@ -130,16 +131,23 @@ class Sensor:
     def __init__(self, address, refusals=0):
         script = os.path.join(os.path.dirname(os.path.abspath(__file__)), "fake_sensor.py")
         self.process = subprocess.Popen(["/usr/bin/python3", script, address, str(refusals)], stdin=subprocess.PIPE,
-                                        stdout=subprocess.PIPE, stderr=subprocess.DEVNULL, text=True)
+                                        stdout=subprocess.PIPE, stderr=subprocess.DEVNULL, bufsize=0)
+        self.said = b""
 
     def answers(self, n):
-        return [self.process.stdout.readline().strip() for _ in range(n)]
+        """The next n lines that it says, fewer when it says no more."""
+        while self.said.count(b"\n") < n and select.select([self.process.stdout], [], [], PATIENCE)[0]:
+            said = self.process.stdout.read(4096)
+            if not said:
+                break
+            self.said += said
+        *lines, self.said = self.said.split(b"\n", n)
+        return [line.decode() for line in lines]
 
     def turn(self, *words):
         """Once the daemon has asked for the present word, which is no change, turns the device, and waits until it knows."""
         for word in words:
-            self.process.stdin.write(word + "\n")
-        self.process.stdin.flush()
+            self.process.stdin.write(f"{word}\n".encode())
         return self.answers(len(words))
 
     def leave(self):
@@ -168,6 +176,7 @@ class OrientationTest(DaemonTest):
 
     def sensor(self, refusals=0):
         sensor = Sensor(self.address, refusals)
+        self.addCleanup(sensor.leave)
         self.assertEqual(sensor.answers(refusals + 1), ["refused"] * refusals + ["asked"])
         return sensor
 
@@ -187,7 +196,6 @@ class OrientationTest(DaemonTest):
         sensor = self.sensor()
         self.assertEqual(sensor.turn("right-up"), ["told"])
         self.assertEqual(self.words("device_orientation"), ["normal", "left-up", "undefined", "right-up"])
-        sensor.leave()
 
     def test_bus_that_comes_late_and_dies_under_registered_handlers(self):
         self.c.started(1, 7)
@@ -206,7 +214,6 @@ class OrientationTest(DaemonTest):
         self.assertEqual(sensor.turn("left-up"), ["told"])
         self.assertEqual(self.words("device_orientation")[-1], "left-up")
         self.assertEqual(self.d.log().count("device orientation is off for now"), 1)  # nothing is said of what lasts
-        sensor.leave()
         self.assertEqual(self.d.stop(), 0)
 
     def test_interface_orientation_from_the_state_file(self):
