@@ -206,6 +206,10 @@ class Daemon:
         finally:
             connection.close()
 
+    def wait_for_messages(self, count):
+        """Stopping has a limit of time, which much that is not stored yet may pass on a busy machine."""
+        self.wait_until(lambda: self.rows("SELECT count(*) FROM relay_messages") == [(count,)], f"{count} messages are stored")
+
     def clean_up(self):
         for c in self.clients:
             c.close()

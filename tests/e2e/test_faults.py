@@ -143,8 +143,7 @@ class Surroundings(DaemonTest):
         c = d.client()
         c.started(1, 2)
         c.call(SEND, {"a": 1}, 3, 1, [1])
-        count = lambda: d.rows("SELECT count(*) FROM relay_messages WHERE category = 3")
-        d.wait_until(lambda: count() == [(1,)], "the message is stored")
+        d.wait_for_messages(1)
         self.assertEqual(d.rows("PRAGMA journal_mode"), [("wal",)])  # readers do not hold up the service
         d.process.kill()
         d.process.wait()
@@ -158,7 +157,7 @@ class Surroundings(DaemonTest):
         c.call(STOP, 1)
         self.assertEqual(len(d.summaries()), 1)  # what was half-written when it died is gone
         self.assertEqual(d.stop(), 0)
-        self.assertEqual(count(), [(2,)])
+        self.assertEqual(d.rows("SELECT count(*) FROM relay_messages WHERE category = 3"), [(2,)])
 
     def test_garbage_database_is_moved_aside(self):
         d = self.daemon()
@@ -180,7 +179,7 @@ class Surroundings(DaemonTest):
         c = d.client()
         c.started(1)
         c.call(SEND, {"i": -1}, 3, 1, [1])
-        d.wait_until(lambda: d.rows("SELECT count(*) FROM relay_messages") == [(1,)], "the first message is stored")
+        d.wait_for_messages(1)
         # No file of the daemon may grow any more: to SQLite that is a full disk.
         resource.prlimit(d.process.pid, resource.RLIMIT_FSIZE, (4096, resource.RLIM_INFINITY))
         for i in range(200):
@@ -199,8 +198,8 @@ class Surroundings(DaemonTest):
         posts = [c.post(SEND, {"i": i, "text": "x" * 500}, 3, 1, [1]) for i in range(500)]
         for n in posts:
             self.assertIsNone(c.answer(n)[2])
+        d.wait_for_messages(500)
         self.assertEqual(d.stop(), 0)
-        self.assertEqual(d.rows("SELECT count(*) FROM relay_messages WHERE category = 3"), [(500,)])
 
     def test_socket_activation_and_readiness(self):
         folder = tempfile.mkdtemp(prefix="vx")

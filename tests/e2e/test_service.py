@@ -121,6 +121,7 @@ class Store(DaemonTest):
             self.assertEqual([c.answer(n) for n in sent], [[REPLY, n, None] for n in sent])
             self.assertIs(c.call(STOP, number), True)
             self.assertEqual([len(c.answers[n]) for n in (start, *sent)], [1] * (messages + 1))
+        d.wait_for_messages(clients * (messages + 1))
         self.assertEqual(d.stop(), 0)
         per_session = d.rows("SELECT s.session_id, count(*), count(DISTINCT json_extract(m.payload, '$.i')),"
                              " min(json_extract(m.payload, '$.client')), max(json_extract(m.payload, '$.client'))"
