@@ -5,61 +5,112 @@
 #include <cstddef>
 #include <memory>
 #include <new>
+#include <span>
 #include <utility>
 #include <vector>
 
 namespace vx {
 
 // Unlike a vector, growing moves nothing and asks for no memory larger than a chunk, which the
-// allocator would fetch from the kernel page by page each time. Not thread-safe.
-template <class T, std::size_t kPerChunk>
+// allocator would fetch from the kernel page by page each time. The first chunk holds kFirst
+// elements, each further one kFactor times as many up to kLargest; an empty list owns none. Not
+// thread-safe.
+template <class T, std::size_t kLargest, std::size_t kFirst = kLargest, std::size_t kFactor = 1>
 class ChunkList {
  public:
-  static_assert((kPerChunk & (kPerChunk - 1)) == 0, "a power of two");
+  static_assert((kLargest & (kLargest - 1)) == 0, "a power of two");
+  static_assert(kFirst == kLargest || (kFirst < kLargest && kFactor > 1));
+  static_assert(alignof(T) <= __STDCPP_DEFAULT_NEW_ALIGNMENT__);
 
   ChunkList() = default;
+  ChunkList(ChunkList&& other) noexcept { swap(other); }
+  ChunkList& operator=(ChunkList&& other) noexcept {
+    ChunkList(std::move(other)).swap(*this);
+    return *this;
+  }
   ChunkList(const ChunkList&) = delete;
   ChunkList& operator=(const ChunkList&) = delete;
   ~ChunkList() { clear(); }
 
-  std::size_t size() const { return size_; }
-  bool empty() const { return size_ == 0; }
-  std::size_t capacity() const { return chunks_.size() * kPerChunk; }
-  T& operator[](std::size_t i) { return *at(i); }
-  const T& operator[](std::size_t i) const { return *at(i); }
+  std::size_t size() const { return filled_ - static_cast<std::size_t>(end_ - at_); }
+  bool empty() const { return size() == 0; }
+  T& operator[](std::size_t i)
+    requires(kFirst == kLargest)
+  {
+    return *(first(i / kLargest) + i % kLargest);
+  }
+  const T& operator[](std::size_t i) const
+    requires(kFirst == kLargest)
+  {
+    return *(first(i / kLargest) + i % kLargest);
+  }
 
   void push_back(T value) {
-    if (size_ == capacity()) chunks_.push_back(std::unique_ptr<Chunk>(new Chunk));
-    ::new (static_cast<void*>(place(size_))) T(std::move(value));
-    ++size_;
+    if (at_ == end_) beginChunk();
+    ::new (static_cast<void*>(at_)) T(std::move(value));
+    ++at_;
+  }
+  // Copies all of them to the end; a run may lie in several chunks.
+  void append(std::span<const T> values) {
+    while (!values.empty()) {
+      if (at_ == end_) beginChunk();
+      const std::size_t count = std::min(values.size(), static_cast<std::size_t>(end_ - at_));
+      at_ = std::uninitialized_copy_n(values.begin(), count, at_);
+      values = values.subspan(count);
+    }
+  }
+  // The elements in order, as one span for each chunk in use.
+  template <class OnChunk>
+  void forEachChunk(const OnChunk& onChunk) const {
+    for (std::size_t i = 0; i < used_; ++i)
+      onChunk(std::span<const T>(first(i), i + 1 < used_ ? end(i) : at_));
   }
   // Keeps the chunks.
   void clear() {
-    for (std::size_t i = 0; i < size_; ++i) at(i)->~T();
-    size_ = 0;
+    for (std::size_t i = 0; i < used_; ++i) std::destroy(first(i), i + 1 < used_ ? end(i) : at_);
+    used_ = filled_ = 0;
+    at_ = end_ = nullptr;
   }
-  // Lets go of chunks that are not in use, as far as there are more than `capacity` needs.
+  // Frees chunks that are not in use, as far as there are more than `capacity` needs.
   void shrink(std::size_t capacity) {
-    const std::size_t used = (size_ + kPerChunk - 1) / kPerChunk;
-    const std::size_t kept = std::max(used, (capacity + kPerChunk - 1) / kPerChunk);
-    if (chunks_.size() > kept) chunks_.resize(kept);
+    std::size_t kept = 0;
+    for (std::size_t held = 0; kept < chunks_.size() && (kept < used_ || held < capacity); ++kept)
+      held += capacityOf(kept);
+    chunks_.resize(kept);
   }
-  void swap(ChunkList& other) {
+  void swap(ChunkList& other) noexcept {
     chunks_.swap(other.chunks_);
-    std::swap(size_, other.size_);
+    std::swap(used_, other.used_);
+    std::swap(filled_, other.filled_);
+    std::swap(at_, other.at_);
+    std::swap(end_, other.end_);
   }
 
  private:
-  struct Chunk {
-    alignas(T) std::byte bytes[kPerChunk * sizeof(T)];
-  };
-  std::byte* place(std::size_t i) const {
-    return chunks_[i / kPerChunk]->bytes + i % kPerChunk * sizeof(T);
+  static std::size_t capacityOf(std::size_t chunk) {
+    std::size_t capacity = kFirst;
+    for (; chunk > 0 && capacity < kLargest; --chunk) capacity *= kFactor;
+    return std::min(capacity, kLargest);
   }
-  T* at(std::size_t i) const { return std::launder(reinterpret_cast<T*>(place(i))); }
+  T* first(std::size_t chunk) const {
+    return std::launder(reinterpret_cast<T*>(chunks_[chunk].get()));
+  }
+  T* end(std::size_t chunk) const { return first(chunk) + capacityOf(chunk); }
+  void beginChunk() {
+    const std::size_t capacity = capacityOf(used_);
+    if (used_ == chunks_.size())
+      chunks_.push_back(std::unique_ptr<std::byte[]>(new std::byte[capacity * sizeof(T)]));
+    at_ = reinterpret_cast<T*>(chunks_[used_].get());
+    end_ = at_ + capacity;
+    filled_ += capacity;
+    ++used_;
+  }
 
-  std::vector<std::unique_ptr<Chunk>> chunks_;
-  std::size_t size_ = 0;
+  std::vector<std::unique_ptr<std::byte[]>> chunks_;
+  std::size_t used_ = 0;    // chunks; all but the last of them are full
+  std::size_t filled_ = 0;  // elements, were the last one full too
+  T* at_ = nullptr;         // where the next element goes, in the last chunk in use
+  T* end_ = nullptr;
 };
 
 }  // namespace vx

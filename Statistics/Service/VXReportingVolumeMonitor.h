@@ -18,11 +18,11 @@ class VXReportingSession;
 class VXReportingVolumeMonitor {
  public:
   // Null: on this device class its construction yields no object.
-  static std::shared_ptr<VXReportingVolumeMonitor> create() { return nullptr; }
+  static std::shared_ptr<VXReportingVolumeMonitor> create();
 
-  void stop() {}
-  void addSession(const std::shared_ptr<VXReportingSession>&) {}
-  void removeSession(const std::shared_ptr<VXReportingSession>&) {}
+  void stop();
+  void addSession(const std::shared_ptr<VXReportingSession>& session);
+  void removeSession(const std::shared_ptr<VXReportingSession>& session);
 
   std::shared_ptr<OneShotTimer> timer;
   std::shared_ptr<Thread> timerThread;
