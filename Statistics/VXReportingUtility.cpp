@@ -1,10 +1,9 @@
 #include "Statistics/VXReportingUtility.h"
 
 #include <array>
-#include <atomic>
 #include <chrono>
 
-#include "base/Mutex.h"
+#include "Statistics/VXReportingProcessState.h"
 #include "platform/Log.h"
 
 namespace vx {
@@ -71,10 +70,6 @@ void appendCategoryName(std::string& out, std::size_t prefix, std::size_t kind) 
   out += kKindNames[kind];
 }
 
-// 0: not asked yet; otherwise 1 + the answer.
-std::atomic<int> internalBuild{0};
-Mutex internalBuildMutex;
-
 }  // namespace
 
 std::string_view VXReportingServiceTypeName(ServiceType type) {
@@ -125,18 +120,7 @@ HostApplicationDisplayID VXReportingHostApplicationDisplayID(
   return payload ? HostApplicationDisplayID(*payload) : HostApplicationDisplayID();
 }
 
-bool VXReportingIsInternalBuild() {
-  int answer = internalBuild.load(std::memory_order_acquire);
-  if (answer == 0) {
-    MutexLock lock(internalBuildMutex);
-    answer = internalBuild.load(std::memory_order_relaxed);
-    if (answer == 0) {
-      answer = platform().deviceProperties.boolean("InternalBuild") ? 2 : 1;
-      internalBuild.store(answer, std::memory_order_release);
-    }
-  }
-  return answer == 2;
-}
+bool VXReportingIsInternalBuild() { return VXReportingProcessState::current().isInternalBuild(); }
 
 bool VXReportingUtilityWait(Condition& condition, const bool& done, const char* waitingMessage,
                             const char* timeoutMessage, const LogScope* log,
@@ -162,9 +146,5 @@ bool VXReportingUtilityWait(Condition& condition, const bool& done, const char* 
     }
   }
 }
-
-namespace testing_hooks {
-void forgetInternalBuild() { internalBuild.store(0, std::memory_order_release); }
-}  // namespace testing_hooks
 
 }  // namespace vx

@@ -78,9 +78,4 @@ bool VXReportingUtilityWait(Condition& condition, const bool& done, const char* 
                             const char* timeoutMessage, const LogScope* log,
                             double timeLimitSeconds);
 
-namespace testing_hooks {
-// Forgets the internal-build answer, as a new process would.
-void forgetInternalBuild();
-}  // namespace testing_hooks
-
 }  // namespace vx

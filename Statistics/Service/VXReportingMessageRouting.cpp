@@ -57,6 +57,7 @@ void VXReportingServerInstance::sendMessage(Payload message, MessageCategory cat
 void VXReportingServerInstance::routeMessage(
     const Payload& message, MessageCategory category, MessageType type,
     const std::optional<std::vector<ReporterID>>& reportingIDs, const ErrorReply& reply) {
+  serviceQueue()->assertIsCurrent();
   const auto delegate = delegate_.lock();
   if (delegate == nullptr || !delegate->isReportingEnabled()) return reply(reportingIsOff());
   if (reportingIDs)
@@ -114,6 +115,7 @@ void VXReportingServerInstance::routeToStarted(VXReportingServiceDelegateProtoco
 }
 
 void VXReportingServerInstance::startSession(ReporterID reporterID, BooleanReply reply) {
+  serviceQueue()->assertIsCurrent();
   platform().trace.emit(kTraceStart, 0, 0, 0, 0);
   if (reporterID == 0) return reply(true);
   const auto session = findReportingSessionForID(reporterID, Lookup::AcrossAllClients);
@@ -127,6 +129,7 @@ void VXReportingServerInstance::startSession(ReporterID reporterID, BooleanReply
 }
 
 void VXReportingServerInstance::stopSession(ReporterID reporterID) {
+  serviceQueue()->assertIsCurrent();
   static constexpr const char* kFunction = "stopReportingSessionForID";
   platform().trace.emit(kTraceStop, 0, 0, 0, 0);
   if (reporterID == 0) return;

@@ -34,6 +34,12 @@ VXReportingServerInstance::~VXReportingServerInstance() {
             processIdentifier_);
 }
 
+const VXReportingServerInstance::SessionMap& VXReportingServerInstance::clientReportingSessionMap()
+    const {
+  serviceQueue()->assertIsCurrent();
+  return clientReportingSessionMap_;
+}
+
 std::optional<Date> VXReportingServerInstance::clientStartDate() const {
   MutexLock lock(registrationMutex_);
   return clientStartDate_;
@@ -53,6 +59,7 @@ void VXReportingServerInstance::setRegistration(Date startDate,
 
 std::shared_ptr<VXReportingSession> VXReportingServerInstance::findReportingSessionForID(
     ReporterID reporterID, Lookup lookup) {
+  serviceQueue()->assertIsCurrent();
   const auto found = clientReportingSessionMap_.find(reporterID);
   if (found != clientReportingSessionMap_.end()) return found->second;
   if (lookup == Lookup::OwnMap) return nullptr;
@@ -70,11 +77,10 @@ void VXReportingServerInstance::createReportingSession(ReporterID reporterID, Bo
 }
 
 void VXReportingServerInstance::createSession(ReporterID reporterID) {
-  std::shared_ptr<VXReportingSession> session =
-      VXReportingSession::initWithID(reporterID, {processIdentifier_});
-  if (session == nullptr) return;
+  serviceQueue()->assertIsCurrent();
   // A session that is there already is dropped without being stopped.
-  clientReportingSessionMap_[reporterID] = std::move(session);
+  clientReportingSessionMap_[reporterID] =
+      VXReportingSession::initWithID(reporterID, {processIdentifier_});
   VX_LOG_AS("createReportingSession", serverLogScope(), Default,
             "session created for reporter %lli", ll(reporterID));
 }
@@ -147,6 +153,7 @@ void VXReportingServerInstance::destroyReportingSession(ReporterID reporterID, B
 }
 
 void VXReportingServerInstance::destroySession(ReporterID reporterID) {
+  serviceQueue()->assertIsCurrent();
   const auto found = clientReportingSessionMap_.find(reporterID);
   if (found != clientReportingSessionMap_.end()) {
     if (found->second->started()) found->second->stop();

@@ -129,13 +129,20 @@ void VXReportingServiceDelegate::clientInvalidated(
       Payload());
 }
 
+const VXReportingServiceDelegate::Clients& VXReportingServiceDelegate::getAllClients() {
+  serviceQueue()->assertIsCurrent();
+  return clients_;
+}
+
 void VXReportingServiceDelegate::removeClient(
     const std::shared_ptr<VXReportingServerInstance>& client) {
+  serviceQueue()->assertIsCurrent();
   std::erase(clients_, client);
 }
 
 std::shared_ptr<VXReportingSession> VXReportingServiceDelegate::findReportingSessionForID(
     ReporterID reporterID) {
+  serviceQueue()->assertIsCurrent();
   RecursiveMutexLock lock(monitor_);
   if (reporterID == 0) return nullptr;
   if (!isReportingEnabled()) return nullptr;
@@ -154,6 +161,11 @@ std::shared_ptr<VXReportingSession> VXReportingServiceDelegate::findReportingSes
 
 // ---------------------------------------------------------------------------------------------------------------------
 // Preferences
+
+std::optional<Payload> VXReportingServiceDelegate::getDefaults() {
+  serviceQueue()->assertIsCurrent();
+  return defaults_;
+}
 
 Payload VXReportingServiceDelegate::VXReportingDefaults() {
   const std::unique_ptr<PreferencesDomain> domain = platform().preferences.open(kDomain);
@@ -181,6 +193,7 @@ void VXReportingServiceDelegate::listenForDefaultsNotification() {
 }
 
 void VXReportingServiceDelegate::preferencesChanged(int token) {
+  serviceQueue()->assertIsCurrent();
   static constexpr const char* kFunction = "listenForDefaultsNotification";
   if (token != preferencesToken.load()) return;
   VX_LOG_AS(kFunction, serverLogScope(), Default, "re-reading sonik defaults");
@@ -193,6 +206,20 @@ void VXReportingServiceDelegate::preferencesChanged(int token) {
   if (const std::optional<Value> disabled = defaults_->find(kDisableReporting)) {
     reportingEnabled_.store(!disabled->asBool());
   }
+}
+
+// ---------------------------------------------------------------------------------------------------------------------
+// Drivers
+
+std::shared_ptr<DriverSnapShot> VXReportingServiceDelegate::getSnapShot() {
+  serviceQueue()->assertIsCurrent();
+  return driverUtility_->getSnapShot();
+}
+
+std::optional<Payload> VXReportingServiceDelegate::getDriverStatisticsRelativeToSnapShot(
+    const std::shared_ptr<DriverSnapShot>& snapShot) {
+  serviceQueue()->assertIsCurrent();
+  return driverUtility_->getDriverStatisticsRelativeToSnapShot(snapShot);
 }
 
 }  // namespace vx

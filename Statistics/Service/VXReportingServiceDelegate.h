@@ -26,7 +26,8 @@ class VXReportingServerInstance;
 // ---------------------------------------------------------------------------------------------------------------------
 // VXReportingServiceDelegateProtocol
 
-// How a server instance reaches service-wide state. Called on the service queue.
+// How a server instance reaches service-wide state. Called on the service queue, all but
+// isReportingEnabled.
 class VXReportingServiceDelegateProtocol {
  public:
   using Clients = std::vector<std::shared_ptr<VXReportingServerInstance>>;
@@ -84,7 +85,7 @@ class VXReportingServerInstance final
   void handleConnectionError();
 
   int32_t processIdentifier() const { return processIdentifier_; }
-  const SessionMap& clientReportingSessionMap() const { return clientReportingSessionMap_; }
+  const SessionMap& clientReportingSessionMap() const;
   // Written at registration, read by the connection's invalidation without a hop.
   std::optional<Date> clientStartDate() const;
   std::optional<std::string> clientProcessName() const;
@@ -131,15 +132,13 @@ class VXReportingServiceDelegate final
   bool listener(ServiceListener& listener,
                 const std::shared_ptr<ClientConnection>& connection) override;
 
-  std::optional<Payload> getDefaults() override { return defaults_; }
-  const Clients& getAllClients() override { return clients_; }
+  std::optional<Payload> getDefaults() override;
+  const Clients& getAllClients() override;
   bool isReportingEnabled() override { return reportingEnabled_.load(std::memory_order_relaxed); }
   std::shared_ptr<VXReportingSession> findReportingSessionForID(ReporterID reporterID) override;
-  std::shared_ptr<DriverSnapShot> getSnapShot() override { return driverUtility_->getSnapShot(); }
+  std::shared_ptr<DriverSnapShot> getSnapShot() override;
   std::optional<Payload> getDriverStatisticsRelativeToSnapShot(
-      const std::shared_ptr<DriverSnapShot>& snapShot) override {
-    return driverUtility_->getDriverStatisticsRelativeToSnapShot(snapShot);
-  }
+      const std::shared_ptr<DriverSnapShot>& snapShot) override;
   void removeClient(const std::shared_ptr<VXReportingServerInstance>& client) override;
 
   // The preferences as a dictionary: "device_name" when there is one, "disable_reporting" always
@@ -154,8 +153,8 @@ class VXReportingServiceDelegate final
   static void clientInvalidated(const std::weak_ptr<VXReportingServerInstance>& client,
                                 int32_t processIdentifier);
 
-  RecursiveMutex monitor_;  // set-up of a connection, and the lookup across clients; nested lookups
-                            // re-enter it
+  // Held for the set-up of a connection and for the lookup across clients; nested lookups re-enter.
+  RecursiveMutex monitor_;
   Clients clients_;
   std::unique_ptr<VXReportingDriverUtility> driverUtility_;
   std::optional<Payload> defaults_;

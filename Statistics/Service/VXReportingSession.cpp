@@ -1,8 +1,15 @@
 #include "Statistics/Service/VXReportingSession.h"
 
 #include <algorithm>
+#include <cmath>
+#include <stdexcept>
 
+#include "Statistics/Service/VXReportingServiceDelegate.h"
+#include "Statistics/Service/VXReportingSummaryEvent.h"
+#include "Statistics/Service/VXReportingSummaryFile.h"
+#include "Statistics/VXReportingProcessState.h"
 #include "platform/Log.h"
+#include "propertylist/JsonWriter.h"
 
 namespace vx {
 
@@ -15,32 +22,20 @@ constexpr uint32_t kTraceGone = 0x21042834;
 constexpr uint32_t kTraceMessage = 0x21042838;
 constexpr std::size_t kManyMessages = 4096;  // a megabyte or so
 constexpr std::chrono::seconds kUntilStored{2};
+constexpr int32_t kDeviceClassWithoutOrientation = 6;
+constexpr const char* kReportingSubdirectory = "/Audio/Reporting";
+constexpr const char* kDateFormat = "%Y%m%d-%H%M%S%z";
+constexpr unsigned kDirectoryMode = 0777;
 
-Mutex scopeMutex;
-bool scopeRegistered GUARDED_BY(scopeMutex) = false;
-std::atomic<const LogScope*> registeredScope{nullptr};
-
-void registerScopeOnce() {
-  MutexLock lock(scopeMutex);
-  if (scopeRegistered) return;
-  scopeRegistered = true;
-  registeredScope.store(
-      platform().log.registerScope(true, fourCharacterCode("vxrr"), "vxrr", "com.quorvel.sonik",
-                                   "reporting_session_verbose", 31),
-      std::memory_order_release);
+// Seconds since `start`, to the nearest millisecond, halves away from zero.
+double secondsSince(Date start) {
+  const double d = std::chrono::duration<double>(start - platform().clock.now()).count();
+  return std::round(d * 1000.0) / -1000.0;
 }
 
 }  // namespace
 
-const LogScope* sessionLogScope() { return registeredScope.load(std::memory_order_acquire); }
-
-namespace testing_hooks {
-void forgetSessionLogScope() {
-  MutexLock lock(scopeMutex);
-  scopeRegistered = false;
-  registeredScope.store(nullptr);
-}
-}  // namespace testing_hooks
+const LogScope* sessionLogScope() { return VXReportingProcessState::current().sessionLogScope(); }
 
 void VXReportingUserInfo::merge(const Payload& entries) {
   MutexLock lock(mutex_);
@@ -63,7 +58,7 @@ std::shared_ptr<VXReportingSession> VXReportingSession::initWithID(
     Constructible(ReporterID id, std::vector<int32_t> pids)
         : VXReportingSession(id, std::move(pids)) {}
   };
-  registerScopeOnce();
+  VXReportingProcessState::current().registerSessionLogScope();
   auto session = std::make_shared<Constructible>(reporterID, std::move(processIdentifiers));
   session->vyrReportingQueue_ = platform().workQueues.makeSerial(
       "com.quorvel.sonik.session.vyrreporting", QualityOfService::Utility);
@@ -80,6 +75,7 @@ VXReportingSession::~VXReportingSession() {
 }
 
 void VXReportingSession::setServiceType(ServiceType type) {
+  serviceQueue()->assertIsCurrent();
   serviceType_.store(type, std::memory_order_relaxed);
   serviceName_ = VXReportingServiceTypeName(type);
   VX_LOG(sessionLogScope(), Info, "setting service type %s", std::string(serviceName_).c_str());
@@ -94,10 +90,12 @@ void VXReportingSession::updateDefaults(const std::optional<Payload>& defaults) 
 }
 
 void VXReportingSession::mergeIntoUserInfo(const std::optional<Payload>& entries) {
+  serviceQueue()->assertIsCurrent();
   if (entries) userInfo_->merge(*entries);
 }
 
 void VXReportingSession::start() {
+  serviceQueue()->assertIsCurrent();
   VX_VERBOSE(sessionLogScope(), "starting session owned by %lli",
              static_cast<long long>(reporterID_));
   if (started_) {
@@ -117,6 +115,7 @@ void VXReportingSession::start() {
 }
 
 void VXReportingSession::stop() {
+  serviceQueue()->assertIsCurrent();
   VX_VERBOSE(sessionLogScope(), "ending session %lli", static_cast<long long>(reporterID_));
   if (shouldReportOrientation()) unregisterOrientationHandlers();
   if (!started_) return;
@@ -130,14 +129,13 @@ void VXReportingSession::stop() {
   writeSummaryJson();
   vyrReportingQueue_->async([self = shared_from_this()] { self->flushRelay(); });
   const bool many = aggregatedPayloadData_.size() >= kManyMessages;
-  auto flat = aggregatedPayloadData_.removeAll();
-  auto nested = nestedAggregatedPayloadData_.removeAll();
-  // Letting go of millions of messages takes its time: not on the queue that serves everybody.
-  vyrReportingQueue_->async([flat = std::move(flat), nested = std::move(nested)]() mutable {
+  // Destroying millions of messages takes its time: not on the queue that serves everybody.
+  vyrReportingQueue_->async([flat = aggregatedPayloadData_.removeAll(),
+                             nested = nestedAggregatedPayloadData_.removeAll()]() mutable {
     flat = {};
     nested = {};
   });
-  // The platform lets go of the last of them a moment later, when they are where they belong.
+  // The platform frees the last of them a moment later, when they are stored.
   if (many)
     vyrReportingQueue_->asyncAfter(kUntilStored, [] { platform().threading.memoryWasFreed(); });
   started_ = false;
@@ -148,6 +146,7 @@ void VXReportingSession::stop() {
 
 VXReportingSession::KindCount VXReportingSession::nextIdentifier(MessageCategory category,
                                                                  MessageType type) {
+  serviceQueue()->assertIsCurrent();
   const MessageKind kind = messageKind(category, type);
   for (KindCount& known : messageTypeCounts_) {
     if (known.kind == kind) return {kind, ++known.count};
@@ -179,6 +178,7 @@ Payload VXReportingSession::normalizePayloadKeys(const Payload& payload) {
 
 void VXReportingSession::sendMessage(const Payload& message, MessageCategory category,
                                      MessageType type, Sync, MessageReply reply) {
+  serviceQueue()->assertIsCurrent();
   VX_VERBOSE(sessionLogScope(), "sending message for session owned by %lli",
              static_cast<long long>(reporterID_));
   Payload normalised = normalizePayloadKeys(message);
@@ -195,6 +195,126 @@ void VXReportingSession::sendMessage(const Payload& message, MessageCategory cat
     self->relayMessage(normalised, asSent ? *asSent : normalised, category, type, startedNow);
   });
   if (reply) reply(std::nullopt);
+}
+
+// ---------------------------------------------------------------------------------------------------------------------
+// Orientation: changes while a long-form audio or telephony session is started, on internal builds
+
+// Asked at start and again at stop, with the service type of the moment: a type changed in between
+// leaves the handlers registered, or finds none to unregister. Intended.
+bool VXReportingSession::shouldReportOrientation() const {
+  return VXReportingIsInternalBuild() &&
+         (serviceType() == kServiceTypeLongFormAudio || serviceType() == kServiceTypeTelephony) &&
+         platform().deviceProperties.integer("DeviceClassNumber", 0) !=
+             kDeviceClassWithoutOrientation;
+}
+
+void VXReportingSession::registerOrientationHandlers() {
+  const std::string identifier = "VXReportingService " + std::to_string(reporterID_);
+  {
+    MutexLock lock(fieldsMutex_);
+    orientationCallbackID_ = identifier;
+    startDate_ = platform().clock.now();
+  }
+  OrientationNotifier& notifier = platform().orientation;
+  notifier.registerDeviceOrientationHandler(
+      identifier, [self = shared_from_this()](int64_t orientation) {
+        self->orientationChanged("device", "device_orientation", orientation);
+      });
+  notifier.registerInterfaceOrientationHandler(
+      identifier, [self = shared_from_this()](int64_t orientation) {
+        self->orientationChanged("ui", "ui_orientation", orientation);
+      });
+}
+
+void VXReportingSession::unregisterOrientationHandlers() {
+  const std::optional<std::string> identifier = orientationCallbackID();
+  if (!identifier) return;
+  OrientationNotifier& notifier = platform().orientation;
+  notifier.unregisterDeviceOrientationHandler(*identifier);
+  notifier.unregisterInterfaceOrientationHandler(*identifier);
+  MutexLock lock(fieldsMutex_);
+  orientationCallbackID_.reset();
+}
+
+void VXReportingSession::orientationChanged(const char* mode, std::string_view key,
+                                            int64_t orientation) {
+  const std::string name = platform().orientation.orientationText(orientation);
+  const std::optional<Date> began = startDate();
+  const double time = began ? secondsSince(*began) : 0;
+  if (platform().log.isLogEnabled(5, sessionLogScope())) {
+    const Payload info = userInfo_->snapshot();
+    const std::optional<Value> application = info.find(kHostApplicationDisplayIDKey);
+    VX_LOG_AS(
+        "start", sessionLogScope(), Debug,
+        "Orientation handler callback mode=%s orientation=\"%s\" app=\"%s\", time=%s, id=\"%s\"",
+        mode, name.c_str(), application ? application->text().c_str() : "(null)",
+        PayloadBuilder().set("t", time).build().find("t")->text().c_str(),
+        orientationCallbackID().value_or("(null)").c_str());
+  }
+  aggregatedPayloadData_.append(
+      PayloadBuilder().set(key, name).set(std::string(key) + "_time", time).build());
+}
+
+// ---------------------------------------------------------------------------------------------------------------------
+// Summary
+
+std::optional<Payload> VXReportingSession::createSummaryEventForSession() const {
+  serviceQueue()->assertIsCurrent();
+  if (aggregatedPayloadData_.size() == 0) return std::nullopt;
+  VXReportingSummaryEvent event(serviceType());
+  aggregatedPayloadData_.forEach([&](const Payload& payload) { event.add(payload); });
+  try {
+    return event.build();
+  } catch (const std::length_error& tooLarge) {
+    VX_LOG(sessionLogScope(), Error, "no summary event for reporter %lli: %s",
+           static_cast<long long>(reporterID_), tooLarge.what());
+    return std::nullopt;
+  }
+}
+
+void VXReportingSession::writeSummaryJson() {
+  serviceQueue()->assertIsCurrent();
+  if (!VXReportingIsInternalBuild()) return;
+  if (!nestedAggregatedPayloadData_.isPresent() || nestedAggregatedPayloadData_.size() == 0) return;
+  const Payload information = userInfo_->snapshot();
+  nestedAggregatedPayloadData_.insertAtFront(information);
+
+  std::optional<Error> unserialisable;
+  auto check = [&](const Payload& payload) {
+    if (!unserialisable) unserialisable = checkJson(payload);
+  };
+  nestedAggregatedPayloadData_.forEach(
+      check, [&](const VXReportingNestedEntry& entry) { check(entry.payload); });
+  if (unserialisable) {
+    VX_LOG(sessionLogScope(), Error, "dataWithJSONObject: %s",
+           unserialisable->description().c_str());
+  }
+
+  DiagnosticFiles& files = platform().diagnosticFiles;
+  const std::string date = platform().clock.formatLocal(platform().clock.now(), kDateFormat);
+  const std::string directory = files.logsDirectory() + kReportingSubdirectory;
+  if (const std::optional<Error> error = files.createDirectory(directory, kDirectoryMode)) {
+    VX_LOG(sessionLogScope(), Error, "can't create logging directory at %s: %s", directory.c_str(),
+           error->description().c_str());
+  }
+  if (unserialisable) return;  // there is no text to write, and nothing more is said
+
+  const std::string name = VXReportingSummaryFile::name(
+      date, information.find(kHostApplicationDisplayIDKey), serviceType());
+  std::optional<Error> error;
+  if (const std::unique_ptr<AtomicFile> file = files.createAtomically(directory, name, error)) {
+    VXReportingSummaryFile writer(*file);
+    nestedAggregatedPayloadData_.forEach(
+        [&](const Payload& header) { writer.element(header); },
+        [&](const VXReportingNestedEntry& entry) {
+          writer.namedElement(identifierText(static_cast<MessageKind>(entry.kind), entry.count),
+                              entry.payload);
+        });
+    error = writer.finish();
+  }
+  if (error)
+    VX_LOG(sessionLogScope(), Error, "jsonOutput writeToURL: %s", error->description().c_str());
 }
 
 // ---------------------------------------------------------------------------------------------------------------------

@@ -128,7 +128,6 @@ class VXReportingSession : public std::enable_shared_from_this<VXReportingSessio
     MessageKind kind;
     uint64_t count;
   };
-  struct RelayConfiguration;
 
   VXReportingSession(ReporterID reporterID, std::vector<int32_t> processIdentifiers);
   void mergeIntoUserInfo(const std::optional<Payload>& entries);
@@ -172,10 +171,5 @@ class VXReportingSession : public std::enable_shared_from_this<VXReportingSessio
 
 // The "vxrr" scope, once a session has been created; null before.
 const LogScope* sessionLogScope();
-
-namespace testing_hooks {
-// Forgets the session log scope, as a new process would.
-void forgetSessionLogScope();
-}  // namespace testing_hooks
 
 }  // namespace vx

@@ -1,5 +1,5 @@
-// The session's road to the reporting relay: set-up, sends and flush on its own queue, and
-// standalone messages.
+// The session and the reporting relay: set-up, sends and flush, all on the session's own queue, and
+// standalone messages on the background queue.
 #include <cstdlib>
 
 #include "Statistics/Service/VXReportingSession.h"
@@ -13,8 +13,8 @@ constexpr uint32_t kTraceMessage = 0x21042838;
 constexpr int32_t kClientType = 19;
 constexpr const char* kClientVersion = "2.0";
 constexpr std::string_view kClientName = "com.quorvel.sonik";
-constexpr const char* kConfigurationTimeLimit =
-    "9.0";                                   // seconds; parsed as single precision, then widened
+// Seconds; parsed as single precision, then widened.
+constexpr const char* kConfigurationTimeLimit = "9.0";
 constexpr uint32_t kAlarmDelaySeconds = 60;  // exclusive
 
 float clientVersion() { return std::strtof(kClientVersion, nullptr); }
@@ -40,6 +40,7 @@ struct ConfigurationState {
 
 void VXReportingSession::setUpRelay(std::string_view serviceName, ServiceType serviceTypeThen,
                                     bool configurationDone) {
+  vyrReportingQueue_->assertIsCurrent();
   static constexpr const char* kFunction = "start";
   if (serviceType() == kServiceTypeTest) return;
   setVyrReportingAgentToken(
@@ -79,15 +80,15 @@ void VXReportingSession::setUpRelay(std::string_view serviceName, ServiceType se
         state->condition->signal();
         state->condition->unlock();
       });
-  bool configured_ = false;
+  bool foundBackends = false;
   {
     Blocking blocking(platform().workQueues);
-    configured_ = VXReportingUtilityWait(*state->condition, state->done,
-                                         "waiting for vyrreportingd to find backends",
-                                         "failed to find backend", sessionLogScope(),
-                                         double{std::strtof(kConfigurationTimeLimit, nullptr)});
+    foundBackends = VXReportingUtilityWait(*state->condition, state->done,
+                                           "waiting for vyrreportingd to find backends",
+                                           "failed to find backend", sessionLogScope(),
+                                           double{std::strtof(kConfigurationTimeLimit, nullptr)});
   }
-  if (!configured_) {
+  if (!foundBackends) {
     setVyrReportingSession(nullptr);
     setVyrReportingSessionStarted(false);
   }
@@ -96,6 +97,7 @@ void VXReportingSession::setUpRelay(std::string_view serviceName, ServiceType se
 void VXReportingSession::relayMessage(const Payload& normalised, const Payload& message,
                                       MessageCategory category, MessageType type,
                                       bool startedThen) {
+  vyrReportingQueue_->assertIsCurrent();
   static constexpr const char* kFunction = "sendMessage";
   if (!startedThen) {
     if (platform().log.isLogEnabled(5, sessionLogScope())) {
@@ -134,6 +136,7 @@ void VXReportingSession::relayMessage(const Payload& normalised, const Payload& 
 }
 
 void VXReportingSession::flushRelay() {
+  vyrReportingQueue_->assertIsCurrent();
   static constexpr const char* kFunction = "stop";
   if (serviceType() == kServiceTypeTest) return;
   if (const std::shared_ptr<VyrReportingSession> relay = vyrReportingSession()) {

@@ -22,7 +22,7 @@ TEST_F(ClientTest, RegistrationPrecedesTheClientsFirstOperation) {
   connections.push_back(connection);
   EXPECT_TRUE(service->listener(p.listener, connection));
   EXPECT_TRUE(connection->resumed);
-  EXPECT_THAT(service->getAllClients(), IsEmpty());
+  EXPECT_THAT(onQueue([&] { return service->getAllClients(); }), IsEmpty());
   auto client = std::static_pointer_cast<VXReportingServerInstance>(connection->object);
   client->getAllReporters([&](const auto&) { EXPECT_EQ(service->getAllClients().size(), 1u); });
   p.queues.runAll();
@@ -41,7 +41,7 @@ TEST_F(ClientTest, UptimeIsSentOnInvalidationOnlyAndOnce) {
   connections[0]->interruption();
   p.queues.runAll();
   EXPECT_THAT(p.services.events, IsEmpty());
-  EXPECT_THAT(service->getAllClients(), IsEmpty());
+  EXPECT_THAT(onQueue([&] { return service->getAllClients(); }), IsEmpty());
   const auto gained = during([&] {
     connections[0]->invalidation();
     p.queues.runAll();
@@ -91,7 +91,7 @@ TEST_F(ClientTest, LostConnectionStopsStartedSessionsAndKeepsTheirReplies) {
       {"0x21042830", "reply", "removing"});
   EXPECT_THAT(gained, ElementsAre("trace 0x21042830",
                                   "log vxrs default removing 200 from the server client list"));
-  EXPECT_EQ(client.clientReportingSessionMap().size(), 2u);
+  EXPECT_EQ(onQueue([&] { return client.clientReportingSessionMap().size(); }), 2u);
 }
 
 TEST_F(ClientTest, OperationsTraceLogAndReplyInOrder) {
@@ -190,10 +190,10 @@ TEST_F(ClientTest, LookupsOfOwnMapAndAcrossClients) {
   a.setServiceType(9, 8, booleans("type"));  // not its own: nothing happens
   p.queues.runAll();
   EXPECT_EQ(typeOf(b, 8), 65535);
-  EXPECT_EQ(service->findReportingSessionForID(99), nullptr);
+  EXPECT_EQ(onQueue([&] { return service->findReportingSessionForID(99); }), nullptr);
   EXPECT_EQ(p.log.lines.back(), "vxrs error failed to find reporting session 99");
   create(a, 0);
-  EXPECT_EQ(service->findReportingSessionForID(0), nullptr);
+  EXPECT_EQ(onQueue([&] { return service->findReportingSessionForID(0); }), nullptr);
   EXPECT_NE(session(a, 0), nullptr);
 }
 

@@ -5,14 +5,16 @@ namespace {
 
 class PreferencesTest : public ServiceTest {
  protected:
-  void notify(int token = fakes::FakeServices::kToken) { (*p.services.notifyHandler)(token); }
+  void notify(int token = fakes::FakeServices::kToken) {
+    onQueue([&] { (*p.services.notifyHandler)(token); });
+  }
 };
 
 TEST_F(PreferencesTest, NothingIsReadBeforeTheFirstNotification) {
   p.services.preferences["disable_reporting"] = "true";
   EXPECT_EQ(p.services.preferenceReads, 0);
   EXPECT_TRUE(service->isReportingEnabled());
-  EXPECT_EQ(service->getDefaults(), std::nullopt);
+  EXPECT_EQ(onQueue([&] { return service->getDefaults(); }), std::nullopt);
   EXPECT_EQ(p.services.notifyQueue, serviceQueue());
 }
 
@@ -52,9 +54,8 @@ TEST_F(PreferencesTest, OffRefusesMessagesAndHidesOthersSessions) {
   notify();
   EXPECT_THAT(during([&] { send(a, message(), 1, 1); }),
               ElementsAre("trace 0x21042824", "reply send com.quorvel.audio.reporting 1"));
-  EXPECT_EQ(service->findReportingSessionForID(1), nullptr);
-  EXPECT_NE(b.findReportingSessionForID(1, VXReportingServerInstance::Lookup::AcrossAllClients),
-            nullptr);
+  EXPECT_EQ(onQueue([&] { return service->findReportingSessionForID(1); }), nullptr);
+  EXPECT_NE(session(b, 1), nullptr);
   p.services.preferences.clear();
   notify();
   EXPECT_THAT(during([&] { send(a, message(), 1, 1); }, {"reply"}), ElementsAre("reply send"));

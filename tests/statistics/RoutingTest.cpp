@@ -44,7 +44,7 @@ TEST_F(RoutingTest, StartedSessionsOfAllClientsAreServedBeforeTheSinks) {
 TEST_F(RoutingTest, MessageToNobodyGoesOutAloneWithoutAnalyticsOrUserInformation) {
   auto& client = connect();
   p.services.preferences["device_name"] = "Pocket";
-  (*p.services.notifyHandler)(p.services.kToken);
+  onQueue([&] { (*p.services.notifyHandler)(p.services.kToken); });
   const auto gained = during([&] { send(client, engineOn(), kSetup, 6); },
                              {"event", "power", "one-off", "standalone"});
   EXPECT_THAT(
@@ -96,7 +96,7 @@ TEST_F(RoutingTest, StartTakesItsSnapshotAfterStartingAndHoldsTheReply) {
 TEST_F(RoutingTest, AReplyHeldOverAStopElsewhereIsReleasedByTheNextStart) {
   auto& client = connect();
   started(client, 1);
-  session(client, 1)->stop();
+  onQueue([&] { session(client, 1)->stop(); });
   EXPECT_THAT(during([&] { start(client, 1); }, {"reply"}), ElementsAre("reply start true"));
   EXPECT_TRUE(session(client, 1)->hasTransactionCompleteBlock());
 }

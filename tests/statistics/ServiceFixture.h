@@ -10,6 +10,7 @@
 #include <vector>
 
 #include "Statistics/Service/VXReportingServiceDelegate.h"
+#include "Statistics/VXReportingProcessState.h"
 #include "tests/fakes/FakePlatform.h"
 
 namespace vx {
@@ -21,13 +22,25 @@ using ::testing::HasSubstr;
 using ::testing::IsEmpty;
 using ::testing::Not;
 
+// The test's own code is an item of the service queue while this lives.
+class OnServiceQueue {
+ public:
+  explicit OnServiceQueue(fakes::FakePlatform& platform)
+      : current_(platform.queues.current), outer_(current_) {
+    current_ = serviceQueue().get();
+  }
+  ~OnServiceQueue() { current_ = outer_; }
+
+ private:
+  const WorkQueue*& current_;
+  const WorkQueue* const outer_;
+};
+
 class ServiceTest : public ::testing::Test {
  protected:
   static constexpr MessageCategory kSetup = 0x08000005;
 
   ServiceTest() {
-    testing_hooks::forgetInternalBuild();
-    testing_hooks::forgetSessionLogScope();
     p.services.processNames[200] = "player";
     p.services.processNames[201] = "phone";
     service = VXReportingServiceDelegate::create();
@@ -86,6 +99,7 @@ class ServiceTest : public ::testing::Test {
     };
   }
   std::shared_ptr<VXReportingSession> session(VXReportingServerInstance& client, ReporterID id) {
+    const OnServiceQueue here{p};
     return client.findReportingSessionForID(id, VXReportingServerInstance::Lookup::OwnMap);
   }
   // What the journal gained while `steps` ran, only lines that contain one of `interesting` (all
@@ -105,7 +119,15 @@ class ServiceTest : public ::testing::Test {
   }
   static Payload message() { return PayloadBuilder().set("a", 1).build(); }
 
+  // What belongs to the service queue, done there.
+  template <class Steps>
+  decltype(auto) onQueue(const Steps& steps) {
+    const OnServiceQueue here{p};
+    return steps();
+  }
+
   fakes::FakePlatform p;
+  VXReportingProcessState processState;
   std::shared_ptr<VXReportingServiceDelegate> service;
   std::vector<std::shared_ptr<fakes::FakeConnection>> connections;
   std::vector<std::shared_ptr<VXReportingServerInstance>> clients;

@@ -17,6 +17,7 @@ class SessionTest : public ServiceTest {
       all.push_back(payload.text());
     return all;
   }
+  const OnServiceQueue here_{p};
 };
 
 TEST_F(SessionTest, NumbersPerKindAcrossRestartsAndStates) {
@@ -233,7 +234,7 @@ TEST_F(OrientationTest, OnlyWhereAllThreeConditionsHold) {
   p.services.deviceClass = 6;
   EXPECT_FALSE(make(1, 7)->shouldReportOrientation());
   p.services.deviceClass = 0;
-  testing_hooks::forgetInternalBuild();
+  const VXReportingProcessState another;
   p.services.internalBuild = false;
   EXPECT_FALSE(make(1, 7)->shouldReportOrientation());
 }

@@ -15,6 +15,7 @@ class SummaryTest : public ServiceTest {
     p.queues.runAll();
     return s;
   }
+  const OnServiceQueue here_{p};
 };
 
 TEST_F(SummaryTest, JoinsEveryValueOfAKeyAsText) {
@@ -100,7 +101,7 @@ TEST_F(SummaryTest, FailedWriteIsLoggedAndTheStopGoesOn) {
 }
 
 TEST_F(SummaryTest, OtherBuildsWriteNothing) {
-  testing_hooks::forgetInternalBuild();
+  const VXReportingProcessState another;
   p.services.internalBuild = false;
   const auto s = startedSession();
   s->sendMessage(message(), 3, 1, nullptr);

@@ -47,7 +47,7 @@ TEST(Vocabulary, HostApplicationIsPassedThroughWhateverItIs) {
 
 TEST(Vocabulary, InternalBuildIsAskedOnce) {
   fakes::FakePlatform p;
-  testing_hooks::forgetInternalBuild();
+  const VXReportingProcessState processState;
   p.services.internalBuild = true;
   EXPECT_TRUE(VXReportingIsInternalBuild());
   p.services.internalBuild = false;

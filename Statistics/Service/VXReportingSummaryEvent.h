@@ -1,0 +1,44 @@
+// The event that condenses everything a session received.
+#pragma once
+
+#include <cstddef>
+#include <deque>
+#include <string>
+#include <string_view>
+#include <unordered_map>
+
+#include "Statistics/VXReportingUtility.h"
+#include "base/ChunkList.h"
+
+namespace vx {
+
+// Groups the values of many dictionaries by key: each key's texts in the order met, joined by ",".
+// Lives for one stop of a session, on the service queue; as large as the texts it holds.
+class VXReportingSummaryEvent {
+ public:
+  // The first value of all is the service type, under "VX_Session_Summary_Event". A payload that
+  // holds this key too appends to it: nothing prevents that.
+  explicit VXReportingSummaryEvent(ServiceType serviceType);
+  void add(const Payload& payload);
+  // std::length_error when the event would be larger than a Payload can be.
+  Payload build() const;
+
+ private:
+  struct Group {
+    std::string key;
+    ChunkList<char, (64 << 10), 128, 2> text;
+    bool any = false;  // a value: the first may be the empty text
+  };
+  static void add(Group& group, const Value& value);
+  static void append(Group& group, std::string_view text);
+  std::size_t indexOf(std::string_view key);
+
+  std::deque<Group> groups_;  // in order of their first values; never moves its elements
+  std::unordered_map<std::string_view, std::size_t> index_;
+  // Messages of one kind tend to hold the same keys in the same order, so the group after the one
+  // used last is tried before the index is asked.
+  std::size_t next_ = 0;
+  std::size_t first_ = 0;  // the group of the last dictionary's first key
+};
+
+}  // namespace vx
