@@ -390,7 +390,7 @@ std::unique_ptr<AtomicFile> FakeServices::createAtomically(const std::string& di
     std::optional<Error> take(std::string& text) override {
       content_ += text;
       text.clear();
-      return std::nullopt;
+      return std::exchange(owner_.writeError, std::nullopt);
     }
     std::optional<Error> commit() override {
       owner_.journal_.push_back("file " + path_);

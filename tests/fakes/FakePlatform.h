@@ -287,6 +287,7 @@ class FakeServices final : public AnalyticsEventService,
   std::map<std::string, std::string> files;
   std::optional<Error> directoryError;
   std::optional<Error> fileError;
+  std::optional<Error> writeError;  // of the next piece written, and of no other
   std::map<std::string, Group> groups;  // by "group-subgroup", "(null)" for an absent one
   std::function<void()> onSnapshot;
 

@@ -12,9 +12,71 @@ TEST_F(ClientTest, CreationRegistersInOrder) {
   EXPECT_THAT(p.journal, ElementsAre("notify com.quorvel.sonik.reporting",
                                      "log vxrs default notify setup result 0",
                                      "log vxrd info creating channelreporting driver utility"));
+  p.services.notifyStatus = 9;
+  const auto again = during([&] { service = VXReportingServiceDelegate::create(); }, {"setup"});
+  EXPECT_THAT(again, ElementsAre("log vxrs default notify setup result 9"));
   EXPECT_EQ(p.queues.made[0],
             (std::pair<std::string, QualityOfService>("com.quorvel.sonik.reporting.server",
                                                       QualityOfService::UserInteractive)));
+}
+
+// What the connection checks arguments against and bounds resources by.
+TEST_F(ClientTest, TheExportedInterface) {
+  connect();
+  std::string text;
+  for (const OperationDescription& operation : connections[0]->interface->operations) {
+    text += std::string(operation.name) + "(";
+    for (const ArgumentKind kind : operation.arguments) text += "iwud?*"[static_cast<int>(kind)];
+    text += std::string(")") + "bwedn"[static_cast<int>(operation.reply)];
+    if (operation.replyMayBeHeld) text += " held";
+    if (operation.resource == ResourceEffect::Acquire) text += " acquires";
+    text += operation.resource == ResourceEffect::Release ? " releases; " : "; ";
+  }
+  EXPECT_EQ(text,
+            "createReportingSession(i)b acquires; setServiceType(wi)b; "
+            "getServiceNameForReporterID(i)w; setConfiguration(?i)b; "
+            "startReportingSessionForID(i)b held; sendMessage(duw*)e; "
+            "stopReportingSessionForID(i)b; destroyReportingSession(i)b releases; reporterID(i)d; "
+            "getAllReporters()n; killService()b; ");
+}
+
+TEST_F(ClientTest, EveryOperationIsInvokedWithItsArguments) {
+  class Target final : public ReplyTarget {
+   public:
+    void reply(uint64_t, ReplyValue value) override { last = std::move(value); }
+    void release(uint64_t) override {}
+    ReplyValue last = std::monostate();
+  };
+  auto& client = connect();
+  const auto target = std::make_shared<Target>();
+  const auto call = [&](std::size_t operation, const std::vector<Argument>& given) {
+    CallArguments arguments;
+    for (std::size_t i = 0; i < given.size(); ++i) arguments.set(i, given[i]);
+    connections[0]->interface->operations[operation].invoke(client, arguments, Reply(target, 1));
+    p.queues.runAll();
+    return target->last;
+  };
+  const Argument five = int64_t{5};
+  EXPECT_EQ(call(0, {five}), ReplyValue(true));
+  EXPECT_EQ(call(1, {uint64_t{3}, five}), ReplyValue(true));
+  EXPECT_EQ(call(2, {five}), ReplyValue(uint16_t{3}));
+  EXPECT_EQ(call(3, {std::optional(message()), five}), ReplyValue(true));
+  EXPECT_EQ(session(client, 5)->userInfo()->snapshot().text(), "{a=1}");
+  target->last = std::monostate();
+  EXPECT_EQ(call(4, {five}), ReplyValue());
+  EXPECT_EQ(call(5, {std::optional(message()), uint64_t{0x40000007}, uint64_t{2},
+                     std::optional(std::vector<int64_t>{5})}),
+            ReplyValue());
+  EXPECT_EQ(p.vyr.sent.back().category, 7);
+  EXPECT_EQ(p.vyr.sent.back().type, 2);
+  EXPECT_EQ(call(6, {five}), ReplyValue(true));
+  EXPECT_FALSE(session(client, 5)->started());
+  EXPECT_EQ(std::get<Payload>(call(8, {five})).text(), "{reporterID=5,serviceType=3}");
+  EXPECT_EQ(call(9, {}), ReplyValue(std::vector<int64_t>{5}));
+  EXPECT_EQ(call(7, {five}), ReplyValue(true));
+  EXPECT_EQ(session(client, 5), nullptr);
+  call(10, {});
+  EXPECT_EQ(p.journal.back(), "exit 2");
 }
 
 TEST_F(ClientTest, RegistrationPrecedesTheClientsFirstOperation) {
@@ -36,22 +98,29 @@ TEST_F(ClientTest, OwnProcessHasItsOwnNameAndImpossibleOnesNone) {
 }
 
 TEST_F(ClientTest, UptimeIsSentOnInvalidationOnlyAndOnce) {
-  connect();
+  EXPECT_THAT(during([&] { connect(); }),
+              ElementsAre("log vxrs default newConnection: <connection>",
+                          "log vxrs default new client with pid 200"));
   p.clock.advance(std::chrono::milliseconds(2500));
-  connections[0]->interruption();
-  p.queues.runAll();
-  EXPECT_THAT(p.services.events, IsEmpty());
+  EXPECT_THAT(during([&] {
+                connections[0]->interruption();
+                p.queues.runAll();
+              }),
+              ElementsAre("log vxrs default InterruptionHandler: connection exited",
+                          "log vxrs default removing 200 from the server client list"));
   EXPECT_THAT(onQueue([&] { return service->getAllClients(); }), IsEmpty());
-  const auto gained = during([&] {
-    connections[0]->invalidation();
-    p.queues.runAll();
-  });
   EXPECT_THAT(
-      gained,
+      during([&] {
+        connections[0]->invalidation();
+        p.queues.runAll();
+      }),
       ElementsAre(
           "log vxrs default InvalidationHandler: connection exited process=player uptime_sec=2",
           "event com.quorvel.sonik.vxreportingclientuptime"));
   EXPECT_EQ((*p.services.events[0].builder)().text(), "{processName=player,seconds=2.5}");
+  clients.clear();
+  EXPECT_THAT(during([&] { connections.clear(); }),
+              ElementsAre("log vxrs default dealloc 200 from the server client list"));
 }
 
 TEST_F(ClientTest, StartDateInTheFutureIsCalledThePastAndCountsAllTheSame) {
@@ -65,16 +134,20 @@ TEST_F(ClientTest, StartDateInTheFutureIsCalledThePastAndCountsAllTheSame) {
   EXPECT_EQ((*p.services.events[0].builder)().find("seconds")->text(), "4");
 }
 
-TEST_F(ClientTest, MissingStartDateGivesMinusOneAsAnInteger) {
-  auto connection = std::make_shared<fakes::FakeConnection>(200);
-  connections.push_back(connection);
-  service->listener(p.listener, connection);
-  std::static_pointer_cast<VXReportingServerInstance>(connection->object);
-  connection->invalidation();  // before registration ran
-  EXPECT_THAT(
-      p.log.lines,
-      Contains("vxrs default clientStartDate is nil. clientpid=200 clientprocessname=unknown"));
-  EXPECT_THAT(p.log.lines, Contains("vxrs default clientProcessName is nil. clientpid=200"));
+TEST_F(ClientTest, WithoutANameNoUptime) {
+  connect(555);
+  p.clock.advance(std::chrono::seconds(3));
+  auto unregistered = std::make_shared<fakes::FakeConnection>(200);
+  service->listener(p.listener, unregistered);
+  const std::string gone =
+      "log vxrs default InvalidationHandler: connection exited process=unknown";
+  const std::string nameless = "log vxrs default clientProcessName is nil. clientpid=";
+  EXPECT_THAT(during([&] { connections[0]->invalidation(); }),
+              ElementsAre(gone + " uptime_sec=3", nameless + "555"));
+  EXPECT_THAT(during([&] { unregistered->invalidation(); }),
+              ElementsAre("log vxrs default clientStartDate is nil. clientpid=200 "
+                          "clientprocessname=unknown",
+                          gone + " uptime_sec=-1", nameless + "200"));
   EXPECT_THAT(p.services.events, IsEmpty());
 }
 
@@ -91,6 +164,7 @@ TEST_F(ClientTest, LostConnectionStopsStartedSessionsAndKeepsTheirReplies) {
       {"0x21042830", "reply", "removing"});
   EXPECT_THAT(gained, ElementsAre("trace 0x21042830",
                                   "log vxrs default removing 200 from the server client list"));
+  EXPECT_FALSE(onQueue([&] { return client.clientReportingSessionMap().at(1)->started(); }));
   EXPECT_EQ(onQueue([&] { return client.clientReportingSessionMap().size(); }), 2u);
 }
 
@@ -123,6 +197,15 @@ TEST_F(ClientTest, OperationsTraceLogAndReplyInOrder) {
       }),
       ElementsAre("trace 0x21042820", "trace 0x21042834", "log vxrr info deallocing this session 5",
                   "log vxrs default destroying 5", "reply destroy true"));
+  started(client, 6);
+  EXPECT_THAT(during(
+                  [&] {
+                    client.destroyReportingSession(6, booleans("destroy"));
+                    p.queues.runAll();
+                  },
+                  {"trace", "flush", "reply"}),
+              ElementsAre("trace 0x21042820", "trace 0x21042830", "reply destroy true", "flush",
+                          "trace 0x21042834"));
   EXPECT_THAT(during([&] {
                 client.destroyReportingSession(5, booleans("destroy"));
                 client.destroyReportingSession(0, booleans("destroy"));
@@ -146,16 +229,32 @@ TEST_F(ClientTest, ServiceTypeOfReporter0IsAnsweredTwice) {
 
 TEST_F(ClientTest, FrontHalvesSpeakOnlyWhenVerbose) {
   auto& client = connect();
-  auto frontHalf = [&] {
+  auto frontHalves = [&] {
     return during([&] {
+      client.createReportingSession(1, booleans(""));
+      client.setServiceType(2, 1, booleans(""));
       client.getServiceNameForReporterID(1, [](ServiceType) {});
+      client.setConfiguration(message(), 1, booleans(""));
+      client.startReportingSessionForID(1, booleans(""));
       client.sendMessage(message(), 1, 1, std::vector<ReporterID>{4, 5}, [](const auto&) {});
+      client.sendMessage(message(), 1, 1, std::nullopt, [](const auto&) {});
+      client.stopReportingSessionForID(1, booleans(""));
+      client.destroyReportingSession(1, booleans(""));
+      client.reporterID(1, [](const Payload&) {});
     });
   };
-  EXPECT_THAT(frontHalf(), IsEmpty());
+  EXPECT_THAT(frontHalves(), IsEmpty());
   p.log.verbose = true;
-  EXPECT_THAT(frontHalf(), ElementsAre("log vxrs debug fetching seviceType",
-                                       "log vxrs debug sending message for reporter (4, 5)"));
+  const std::string before = "log vxrs debug ";
+  EXPECT_THAT(
+      frontHalves(),
+      ElementsAre(before + "creating session for reporter 1",
+                  before + "setting service type 2 for reporter 1", before + "fetching seviceType",
+                  before + "setting configuration", before + "starting session for reporter 1",
+                  before + "sending message for reporter (4, 5)",
+                  before + "sending message for reporter (null)",
+                  before + "stopping session for reporter 1",
+                  before + "destroying session for reporter 1", before + "validating reporter 1"));
   p.log.verbose = false;
 }
 
@@ -186,14 +285,28 @@ TEST_F(ClientTest, LookupsOfOwnMapAndAcrossClients) {
   };
   EXPECT_EQ(typeOf(b, 7), 4);  // its own comes first
   auto& c = connect(202);
-  EXPECT_EQ(typeOf(c, 7), 3);                // then the client that was registered first
-  a.setServiceType(9, 8, booleans("type"));  // not its own: nothing happens
+  EXPECT_EQ(typeOf(c, 7), 3);  // then the client that was registered first
+  // What is not its own stays as it is.
+  a.setServiceType(9, 8, booleans("type"));
+  configure(a, 8, message());
+  a.destroyReportingSession(8, booleans("destroy"));
   p.queues.runAll();
   EXPECT_EQ(typeOf(b, 8), 65535);
-  EXPECT_EQ(onQueue([&] { return service->findReportingSessionForID(99); }), nullptr);
+  EXPECT_EQ(session(b, 8)->userInfo()->snapshot().size(), 0u);
+  for (const auto& [id, answer] : {std::pair(ReporterID{7}, "{reporterID=7,serviceType=3}"),
+                                   {8, "{reporterID=8,serviceType=65535}"},
+                                   {99, "{reporterID=0,serviceType=65535}"}}) {
+    c.reporterID(id, [expected = answer](const Payload& p) { EXPECT_EQ(p.text(), expected); });
+    p.queues.runAll();
+  }
+  c.getAllReporters([](const auto& all) { EXPECT_THAT(all, ElementsAre(7, 7, 8)); });
+  const OnServiceQueue here{p};
+  EXPECT_NE(service->findReportingSessionForID(8), nullptr);
+  EXPECT_EQ(p.log.lines.back(), "vxrs info found reporting session 8 for client 201");
+  EXPECT_EQ(service->findReportingSessionForID(99), nullptr);
   EXPECT_EQ(p.log.lines.back(), "vxrs error failed to find reporting session 99");
   create(a, 0);
-  EXPECT_EQ(onQueue([&] { return service->findReportingSessionForID(0); }), nullptr);
+  EXPECT_EQ(service->findReportingSessionForID(0), nullptr);
   EXPECT_NE(session(a, 0), nullptr);
 }
 

@@ -18,12 +18,6 @@ TEST_F(PreferencesTest, NothingIsReadBeforeTheFirstNotification) {
   EXPECT_EQ(p.services.notifyQueue, serviceQueue());
 }
 
-TEST_F(PreferencesTest, ForeignTokenChangesNothing) {
-  p.services.preferences["disable_reporting"] = "true";
-  EXPECT_THAT(during([&] { notify(3); }), IsEmpty());
-  EXPECT_TRUE(service->isReportingEnabled());
-}
-
 TEST_F(PreferencesTest, AbsentSwitchIsTheIntegerZeroPresentOneABoolean) {
   EXPECT_EQ(VXReportingServiceDelegate::VXReportingDefaults().find("disable_reporting")->kind(),
             ValueKind::Integer);
@@ -43,19 +37,29 @@ TEST_F(PreferencesTest, SessionsLearnBeforeTheSwitchMoves) {
   EXPECT_EQ(session(client, 1)->userInfo()->snapshot().text(),
             "{device_name=Pocket,disable_reporting=1}");
   create(client, 2);
+  p.services.preferences.erase("device_name");
+  notify(3);                                                         // somebody else's
   EXPECT_EQ(session(client, 2)->userInfo()->snapshot().size(), 0u);  // until the next notification
+  notify();
+  EXPECT_EQ(onQueue([&] { return service->getDefaults(); })->text(), "{disable_reporting=1}");
+  EXPECT_EQ(session(client, 2)->userInfo()->snapshot().text(), "{disable_reporting=1}");
 }
 
 TEST_F(PreferencesTest, OffRefusesMessagesAndHidesOthersSessions) {
   auto& a = connect(200);
   auto& b = connect(201);
   started(b, 1);
+  create(b, 2);
   p.services.preferences["disable_reporting"] = "true";
   notify();
+  p.log.lines.clear();
+  start(a, 2);
+  EXPECT_FALSE(session(b, 2)->started());
   EXPECT_THAT(during([&] { send(a, message(), 1, 1); }),
               ElementsAre("trace 0x21042824", "reply send com.quorvel.audio.reporting 1"));
   EXPECT_EQ(onQueue([&] { return service->findReportingSessionForID(1); }), nullptr);
   EXPECT_NE(session(b, 1), nullptr);
+  EXPECT_THAT(p.log.lines, IsEmpty());
   p.services.preferences.clear();
   notify();
   EXPECT_THAT(during([&] { send(a, message(), 1, 1); }, {"reply"}), ElementsAre("reply send"));

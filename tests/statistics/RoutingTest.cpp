@@ -1,3 +1,5 @@
+#include "Statistics/VXReportingTallyhubBridge.h"
+#include "Statistics/VXReportingWattmarkUtility.h"
 #include "tests/statistics/ServiceFixture.h"
 
 namespace vx {
@@ -16,7 +18,7 @@ TEST_F(RoutingTest, ListedSessionsAreServedAfterTheSinks) {
   create(client, 1);  // need not be started
   const auto gained = during(
       [&] {
-        client.sendMessage(engineOn(), 1, 6, std::vector<ReporterID>{0, 1, 99},
+        client.sendMessage(engineOn(), 1, 6, std::vector<ReporterID>{0, 99, 1},
                            [&](const auto&) { p.journal.push_back("reply send"); });
         p.queues.runAll("com.quorvel.sonik.session.vyrreporting");
       },
@@ -30,11 +32,15 @@ TEST_F(RoutingTest, StartedSessionsOfAllClientsAreServedBeforeTheSinks) {
   auto& b = connect(201);
   started(b, 1);
   create(b, 2);
+  started(a, 3);
+  const std::string event = "event com.quorvel.sonik.Session_Setup.Undefined";
   const auto gained = during([&] { send(a, engineOn(), kSetup, 6); }, kDelivery);
-  EXPECT_THAT(gained,
-              ElementsAre("trace 0x21042838", "event com.quorvel.sonik.Session_Setup.Undefined",
-                          "power Lumo_Haptics", "reply send"));
-  EXPECT_THAT(p.log.lines, Contains("vxrs default sessions for client 200 : ()"));
+  EXPECT_THAT(gained, ElementsAre("trace 0x21042838", event, "power Lumo_Haptics",
+                                  "trace 0x21042838", event, "power Lumo_Haptics", "reply send"));
+  stop(a, 3);
+  EXPECT_EQ(during([&] { send(a, engineOn(), kSetup, 6); }, kDelivery).size(), 4u);
+  EXPECT_THAT(p.log.lines,
+              Contains("vxrs default sessions for client 200 : (<VXReportingSession 3>)"));
   EXPECT_THAT(p.log.lines, Contains("vxrs default sessions for client 201 : (<VXReportingSession "
                                     "1>, <VXReportingSession 2>)"));
   EXPECT_THAT(p.log.lines,
@@ -108,6 +114,9 @@ TEST_F(RoutingTest, StopOfASessionNeverStartedStillAsksTheDrivers) {
               ElementsAre("log vxrs default nothing interesting to fetch from the drivers",
                           "reply stop true"));
   EXPECT_THAT(during([&] { stop(client, 0); }), ElementsAre("trace 0x2104281C", "reply stop true"));
+  for (const ReporterID nobody : {0, 99})
+    EXPECT_THAT(during([&] { start(client, nobody); }, {"trace", "reply"}),
+                ElementsAre("trace 0x21042818", "reply start true"));
 }
 
 TEST_F(RoutingTest, AnotherClientsSessionCanBeStartedButNotStopped) {
@@ -130,10 +139,13 @@ TEST_F(RoutingTest, SessionsOwnIdentifierWinsInAnalytics) {
   const Payload claimed =
       PayloadBuilder().set("HostApplicationDisplayID", "liar").set("b", 1).build();
   send(client, claimed, 3, 6);
-  const auto& event = p.services.events.back();
+  const auto event = p.services.events.back();
   EXPECT_EQ(event.name, "com.quorvel.sonik.Playback.Undefined");
   EXPECT_EQ((*event.builder)().text(), "{HostApplicationDisplayID=com.example,b=1}");
   EXPECT_TRUE((*event.builder)() == (*event.builder)());
+  VXReportingTallyhubBridge::handleEvent(nullptr, 0x10000009, 0xFFFF, nullptr);
+  EXPECT_EQ(p.services.events.back().name, "com.quorvel.sonik.DSP_ChannelReporting.Unknown");
+  EXPECT_EQ((*p.services.events.back().builder)().text(), "{HostApplicationDisplayID=Unknown}");
   EXPECT_EQ(claimed.find("HostApplicationDisplayID")->text(), "liar");
   EXPECT_EQ(p.vyr.sent.back().payload.text(), claimed.text());
 }
@@ -150,13 +162,22 @@ TEST_F(RoutingTest, PowerRecords) {
   EXPECT_EQ(p.services.powers[0].record.text(), "{EngineOnDuration=0,ApplicationName=com.example}");
   EXPECT_THAT(p.log.lines,
               Contains("system error failed to get VXReporting timestamp for wattmark"));
-  send(client, PayloadBuilder().set("Haptic_Active_Hardware_Time_Seconds", 1.5).build(), 0xFFFFFFFF,
-       6);
+  PayloadBuilder leaked;
+  leaked.set("Haptic_Active_Hardware_Time_Seconds", 1.5);
+  send(client, leaked.build(), 0xFFFFFFFF, 6);
+  send(client, leaked.set("Active_Clients", "x").set("vxreporting_timestamp", 1).build(), 1, 6);
+  send(client, engineOn(), 1, 5);
+  send(client, message(), 1, 6);
+  VXReportingWattmarkUtility::handleEvent(nullptr, 1, 6, nullptr);
+  ASSERT_EQ(p.services.powers.size(), 3u);
   EXPECT_EQ(p.services.powers[1].name, "LeakedHapticsSessionInfo");
   EXPECT_EQ(p.services.powers[1].record.text(), "{Haptic_Active_Hardware_Time_Seconds=1.5}");
-  send(client, PayloadBuilder().set("EngineOnTime", 1).build(), 1, 5);
-  send(client, message(), 1, 6);
-  EXPECT_EQ(p.services.powers.size(), 2u);
+  EXPECT_EQ(p.services.powers[2].record.text(),
+            "{Haptic_Active_Hardware_Time_Seconds=1.5,Active_Clients=x}");
+  const Payload alone = engineOn();
+  VXReportingWattmarkUtility::handleEvent(&alone, 1, 6, nullptr);
+  EXPECT_EQ(p.services.powers[3].record.text(),
+            "{EngineOnDuration=2,ApplicationName=Unknown,TimestampEnd=9}");
 }
 
 }  // namespace

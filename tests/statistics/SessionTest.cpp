@@ -46,23 +46,76 @@ TEST_F(SessionTest, KeysAreNormalisedAndTheLaterOfTwoStays) {
                           .set("a b", 1)
                           .set("c", PayloadBuilder().set("d e", 2).build())
                           .set("a_b", 3)
+                          .set(" f g ", "h i")
                           .build();
-  EXPECT_EQ(VXReportingSession::normalizePayloadKeys(odd).text(), "{a_b=3,c={d e=2}}");
-  const Payload plain = message();
-  EXPECT_TRUE(VXReportingSession::normalizePayloadKeys(plain).isSameObject(plain));
-}
-
-TEST_F(SessionTest, ReplyComesBeforeTheRelay) {
+  EXPECT_EQ(VXReportingSession::normalizePayloadKeys(odd).text(), "{a_b=3,c={d e=2},_f_g_=h i}");
   const auto s = make();
   s->start();
+  s->sendMessage(odd, 3, 1, nullptr);
   run();
-  const auto gained = during([&] {
+  const std::string sent = p.vyr.sent.at(0).payload.text();
+  EXPECT_EQ(sent, "{a_b=3,c={d e=2},_f_g_=h i}");
+  EXPECT_THAT(texts(s->aggregatedPayloadData()), ElementsAre(sent));
+  EXPECT_THAT(texts(s->nestedAggregatedPayloadData()),
+              ElementsAre("{Playback_Start_1=" + sent + "}"));
+}
+
+TEST_F(SessionTest, AWholeLifeInOrder) {
+  p.log.verbose = true;
+  auto gained = during([&] {
+    auto s = make();
+    s->start();
     s->sendMessage(message(), kSetup, 1, VXReportingSession::Sync::Yes, [&](const auto& error) {
       p.journal.push_back(error ? "reply error" : "reply");
     });
     run();
+    s->stop();
+    s->sendMessage(message(), kSetup, 1, nullptr);
+    s.reset();
+    run();
   });
-  EXPECT_THAT(gained, ElementsAre("trace 0x21042838", "reply", "relay 5 1"));
+  EXPECT_THAT(
+      gained,
+      ElementsAre(
+          "log vxrr info created reporting session for ID: 42", "trace 0x21042828",
+          "log vxrr info setting service type generic",
+          "log vxrr debug starting session owned by 42", "trace 0x2104282C",
+          "log vxrr debug sending message for session owned by 42", "trace 0x21042838", "reply",
+          "relay session", "log vxrr default waiting for vyrreportingd to find backends",
+          "log vxrr default List of backends (store)", "log vxrr default continuing", "relay 5 1",
+          "log vxrr debug VyrReportingAgent <relay> : message {a=1} : category 134217733 : type 1",
+          "log vxrr debug ending session 42", "log vxrr debug ending session 42",
+          "trace 0x21042830", "log vxrr default sending summary event for reporter 42",
+          "log vxrr debug sending message for session owned by 42", "trace 0x21042838",
+          "log vxrr debug sending message for session owned by 42", "trace 0x21042838",
+          "relay 65535 65535",
+          "log vxrr debug VyrReportingAgent <relay> : message {VX_Session_Summary_Event=0,a=1} : "
+          "category -1 : type 65535",
+          "flush", "log vxrr debug session not started, will send as a single message",
+          "log vxrr debug sending single message after delta 0 for service 0", "trace 0x21042834",
+          "log vxrr info deallocing this session 42", "trace 0x21042838",
+          "log vxrr debug sending single message", "one-off 5 1",
+          "log vxrr debug message {a=1} : category 134217733 : type 1"));
+  EXPECT_EQ(p.queues.made.back(),
+            (std::pair<std::string, QualityOfService>("com.quorvel.sonik.session.vyrreporting",
+                                                      QualityOfService::Utility)));
+  EXPECT_EQ(p.log.registrations.back(),
+            "vxrr 1987605106 com.quorvel.sonik reporting_session_verbose 31");
+}
+
+TEST_F(SessionTest, ARestartIsAWholeLifeAgain) {
+  const auto s = make();
+  for (const int round : {1, 2}) {
+    s->start();
+    s->sendMessage(message(), 3, 1, nullptr);
+    s->stop();
+    run();
+    EXPECT_EQ(s->vyrReportingSession(), nullptr);
+    EXPECT_EQ(p.vyr.tokens, round);
+    EXPECT_EQ(p.vyr.sent.size(), 2u * static_cast<unsigned>(round));
+    EXPECT_EQ(p.vyr.sent.back().payload.text(), "{VX_Session_Summary_Event=0,a=1}");
+  }
+  EXPECT_EQ(s->messageIdForCategory(0xFFFFFFFF, 0xFFFF), "Undefined_Unknown_3");
 }
 
 TEST_F(SessionTest, SecondStartChangesNothing) {
@@ -83,33 +136,34 @@ TEST_F(SessionTest, ConfigurationMergesAndNothingIsRemoved) {
 }
 
 TEST_F(SessionTest, RelaySessionCarriesWhatTheSetUpTook) {
-  const auto s = make(42, 7);
-  s->start();
-  s->setServiceType(3);  // too late for the names
-  s->setConfiguration(PayloadBuilder()
-                          .set("HostApplicationDisplayID", "app")
-                          .build());  // in time: the same dictionary
+  for (const auto& [type, name] : {std::pair(ServiceType{7}, "longformaudio"), {12, "apiusage"}}) {
+    const auto s = make(42, type);
+    s->start();
+    s->setServiceType(3);  // too late for the names
+    // In time: the set-up holds the dictionary itself.
+    s->setConfiguration(PayloadBuilder().set("HostApplicationDisplayID", "app").build());
+    run();
+    const auto& relay = *p.vyr.sessions.back();
+    EXPECT_EQ(relay.userInfo.text(),
+              "{clientName=com.quorvel.sonik,serviceName=" + std::string(name) +
+                  "_session,HostApplicationDisplayID=app}");
+    EXPECT_EQ(relay.info, (VyrSessionInfo{{"clientType", int32_t{19}},
+                                          {"clientVersion", 2.0f},
+                                          {"sessionID", int64_t{42}},
+                                          {"batchEvent", type != 12},
+                                          {"hierarchyToken", s->vyrReportingAgentToken()},
+                                          {"containsRealtimeEvents", type == 12}}));
+    EXPECT_EQ(s->vyrReportingSession(), p.vyr.sessions.back());
+  }
+  EXPECT_EQ(p.queues.blockingScopes, 2);
+  const auto unnamed = make(1, kServiceTypeUnknown);
+  EXPECT_EQ(unnamed->serviceType(), 0xFFFF);
+  EXPECT_EQ(unnamed->serviceName(), "unknown");
+  unnamed->setConfiguration(PayloadBuilder().set("serviceName", "mine").build());
+  unnamed->start();
   run();
-  const auto& relay = *p.vyr.sessions.at(0);
-  EXPECT_EQ(relay.userInfo.text(),
-            "{clientName=com.quorvel.sonik,serviceName=longformaudio_session,"
-            "HostApplicationDisplayID=app}");
-  EXPECT_EQ(relay.info[2],
-            (std::pair<std::string_view, VyrSessionInfoValue>{"sessionID", int64_t{42}}));
-  EXPECT_EQ(relay.info[3].second, VyrSessionInfoValue{true});
-  EXPECT_EQ(relay.info[5].second, VyrSessionInfoValue{false});
-  EXPECT_EQ(p.queues.blockingScopes, 1);
-  EXPECT_THAT(p.log.lines, Contains("vxrr default List of backends (store)"));
-}
-
-TEST_F(SessionTest, ApiUsageIsRealtimeAndConfigurationMayRenameTheService) {
-  const auto s = make(1, 12);
-  s->setConfiguration(PayloadBuilder().set(kVyrReportingUserInfoServiceName, "mine").build());
-  s->start();
-  run();
-  EXPECT_EQ(p.vyr.sessions[0]->info[3].second, VyrSessionInfoValue{false});
-  EXPECT_EQ(p.vyr.sessions[0]->info[5].second, VyrSessionInfoValue{true});
-  EXPECT_EQ(p.vyr.sessions[0]->userInfo.find(kVyrReportingUserInfoServiceName)->text(), "mine");
+  EXPECT_EQ(p.vyr.sessions.back()->userInfo.text(),
+            "{clientName=com.quorvel.sonik,serviceName=mine}");
 }
 
 TEST_F(SessionTest, TestSessionsNeverTouchTheRelay) {
@@ -121,57 +175,59 @@ TEST_F(SessionTest, TestSessionsNeverTouchTheRelay) {
   EXPECT_THAT(p.vyr.sessions, IsEmpty());
   EXPECT_EQ(p.vyr.tokens, 0);
   EXPECT_THAT(p.log.lines, Contains("vxrr info transactions aren't allowed on this platform"));
+  s->sendMessage(message(), 3, 1, nullptr);  // not started: alone, like any other
+  run();
+  EXPECT_EQ(p.vyr.oneOffs.size(), 1u);
+  const auto later = make(2, 3);
+  later->start();
+  run();
+  later->setServiceType(11);
+  EXPECT_THAT(during([&] {
+                later->stop();
+                run();
+              }),
+              ElementsAre("trace 0x21042830"));
+  EXPECT_NE(later->vyrReportingSession(), nullptr);
 }
 
 TEST_F(SessionTest, NoBackEndsDropsMessagesAfterNineSeconds) {
-  p.vyr.backends = std::nullopt;
-  const auto s = make();
-  s->start();
-  s->sendMessage(message(), 3, 1, nullptr);
-  const Monotonic before = p.clock.monotonic();
-  run();
-  EXPECT_EQ(p.clock.monotonic() - before, std::chrono::seconds(9));
-  EXPECT_EQ(s->vyrReportingSession(), nullptr);
-  EXPECT_NE(s->vyrReportingAgentToken(), nullptr);
-  EXPECT_THAT(
-      p.log.lines,
-      AllOf(Contains("vxrr error No backends found, this session won't get sent to the server"),
-            Contains("vxrr default waiting for vyrreportingd to find backends"),
-            Contains("vxrr error failed to find backend"),
-            Contains("vxrr error No valid VyrReportingSession")));
-  EXPECT_TRUE(s->started());
-  EXPECT_EQ(s->aggregatedPayloadData()->size(), 1u);
+  for (const bool late : {false, true}) {
+    p.vyr.backends = std::nullopt;
+    if (late) p.vyr.configurationAfter = std::chrono::seconds(20);
+    auto s = make();
+    s->start();
+    s->sendMessage(message(), 3, 1, nullptr);
+    const Monotonic before = p.clock.monotonic();
+    p.log.lines.clear();
+    run();
+    EXPECT_EQ(p.clock.monotonic() - before, std::chrono::seconds(9));
+    EXPECT_EQ(s->vyrReportingSession(), nullptr);
+    EXPECT_NE(s->vyrReportingAgentToken(), nullptr);
+    std::vector<std::string> lines = {"vxrr default waiting for vyrreportingd to find backends",
+                                      "vxrr error failed to find backend",
+                                      "vxrr error No valid VyrReportingSession"};
+    if (!late)
+      lines.insert(lines.begin() + 1,
+                   "vxrr error No backends found, this session won't get sent to the server");
+    EXPECT_EQ(p.log.lines, lines);
+    EXPECT_EQ(s->aggregatedPayloadData()->size(), 1u);
+  }
+  p.threading.passTimeUntil(p.clock.monotonic() + std::chrono::seconds(30));  // answered at last
 }
 
-TEST_F(SessionTest, LateAnswerOfTheConfigurationIsHarmless) {
-  p.vyr.configurationAfter = std::chrono::seconds(20);
-  auto s = make();
-  s->start();
-  run();
-  EXPECT_EQ(s->vyrReportingSession(), nullptr);
-  s.reset();
-  p.threading.passTimeUntil(p.clock.monotonic() + std::chrono::seconds(30));
-}
-
-TEST_F(SessionTest, RelayFailureIsSilent) {
+TEST_F(SessionTest, FailedSendsAreSilentAndFailedFlushesLogged) {
   const auto s = make();
   s->start();
   run();
-  p.vyr.sendError = Error{"x", 5, "broken"};
+  p.vyr.sendError = p.vyr.flushError = Error{"x", 5, "broken"};
   EXPECT_THAT(during([&] {
-                s->sendMessage(message(), 0x40000007, 2, nullptr);
+                s->sendMessage(Payload(), 0x40000007, 2, nullptr);
                 run();
               }),
               ElementsAre("trace 0x21042838", "relay 7 2"));
-}
-
-TEST_F(SessionTest, FlushFailureIsLoggedAndTheSessionDropped) {
-  p.vyr.flushError = Error{"x", 5, "broken"};
-  const auto s = make();
-  s->start();
   s->stop();
   run();
-  EXPECT_THAT(p.log.lines, Contains("vxrr error flush error broken (x, code 5)"));
+  EXPECT_EQ(p.log.lines.back(), "vxrr error flush error broken (x, code 5)");
   EXPECT_EQ(s->vyrReportingSession(), nullptr);
 }
 
@@ -179,6 +235,7 @@ TEST_F(SessionTest, UnstartedSessionSendsSinglesWithItsOwnServiceName) {
   const auto s = make(1, 3);
   s->setConfiguration(PayloadBuilder().set("secret", 1).build());
   s->sendMessage(message(), 0x40000007, 2, nullptr);
+  s->start();  // too late for it
   run();
   ASSERT_EQ(p.vyr.oneOffs.size(), 1u);
   EXPECT_EQ(p.vyr.oneOffs[0].category, 7);
@@ -188,13 +245,15 @@ TEST_F(SessionTest, UnstartedSessionSendsSinglesWithItsOwnServiceName) {
 TEST_F(SessionTest, SinglesOfAlarmsAreSpreadOverAMinute) {
   p.services.random = 59;
   std::optional<Error> answer = Error{};
-  VXReportingSession::sendSingleMessage(message(), 1, 1, 4, std::nullopt,
+  const Payload spaced = PayloadBuilder().set("a b c", 1).build();
+  VXReportingSession::sendSingleMessage(spaced, 1, 1, 4, std::nullopt,
                                         [&](const auto& error) { answer = error; });
   EXPECT_EQ(p.services.randomBound, 60u);
   p.queues.advance(std::chrono::milliseconds(58999));
   EXPECT_THAT(p.vyr.oneOffs, IsEmpty());
   p.queues.advance(std::chrono::milliseconds(1));
-  EXPECT_EQ(p.vyr.oneOffs.size(), 1u);
+  ASSERT_EQ(p.vyr.oneOffs.size(), 1u);
+  EXPECT_EQ(p.vyr.oneOffs[0].payload.text(), "{a_b_c=1}");
   EXPECT_EQ(answer, std::nullopt);
 }
 
@@ -225,6 +284,9 @@ TEST_F(OrientationTest, HandlersComeAndGoInOrder) {
               ElementsAre("unregister device VXReportingService 42",
                           "unregister interface VXReportingService 42", "trace 0x21042830"));
   EXPECT_THAT(during([&] { s->stop(); }, {"register"}), IsEmpty());
+  s->start();
+  s->setStarted(false);  // not started, and registered all the same
+  EXPECT_EQ(during([&] { s->stop(); }, {"register"}).size(), 2u);
 }
 
 TEST_F(OrientationTest, OnlyWhereAllThreeConditionsHold) {
@@ -260,7 +322,11 @@ TEST_F(OrientationTest, ChangesAreStampedToTheMillisecondInTheFlatAggregateOnly)
   p.clock.advance(std::chrono::microseconds(1000400));
   (*device)(3);
   p.clock.advance(std::chrono::microseconds(11345200));
+  p.log.verbose = true;
   (*interface)(4);
+  EXPECT_EQ(p.log.lines.back(),
+            "vxrr debug Orientation handler callback mode=ui orientation=\"o4\" app=\"(null)\", "
+            "time=12.346, id=\"VXReportingService 42\"");
   EXPECT_THAT(texts(s->aggregatedPayloadData()),
               ElementsAre("{device_orientation=o3,device_orientation_time=1}",
                           "{ui_orientation=o4,ui_orientation_time=12.346}"));

@@ -1,5 +1,6 @@
 #include <cmath>
 
+#include "propertylist/JsonWriter.h"
 #include "tests/statistics/ServiceFixture.h"
 
 namespace vx {
@@ -21,20 +22,45 @@ class SummaryTest : public ServiceTest {
 TEST_F(SummaryTest, JoinsEveryValueOfAKeyAsText) {
   const auto s = startedSession();
   EXPECT_EQ(s->createSummaryEventForSession(), std::nullopt);
-  s->sendMessage(PayloadBuilder().set("a", 1).set("b", "x").build(), 3, 1, nullptr);
+  s->sendMessage(Payload(), 3, 1, nullptr);
+  EXPECT_EQ(s->createSummaryEventForSession()->text(), "{VX_Session_Summary_Event=3}");
+  s->sendMessage(PayloadBuilder().set("a", 1).set("b", "").build(), 3, 1, nullptr);
   s->sendMessage(PayloadBuilder().set("a", 2).build(), 3, 1, nullptr);
-  s->sendMessage(PayloadBuilder().set("b", "").set("c", true).set("a", 0.5).build(), 3, 1, nullptr);
+  s->sendMessage(PayloadBuilder().set("b", "x").set("c", true).set("a", 0.5).build(), 3, 1,
+                 nullptr);
+  s->sendMessage(PayloadBuilder()
+                     .set("l", ArrayBuilder().add(1).add("y"))
+                     .set("VX_Session_Summary_Event", "mine")
+                     .set("b", "")
+                     .set("d", message())
+                     .build(),
+                 3, 1, nullptr);
   EXPECT_EQ(s->createSummaryEventForSession()->text(),
-            "{VX_Session_Summary_Event=3,a=1,2,0.5,b=x,,c=1}");
+            "{VX_Session_Summary_Event=3,mine,a=1,2,0.5,b=,x,,c=1,l=(1,y),d={a=1}}");
   EXPECT_TRUE(s->createSummaryEventForSession()->find("a")->isString());
 }
 
-TEST_F(SummaryTest, OneEmptyDictionaryAndAClaimedEventKey) {
+// More than any chunk of an aggregate or a text holds, and more than is written at once.
+TEST_F(SummaryTest, LargeSessionsLoseNothing) {
   const auto s = startedSession();
-  s->sendMessage(Payload(), 3, 1, nullptr);
-  EXPECT_EQ(s->createSummaryEventForSession()->text(), "{VX_Session_Summary_Event=3}");
-  s->sendMessage(PayloadBuilder().set("VX_Session_Summary_Event", "mine").build(), 3, 1, nullptr);
-  EXPECT_EQ(s->createSummaryEventForSession()->text(), "{VX_Session_Summary_Event=3,mine}");
+  const std::string quote(150000, '"');
+  const Payload large = PayloadBuilder().set("a", "x").set("b", quote).set("c", 0.5).build();
+  s->sendMessage(large, 3, 2, nullptr);
+  std::string numbers = "x", file;
+  for (int i = 0; i < 25000; ++i) {
+    s->sendMessage(PayloadBuilder().set("a", i).build(), 3, 1, nullptr);
+    numbers += "," + std::to_string(i);
+  }
+  const Payload summary = *s->createSummaryEventForSession();
+  EXPECT_EQ(summary.find("a")->asString(), numbers);
+  EXPECT_EQ(summary.find("b")->asString(), quote);
+  s->stop();
+  for (const auto& [name, payload] :
+       {std::pair("Playback_Stop_1", large), {"Undefined_Unknown_1", summary}}) {
+    std::string element = "{\n  \"" + std::string(name) + "\": ";
+    appendPrettyJson(element, payload, 2);
+    EXPECT_TRUE(p.services.files.begin()->second.find(element + "\n }") != std::string::npos);
+  }
 }
 
 TEST_F(SummaryTest, EventThenFileThenFlush) {
@@ -67,37 +93,61 @@ TEST_F(SummaryTest, NothingReceivedLeavesNothingBehind) {
               }),
               ElementsAre("trace 0x21042830", "flush"));
   EXPECT_THAT(during([&] { s->stop(); }), IsEmpty());
+  EXPECT_THAT(p.services.files, IsEmpty());
 }
 
-TEST_F(SummaryTest, UnknownApplicationAndUnlistedServiceInTheName) {
-  const auto s = startedSession(13);
-  s->sendMessage(message(), 3, 1, nullptr);
-  s->stop();
-  EXPECT_EQ(p.services.files.begin()->first,
-            "/logs/Audio/Reporting/20261116-061530+0000-sonik-unknown-telephony.json");
+TEST_F(SummaryTest, TheFileIsNamedAfterApplicationAndService) {
+  const std::pair<Payload, const char*> names[] = {
+      {Payload(), "unknown"},
+      {PayloadBuilder().set("HostApplicationDisplayID", "../a b").build(), "%2E.%2Fa%20b"},
+      {PayloadBuilder().set("HostApplicationDisplayID", 7).build(), "7"}};
+  for (const auto& [configuration, name] : names) {
+    const auto s = startedSession(13);
+    s->setConfiguration(configuration);
+    s->sendMessage(message(), 3, 1, nullptr);
+    s->writeSummaryJson();
+    s->stop();  // writes once more, with one more header
+    ASSERT_EQ(p.services.files.size(), 1u);
+    const auto& [path, text] = *p.services.files.begin();
+    EXPECT_EQ(path, "/logs/Audio/Reporting/20261116-061530+0000-sonik-" + std::string(name) +
+                        "-telephony.json");
+    std::string header;
+    appendPrettyJson(header, configuration, 1);
+    EXPECT_EQ(text.find("[\n " + header + ",\n " + header + ",\n {\n"), 0u) << text;
+    p.services.files.clear();
+  }
 }
 
 TEST_F(SummaryTest, WhatJsonCannotHoldIsLoggedAndTheDirectoryStillMade) {
-  const auto s = startedSession();
-  s->setConfiguration(PayloadBuilder().set("bad", std::nan("")).build());
-  s->sendMessage(message(), 3, 1, nullptr);
+  const Payload bad = PayloadBuilder().set("bad", std::nan("")).build();
   p.services.directoryError = Error{"posix", 13, "denied"};
-  const auto gained = during([&] { s->stop(); }, {"JSON", "mkdir", "file", "can't", "write"});
-  ASSERT_EQ(gained.size(), 3u);
-  EXPECT_THAT(gained[0], HasSubstr("log vxrr error dataWithJSONObject: "));
-  EXPECT_THAT(gained[1], HasSubstr("mkdir"));
-  EXPECT_EQ(gained[2],
-            "log vxrr error can't create logging directory at /logs/Audio/Reporting: denied "
-            "(posix, code 13)");
+  for (const auto& [header, sent] : {std::pair(bad, message()), {message(), bad}}) {
+    const auto s = startedSession();
+    s->setConfiguration(header);
+    s->sendMessage(sent, 3, 1, nullptr);
+    const auto gained = during([&] { s->stop(); }, {"JSON", "mkdir", "file", "can't", "write"});
+    ASSERT_EQ(gained.size(), 3u);
+    EXPECT_THAT(gained[0], HasSubstr("log vxrr error dataWithJSONObject: "));
+    EXPECT_THAT(gained[1], HasSubstr("mkdir"));
+    EXPECT_EQ(gained[2],
+              "log vxrr error can't create logging directory at /logs/Audio/Reporting: denied "
+              "(posix, code 13)");
+  }
 }
 
-TEST_F(SummaryTest, FailedWriteIsLoggedAndTheStopGoesOn) {
-  const auto s = startedSession();
-  s->sendMessage(message(), 3, 1, nullptr);
-  p.services.fileError = Error{"posix", 28, "full"};
-  s->stop();
-  EXPECT_THAT(p.log.lines, Contains("vxrr error jsonOutput writeToURL: full (posix, code 28)"));
-  EXPECT_FALSE(s->started());
+TEST_F(SummaryTest, FailedWritesAreLoggedAndTheStopGoesOn) {
+  p.services.directoryError = Error{"posix", 13, "denied"};  // the file is tried all the same
+  for (const bool begins : {false, true}) {
+    const auto s = startedSession();
+    s->sendMessage(PayloadBuilder().set("a", std::string(70000, 'x')).build(), 3, 1, nullptr);
+    (begins ? p.services.writeError : p.services.fileError) = Error{"posix", 28, "full"};
+    p.log.lines.clear();
+    s->stop();
+    EXPECT_EQ(p.log.lines.back(), "vxrr error jsonOutput writeToURL: full (posix, code 28)");
+    EXPECT_THAT(p.services.files, IsEmpty());
+    EXPECT_FALSE(s->started());
+    p.services.fileError.reset();
+  }
 }
 
 TEST_F(SummaryTest, OtherBuildsWriteNothing) {
