@@ -2,6 +2,7 @@
 #pragma once
 
 #include <chrono>
+#include <cstddef>
 #include <memory>
 #include <string_view>
 
@@ -58,9 +59,10 @@ class Threading {
   virtual std::unique_ptr<RunLoop> makeRunLoop() = 0;
   virtual std::unique_ptr<Thread> startThread(std::string_view name, Function<void()> body) = 0;
   virtual void sleepFor(std::chrono::nanoseconds duration) = 0;
-  // Says that the caller has just let go of memory by the megabyte, in small pieces: the platform
-  // may want to give it back to the system, which takes its time.
-  virtual void memoryWasFreed() = 0;
+  // Says that the caller has just let go of about so much memory in small pieces, or is about to.
+  // From any thread, at any rate; returns at once. Whether and when that is worth the time it takes
+  // to give it back to the system is the platform's decision.
+  virtual void memoryWasFreed(std::size_t approximateBytes) = 0;
 };
 
 }  // namespace vx

@@ -20,8 +20,7 @@ constexpr uint32_t kTraceStarted = 0x2104282C;
 constexpr uint32_t kTraceStopped = 0x21042830;
 constexpr uint32_t kTraceGone = 0x21042834;
 constexpr uint32_t kTraceMessage = 0x21042838;
-constexpr std::size_t kManyMessages = 4096;  // a megabyte or so
-constexpr std::chrono::seconds kUntilStored{2};
+constexpr std::size_t kApproximateMessageBytes = 256;  // of a small one, with its entries
 constexpr int32_t kDeviceClassWithoutOrientation = 6;
 constexpr const char* kReportingSubdirectory = "/Audio/Reporting";
 constexpr const char* kDateFormat = "%Y%m%d-%H%M%S%z";
@@ -128,16 +127,14 @@ void VXReportingSession::stop() {
   }
   writeSummaryJson();
   vyrReportingQueue_->async([self = shared_from_this()] { self->flushRelay(); });
-  const bool many = aggregatedPayloadData_.size() >= kManyMessages;
   // Destroying millions of messages takes its time: not on the queue that serves everybody.
   vyrReportingQueue_->async([flat = aggregatedPayloadData_.removeAll(),
                              nested = nestedAggregatedPayloadData_.removeAll()]() mutable {
+    const std::size_t bytes = flat.size() * kApproximateMessageBytes;
     flat = {};
     nested = {};
+    platform().threading.memoryWasFreed(bytes);
   });
-  // The platform frees the last of them a moment later, when they are stored.
-  if (many)
-    vyrReportingQueue_->asyncAfter(kUntilStored, [] { platform().threading.memoryWasFreed(); });
   started_ = false;
 }
 

@@ -242,9 +242,9 @@ class RunningPlatform final : public LinuxPlatform {
 
   const PlatformConfiguration configuration_;
   SystemClock clock_;
-  SystemThreading threading_;
   SystemLog log_;
   Executor executor_;
+  SystemThreading threading_{executor_.background()};
   EventLoop loop_;
   SocketListener listener_;
   TomlPreferences preferences_;

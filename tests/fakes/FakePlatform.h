@@ -78,14 +78,14 @@ class FakeThreading final : public Threading {
   std::unique_ptr<RunLoop> makeRunLoop() override;
   std::unique_ptr<Thread> startThread(std::string_view name, Function<void()> body) override;
   void sleepFor(std::chrono::nanoseconds duration) override;
-  void memoryWasFreed() override { ++releases; }
+  void memoryWasFreed(std::size_t approximateBytes) override { freedBytes += approximateBytes; }
 
   // Something that happens at a time, seen by sleeps, run loops and waits as they pass it.
   void at(std::chrono::nanoseconds fromNow, std::function<void()> event);
   Function<void()> threadBody;    // of the last thread started
   std::function<void()> onSleep;  // before each sleep of a thread
   std::vector<std::chrono::nanoseconds> sleeps;
-  int releases = 0;  // of much memory at once
+  std::size_t freedBytes = 0;
   // Moves time to `when`, running events on the way.
   void passTimeUntil(Monotonic when);
   std::optional<Monotonic> nextEvent() const;

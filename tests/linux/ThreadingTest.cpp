@@ -22,7 +22,8 @@ class RunLoopTest : public ::testing::Test {
     loop->attach(timer);
     return timer;
   }
-  SystemThreading threading;
+  fakes::FakePlatform p;
+  SystemThreading threading{p.queues.background()};
   SystemClock clock;
   std::unique_ptr<RunLoop> loop = threading.makeRunLoop();
   std::vector<int> fired;
@@ -63,7 +64,8 @@ TEST_F(RunLoopTest, MovingWhileFiringChangesNothingAndExceptionsLeave) {
 }
 
 TEST(SystemConditionTest, SignalEndsAWaitAndTheDeadlineDoesToo) {
-  SystemThreading threading;
+  fakes::FakePlatform p;
+  SystemThreading threading(p.queues.background());
   SystemClock clock;
   const std::shared_ptr<Condition> condition = threading.makeCondition();
   condition->lock();
@@ -77,10 +79,30 @@ TEST(SystemConditionTest, SignalEndsAWaitAndTheDeadlineDoesToo) {
   condition->unlock();
 }
 
+TEST(FreedMemory, GoesBackInOneStepTwoSecondsAfterAMegabyteWasFreed) {
+  fakes::FakePlatform p;
+  int trims = 0;
+  SystemThreading threading(p.queues.background(), [&] { ++trims; });
+  threading.memoryWasFreed((1 << 20) - 1);
+  EXPECT_FALSE(p.queues.nextDue());
+  for (int i = 0; i < 100; ++i) threading.memoryWasFreed(1 << 20);
+  p.queues.advance(1999ms);
+  EXPECT_EQ(trims, 0);
+  p.queues.advance(1ms);
+  EXPECT_EQ(trims, 1);
+  p.queues.advance(2s);  // for those that came while one was pending
+  EXPECT_EQ(trims, 2);
+  EXPECT_FALSE(p.queues.nextDue());
+  threading.memoryWasFreed(1 << 20);
+  p.queues.advance(2s);
+  EXPECT_EQ(trims, 3);
+  EXPECT_FALSE(p.queues.nextDue());
+}
+
 // The process may end while deliveries are pending: they do not happen, and nothing waits for them.
 [[noreturn]] void exitWithADeliveryPending() {
   fakes::FakePlatform p;
-  SystemThreading threading;
+  SystemThreading threading(p.queues.background());
   SystemClock clock;
   auto& s = p.services;
   Platform real{p.listener, p.queues, clock, threading, s, s, s,     s, s,

@@ -159,6 +159,9 @@ std::string SystemClock::formatLocal(Date date, const char* format) {
   return std::string(text, length);
 }
 
+SystemThreading::SystemThreading(WorkQueue& background, Function<void()> trim)
+    : background_(background), trim_(std::move(trim)) {}
+
 std::unique_ptr<Condition> SystemThreading::makeCondition() {
   return std::make_unique<SystemCondition>();
 }
@@ -178,7 +181,29 @@ std::unique_ptr<Thread> SystemThreading::startThread(std::string_view name, Func
 }
 
 // The allocator gives back only what lies at the end of its heap by itself.
-void SystemThreading::memoryWasFreed() { malloc_trim(0); }
+void SystemThreading::trimHeap() { malloc_trim(0); }
+
+void SystemThreading::memoryWasFreed(std::size_t approximateBytes) {
+  if (approximateBytes < kWorthTrimmingBytes) return;
+  {
+    MutexLock lock(mutex_);
+    freedMeanwhile_ = trimPending_;
+    if (std::exchange(trimPending_, true)) return;
+  }
+  trimLater();
+}
+
+void SystemThreading::trimLater() {
+  background_.asyncAfter(kTrimDelay, [this] {
+    trim_();
+    {
+      MutexLock lock(mutex_);
+      trimPending_ = std::exchange(freedMeanwhile_, false);
+      if (!trimPending_) return;
+    }
+    trimLater();
+  });
+}
 
 void SystemThreading::sleepFor(std::chrono::nanoseconds duration) {
   std::this_thread::sleep_for(duration);
