@@ -44,7 +44,8 @@ TEST(JsonWriter, WritesEveryKind) {
 TEST(JsonWriter, EscapesWhereverTheCharacterStands) {
   EXPECT_EQ(asJson(std::string_view("\0\x1F\b\f\n\r\t\"\\/\x7F", 11)),
             "\"\\u0000\\u001f\\b\\f\\n\\r\\t\\\"\\\\/\x7F\"");
-  for (const auto& [special, escaped] : {std::pair('"', "\\\""), {'\\', "\\\\"}, {'\n', "\\n"}}) {
+  for (const auto& [special, escaped] :
+       {std::pair('"', "\\\""), {'\\', "\\\\"}, {'\n', "\\n"}, {'\x1F', "\\u001f"}}) {
     for (std::size_t at = 0; at < 20; ++at) {
       std::string text(20, '\x7F');
       text[at] = special;
@@ -52,7 +53,11 @@ TEST(JsonWriter, EscapesWhereverTheCharacterStands) {
       EXPECT_EQ(asJson(text.substr(at)), '"' + (escaped + std::string(19 - at, '\x7F')) + '"');
     }
   }
-  EXPECT_EQ(asJson(std::string(5000, '\n')).size(), 10002u);
+  std::string part;
+  appendJsonText(part, std::string(5000, '\x10'));
+  EXPECT_EQ(asJson(std::string(5000, '\x10')), '"' + part + '"');
+  EXPECT_EQ(part.size(), 30000u);
+  EXPECT_TRUE(part.ends_with("\\u0010"));
   EXPECT_EQ(asJson("a\xFF"), "\"a\xEF\xBF\xBD\"") << "the file must stay UTF-8";
 }
 

@@ -55,6 +55,8 @@ TEST_F(SummaryTest, LargeSessionsLoseNothing) {
   EXPECT_EQ(summary.find("a")->asString(), numbers);
   EXPECT_EQ(summary.find("b")->asString(), quote);
   s->stop();
+  p.queues.runAll();
+  EXPECT_GT(p.threading.freedBytes, 25000 * sizeof(Payload));
   for (const auto& [name, payload] :
        {std::pair("Playback_Stop_1", large), {"Undefined_Unknown_1", summary}}) {
     std::string element = "{\n  \"" + std::string(name) + "\": ";
