@@ -16,31 +16,29 @@ EventLoop::EventLoop(Executor& executor, Clock& clock)
   epoll_event event{};
   event.events = EPOLLIN;
   event.data.ptr = nullptr;  // stands for the wake-up descriptor
-  epoll_ctl(epollFd_, EPOLL_CTL_ADD, wakeFd_, &event);
+  epoll_ctl(epollFd_.get(), EPOLL_CTL_ADD, wakeFd_.get(), &event);
   executor_.setInteractiveWaker([this] { wake(); });
 }
 
-EventLoop::~EventLoop() {
-  close(wakeFd_);
-  close(epollFd_);
-}
-
 bool EventLoop::add(int fd, uint32_t events, Source& source) {
+  executor_.assertInteractiveThread();
   epoll_event event{};
   event.events = events;
   event.data.ptr = &source;
-  return epoll_ctl(epollFd_, EPOLL_CTL_ADD, fd, &event) == 0;
+  return epoll_ctl(epollFd_.get(), EPOLL_CTL_ADD, fd, &event) == 0;
 }
 
 void EventLoop::modify(int fd, uint32_t events, Source& source) {
+  executor_.assertInteractiveThread();
   epoll_event event{};
   event.events = events;
   event.data.ptr = &source;
-  epoll_ctl(epollFd_, EPOLL_CTL_MOD, fd, &event);
+  epoll_ctl(epollFd_.get(), EPOLL_CTL_MOD, fd, &event);
 }
 
 void EventLoop::remove(int fd, Source& source) {
-  epoll_ctl(epollFd_, EPOLL_CTL_DEL, fd, nullptr);
+  executor_.assertInteractiveThread();
+  epoll_ctl(epollFd_.get(), EPOLL_CTL_DEL, fd, nullptr);
   for (std::size_t i = 0; i < eventCount_; ++i) {
     if (events_[i].data.ptr == &source) events_[i].data.ptr = nullptr;
   }
@@ -55,7 +53,7 @@ void EventLoop::addPassEndHook(Function<void()> hook) { passEndHooks_.push_back(
 void EventLoop::wake() {
   const uint64_t one = 1;
   // A full counter means that a wake-up is pending already.
-  [[maybe_unused]] const ssize_t written = write(wakeFd_, &one, sizeof one);
+  [[maybe_unused]] const ssize_t written = write(wakeFd_.get(), &one, sizeof one);
 }
 
 std::optional<Monotonic> EventLoop::earliestDeadline() const {
@@ -88,6 +86,7 @@ void EventLoop::run() {
 }
 
 void EventLoop::runOnce(std::optional<Monotonic> deadline) {
+  executor_.assertInteractiveThread();
   runDueDeadlines();
   bool moreWork = executor_.runInteractive(kItemsPerPass);
   for (const Function<void()>& hook : passEndHooks_) hook();
@@ -99,7 +98,8 @@ void EventLoop::runOnce(std::optional<Monotonic> deadline) {
     if (deadline && (!until || *deadline < *until)) until = deadline;
     timeout = timeoutMs(until);
   }
-  const int count = epoll_wait(epollFd_, events_.data(), static_cast<int>(events_.size()), timeout);
+  const int count =
+      epoll_wait(epollFd_.get(), events_.data(), static_cast<int>(events_.size()), timeout);
   eventCount_ = count > 0 ? static_cast<std::size_t>(count) : 0;
   for (std::size_t i = 0; i < eventCount_; ++i) {
     auto* source = static_cast<Source*>(events_[i].data.ptr);
@@ -107,7 +107,7 @@ void EventLoop::runOnce(std::optional<Monotonic> deadline) {
       source->onReady(events_[i].events);
     } else if (events_[i].events & EPOLLIN) {
       uint64_t count64 = 0;
-      [[maybe_unused]] const ssize_t got = read(wakeFd_, &count64, sizeof count64);
+      [[maybe_unused]] const ssize_t got = read(wakeFd_.get(), &count64, sizeof count64);
     }
   }
   eventCount_ = 0;

@@ -17,11 +17,13 @@
 
 #include "base/Clock.h"
 #include "base/Function.h"
+#include "base/UniqueFd.h"
 #include "platform/linux/execution/Executor.h"
 
 namespace vx::lnx {
 
-// Owned by LinuxPlatform. Everything but wake() and stop() belongs to the thread that calls run().
+// Owned by LinuxPlatform. Everything but wake() and stop() belongs to the interactive thread:
+// the one that calls run(), and before that the one that makes it.
 class EventLoop {
  public:
   class Source {
@@ -31,7 +33,7 @@ class EventLoop {
   };
 
   EventLoop(Executor& executor, Clock& clock);
-  ~EventLoop();
+  ~EventLoop() = default;
   EventLoop(const EventLoop&) = delete;
   EventLoop& operator=(const EventLoop&) = delete;
 
@@ -69,8 +71,8 @@ class EventLoop {
 
   Executor& executor_;
   Clock& clock_;
-  int epollFd_ = -1;
-  int wakeFd_ = -1;
+  const UniqueFd epollFd_;
+  const UniqueFd wakeFd_;
   std::atomic<bool> stopped_{false};
   std::vector<Deadline> deadlines_;
   std::vector<Function<void()>> passEndHooks_;

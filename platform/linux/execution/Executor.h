@@ -12,49 +12,57 @@
 // rather than one per item.
 #pragma once
 
-#include <atomic>
 #include <chrono>
 #include <cstddef>
-#include <cstdint>
 #include <memory>
 #include <optional>
 #include <string_view>
 
 #include "base/Clock.h"
 #include "platform/WorkQueue.h"
+#include "platform/linux/execution/ConcurrentQueue.h"
+#include "platform/linux/execution/Lane.h"
 
 namespace vx::lnx {
 
+// Owned by LinuxPlatform. Thread-safe but for what is said to belong to the event loop's thread or
+// to the time before there are others.
 class Executor final : public WorkQueues {
  public:
   Executor();
   // stop() must have run.
-  ~Executor() override;
+  ~Executor() override = default;
+  Executor(const Executor&) = delete;
+  Executor& operator=(const Executor&) = delete;
 
   std::shared_ptr<WorkQueue> makeSerial(std::string_view label, QualityOfService quality) override;
-  WorkQueue& background() override;
-  void beginBlocking() override;
-  void endBlocking() override;
+  WorkQueue& background() override { return concurrent_; }
+  void beginBlocking() override { Lane::beginBlocking(); }
+  void endBlocking() override { Lane::endBlocking(); }
 
   // --- the interactive lane, for the event loop ---
   // Names the calling thread the interactive one.
-  void adoptInteractiveThread();
-  bool isInteractiveThread() const;
+  void adoptInteractiveThread() { interactive_->adoptThread(); }
+  bool isInteractiveThread() const { return interactive_->isThread(); }
+  // Fails the process on any other thread once there is an interactive one (development builds).
+  void assertInteractiveThread() const {
+    VX_DCHECK(!interactive_->hasThread() || isInteractiveThread());
+  }
   // Runs ready interactive work, including what it queues, until there is none or `maxItems` ran.
   // True: more is ready.
-  bool runInteractive(std::size_t maxItems);
+  bool runInteractive(std::size_t maxItems) { return interactive_->run(maxItems); }
   // When the earliest delayed interactive work is due; none when there is none. Due work joins its
   // queue in runInteractive.
-  std::optional<Monotonic> nextInteractiveDue() const;
+  std::optional<Monotonic> nextInteractiveDue() const { return interactive_->nextDue(); }
   // Called, on the producer's thread, when interactive work is queued from another thread while the
   // loop may be asleep: once until the next prepareToSleep(). Set before any other thread exists.
   void setInteractiveWaker(Function<void()> wake);
   // The loop says that it is about to sleep. False: there is ready work after all, do not.
-  bool prepareToSleep();
+  bool prepareToSleep() { return interactive_->prepareToSleep(); }
 
   // Items queued or running on the utility lane, delayed ones not counted: the relay work that
   // accepted messages have caused. Reading from clients pauses while it is too large.
-  std::size_t utilityBacklog() const;
+  std::size_t utilityBacklog() const { return utility_->backlog(); }
   // Called, on a lane's thread, when the backlog falls below `level` after having been at or above
   // it.
   void setUtilityLowWater(std::size_t level, Function<void()> reached);
@@ -66,10 +74,13 @@ class Executor final : public WorkQueues {
   // left behind (the process is about to end).
   void stop(Monotonic deadline);
 
-  struct Impl;
-
  private:
-  std::shared_ptr<Impl> impl_;
+  const std::shared_ptr<Lane>& lane(QualityOfService quality) const;
+
+  const std::shared_ptr<Lane> interactive_;
+  const std::shared_ptr<Lane> utility_;
+  const std::shared_ptr<Lane> background_;
+  ConcurrentQueue concurrent_;
 };
 
 }  // namespace vx::lnx

@@ -1,0 +1,133 @@
+// The queues of one quality of service, and the threads that serve them.
+#pragma once
+
+#include <atomic>
+#include <chrono>
+#include <cstddef>
+#include <cstdint>
+#include <deque>
+#include <memory>
+#include <optional>
+#include <thread>
+#include <vector>
+
+#include "base/Clock.h"
+#include "base/Mutex.h"
+#include "platform/WorkQueue.h"
+#include "platform/linux/execution/SerialQueue.h"
+#include "platform/linux/execution/WorkItem.h"
+
+namespace vx::lnx {
+
+struct LaneOptions {
+  const char* threadName;
+  int niceness;
+  std::size_t runnableThreads;  // 0: the interactive lane, whose thread comes from outside
+};
+
+// The queues that have work, and the threads that run it. Thread-safe. Kept alive by its threads
+// and its queues. At most kMaxThreads threads; the items are bounded by who posts them.
+class Lane : public std::enable_shared_from_this<Lane> {
+ public:
+  static constexpr std::size_t kMaxThreads = 1024;
+
+  explicit Lane(const LaneOptions& options) : options_(options) {}
+
+  // Whose item the calling thread is running, if any.
+  static const WorkQueue* currentQueue();
+  // While one lives, the calling thread runs an item of `queue`.
+  class Current {
+   public:
+    explicit Current(const WorkQueue* queue);
+    ~Current();
+    Current(const Current&) = delete;
+    Current& operator=(const Current&) = delete;
+
+   private:
+    const WorkQueue* const outer_;
+  };
+
+  // A queue has got work. Takes part in the running of it until it has none.
+  void post(std::shared_ptr<SerialQueue> queue);
+  // Both take the item; it is dropped once the lane is stopping. `queue`: null for the concurrent
+  // one.
+  void postConcurrent(WorkItem* item);
+  void postDelayed(std::chrono::nanoseconds delay, std::shared_ptr<SerialQueue> queue,
+                   WorkItem* item);
+  // Before any other thread knows the lane.
+  void setConcurrentQueue(const WorkQueue* queue) { concurrentQueue_ = queue; }
+
+  // Around a wait on the calling thread, which may be none of a lane's: then without effect.
+  static void beginBlocking();
+  static void endBlocking();
+
+  // --- the interactive lane; see Executor ---
+  void adoptThread() { interactiveThread_ = std::this_thread::get_id(); }
+  bool isThread() const { return interactiveThread() == std::this_thread::get_id(); }
+  bool hasThread() const { return interactiveThread() != std::thread::id(); }
+  void setWaker(Function<void()> wake) { waker_ = std::move(wake); }
+  bool run(std::size_t maxItems);
+  bool prepareToSleep();
+  std::optional<Monotonic> nextDue();
+
+  bool drain(Monotonic deadline);
+  void stop(Monotonic deadline);
+
+  // Items of serial queues and concurrent ones that are queued or running.
+  void itemQueued() { backlog_.fetch_add(1, std::memory_order_relaxed); }
+  void itemsDone(std::size_t count);
+  std::size_t backlog() const { return backlog_.load(std::memory_order_relaxed); }
+  void setLowWater(std::size_t level, Function<void()> reached);
+
+ private:
+  struct Delayed {
+    Monotonic due;
+    uint64_t order = 0;
+    std::shared_ptr<SerialQueue> queue;  // null: concurrent
+    WorkItem* item = nullptr;
+    bool operator<(const Delayed& other) const {  // std heap functions keep the largest first
+      return due != other.due ? due > other.due : order > other.order;
+    }
+  };
+
+  bool isInteractive() const { return options_.runnableThreads == 0; }
+  std::thread::id interactiveThread() const {
+    return interactiveThread_.load(std::memory_order_relaxed);
+  }
+  bool hasWork() const REQUIRES(mutex_) { return !ready_.empty() || !concurrent_.empty(); }
+  // True: the waker must be called, without the lock.
+  bool arrived() REQUIRES(mutex_);
+  void wakeOrStartThread() REQUIRES(mutex_);
+  void startThread() REQUIRES(mutex_);
+  void moveDue() REQUIRES(mutex_);
+  void threadMain();
+  // Runs one turn of one queue, or one concurrent item, with the lock released meanwhile. How many
+  // items ran.
+  std::size_t runOne(std::size_t maxItems) REQUIRES(mutex_);
+  void sleep(bool didWork) REQUIRES(mutex_);
+  void waitForChange(Monotonic deadline) REQUIRES(mutex_);
+
+  const LaneOptions options_;
+  const WorkQueue* concurrentQueue_ = nullptr;
+  Function<void()> waker_;
+  std::size_t lowWaterLevel_ = 0;
+  Function<void()> lowWaterReached_;
+  std::atomic<std::thread::id> interactiveThread_{};
+  std::atomic<std::size_t> backlog_{0};
+
+  Mutex mutex_;
+  CondVar wake_;     // for sleeping threads
+  CondVar changed_;  // for drain and stop
+  std::deque<std::shared_ptr<SerialQueue>> ready_ GUARDED_BY(mutex_);
+  ItemList concurrent_ GUARDED_BY(mutex_);
+  std::vector<Delayed> delayed_ GUARDED_BY(mutex_);  // a heap
+  uint64_t nextOrder_ GUARDED_BY(mutex_) = 0;
+  std::size_t threads_ GUARDED_BY(mutex_) = 0;
+  std::size_t runnable_ GUARDED_BY(mutex_) = 0;  // threads not inside a Blocking scope
+  std::size_t sleeping_ GUARDED_BY(mutex_) = 0;  // of these, waiting to be notified
+  std::size_t running_ GUARDED_BY(mutex_) = 0;   // turns under way, blocked ones included
+  bool asleep_ GUARDED_BY(mutex_) = false;       // the event loop, since prepareToSleep
+  bool stopping_ GUARDED_BY(mutex_) = false;
+};
+
+}  // namespace vx::lnx
