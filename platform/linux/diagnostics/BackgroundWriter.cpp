@@ -19,14 +19,14 @@ constexpr std::size_t kStagingBytes = 1 << 20;
 
 }  // namespace
 
-int writeAll(int fd, std::string_view text) {
+Status writeAll(int fd, std::string_view text) {
   while (!text.empty()) {
     const ssize_t written = write(fd, text.data(), text.size());
     if (written < 0 && errno == EINTR) continue;
-    if (written < 0) return errno;
+    if (written < 0) return Status::lastError("write");
     text.remove_prefix(static_cast<std::size_t>(written));
   }
-  return 0;
+  return {};
 }
 
 BackgroundWriter::BackgroundWriter(int fd, std::size_t offset)
@@ -34,20 +34,20 @@ BackgroundWriter::BackgroundWriter(int fd, std::size_t offset)
 
 BackgroundWriter::~BackgroundWriter() { (void)finish(); }
 
-int BackgroundWriter::push(std::string& text) {
+Status BackgroundWriter::push(std::string& text) {
   MutexLock lock(mutex_);
-  while (waiting_.size() >= kMostPieces && code_ == 0) changed_.wait(mutex_);
-  if (code_ != 0) return code_;
+  while (waiting_.size() >= kMaxPieces && status_.ok()) changed_.wait(mutex_);
+  if (!status_.ok()) return status_;
   waiting_.push_back(std::exchange(text, {}));
   if (!done_.empty()) {
     text.swap(done_.back());
     done_.pop_back();
   }
   changed_.notifyAll();
-  return 0;
+  return {};
 }
 
-int BackgroundWriter::finish() {
+Status BackgroundWriter::finish() {
   {
     MutexLock lock(mutex_);
     ending_ = true;
@@ -55,17 +55,27 @@ int BackgroundWriter::finish() {
   }
   if (thread_.joinable()) thread_.join();
   MutexLock lock(mutex_);
-  return code_;
+  return status_;
 }
 
 void BackgroundWriter::run() {
+  writer_.assertHere();
+  Status status = writeWaiting();
+  if (status.ok()) return;
+  MutexLock lock(mutex_);
+  status_ = std::move(status);
+  waiting_.clear();
+  changed_.notifyAll();
+}
+
+Status BackgroundWriter::writeWaiting() {
   staging_.reset(static_cast<char*>(std::aligned_alloc(kBlock, kStagingBytes)));
-  if (staging_ == nullptr) return fail(ENOMEM);
+  if (staging_ == nullptr) return Status::posix("staging buffer", ENOMEM);
   std::string piece;
   while (next(piece)) {
-    if (const int code = stage(piece); code != 0) return fail(code);
+    if (Status status = stage(piece); !status.ok()) return status;
   }
-  if (const int code = writeStaged(); code != 0) fail(code);
+  return writeStaged();
 }
 
 bool BackgroundWriter::next(std::string& piece) {
@@ -80,11 +90,11 @@ bool BackgroundWriter::next(std::string& piece) {
   return true;
 }
 
-int BackgroundWriter::stage(std::string_view text) {
+Status BackgroundWriter::stage(std::string_view text) {
   // Up to the next whole block the file goes on as it began.
   if (const std::size_t odd = offset_ % kBlock; odd != 0 && staged_ == 0) {
     const std::string_view first = text.substr(0, kBlock - odd);
-    if (const int code = writeAll(fd_, first); code != 0) return code;
+    if (Status status = writeAll(fd_, first); !status.ok()) return status;
     offset_ += first.size();
     text.remove_prefix(first.size());
   }
@@ -94,42 +104,35 @@ int BackgroundWriter::stage(std::string_view text) {
     staged_ += count;
     text.remove_prefix(count);
     if (staged_ < kStagingBytes) continue;
-    if (const int code = writeStaged(); code != 0) return code;
+    if (Status status = writeStaged(); !status.ok()) return status;
   }
-  return 0;
+  return {};
 }
 
 // Whole blocks directly, the rest (only at the end of the file) through the cache.
-int BackgroundWriter::writeStaged() {
+Status BackgroundWriter::writeStaged() {
   std::size_t direct = offset_ % kBlock == 0 ? staged_ / kBlock * kBlock : 0;
   if (direct > 0 && !isDirect_) isDirect_ = setDirect(true);
   if (!isDirect_) direct = 0;
   if (direct > 0) {
     const ssize_t written = write(fd_, staging_.get(), direct);
-    if (written < 0 && errno != EINVAL) return errno;
+    if (written < 0 && errno != EINVAL) return Status::lastError("write");
     // Less than all of it, or a file system that changed its mind: the rest goes the usual way.
     direct = written > 0 ? static_cast<std::size_t>(written) : 0;
   }
   if (direct < staged_) {
     if (isDirect_) isDirect_ = setDirect(false);
-    if (const int code = writeAll(fd_, {staging_.get() + direct, staged_ - direct}); code != 0)
-      return code;
+    Status status = writeAll(fd_, {staging_.get() + direct, staged_ - direct});
+    if (!status.ok()) return status;
   }
   offset_ += staged_;
   staged_ = 0;
-  return 0;
+  return {};
 }
 
 bool BackgroundWriter::setDirect(bool direct) const {
   const int flags = fcntl(fd_, F_GETFL);
   return fcntl(fd_, F_SETFL, direct ? flags | O_DIRECT : flags & ~O_DIRECT) == 0 && direct;
-}
-
-void BackgroundWriter::fail(int code) {
-  MutexLock lock(mutex_);
-  code_ = code;
-  waiting_.clear();
-  changed_.notifyAll();
 }
 
 }  // namespace vx::lnx

@@ -11,56 +11,59 @@
 #include <vector>
 
 #include "base/Mutex.h"
+#include "base/Status.h"
+#include "base/ThreadChecker.h"
 
 namespace vx::lnx {
 
-// 0, or the errno that kept some of it from being written.
-int writeAll(int fd, std::string_view text);
+// All of it, however many writes that takes.
+Status writeAll(int fd, std::string_view text);
 
 // Writes the rest of a large file with a thread of its own while the caller makes it, past the page
 // cache where the file system can do that: tens of megabytes that nobody on the device reads would
 // only push out what somebody does. Owned by the file, which outlives it; used by one thread. At
-// most kMostPieces wait, then so does the caller.
+// most kMaxPieces wait, then so does the caller.
 class BackgroundWriter {
  public:
-  // `offset`: the file's size so far. std::system_error when there is no thread to be had.
+  // `fd` must outlive it; `offset`: the file's size so far. std::system_error when there is no
+  // thread to be had.
   BackgroundWriter(int fd, std::size_t offset);
   ~BackgroundWriter();
   BackgroundWriter(const BackgroundWriter&) = delete;
   BackgroundWriter& operator=(const BackgroundWriter&) = delete;
 
-  // Leaves `text` empty, with the room of a piece that is done with. 0, or the errno that an
-  // earlier piece met; nothing more is written then.
-  int push(std::string& text);
-  // Once everything is written: 0, or the errno that prevented it.
-  int finish();
+  // Leaves `text` empty, with the capacity of a piece that is done with. Fails with what an earlier
+  // piece met; nothing more is written then. Waits while kMaxPieces wait.
+  Status push(std::string& text);
+  // Waits until everything is written, or told why it is not.
+  Status finish();
 
  private:
-  static constexpr std::size_t kMostPieces = 16;
+  static constexpr std::size_t kMaxPieces = 16;
 
   void run();
+  Status writeWaiting() REQUIRES(writer_);
   bool next(std::string& piece);
-  int stage(std::string_view text);
-  int writeStaged();
+  Status stage(std::string_view text) REQUIRES(writer_);
+  Status writeStaged() REQUIRES(writer_);
   bool setDirect(bool direct) const;
-  void fail(int code);
 
   struct Free {
-    void operator()(void* room) const { std::free(room); }
+    void operator()(void* memory) const { std::free(memory); }
   };
   const int fd_;
-  // The thread's, once it runs.
-  std::size_t offset_;
-  std::unique_ptr<char, Free> staging_;
-  std::size_t staged_ = 0;
-  bool isDirect_ = false;
+  ThreadChecker writer_;
+  std::size_t offset_ GUARDED_BY(writer_);
+  std::unique_ptr<char, Free> staging_ GUARDED_BY(writer_);
+  std::size_t staged_ GUARDED_BY(writer_) = 0;
+  bool isDirect_ GUARDED_BY(writer_) = false;
 
   Mutex mutex_;
   CondVar changed_;
   std::deque<std::string> waiting_ GUARDED_BY(mutex_);
   std::vector<std::string> done_ GUARDED_BY(mutex_);  // at most as many as may wait, and one
   bool ending_ GUARDED_BY(mutex_) = false;
-  int code_ GUARDED_BY(mutex_) = 0;
+  Status status_ GUARDED_BY(mutex_);
   std::thread thread_;  // last: it uses the others
 };
 

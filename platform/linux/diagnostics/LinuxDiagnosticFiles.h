@@ -1,10 +1,15 @@
 // The diagnostic-logs directory on disk.
 #pragma once
 
+#include <sys/types.h>
+
+#include <optional>
 #include <set>
 #include <string>
 
 #include "base/Mutex.h"
+#include "base/Status.h"
+#include "base/UniqueFd.h"
 #include "platform/DiagnosticFiles.h"
 
 namespace vx::lnx {
@@ -25,10 +30,8 @@ class LinuxDiagnosticFiles final : public DiagnosticFiles {
                                                std::optional<Error>& error) override;
 
  private:
-  // A descriptor of the directory, or -1 and an error. Creates what is missing when `mode` is
-  // given.
-  int openDirectory(const std::string& path, const unsigned* mode,
-                    std::optional<Error>& error) const;
+  // Creates what is missing when `mode` is given.
+  Result<UniqueFd> openDirectory(const std::string& path, std::optional<mode_t> mode) const;
   void removeLeftovers(int directoryFd, const std::string& path);
 
   const std::string logsDirectory_;

@@ -7,6 +7,7 @@
 #include <vector>
 
 #include "base/Mutex.h"
+#include "base/ThreadChecker.h"
 #include "platform/linux/execution/Threads.h"
 
 namespace vx::lnx {
@@ -101,12 +102,14 @@ class SystemTimer final : public OneShotTimer {
 class SystemRunLoop final : public RunLoop {
  public:
   void attach(std::shared_ptr<OneShotTimer> timer) override {
+    thread_.assertHere();
     auto systemTimer = std::static_pointer_cast<SystemTimer>(std::move(timer));
     systemTimer->attachTo(state_);
     timers_.push_back(std::move(systemTimer));
   }
 
   void runUntilEmpty() override {
+    thread_.assertHere();
     for (;;) {
       std::shared_ptr<SystemTimer> due;
       {
@@ -135,7 +138,8 @@ class SystemRunLoop final : public RunLoop {
 
  private:
   const std::shared_ptr<LoopState> state_ = std::make_shared<LoopState>();
-  std::vector<std::shared_ptr<SystemTimer>> timers_;  // bounded by who attaches them
+  ThreadChecker thread_;
+  std::vector<std::shared_ptr<SystemTimer>> timers_ GUARDED_BY(thread_);  // bounded by who attaches them
 };
 
 class SystemThread final : public Thread {};
