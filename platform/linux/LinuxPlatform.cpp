@@ -17,9 +17,13 @@
 #include "platform/Log.h"
 #include "platform/linux/PlatformConfiguration.h"
 #include "platform/linux/RelayReporting.h"
+#include "platform/linux/device/ConfiguredDeviceProperties.h"
 #include "platform/linux/device/CounterChannels.h"
+#include "platform/linux/device/ImmediateProcessControl.h"
+#include "platform/linux/device/KernelRandom.h"
 #include "platform/linux/device/LinuxOrientation.h"
-#include "platform/linux/device/SystemServices.h"
+#include "platform/linux/device/ProcProcessInfo.h"
+#include "platform/linux/device/UsdtTracePoint.h"
 #include "platform/linux/diagnostics/LinuxDiagnosticFiles.h"
 #include "platform/linux/diagnostics/SystemLog.h"
 #include "platform/linux/execution/EventLoop.h"
@@ -104,9 +108,7 @@ class RunningPlatform final : public LinuxPlatform {
         orientation_(withDefaults(configuration.orientation, directories)),
         diagnosticFiles_(directories.logs) {
     log_.configure(configuration.log);
-    log_.setVerboseReader([this](std::string_view domain, std::string_view key) {
-      return preferences_.open(domain)->boolean(key);
-    });
+    log_.setPreferences(preferences_);
   }
 
   bool open(const Directories& directories, std::string& problem) {

@@ -7,7 +7,7 @@
 #include <map>
 
 #include "platform/linux/device/CounterChannels.h"
-#include "platform/linux/device/SystemServices.h"
+#include "platform/linux/device/ProcProcessInfo.h"
 #include "tests/linux/FolderTest.h"
 
 namespace vx::lnx {
@@ -55,9 +55,8 @@ class Group {
 
 TEST_F(ChannelsTest, CountersAreReadStrictly) {
   auto parsed = [](std::string_view text) {
-    int64_t value = 0;
-    const int code = parseCounter(text, value);
-    return code != 0 ? std::to_string(code) : "=" + std::to_string(value);
+    const Result<int64_t> value = parseCounter(text);
+    return value.ok() ? "=" + std::to_string(*value) : std::to_string(value.status().code());
   };
   EXPECT_EQ(parsed("17\n"), "=17");
   EXPECT_EQ(parsed("-3"), "=-3");

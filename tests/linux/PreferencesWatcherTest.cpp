@@ -113,8 +113,7 @@ TEST_F(PreferencesWatcherTest, PollsWhereInotifyCannotBeHad) {
   PreferencesOptions options;
   PreferencesWatcher watcher(folder + "/preferences", folder + "/notify", {{"name", "d.toml"}},
                              options, clock);
-  errno = EMFILE;
-  watcher.start(-1);
+  watcher.start(Status::posix("inotify", EMFILE));
   EXPECT_THAT(p.log.lines,
               ElementsAre(HasSubstr("(Too many open files); looking every 3000 ms instead")));
   EXPECT_EQ(watcher.fd(), -1);

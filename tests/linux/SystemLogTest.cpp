@@ -3,6 +3,8 @@
 #include <time.h>
 #include <unistd.h>
 
+#include <functional>
+#include <set>
 #include <string>
 #include <thread>
 #include <vector>
@@ -117,18 +119,68 @@ TEST(SystemLogLimits, ThreadsShareOneStatementsAllowance) {
   EXPECT_EQ(wanted.load(), 50);
 }
 
-TEST(SystemLogScopes, TheVerboseReaderMayLogAndRegister) {
+// Preferences in which every key is whether it is one of `on`.
+class KeyedPreferences final : public Preferences {
+ public:
+  class Domain final : public PreferencesDomain {
+   public:
+    explicit Domain(std::set<std::string, std::less<>> on) : on_(std::move(on)) {}
+    bool hasObject(std::string_view) const override { return true; }
+    std::optional<std::string> string(std::string_view) const override { return std::nullopt; }
+    bool boolean(std::string_view key) const override { return on_.contains(key); }
+
+   private:
+    const std::set<std::string, std::less<>> on_;
+  };
+  std::unique_ptr<PreferencesDomain> open(std::string_view domain) override {
+    opened.emplace_back(domain);
+    if (auto hook = std::exchange(onOpen, nullptr)) hook();
+    return std::make_unique<Domain>(on);
+  }
+  std::set<std::string, std::less<>> on;
+  std::vector<std::string> opened;
+  std::function<void()> onOpen;
+};
+
+TEST(SystemLogScopes, PreferencesMayLogAndRegisterWhileTheyAreRead) {
   SystemLog log;
+  KeyedPreferences preferences;
+  log.setPreferences(preferences);
   const LogScope* inner = nullptr;
-  log.setVerboseReader([&](std::string_view, std::string_view key) {
-    if (key == "outer") inner = log.registerScope(true, 1, "in", "d", "inner", 31);
-    return key == "outer";
-  });
+  preferences.on = {"outer"};
+  preferences.onOpen = [&] { inner = log.registerScope(true, 1, "in", "d", "inner", 31); };
   const LogScope* outer = log.registerScope(true, 1, "out", "d", "outer", 31);
   ASSERT_NE(inner, nullptr);
   EXPECT_TRUE(log.isLogEnabled(5, outer));
   EXPECT_FALSE(log.isLogEnabled(5, inner));
+  EXPECT_FALSE(log.isLogEnabled(5, nullptr));
+  EXPECT_TRUE(log.isLogEnabled(4, nullptr));
   EXPECT_EQ(log.registerScope(false, 1, "off", "d", "k", 31), nullptr);
+}
+
+TEST(SystemLogScopes, ARefreshOpensEachDomainOnceForAllItsScopes) {
+  SystemLog log;
+  KeyedPreferences preferences;
+  log.refreshVerbose();  // without any
+  log.setPreferences(preferences);
+  const LogScope* a = log.registerScope(true, 1, "a", "d", "ka", 31);
+  const LogScope* b = log.registerScope(true, 1, "b", "d", "kb", 31);
+  const LogScope* c = log.registerScope(true, 1, "c", "other", "ka", 31);
+  preferences.opened.clear();
+  preferences.on = {"ka"};
+  log.refreshVerbose();
+  EXPECT_EQ(preferences.opened, (std::vector<std::string>{"d", "other"}));
+  EXPECT_TRUE(log.isLogEnabled(5, a));
+  EXPECT_FALSE(log.isLogEnabled(5, b));
+  EXPECT_TRUE(log.isLogEnabled(5, c));
+  log.configure(toStderr(0, 0));
+  const LogSite site{"F.cpp", 1, "f", 0};
+  EXPECT_TRUE(log.wantsLine(a, LogLevel::Debug, site));
+  EXPECT_FALSE(log.wantsLine(b, LogLevel::Debug, site));
+  EXPECT_FALSE(log.wantsLine(a, LogLevel::Info, site));
+  preferences.on = {};
+  log.refreshVerbose();
+  EXPECT_FALSE(log.isLogEnabled(5, a));
 }
 
 }  // namespace

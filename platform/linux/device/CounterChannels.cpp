@@ -9,9 +9,10 @@
 #include <cerrno>
 #include <charconv>
 #include <map>
+#include <memory>
 #include <set>
 
-#include "base/Status.h"
+#include "base/UniqueFd.h"
 #include "platform/Log.h"
 
 namespace vx {
@@ -67,60 +68,51 @@ bool mayBeCounter(const std::string& path) {
   return stat(path.c_str(), &status) != 0 || S_ISREG(status.st_mode);
 }
 
+using Names = std::set<std::string>;
+
 // Names in a folder, sorted, without those that start with a dot; just more than a subscription may
-// have when there are so many. False with errno when it cannot be read.
-bool listFolder(const std::string& path, std::set<std::string>& names) {
-  DIR* folder = opendir(path.c_str());
-  if (folder == nullptr) return false;
-  while (const dirent* entry = readdir(folder)) {
+// have when there are so many.
+Result<Names> listFolder(const std::string& path) {
+  const std::unique_ptr<DIR, int (*)(DIR*)> folder(opendir(path.c_str()), closedir);
+  if (folder == nullptr) return Status::lastError(path);
+  Names names;
+  while (const dirent* entry = readdir(folder.get())) {
     if (names.size() > CounterChannels::kMaxChannels) break;
     if (entry->d_name[0] != '.') names.insert(entry->d_name);
   }
-  closedir(folder);
-  return true;
+  return names;
 }
-
-// What stands in the way of reading a folder; nothing when it simply is not there.
-bool folderMissing(int errnoValue) { return errnoValue == ENOENT || errnoValue == ENOTDIR; }
 
 class Collector {
  public:
   bool found = false;  // a folder of the group exists
-  std::optional<Error> error;
+  Status status;       // the last folder that cannot be read
   std::shared_ptr<ChannelSet> set = std::make_shared<ChannelSet>();
 
   void addFolder(const std::string& path) {
-    std::set<std::string> names;
-    if (!list(path, names)) return;
+    const std::optional<Names> names = list(path);
+    if (!names) return;
     found = true;
-    for (const std::string& name : names) {
+    for (const std::string& name : *names) {
       const std::string file = path + "/" + name;
       if (mayBeCounter(file)) add({name, file, ""});
     }
   }
   void addSubFolders(const std::string& path) {
-    std::set<std::string> names;
-    if (!list(path, names)) return;
-    for (const std::string& name : names) {
+    for (const std::string& name : list(path).value_or(Names())) {
       if (isDirectory(path + "/" + name)) addFolder(path + "/" + name);
     }
   }
   // /proc/asound/card*/pcm*/sub*/status: lines "key : value"; a closed stream says so and gives no
   // channel.
   void addAlsa(const std::string& root) {
-    std::set<std::string> cards;
-    if (!list(root, cards)) return;
+    const std::optional<Names> cards = list(root);
+    if (!cards) return;
     found = true;
-    for (const std::string& card : cards) {
-      if (card.rfind("card", 0) != 0 || !isDirectory(root + "/" + card)) continue;
-      std::set<std::string> devices;
-      listFolder(root + "/" + card, devices);
-      for (const std::string& device : devices) {
-        if (device.rfind("pcm", 0) != 0) continue;
-        std::set<std::string> streams;
-        listFolder(root + "/" + card + "/" + device, streams);
-        for (const std::string& stream : streams) {
-          if (stream.rfind("sub", 0) != 0) continue;
+    for (const std::string& card : *cards) {
+      if (!card.starts_with("card") || !isDirectory(root + "/" + card)) continue;
+      for (const std::string& device : below(root + "/" + card, "pcm")) {
+        for (const std::string& stream : below(root + "/" + card + "/" + device, "sub")) {
           const std::string file = root + "/" + card + "/" + device + "/" + stream + "/status";
           for (const char* key : {"delay", "avail", "avail_max", "hw_ptr", "appl_ptr"}) {
             add({card + "_" + device + "_" + stream + "_" + key, file, key});
@@ -129,13 +121,23 @@ class Collector {
       }
     }
   }
-  bool list(const std::string& path, std::set<std::string>& names) {
-    if (listFolder(path, names)) return true;
-    if (!folderMissing(errno)) error = posixError(errno, path);
-    return false;
+  // None when it cannot be read, which is a failure unless it simply is not there.
+  std::optional<Names> list(const std::string& path) {
+    Result<Names> names = listFolder(path);
+    if (names.ok()) return std::move(*names);
+    const int code = names.status().code();
+    if (code != ENOENT && code != ENOTDIR) status = names.status();
+    return std::nullopt;
   }
 
  private:
+  // What has that beginning; a device may have gone meanwhile.
+  static Names below(const std::string& path, std::string_view beginning) {
+    Result<Names> names = listFolder(path);
+    if (!names.ok()) return {};
+    std::erase_if(*names, [&](const std::string& name) { return !name.starts_with(beginning); });
+    return std::move(*names);
+  }
   void add(Channel channel) {
     if (set->channels.size() >= CounterChannels::kMaxChannels) {
       if (!full_) {
@@ -151,9 +153,9 @@ class Collector {
   bool full_ = false;
 };
 
-// The number behind "key" in a status file. ENOENT when the stream is closed or the line is not
+// The number after "key" in a status file. ENOENT when the stream is closed or the line is not
 // there.
-int statusValue(const std::string& text, const std::string& key, int64_t& value) {
+Result<int64_t> statusValue(const std::string& text, const std::string& key) {
   std::size_t at = 0;
   while (at < text.size()) {
     const std::size_t end = std::min(text.find('\n', at), text.size());
@@ -164,55 +166,61 @@ int statusValue(const std::string& text, const std::string& key, int64_t& value)
       std::string_view number = line.substr(colon + 1);
       while (!name.empty() && name.back() == ' ') name.remove_suffix(1);
       while (!number.empty() && number.front() == ' ') number.remove_prefix(1);
-      if (name == key) return parseCounter(number, value);
+      if (name == key) return parseCounter(number);
     }
     at = end + 1;
   }
-  return ENOENT;
+  return Status::posix(key, ENOENT);
 }
 
-// 0, or an errno value; ENOENT and ENODEV mean that the channel has vanished.
-int readChannel(const Channel& channel, int64_t& value) {
-  const std::size_t most = channel.statusKey.empty() ? kMaxCounterBytes : kMaxStatusBytes;
-  // Files below /proc and /sys say 0 or 4096 of their size, whatever they hold.
-  const int fd = open(channel.path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOCTTY);
-  if (fd < 0) return errno;
+// The beginning of a regular file, as much as fits into `text`. Not by the size that the file says
+// it has: below /proc and /sys that is 0 or 4096, whatever it holds.
+Result<std::size_t> readInto(const std::string& path, std::string& text) {
+  const UniqueFd fd(open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOCTTY));
+  if (!fd) return Status::lastError(path);
   struct stat status {};
-  if (fstat(fd, &status) != 0 || !S_ISREG(status.st_mode)) {
-    close(fd);
-    return EINVAL;
-  }
-  std::string text(most + 1, '\0');
+  if (fstat(fd.get(), &status) != 0 || !S_ISREG(status.st_mode)) return Status::posix(path, EINVAL);
   std::size_t had = 0;
   ssize_t got = 0;
-  while (had < text.size() && (got = read(fd, text.data() + had, text.size() - had)) > 0) {
+  while (had < text.size() && (got = read(fd.get(), text.data() + had, text.size() - had)) > 0) {
     had += static_cast<std::size_t>(got);
   }
-  const int failure = got < 0 ? errno : 0;
-  close(fd);
-  if (failure != 0) return failure;
-  if (had > most) return EINVAL;
-  text.resize(had);
-  return channel.statusKey.empty() ? parseCounter(text, value)
-                                   : statusValue(text, channel.statusKey, value);
+  if (got < 0) return Status::lastError(path);
+  return had;
+}
+
+// Codes ENOENT and ENODEV mean that the channel has vanished.
+Result<int64_t> readChannel(const Channel& channel) {
+  const std::size_t most = channel.statusKey.empty() ? kMaxCounterBytes : kMaxStatusBytes;
+  std::string text(most + 1, '\0');
+  const Result<std::size_t> size = readInto(channel.path, text);
+  if (!size.ok()) return size.status();
+  if (*size > most) return Status::posix(channel.path, EINVAL);
+  text.resize(*size);
+  const Result<int64_t> value =
+      channel.statusKey.empty() ? parseCounter(text) : statusValue(text, channel.statusKey);
+  return value.ok() ? value : Status::posix(channel.path, value.status().code());
 }
 
 }  // namespace
 
-int parseCounter(std::string_view text, int64_t& value) {
+Result<int64_t> parseCounter(std::string_view text) {
+  const Status none = Status::posix("not a number", EINVAL);
   if (!text.empty() && text.back() == '\n') text.remove_suffix(1);
   int base = 10;
   if (text.size() > 2 && text[0] == '0' && (text[1] == 'x' || text[1] == 'X')) {
     base = 16;
     text.remove_prefix(2);
-    if (text.front() == '-') return EINVAL;
+    if (text.front() == '-') return none;
   } else if (!text.empty() && text.front() == '+') {
     text.remove_prefix(1);
-    if (!text.empty() && text.front() == '-') return EINVAL;
+    if (!text.empty() && text.front() == '-') return none;
   }
+  int64_t value = 0;
   const auto [end, code] = std::from_chars(text.data(), text.data() + text.size(), value, base);
-  if (code == std::errc::result_out_of_range) return ERANGE;
-  return code == std::errc() && end == text.data() + text.size() && !text.empty() ? 0 : EINVAL;
+  if (code == std::errc::result_out_of_range) return Status::posix("too large a number", ERANGE);
+  if (code != std::errc() || end != text.data() + text.size() || text.empty()) return none;
+  return value;
 }
 
 ChannelDictionaryRef CounterChannels::copyChannelsInGroup(
@@ -224,11 +232,7 @@ ChannelDictionaryRef CounterChannels::copyChannelsInGroup(
   }
   Collector collector;
   const std::string& root = options_.root;
-  std::set<std::string> groups;
-  if (group)
-    groups.insert(*group);
-  else
-    collector.list(root, groups);
+  const Names groups = group ? Names{*group} : collector.list(root).value_or(Names());
   for (const std::string& name : groups) {
     const std::string folder = root + "/" + name;
     if (subGroup) {
@@ -245,7 +249,7 @@ ChannelDictionaryRef CounterChannels::copyChannelsInGroup(
     else
       collector.addAlsa(source.path);
   }
-  if (collector.error) error = collector.error;
+  if (!collector.status.ok()) error = collector.status.error();
   return collector.found ? collector.set : nullptr;
 }
 
@@ -256,6 +260,7 @@ int32_t CounterChannels::channelCount(const ChannelDictionary& channels) {
 
 ChannelSubscription* CounterChannels::createSubscription(const ChannelDictionaryRef& channels,
                                                          ChannelDictionaryRef& subscribed) {
+  thread_.assertHere();
   if (asChannels(channels.get()) == nullptr) return nullptr;
   subscribed = channels;
   return subscriptions_.emplace_back(std::make_unique<CounterSubscription>()).get();
@@ -271,14 +276,14 @@ ChannelDictionaryRef CounterChannels::createSamples(ChannelSubscription* subscri
   }
   auto samples = std::make_shared<SampleSet>();
   for (const auto& [key, channel] : channels->channels) {
-    int64_t value = 0;
-    const int failure = readChannel(channel, value);
-    if (failure == ENOENT || failure == ENODEV) continue;  // vanished, or a stream that is closed
-    if (failure != 0) {
-      error = posixError(failure, channel.path);
+    const Result<int64_t> value = readChannel(channel);
+    if (!value.ok()) {
+      const int code = value.status().code();
+      if (code == ENOENT || code == ENODEV) continue;  // vanished, or a stream that is closed
+      error = value.status().error();
       return nullptr;
     }
-    samples->samples[key] = ChannelSample{channel.name, value};
+    samples->samples[key] = ChannelSample{channel.name, *value};
   }
   return samples;
 }

@@ -6,8 +6,11 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <string_view>
 #include <vector>
 
+#include "base/Status.h"
+#include "base/ThreadChecker.h"
 #include "platform/ChannelReportService.h"
 #include "platform/linux/device/DeviceOptions.h"
 
@@ -15,9 +18,9 @@ namespace vx::lnx {
 
 // <root>/<group>[/<subgroup>]/<channel>: one file per channel, decimal or 0x, with an optional
 // trailing newline. Mapped sources appear under the group and subgroup they are given.
-// Subscriptions are never taken back. Called on the service queue; at most kMaxChannels channels
-// per subscription, the rest are left out with a log line.
-class CounterChannels final : public ChannelReportService {
+// Subscriptions are never taken back. Confined to the thread of the service queue; at most
+// kMaxChannels channels per subscription, the rest are left out with a log line.
+class CounterChannels : public ChannelReportService {
  public:
   static constexpr std::size_t kMaxChannels = 4096;
 
@@ -45,12 +48,12 @@ class CounterChannels final : public ChannelReportService {
 
  private:
   const DriverOptions options_;
-  std::vector<std::unique_ptr<ChannelSubscription>> subscriptions_;
+  ThreadChecker thread_;
+  std::vector<std::unique_ptr<ChannelSubscription>> subscriptions_ GUARDED_BY(thread_);
 };
 
 // A counter's text as a number: decimal with an optional sign, or 0x and hexadecimal digits, and at
-// most one newline behind it. EINVAL when it is none, ERANGE when it does not fit into 64 bits, 0
-// otherwise.
-int parseCounter(std::string_view text, int64_t& value);
+// most one newline after it. Code EINVAL when it is none, ERANGE when it does not fit into 64 bits.
+Result<int64_t> parseCounter(std::string_view text);
 
 }  // namespace vx::lnx

@@ -12,6 +12,8 @@
 
 #include <algorithm>
 #include <climits>
+#include <map>
+#include <memory>
 #include <vector>
 
 namespace vx::lnx {
@@ -105,35 +107,27 @@ void SystemLog::configure(const LogOptions& options) {
              (options.destination == Log::Destination::Auto && access(kJournalSocket, W_OK) == 0);
 }
 
-void SystemLog::setVerboseReader(Function<bool(std::string_view, std::string_view)> reader) {
-  MutexLock lock(mutex_);
-  verboseReader_ = std::make_shared<const VerboseReader>(std::move(reader));
-}
-
-// The reader may log, so it runs without the lock.
-bool SystemLog::readVerbose(std::string_view domain, std::string_view key) {
-  std::shared_ptr<const VerboseReader> reader;
-  {
-    MutexLock lock(mutex_);
-    reader = verboseReader_;
-  }
-  return reader != nullptr && *reader && (*reader)(domain, key);
-}
-
+// Opening a domain may log, and so ask for a scope: not under the lock.
 void SystemLog::refreshVerbose() {
-  std::vector<Scope*> scopes;
+  Preferences* const preferences = preferences_;
+  if (preferences == nullptr) return;
+  std::map<std::string_view, std::vector<Scope*>> byDomain;
   {
     MutexLock lock(mutex_);
-    for (Scope& scope : scopes_) scopes.push_back(&scope);
+    for (Scope& scope : scopes_) byDomain[scope.domain].push_back(&scope);
   }
-  for (Scope* scope : scopes) scope->verbose = readVerbose(scope->domain, scope->verboseKey);
+  for (const auto& [name, scopes] : byDomain) {
+    const std::unique_ptr<PreferencesDomain> domain = preferences->open(name);
+    for (Scope* scope : scopes) scope->verbose = domain->boolean(scope->verboseKey);
+  }
 }
 
 const LogScope* SystemLog::registerScope(bool enabled, uint32_t, std::string_view name,
                                          std::string_view domain, std::string_view verboseKey,
                                          uint32_t) {
   if (!enabled) return nullptr;
-  const bool verbose = readVerbose(domain, verboseKey);
+  Preferences* const preferences = preferences_;
+  const bool verbose = preferences != nullptr && preferences->open(domain)->boolean(verboseKey);
   MutexLock lock(mutex_);
   Scope& scope = scopes_.emplace_back();
   scope.name = name;

@@ -3,11 +3,10 @@
 
 #include <atomic>
 #include <deque>
-#include <memory>
 #include <string>
 
-#include "base/Function.h"
 #include "base/Mutex.h"
+#include "platform/Preferences.h"
 #include "platform/ScopedLog.h"
 #include "platform/linux/diagnostics/LogOptions.h"
 
@@ -22,9 +21,10 @@ class SystemLog final : public ScopedLog {
  public:
   SystemLog();
   void configure(const LogOptions& options);
-  // How a scope's verbose preference is read: (domain, key). Asked at registration and by
-  // refreshVerbose().
-  void setVerboseReader(Function<bool(std::string_view domain, std::string_view key)> reader);
+  // Where the scopes' verbose preferences are, which are read at registration and by
+  // refreshVerbose(). Must outlive this.
+  void setPreferences(Preferences& preferences) { preferences_ = &preferences; }
+  // Opens each domain once, however many scopes have their preference there.
   void refreshVerbose();
 
   const LogScope* registerScope(bool enabled, uint32_t code, std::string_view name,
@@ -44,8 +44,6 @@ class SystemLog final : public ScopedLog {
     std::string verboseKey;
     std::atomic<bool> verbose{false};
   };
-  using VerboseReader = Function<bool(std::string_view domain, std::string_view key)>;
-  bool readVerbose(std::string_view domain, std::string_view key);
   void writeStderr(int priority, std::string_view scopeName, std::string_view text);
 
   std::atomic<int> threshold_;  // the lowest rank that is written
@@ -53,9 +51,9 @@ class SystemLog final : public ScopedLog {
   std::atomic<double> refillPerMs_;
   std::atomic<bool> journal_{false};
   std::atomic<uint64_t> dropped_{0};
+  std::atomic<Preferences*> preferences_{nullptr};
   Mutex mutex_;
   std::deque<Scope> scopes_ GUARDED_BY(mutex_);  // a handful; never removed, so handles stay valid
-  std::shared_ptr<const VerboseReader> verboseReader_ GUARDED_BY(mutex_);
   Mutex stderrMutex_;  // held over writes that do not wait, so nobody waits for it for long
   bool lineCutOff_ GUARDED_BY(stderrMutex_) = false;  // the last line has no end yet
 };

@@ -39,22 +39,23 @@ PreferencesWatcher::PreferencesWatcher(std::string preferencesFolder, std::strin
   }
 }
 
-int PreferencesWatcher::openInotify() { return inotify_init1(IN_NONBLOCK | IN_CLOEXEC); }
+Result<UniqueFd> PreferencesWatcher::openInotify() {
+  UniqueFd fd(inotify_init1(IN_NONBLOCK | IN_CLOEXEC));
+  if (!fd) return Status::lastError("inotify");
+  return fd;
+}
 
-void PreferencesWatcher::start(int inotifyFd) {
-  fd_ = inotifyFd;
-  if (fd_ < 0) return startPolling(std::strerror(errno));
+void PreferencesWatcher::start(Result<UniqueFd> inotify) {
+  thread_.assertHere();
+  if (!inotify.ok()) return startPolling(std::strerror(inotify.status().code()));
+  fd_ = std::move(*inotify);
   mkdir(postFolder_.c_str(), 0755);
-  postWatch_ = inotify_add_watch(fd_, postFolder_.c_str(), kPostEvents);
+  postWatch_ = inotify_add_watch(fd_.get(), postFolder_.c_str(), kPostEvents);
   if (postWatch_ < 0) {
     VX_LOG(nullptr, Error, "notifications cannot be posted in %s: %s", postFolder_.c_str(),
            std::strerror(errno));
   }
   watchFolders();
-}
-
-PreferencesWatcher::~PreferencesWatcher() {
-  if (fd_ >= 0) close(fd_);
 }
 
 void PreferencesWatcher::watchFolders() {
@@ -65,21 +66,21 @@ void PreferencesWatcher::watchFolders() {
 // Watches the preferences folder, or as long as it is not there, the closest folder above it that
 // is.
 void PreferencesWatcher::watchFolder() {
-  folderWatch_ = inotify_add_watch(fd_, folder_.c_str(), kFolderEvents);
+  folderWatch_ = inotify_add_watch(fd_.get(), folder_.c_str(), kFolderEvents);
   if (folderWatch_ < 0 && errno == ENOSPC)
     return startPolling("no more watches allowed (fs.inotify.max_user_watches)");
   if (folderWatch_ >= 0) {
-    if (ancestorWatch_ >= 0) inotify_rm_watch(fd_, ancestorWatch_);
+    if (ancestorWatch_ >= 0) inotify_rm_watch(fd_.get(), ancestorWatch_);
     ancestorWatch_ = -1;
     return;
   }
   std::filesystem::path ancestor = folder_;
   do {
     ancestor = ancestor.parent_path();
-    ancestorWatch_ = inotify_add_watch(fd_, ancestor.c_str(), kAncestorEvents);
+    ancestorWatch_ = inotify_add_watch(fd_.get(), ancestor.c_str(), kAncestorEvents);
   } while (ancestorWatch_ < 0 && ancestor.has_relative_path());
   // Made between the two looks.
-  folderWatch_ = inotify_add_watch(fd_, folder_.c_str(), kFolderEvents);
+  folderWatch_ = inotify_add_watch(fd_.get(), folder_.c_str(), kFolderEvents);
 }
 
 // Looks again where the file really is.
@@ -90,11 +91,11 @@ void PreferencesWatcher::followLink(Watched& watched) {
   if (std::filesystem::is_symlink(path, failure)) real = std::filesystem::canonical(path, failure);
   int watch = -1;
   if (!real.empty() && !polling_) {
-    watch = inotify_add_watch(fd_, real.parent_path().c_str(), kFolderEvents);
+    watch = inotify_add_watch(fd_.get(), real.parent_path().c_str(), kFolderEvents);
     if (watch == folderWatch_) watch = -1;
   }
   if (watched.targetWatch >= 0 && watched.targetWatch != watch)
-    inotify_rm_watch(fd_, watched.targetWatch);
+    inotify_rm_watch(fd_.get(), watched.targetWatch);
   watched.targetWatch = watch;
   watched.targetName = real.filename();
 }
@@ -110,6 +111,7 @@ void PreferencesWatcher::startPolling(const char* why) {
 uint32_t PreferencesWatcher::registerHandler(std::string_view name, int& token,
                                              std::shared_ptr<WorkQueue> queue,
                                              Function<void(int)> handler) {
+  thread_.assertHere();
   if (queue == nullptr || !handler) return EINVAL;
   token = nextToken_++;
   registrations_.push_back({std::string(name), token, std::move(queue),
@@ -118,44 +120,49 @@ uint32_t PreferencesWatcher::registerHandler(std::string_view name, int& token,
 }
 
 void PreferencesWatcher::onReadable() {
+  thread_.assertHere();
   alignas(inotify_event) char buffer[4096];
   bool foldersMoved = false;
   ssize_t got = 0;
-  while ((got = read(fd_, buffer, sizeof buffer)) > 0) {
+  while ((got = read(fd_.get(), buffer, sizeof buffer)) > 0) {
     for (char* at = buffer; at < buffer + got;) {
       const auto* event = reinterpret_cast<const inotify_event*>(at);
       at += sizeof(inotify_event) + event->len;
-      const std::string_view name = event->len > 0 ? event->name : "";
-      if (event->mask & IN_Q_OVERFLOW) {
-        for (Watched& watched : watched_) changed(watched);
-      } else if (event->wd == postWatch_) {
-        const bool known = std::any_of(registrations_.begin(), registrations_.end(),
-                                       [&](const Registration& r) { return r.name == name; });
-        if (known) fire(std::string(name));
-      } else if (event->mask & (IN_DELETE_SELF | IN_MOVE_SELF | IN_IGNORED)) {
-        foldersMoved = foldersMoved || event->wd == folderWatch_ || event->wd == ancestorWatch_;
-      } else if (event->wd == folderWatch_) {
-        for (Watched& watched : watched_) {
-          if (name == watched.notification.fileName ||
-              (!name.empty() && name == watched.targetName))
-            changed(watched);
-        }
-      } else if (const auto target = std::find_if(
-                     watched_.begin(), watched_.end(),
-                     [&](const Watched& watched) { return watched.targetWatch == event->wd; });
-                 target != watched_.end()) {
-        if (name == target->targetName) changed(*target);
-      } else if (event->wd == ancestorWatch_) {
-        foldersMoved = true;
-      }
+      foldersMoved = onEvent(*event) || foldersMoved;
     }
   }
   if (!foldersMoved || polling_) return;
   // The folder came, went or was replaced: its files may all be others now.
-  if (folderWatch_ >= 0) inotify_rm_watch(fd_, folderWatch_);
+  if (folderWatch_ >= 0) inotify_rm_watch(fd_.get(), folderWatch_);
   folderWatch_ = -1;
   watchFolders();
   for (Watched& watched : watched_) changed(watched);
+}
+
+bool PreferencesWatcher::onEvent(const inotify_event& event) {
+  const std::string_view name = event.len > 0 ? event.name : "";
+  if (event.mask & IN_Q_OVERFLOW) {
+    for (Watched& watched : watched_) changed(watched);
+  } else if (event.wd == postWatch_) {
+    const bool known = std::any_of(registrations_.begin(), registrations_.end(),
+                                   [&](const Registration& r) { return r.name == name; });
+    if (known) fire(std::string(name));
+  } else if (event.mask & (IN_DELETE_SELF | IN_MOVE_SELF | IN_IGNORED)) {
+    return event.wd == folderWatch_ || event.wd == ancestorWatch_;
+  } else if (event.wd == folderWatch_) {
+    for (Watched& watched : watched_) {
+      if (name == watched.notification.fileName || (!name.empty() && name == watched.targetName))
+        changed(watched);
+    }
+  } else if (const auto target = std::find_if(
+                 watched_.begin(), watched_.end(),
+                 [&](const Watched& watched) { return watched.targetWatch == event.wd; });
+             target != watched_.end()) {
+    if (name == target->targetName) changed(*target);
+  } else {
+    return event.wd == ancestorWatch_;
+  }
+  return false;
 }
 
 void PreferencesWatcher::changed(Watched& watched) {
@@ -184,6 +191,7 @@ std::optional<Monotonic> PreferencesWatcher::nextDue() const {
 }
 
 void PreferencesWatcher::onDue() {
+  thread_.assertHere();
   const Monotonic now = clock_.monotonic();
   if (polling_ && nextPoll_ <= now) {
     nextPoll_ = now + options_.pollInterval;

@@ -9,8 +9,13 @@
 #include <vector>
 
 #include "base/Clock.h"
+#include "base/Status.h"
+#include "base/ThreadChecker.h"
+#include "base/UniqueFd.h"
 #include "platform/Preferences.h"
 #include "platform/linux/settings/PreferencesOptions.h"
+
+struct inotify_event;
 
 namespace vx::lnx {
 
@@ -22,9 +27,9 @@ namespace vx::lnx {
 //
 // Where the file is a symbolic link, the file that it leads to is watched as well.
 //
-// Driven by the event loop, on its thread: no thread of its own, no timer while nothing has
-// changed. Where inotify cannot be had, the file is looked at every few seconds, and one log line
-// says so.
+// Owned by LinuxPlatform. Driven by the event loop and confined to its thread: no thread of its
+// own, no timer while nothing has changed. Where inotify cannot be had, the file is looked at every
+// few seconds, and one log line says so.
 class PreferencesWatcher final : public SystemNotify {
  public:
   struct Notification {
@@ -35,21 +40,21 @@ class PreferencesWatcher final : public SystemNotify {
   PreferencesWatcher(std::string preferencesFolder, std::string postFolder,
                      std::vector<Notification> notifications, const PreferencesOptions& options,
                      Clock& clock);
-  ~PreferencesWatcher() override;
+  ~PreferencesWatcher() override = default;
   PreferencesWatcher(const PreferencesWatcher&) = delete;
   PreferencesWatcher& operator=(const PreferencesWatcher&) = delete;
 
-  // Begins to watch with a fresh inotify descriptor, which it takes; without one (-1, errno says
-  // why) it polls. Logs, so the platform must be installed.
-  void start(int inotifyFd);
-  static int openInotify();
+  // Begins to watch with a fresh inotify descriptor, or without one to poll. Logs, so the platform
+  // must be installed.
+  void start(Result<UniqueFd> inotify);
+  static Result<UniqueFd> openInotify();
 
   uint32_t registerHandler(std::string_view name, int& token, std::shared_ptr<WorkQueue> queue,
                            Function<void(int token)> handler) override;
 
   // Called before the handlers of a notification are told.
   void setBeforeFire(Function<void(std::string_view name)> hook) { beforeFire_ = std::move(hook); }
-  int fd() const { return fd_; }  // -1 when inotify cannot be had
+  int fd() const { return fd_.get(); }  // -1 when inotify cannot be had
   void onReadable();
   std::optional<Monotonic> nextDue() const;
   void onDue();
@@ -74,6 +79,8 @@ class PreferencesWatcher final : public SystemNotify {
   void watchFolder();
   void followLink(Watched& watched);
   void startPolling(const char* why);
+  // True: a folder that is watched has come or gone.
+  bool onEvent(const inotify_event& event);
   void changed(Watched& watched);
   void fire(const std::string& name);
   std::string signatureOf(const Watched& watched) const;
@@ -82,11 +89,12 @@ class PreferencesWatcher final : public SystemNotify {
   const std::string postFolder_;
   const PreferencesOptions options_;
   Clock& clock_;
+  ThreadChecker thread_;
   Function<void(std::string_view)> beforeFire_;
   std::vector<Watched> watched_;
   std::vector<Registration> registrations_;  // a handful, made at start-up
   int nextToken_ = 1;
-  int fd_ = -1;
+  UniqueFd fd_;
   int folderWatch_ = -1;
   int ancestorWatch_ = -1;
   int postWatch_ = -1;

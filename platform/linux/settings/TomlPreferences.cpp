@@ -53,38 +53,36 @@ class TomlDomain final : public PreferencesDomain {
 
 }  // namespace
 
-std::shared_ptr<const TomlPreferences::Values> TomlPreferences::read(const std::string& path,
-                                                                     std::string& complaint) const {
+// What is not there is empty; what cannot be read or parsed is a failure.
+Result<std::shared_ptr<const TomlPreferences::Values>> TomlPreferences::read(
+    const std::string& path) {
   const Result<std::string> text = readTomlText(path);
   if (!text.ok()) {
     const int code = text.status().code();
-    if (code == ENOENT || code == ENOTDIR) return std::make_shared<Values>();
-    complaint = text.status().text();
-    return nullptr;
+    if (code != ENOENT && code != ENOTDIR) return text.status();
+    return std::shared_ptr<const Values>(std::make_shared<Values>());
   }
   try {
     return std::make_shared<const Values>(Values{toml::parse(*text, path)});
   } catch (const toml::parse_error& failure) {
-    complaint = path + ":" + std::to_string(failure.source().begin.line) + ":" +
-                std::to_string(failure.source().begin.column) + ": " +
-                std::string(failure.description());
-    return nullptr;
+    return Status::failure(path + ":" + std::to_string(failure.source().begin.line) + ":" +
+                           std::to_string(failure.source().begin.column) + ": " +
+                           std::string(failure.description()));
   }
 }
 
 std::unique_ptr<PreferencesDomain> TomlPreferences::open(std::string_view domain) {
-  std::string complaint;
-  std::shared_ptr<const Values> values = read(fileOf(domain), complaint);
+  const Result<std::shared_ptr<const Values>> read = TomlPreferences::read(fileOf(domain));
+  const std::string& complaint = read.status().text();
+  std::shared_ptr<const Values> values;
   bool isNew = false;
   {
     MutexLock lock(mutex_);
     Known& known = known_[std::string(domain)];
     isNew = known.complaint != complaint;
     known.complaint = complaint;
-    if (values != nullptr)
-      known.values = values;
-    else
-      values = known.values;
+    if (read.ok()) known.values = *read;
+    values = known.values;
   }
   if (isNew && !complaint.empty()) {
     VX_LOG(nullptr, Error, "preferences keep their last good values: %s", complaint.c_str());

@@ -6,6 +6,7 @@
 #include <string>
 
 #include "base/Mutex.h"
+#include "base/Status.h"
 #include "platform/Preferences.h"
 
 namespace vx::lnx {
@@ -28,7 +29,7 @@ class TomlPreferences final : public Preferences {
     std::shared_ptr<const Values> values;
     std::string complaint;  // the last one, so that it is made once
   };
-  std::shared_ptr<const Values> read(const std::string& path, std::string& complaint) const;
+  static Result<std::shared_ptr<const Values>> read(const std::string& path);
 
   const std::string folder_;
   Mutex mutex_;
