@@ -2,16 +2,6 @@
 
 #include <algorithm>
 
-namespace vx {
-
-class ChannelSample {
- public:
-  std::optional<std::string> name;
-  int64_t value = 0;
-};
-
-}  // namespace vx
-
 namespace vx::fakes {
 
 namespace {
@@ -23,7 +13,6 @@ class FakeQueue final : public WorkQueue {
     owner_.post(label_, std::chrono::nanoseconds(0), this, std::move(work));
   }
   void asyncAfter(std::chrono::nanoseconds delay, Work work) override {
-    owner_.lastDelay[std::string(label_)] = delay;
     owner_.post(label_, delay, this, std::move(work));
   }
   bool isCurrent() const override { return owner_.current == this; }
@@ -35,19 +24,7 @@ class FakeQueue final : public WorkQueue {
 };
 
 struct FakeToken final : VyrSecureHierarchyToken {};
-struct FakeSubscription final : ChannelSubscription {
-  FakeServices::Group* group = nullptr;
-};
-struct FakeChannels final : ChannelDictionary {
-  FakeServices::Group* group = nullptr;
-};
-struct FakeSamples final : ChannelDictionary {
-  std::map<std::string, int64_t> values;
-  FakeServices::Group* group = nullptr;
-};
 class FakeThread final : public Thread {};
-
-std::string orNull(const std::optional<std::string>& name) { return name.value_or("(null)"); }
 
 }  // namespace
 
@@ -410,75 +387,7 @@ std::unique_ptr<AtomicFile> FakeServices::createAtomically(const std::string& di
   return std::make_unique<File>(*this, directory + "/" + name);
 }
 
-ChannelDictionaryRef FakeServices::copyChannelsInGroup(const std::optional<std::string>& group,
-                                                       const std::optional<std::string>& subGroup,
-                                                       uint64_t, std::optional<Error>& error) {
-  const auto found = groups.find(orNull(group) + "-" + orNull(subGroup));
-  if (found == groups.end()) return nullptr;
-  error = found->second.lookupError;
-  if (!found->second.exists) return nullptr;
-  auto channels = std::make_shared<FakeChannels>();
-  channels->group = &found->second;
-  return channels;
-}
-
-int32_t FakeServices::channelCount(const ChannelDictionary& channels) {
-  return static_cast<int32_t>(static_cast<const FakeChannels&>(channels).group->channels.size());
-}
-
-ChannelSubscription* FakeServices::createSubscription(const ChannelDictionaryRef& channels,
-                                                      ChannelDictionaryRef& subscribed) {
-  static std::deque<FakeSubscription> subscriptions;
-  FakeSubscription& made = subscriptions.emplace_back();
-  made.group = static_cast<const FakeChannels*>(channels.get())->group;
-  subscribed = channels;
-  return &made;
-}
-
-ChannelDictionaryRef FakeServices::createSamples(ChannelSubscription* subscription,
-                                                 const ChannelDictionaryRef&,
-                                                 std::optional<Error>& error) {
-  journal_.push_back("sample");
-  if (onSnapshot) onSnapshot();
-  Group* group = static_cast<FakeSubscription*>(subscription)->group;
-  error = group->sampleError;
-  auto samples = std::make_shared<FakeSamples>();
-  samples->values = group->channels;
-  samples->group = group;
-  return samples;  // also beside an error: it must not be used then
-}
-
-ChannelDictionaryRef FakeServices::createSamplesDelta(const ChannelDictionaryRef& earlier,
-                                                      const ChannelDictionaryRef& later,
-                                                      std::optional<Error>& error) {
-  const auto* after = static_cast<const FakeSamples*>(later.get());
-  const auto* before = static_cast<const FakeSamples*>(earlier.get());
-  if (after->group->deltaError || before == nullptr) {
-    error = after->group->deltaError.value_or(Error{"test", 22, ""});
-    return nullptr;
-  }
-  auto delta = std::make_shared<FakeSamples>(*after);
-  for (auto& [name, value] : delta->values) value -= before->values.at(name);
-  return delta;
-}
-
-void FakeServices::iterateSamples(const ChannelDictionary& samples,
-                                  const Function<int(const ChannelSample&)>& callback) {
-  const auto& set = static_cast<const FakeSamples&>(samples);
-  for (const auto& [name, value] : set.values) {
-    ChannelSample sample;
-    if (!set.group->nameless) sample.name = name;
-    sample.value = value;
-    if (callback(sample) != 0) return;
-  }
-}
-
-std::optional<std::string_view> FakeServices::channelName(const ChannelSample& sample) {
-  return sample.name;
-}
-int64_t FakeServices::simpleIntegerValue(const ChannelSample& sample, int) { return sample.value; }
-
-FakePlatform::FakePlatform()
+FakePlatform::FakePlatform(ChannelReportService& channels)
     : platform_{.serviceListener = listener,
                 .workQueues = queues,
                 .clock = clock,
@@ -491,7 +400,7 @@ FakePlatform::FakePlatform()
                 .vyrReporting = vyr,
                 .analytics = services,
                 .powerLog = services,
-                .channelReports = services,
+                .channelReports = channels,
                 .deviceProperties = services,
                 .orientation = services,
                 .log = log,

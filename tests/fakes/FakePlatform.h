@@ -51,7 +51,6 @@ class FakeWorkQueues final : public WorkQueues {
 
   int blockingScopes = 0;
   std::vector<std::pair<std::string, QualityOfService>> made;
-  std::map<std::string, std::chrono::nanoseconds> lastDelay;  // by label
   const WorkQueue* current = nullptr;
 
  private:
@@ -186,7 +185,7 @@ class FakeVyrReporting final : public VyrReporting {
 };
 
 // The small ones: analytics, power, trace, process, random, device, preferences, notify,
-// orientation, files, channels.
+// orientation, files.
 class FakeServices final : public AnalyticsEventService,
                            public PowerEventLog,
                            public TracePoint,
@@ -197,8 +196,7 @@ class FakeServices final : public AnalyticsEventService,
                            public Preferences,
                            public SystemNotify,
                            public OrientationNotifier,
-                           public DiagnosticFiles,
-                           public ChannelReportService {
+                           public DiagnosticFiles {
  public:
   explicit FakeServices(Journal& journal) : journal_(journal) {}
 
@@ -210,14 +208,6 @@ class FakeServices final : public AnalyticsEventService,
     int64_t client;
     std::string name;
     Payload record;
-  };
-  struct Group {
-    std::map<std::string, int64_t> channels;
-    std::optional<Error> lookupError;
-    std::optional<Error> sampleError;
-    std::optional<Error> deltaError;
-    bool exists = true;
-    bool nameless = false;  // its channels have no names
   };
 
   void sendEventLazy(std::string_view name, Function<Payload()> builder,
@@ -247,25 +237,6 @@ class FakeServices final : public AnalyticsEventService,
   std::unique_ptr<AtomicFile> createAtomically(const std::string& directory,
                                                const std::string& name,
                                                std::optional<Error>& error) override;
-  ChannelDictionaryRef copyChannelsInGroup(const std::optional<std::string>& group,
-                                           const std::optional<std::string>& subGroup,
-                                           uint64_t flags, std::optional<Error>& error) override;
-  int32_t channelCount(const ChannelDictionary& channels) override;
-  ChannelSubscription* createSubscription(const ChannelDictionaryRef& channels,
-                                          ChannelDictionaryRef& subscribed) override;
-  ChannelDictionaryRef createSamples(ChannelSubscription* subscription,
-                                     const ChannelDictionaryRef& subscribed,
-                                     std::optional<Error>& error) override;
-  ChannelDictionaryRef createSamplesDelta(const ChannelDictionaryRef& earlier,
-                                          const ChannelDictionaryRef& later,
-                                          std::optional<Error>& error) override;
-  ChannelDictionaryRef copyDictionary(const ChannelDictionaryRef& samples) override {
-    return samples;
-  }
-  void iterateSamples(const ChannelDictionary& samples,
-                      const Function<int(const ChannelSample& sample)>& callback) override;
-  std::optional<std::string_view> channelName(const ChannelSample& sample) override;
-  int64_t simpleIntegerValue(const ChannelSample& sample, int index) override;
 
   std::vector<Event> events;
   std::vector<Power> powers;
@@ -288,8 +259,6 @@ class FakeServices final : public AnalyticsEventService,
   std::optional<Error> directoryError;
   std::optional<Error> fileError;
   std::optional<Error> writeError;  // of the next piece written, and of no other
-  std::map<std::string, Group> groups;  // by "group-subgroup", "(null)" for an absent one
-  std::function<void()> onSnapshot;
 
  private:
   Journal& journal_;
@@ -333,10 +302,40 @@ class FakeListener final : public ServiceListener {
   std::weak_ptr<ServiceListenerDelegate> delegate;
 };
 
-// All of them, installed for as long as it lives.
+// A device without driver statistics.
+class NoChannels final : public ChannelReportService {
+ public:
+  ChannelDictionaryRef copyChannelsInGroup(const std::optional<std::string>&,
+                                           const std::optional<std::string>&, uint64_t,
+                                           std::optional<Error>&) override {
+    return nullptr;
+  }
+  int32_t channelCount(const ChannelDictionary&) override { return 0; }
+  ChannelSubscription* createSubscription(const ChannelDictionaryRef&,
+                                          ChannelDictionaryRef&) override {
+    return nullptr;
+  }
+  ChannelDictionaryRef createSamples(ChannelSubscription*, const ChannelDictionaryRef&,
+                                     std::optional<Error>&) override {
+    return nullptr;
+  }
+  ChannelDictionaryRef createSamplesDelta(const ChannelDictionaryRef&, const ChannelDictionaryRef&,
+                                          std::optional<Error>&) override {
+    return nullptr;
+  }
+  ChannelDictionaryRef copyDictionary(const ChannelDictionaryRef&) override { return nullptr; }
+  void iterateSamples(const ChannelDictionary&,
+                      const Function<int(const ChannelSample&)>&) override {}
+  std::optional<std::string_view> channelName(const ChannelSample&) override { return {}; }
+  int64_t simpleIntegerValue(const ChannelSample&, int) override { return 0; }
+};
+
+// All of them, installed for as long as it lives. Driver channels come from outside, where there
+// are any.
 class FakePlatform {
  public:
-  FakePlatform();
+  FakePlatform() : FakePlatform(noChannels()) {}
+  explicit FakePlatform(ChannelReportService& channels);
   ~FakePlatform();
   FakePlatform(const FakePlatform&) = delete;
   FakePlatform& operator=(const FakePlatform&) = delete;
@@ -351,6 +350,10 @@ class FakePlatform {
   FakeListener listener;
 
  private:
+  static ChannelReportService& noChannels() {
+    static NoChannels none;
+    return none;
+  }
   Platform platform_;
 };
 

@@ -91,21 +91,52 @@ TEST_F(DiagnosticFilesTest, LargeDiagnosticFilesAreWrittenBesides) {
   }
   ASSERT_EQ(file->commit(), std::nullopt);
   EXPECT_TRUE(read("log/Audio/a.json") == expected);
-
-  // A disk that is full after two megabytes.
-  rlimit before{};
-  getrlimit(RLIMIT_FSIZE, &before);
-  const rlimit small{2 << 20, before.rlim_max};
-  signal(SIGXFSZ, SIG_IGN);
-  setrlimit(RLIMIT_FSIZE, &small);
-  const auto full = files.createAtomically(folder + "/log/Audio", "c.json", error);
-  for (int i = 0; i < 500 && !error; ++i) error = full->write(std::string(17000, 'x'));
-  if (!error) error = full->commit();
-  setrlimit(RLIMIT_FSIZE, &before);
-  ASSERT_TRUE(error);
-  EXPECT_EQ(error->code, EFBIG);
-  EXPECT_FALSE(std::filesystem::exists(folder + "/log/Audio/c.json"));
 }
+
+// A disk that takes only so much: as many bytes as there are in all, and one less, where the last
+// write is cut short and has no other after it.
+struct Disk {
+  std::size_t pieces;
+  std::size_t pieceBytes;
+  std::size_t tooFew;
+};
+class FullDiskTest : public FolderTest, public ::testing::WithParamInterface<Disk> {
+ protected:
+  std::optional<Error> writeWithin(std::size_t limit) {
+    rlimit before{};
+    getrlimit(RLIMIT_FSIZE, &before);
+    const rlimit small{limit, before.rlim_max};
+    signal(SIGXFSZ, SIG_IGN);
+    setrlimit(RLIMIT_FSIZE, &small);
+    std::optional<Error> error = files.createDirectory(folder + "/log", 0777);
+    auto file = files.createAtomically(folder + "/log", "a.json", error);
+    for (std::size_t i = 0; i < GetParam().pieces && !error; ++i)
+      error = file->write(std::string(GetParam().pieceBytes, 'x'));
+    if (!error) error = file->commit();
+    file.reset();
+    setrlimit(RLIMIT_FSIZE, &before);
+    return error;
+  }
+  LinuxDiagnosticFiles files{folder + "/log"};
+};
+
+TEST_P(FullDiskTest, AFileThatIsCutShortIsNone) {
+  const std::size_t all = GetParam().pieces * GetParam().pieceBytes;
+  for (const std::size_t limit : {all - 1, all - GetParam().tooFew}) {
+    const std::optional<Error> error = writeWithin(limit);
+    ASSERT_TRUE(error) << limit;
+    EXPECT_EQ(error->code, EFBIG);
+    EXPECT_THAT(error->reason, HasSubstr("/log/a.json"));
+    EXPECT_TRUE(std::filesystem::is_empty(folder + "/log"));
+  }
+  EXPECT_EQ(writeWithin(all), std::nullopt);
+  EXPECT_EQ(std::filesystem::file_size(folder + "/log/a.json"), all);
+}
+
+INSTANTIATE_TEST_SUITE_P(Sizes, FullDiskTest,
+                         ::testing::Values(Disk{1, 1500, 500}, Disk{2, 1024, 1024},
+                                           Disk{5, 512 << 10, 8192},      // whole blocks
+                                           Disk{3, 1000'000, 990'000}));  // and what is left
 
 TEST_F(DiagnosticFilesTest, DiagnosticPathsStayBelowTheLogs) {
   LinuxDiagnosticFiles files(folder + "/log");

@@ -5,8 +5,8 @@
 #include <thread>
 #include <vector>
 
-#include "base/Mutex.h"
 #include "platform/linux/execution/Executor.h"
+#include "tests/linux/Latch.h"
 
 namespace vx::lnx {
 namespace {
@@ -14,28 +14,6 @@ namespace {
 using namespace std::chrono_literals;
 
 Monotonic soon() { return std::chrono::steady_clock::now() + 30s; }
-
-// Something another thread does, waited for.
-class Latch {
- public:
-  void open() {
-    MutexLock lock(mutex_);
-    open_ = true;
-    changed_.notifyAll();
-  }
-  bool wait() {
-    MutexLock lock(mutex_);
-    while (!open_) {
-      if (!changed_.waitUntil(mutex_, std::chrono::steady_clock::now() + 30s)) return false;
-    }
-    return true;
-  }
-
- private:
-  Mutex mutex_;
-  CondVar changed_;
-  bool open_ GUARDED_BY(mutex_) = false;
-};
 
 class ExecutorTest : public ::testing::Test {
  protected:
@@ -150,16 +128,33 @@ TEST_F(ExecutorTest, LowWaterIsToldWhenABacklogFalls) {
   EXPECT_EQ(told, 1);
 }
 
-TEST_F(ExecutorTest, DelayedBackgroundWorkRunsAndUndueWorkIsDroppedAtTheEnd) {
-  Latch ran;
+TEST_F(ExecutorTest, UndueWorkIsDroppedAtTheEndAndLateWorkAtOnce) {
   auto witness = std::make_shared<int>(0);
   const std::weak_ptr<int> dropped = witness;
-  executor.background().asyncAfter(10ms, [&] { ran.open(); });
   executor.background().asyncAfter(1h, [witness = std::move(witness)] { ++*witness; });
-  EXPECT_TRUE(ran.wait());
-  EXPECT_TRUE(executor.drain(soon()));
   executor.stop(soon());
   EXPECT_TRUE(dropped.expired());
+  auto late = std::make_shared<int>(0);
+  executor.background().async([late] { ++*late; });
+  executor.background().asyncAfter(1h, [late] { ++*late; });
+  EXPECT_EQ(late.use_count(), 1);
+}
+
+TEST_F(ExecutorTest, OneBusyQueueLetsTheOthersHaveTheirTurn) {
+  executor.adoptInteractiveThread();
+  const auto busy = executor.makeSerial("busy", QualityOfService::UserInteractive);
+  const auto other = executor.makeSerial("other", QualityOfService::UserInteractive);
+  int before = 0;
+  bool ran = false;
+  for (int i = 0; i < 1000; ++i) busy->async([&] { before += ran ? 0 : 1; });
+  other->async([&] { ran = true; });
+  EXPECT_TRUE(executor.runInteractive(10));
+  EXPECT_EQ(before, 10);
+  EXPECT_FALSE(ran);
+  executor.runInteractive(64 + 1);
+  EXPECT_TRUE(ran);
+  EXPECT_FALSE(executor.runInteractive(2000));
+  EXPECT_FALSE(executor.runInteractive(1));
 }
 
 }  // namespace

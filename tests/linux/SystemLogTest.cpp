@@ -103,6 +103,29 @@ TEST(SystemLogLimits, LinesOfOneStatementAreLimitedAndCounted) {
             "<3>default: File.cpp:7:f: text (7 lines like this were left out)\n");
 }
 
+// The bucket of a statement that wrote its last line some time ago.
+TEST(SystemLogLimits, AnAllowanceComesBackAsSlowlyAsConfigured) {
+  SystemLog log;
+  log.configure(toStderr(6, 0.01));  // a line in 100 seconds
+  const auto wantedAfter = [&](std::chrono::seconds ago) {
+    timespec now{};
+    clock_gettime(CLOCK_MONOTONIC, &now);
+    const auto then = static_cast<uint32_t>((now.tv_sec - ago.count()) * 1000);
+    const LogSite site{"F.cpp", 1, "f", uint64_t{1} << 32 | then};
+    int wanted = 0;
+    for (int i = 0; i < 20; ++i) wanted += log.wantsLine(nullptr, LogLevel::Error, site) ? 1 : 0;
+    return wanted;
+  };
+  EXPECT_EQ(wantedAfter(std::chrono::seconds(450)), 4);
+  EXPECT_EQ(wantedAfter(std::chrono::seconds(50)), 0);
+  EXPECT_EQ(wantedAfter(std::chrono::seconds(-20)), 0);  // another thread's clock was ahead
+  EXPECT_EQ(wantedAfter(std::chrono::hours(10)), 6);     // no more than the burst
+  log.configure(toStderr(100'000, 0.01));                // more than there are bits for
+  EXPECT_EQ(wantedAfter(std::chrono::seconds(450)), 4);
+  const LogSite fresh{"F.cpp", 1, "f", 0};
+  EXPECT_TRUE(log.wantsLine(nullptr, LogLevel::Error, fresh));
+}
+
 TEST(SystemLogLimits, ThreadsShareOneStatementsAllowance) {
   SystemLog log;
   log.configure(toStderr(50, 0.001));

@@ -2,65 +2,37 @@
 
 #include <atomic>
 #include <cstdlib>
-#include <stdexcept>
 #include <thread>
-#include <vector>
 
 #include "Statistics/Service/VXReportingBlockThrottle.h"
 #include "platform/linux/execution/SystemThreading.h"
 #include "tests/fakes/FakePlatform.h"
+#include "tests/linux/Latch.h"
 
 namespace vx::lnx {
 namespace {
 
 using namespace std::chrono_literals;
 
-class RunLoopTest : public ::testing::Test {
- protected:
-  std::shared_ptr<OneShotTimer> attach(std::chrono::milliseconds delay, int name) {
-    auto timer = threading.makeTimer(delay, [this, name] { fired.push_back(name); });
-    loop->attach(timer);
-    return timer;
-  }
+TEST(RunLoopTest, TimersMoveAndGoFromOtherThreads) {
   fakes::FakePlatform p;
-  SystemThreading threading{p.queues.background()};
+  SystemThreading threading(p.queues.background());
   SystemClock clock;
-  std::unique_ptr<RunLoop> loop = threading.makeRunLoop();
-  std::vector<int> fired;
-};
-
-TEST_F(RunLoopTest, FiresInOrderOfTimeAndEnds) {
-  attach(20ms, 2);
-  attach(5ms, 1);
-  loop->runUntilEmpty();
-  EXPECT_EQ(fired, (std::vector<int>{1, 2}));
-  loop->runUntilEmpty();
-}
-
-TEST_F(RunLoopTest, TimersMoveAndGoFromOtherThreads) {
-  const auto far = attach(1h, 1);
-  const auto gone = attach(1h, 2);
+  const auto loop = threading.makeRunLoop();
+  bool fired = false;
+  Latch running;
+  const auto far = threading.makeTimer(1h, [&] { fired = true; });
+  const auto gone = threading.makeTimer(1h, [] { FAIL(); });
+  const auto first = threading.makeTimer(0ns, [&] { running.open(); });
+  for (const auto& timer : {far, gone, first}) loop->attach(timer);
   std::thread other([&] {
-    std::this_thread::sleep_for(5ms);
+    running.wait();
     gone->invalidate();
     far->setFireTime(clock.monotonic());
   });
   loop->runUntilEmpty();
   other.join();
-  EXPECT_EQ(fired, (std::vector<int>{1}));
-}
-
-TEST_F(RunLoopTest, MovingWhileFiringChangesNothingAndExceptionsLeave) {
-  std::shared_ptr<OneShotTimer> self;
-  self = threading.makeTimer(0ms, [&] {
-    self->setFireTime(clock.monotonic());
-    throw std::runtime_error("action");
-  });
-  loop->attach(self);
-  attach(1ms, 2);
-  EXPECT_THROW(loop->runUntilEmpty(), std::runtime_error);
-  loop->runUntilEmpty();
-  EXPECT_EQ(fired, (std::vector<int>{2}));
+  EXPECT_TRUE(fired);
 }
 
 TEST(SystemConditionTest, SignalEndsAWaitAndTheDeadlineDoesToo) {
@@ -105,8 +77,9 @@ TEST(FreedMemory, GoesBackInOneStepTwoSecondsAfterAMegabyteWasFreed) {
   SystemThreading threading(p.queues.background());
   SystemClock clock;
   auto& s = p.services;
+  fakes::NoChannels none;
   Platform real{p.listener, p.queues, clock, threading, s, s, s,     s, s,
-                p.vyr,      s,        s,     s,         s, s, p.log, s, s};
+                p.vyr,      s,        s,     none,      s, s, p.log, s, s};
   installPlatform(&real);
   const auto throttle = VXReportingBlockThrottle::create();
   std::atomic<bool> ran{false};

@@ -77,18 +77,21 @@ TEST_F(RoutingTest, ListsThatNameNobodyRouteNothing) {
 }
 
 TEST_F(RoutingTest, StartTakesItsSnapshotAfterStartingAndHoldsTheReply) {
-  p.services.groups["Speaker-(null)"].channels = {{"x", 1}};
+  drivers.count("Speaker/x", "1");
   service = VXReportingServiceDelegate::create();
   auto& client = connect();
   create(client, 1);
   bool startedThen = false;
-  p.services.onSnapshot = [&] { startedThen = session(client, 1)->started(); };
+  drivers.onSample = [&] {
+    p.journal.push_back("sample");
+    startedThen = session(client, 1)->started();
+  };
   EXPECT_THAT(during([&] { start(client, 1); }, {"trace", "sample", "reply"}),
               ElementsAre("trace 0x21042818", "trace 0x2104282C", "sample"));
   EXPECT_TRUE(startedThen);
   EXPECT_THAT(during([&] { start(client, 1); }, {"sample", "reply"}),
               ElementsAre("reply start true"));
-  p.services.groups["Speaker-(null)"].channels["x"] = 4;
+  drivers.count("Speaker/x", "4");
   EXPECT_THAT(during([&] { stop(client, 1); }, {"0x2104281C", "0x21042838", "event com", "fetching",
                                                 "0x21042830", "reply", "default stopping"}),
               ElementsAre("trace 0x2104281C", "trace 0x21042838",

@@ -12,6 +12,7 @@
 #include "Statistics/Service/VXReportingServiceDelegate.h"
 #include "Statistics/VXReportingProcessState.h"
 #include "tests/fakes/FakePlatform.h"
+#include "tests/statistics/DriverChannels.h"
 
 namespace vx {
 
@@ -126,7 +127,8 @@ class ServiceTest : public ::testing::Test {
     return steps();
   }
 
-  fakes::FakePlatform p;
+  DriverChannels drivers;
+  fakes::FakePlatform p{drivers};
   VXReportingProcessState processState;
   std::shared_ptr<VXReportingServiceDelegate> service;
   std::vector<std::shared_ptr<fakes::FakeConnection>> connections;
