@@ -4,22 +4,20 @@
 
 #include <cstddef>
 #include <cstdint>
+#include <memory>
 #include <string>
 #include <vector>
 
+#include "base/UniqueFd.h"
 #include "propertylist/Payload.h"
+#include "wire/FrameReader.h"
+#include "wire/Operations.h"
 
 namespace vx::bench {
 
 class RawClient {
  public:
   explicit RawClient(const std::string& socketPath);
-  ~RawClient();
-  RawClient(const RawClient&) = delete;
-  RawClient& operator=(const RawClient&) = delete;
-  RawClient(RawClient&& other) noexcept : fd_(other.fd_), in_(std::move(other.in_)) {
-    other.fd_ = -1;
-  }
 
   // Blocking calls; each throws when the answer is not what it must be.
   void create(int64_t reporter);
@@ -38,14 +36,17 @@ class RawClient {
                                            const int64_t* reporter = nullptr);
 
  private:
-  void call(std::vector<uint8_t> body);
+  // One call and its answer. `arguments` writes that many items.
+  template <class Write>
+  void call(wire::Operation operation, std::size_t count, const Write& arguments);
   void sendAll(const uint8_t* data, std::size_t size);
-  // Reads at least one byte; returns how many complete replies to numbered calls below kHeldCalls
-  // arrived.
+  // Reads at least one byte; returns how many complete replies arrived, those to starts not
+  // counted.
   std::size_t receiveReplies();
 
-  int fd_ = -1;
-  std::vector<uint8_t> in_;
+  UniqueFd fd_;
+  std::unique_ptr<wire::ReadBuffers> readBuffers_ = std::make_unique<wire::ReadBuffers>();
+  wire::FrameReader reader_{*readBuffers_};
 };
 
 }  // namespace vx::bench

@@ -5,14 +5,13 @@
 #include <utility>
 
 #include "client/ServiceConnection.h"
-#include "propertylist/CborWriter.h"
 
 namespace vx {
 
 namespace {
 
 using Code = ClientStatus::Code;
-using Operation = ServiceOperation;
+using wire::Operation;
 
 constexpr const char* kDefaultSocket = "/run/vxreporting/service.socket";
 
@@ -21,10 +20,9 @@ template <class WriteArguments>
 ClientStatus call(ServiceConnection& connection, Operation operation, std::size_t count,
                   const WriteArguments& arguments, CallAnswer answer) {
   if (!connection.acceptsCalls()) return connection.whyNoCalls();
-  const std::size_t start = connection.beginCall(operation, count);
-  CborWriter writer = connection.writer();
-  arguments(writer);
-  return connection.endCall(start, std::move(answer));
+  wire::FrameWriter frame = connection.beginCall(operation, count);
+  arguments(frame.items());
+  return connection.endCall(frame, std::move(answer));
 }
 
 ClientStatus callOnReporter(ServiceConnection& connection, Operation operation, int64_t reporterID,
@@ -70,7 +68,7 @@ ClientStatus ReportingClient::connect(std::string socketPath, std::chrono::milli
 }
 
 ClientStatus ReportingClient::adopt(int connectedFd, std::chrono::milliseconds patience) {
-  return connection_->adopt(connectedFd, patience);
+  return connection_->adopt(UniqueFd(connectedFd), patience);
 }
 
 ClientStatus ReportingClient::reconnect(std::chrono::milliseconds patience) {

@@ -4,7 +4,6 @@
 #include <sys/socket.h>
 #include <sys/time.h>
 #include <sys/un.h>
-#include <unistd.h>
 
 #include <algorithm>
 #include <cerrno>
@@ -19,20 +18,15 @@ namespace {
 
 using SteadyClock = std::chrono::steady_clock;
 using Code = ClientStatus::Code;
+using wire::FrameKind;
+using wire::FrameReader;
+using wire::FrameWriter;
 
-constexpr int64_t kProtocolVersion = 1;
-constexpr std::size_t kLengthBytes = 4;
-constexpr std::size_t kReadBytes = 64 << 10;
 // A buffer larger than this is given back when it is empty.
 constexpr std::size_t kKeptBytes = 256 << 10;
-// Either direction, until the service's hello says otherwise; and what is believed of its word.
-constexpr std::size_t kDefaultFrameBytes = 1 << 20;
-constexpr std::size_t kLargestFrameBytes = 64 << 20;
 // Reads of what a service that takes no more may still have said.
 constexpr int kLastReads = 64;
 constexpr std::chrono::hours kLongestPatience{24 * 365};
-
-enum FrameKind : uint8_t { kHello = 0, kCall = 1, kReply = 2, kError = 3, kGoodbye = 4 };
 
 ClientStatus failure(Code code, std::string text) { return {code, std::move(text), "", 0}; }
 
@@ -46,10 +40,6 @@ timeval timeOf(std::chrono::milliseconds time) {
 ServiceConnection::Wait::Wait(Patience wanted)
     : patience(std::clamp<Patience>(wanted, Patience(0), kLongestPatience)),
       deadline(SteadyClock::now() + patience) {}
-
-ServiceConnection::~ServiceConnection() {
-  if (fd_ >= 0) close(fd_);
-}
 
 // ---------------------------------------------------------------------------------------------------------------------
 // Connecting and ending
@@ -65,54 +55,45 @@ ClientStatus ServiceConnection::open(const std::string& path, Patience patience)
     return failure(Code::NotConnected,
                    "the socket path " + path + " is too long for a Unix socket");
   std::memcpy(address.sun_path, path.c_str(), path.size() + 1);
-  const int made = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-  int error = made < 0 ? errno : 0;
-  if (made >= 0) {
+  UniqueFd made(socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+  int error = made ? 0 : errno;
+  if (made) {
     // Connecting waits while the service's queue of new connections is full; this bounds it.
     const timeval limit = timeOf(std::max(Wait(patience).patience, Patience(1)));
-    setsockopt(made, SOL_SOCKET, SO_SNDTIMEO, &limit, sizeof limit);
-    while (::connect(made, reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0) {
-      error = errno;
-      if (error != EINTR) break;
-      error = 0;
-    }
+    setsockopt(made.get(), SOL_SOCKET, SO_SNDTIMEO, &limit, sizeof limit);
+    do {
+      const int refused =
+          ::connect(made.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address);
+      error = refused == 0 ? 0 : errno;
+    } while (error == EINTR);
   }
-  if (error == 0) return begin(made, patience);
-  if (made >= 0) close(made);
+  if (error == 0) return begin(std::move(made), patience);
   return failure(Code::NotConnected,
                  "cannot connect to " + path + ": " +
                      (error == EAGAIN ? "it takes no connections" : std::strerror(error)) +
                      " (is vxreportingd running? set VXREPORTING_SOCKET to its socket)");
 }
 
-ClientStatus ServiceConnection::adopt(int connectedFd, Patience patience) {
+ClientStatus ServiceConnection::adopt(UniqueFd connected, Patience patience) {
   const auto self = shared_from_this();
   disconnect(failure(Code::Disconnected, "the connection was made anew"));
-  if (abandoned_ || isConnected()) {  // a callback of the old connection has seen to it
-    close(connectedFd);
-    return {};
-  }
-  return begin(connectedFd, patience);
+  if (abandoned_ || isConnected()) return {};  // a callback of the old connection has seen to it
+  return begin(std::move(connected), patience);
 }
 
-ClientStatus ServiceConnection::begin(int connectedFd, Patience patience) {
-  fd_ = connectedFd;
+ClientStatus ServiceConnection::begin(UniqueFd connected, Patience patience) {
+  socket_ = std::move(connected);
   ++generation_;
-  in_.clear();
-  inBegin_ = inEnd_ = 0;
+  reader_.clear();
+  reader_.setLimit(wire::kMaxFrameBytes);
   out_.clear();
   outBegin_ = 0;
   writeAt_ = options_.writeAtBytes;
   receiveTimeout_ = Patience(0);
-  largestFrame_ = kDefaultFrameBytes;
+  largestFrame_ = wire::kMaxFrameBytes;
   helloSeen_ = goodbyeSeen_ = false;
   serviceError_.clear();
-  const std::size_t start = beginFrame();
-  CborWriter hello(out_);
-  hello.array(2);
-  hello.integer(kHello);
-  hello.integer(kProtocolVersion);
-  endFrame(start);
+  FrameWriter::hello(out_).end();
   const uint64_t generation = generation_;
   ClientStatus status = waitUntil([this] { return helloSeen_; }, patience);
   if (status.ok())
@@ -126,11 +107,7 @@ ClientStatus ServiceConnection::sayGoodbye(Patience patience) {
   const auto self = shared_from_this();
   if (!isConnected()) return whyNoCalls();
   acceptsCalls_ = false;
-  const std::size_t start = beginFrame();
-  CborWriter goodbye(out_);
-  goodbye.array(1);
-  goodbye.integer(kGoodbye);
-  endFrame(start);
+  FrameWriter::goodbye(out_);
   const uint64_t generation = generation_;
   ClientStatus status = waitUntil([&] { return generation != generation_; }, patience);
   if (generation == generation_) disconnect(failure(Code::Disconnected, "said goodbye"));
@@ -138,11 +115,10 @@ ClientStatus ServiceConnection::sayGoodbye(Patience patience) {
 }
 
 void ServiceConnection::disconnect(const ClientStatus& why) {
-  if (fd_ < 0) return;
+  if (!isConnected()) return;
   const auto self = shared_from_this();
   ended_ = why;
-  close(fd_);
-  fd_ = -1;
+  socket_.reset();
   acceptsCalls_ = false;
   ++generation_;
   for (const CallAnswer& failed : calls_.takeAll()) {
@@ -170,33 +146,15 @@ ClientStatus ServiceConnection::whyNoCalls() const {
 // ---------------------------------------------------------------------------------------------------------------------
 // Writing
 
-std::size_t ServiceConnection::beginFrame() {
-  const std::size_t start = out_.size();
-  out_.resize(start + kLengthBytes);
-  return start;
+FrameWriter ServiceConnection::beginCall(wire::Operation operation, std::size_t arguments) {
+  return FrameWriter::call(out_, calls_.nextNumber(), operation, arguments);
 }
 
-void ServiceConnection::endFrame(std::size_t start) {
-  const std::size_t length = out_.size() - start - kLengthBytes;
-  for (std::size_t i = 0; i < kLengthBytes; ++i)
-    out_[start + i] = static_cast<uint8_t>(length >> (8 * i));
-}
-
-std::size_t ServiceConnection::beginCall(ServiceOperation operation, std::size_t arguments) {
-  const std::size_t start = beginFrame();
-  CborWriter call(out_);
-  call.array(3 + arguments);
-  call.integer(kCall);
-  call.unsignedInteger(calls_.nextNumber());
-  call.integer(static_cast<int64_t>(operation));
-  return start;
-}
-
-ClientStatus ServiceConnection::endCall(std::size_t start, CallAnswer answer) {
-  endFrame(start);
-  const std::size_t bytes = out_.size() - start;
-  if (bytes - kLengthBytes > largestFrame_ || bytes > options_.maxBufferedBytes) {
-    out_.resize(start);
+ClientStatus ServiceConnection::endCall(FrameWriter& call, CallAnswer answer) {
+  call.end();
+  const std::size_t bytes = wire::kLengthBytes + call.bodyBytes();
+  if (call.bodyBytes() > largestFrame_ || bytes > options_.maxBufferedBytes) {
+    call.discard();
     return failure(Code::TooLarge, "a call of " + std::to_string(bytes) +
                                        " bytes; the service takes " +
                                        std::to_string(largestFrame_) + ", the buffer " +
@@ -204,9 +162,9 @@ ClientStatus ServiceConnection::endCall(std::size_t start, CallAnswer answer) {
   }
   const bool tooManyCalls = calls_.size() >= options_.maxPendingCalls;
   if (tooManyCalls || out_.size() - outBegin_ > options_.maxBufferedBytes) {
-    const int error = writeUpTo(start);
+    const int error = writeUpTo(call.start());
     if (error != 0 || tooManyCalls || out_.size() - outBegin_ > options_.maxBufferedBytes) {
-      out_.resize(start);
+      call.discard();
       if (error != 0) return lostWhileSending(error);
       trimOutput();
       return failure(Code::BufferFull,
@@ -224,7 +182,7 @@ ClientStatus ServiceConnection::endCall(std::size_t start, CallAnswer answer) {
 int ServiceConnection::writeUpTo(std::size_t end) {
   while (outBegin_ < end) {
     const ssize_t sent =
-        send(fd_, out_.data() + outBegin_, end - outBegin_, MSG_DONTWAIT | MSG_NOSIGNAL);
+        send(socket_.get(), out_.data() + outBegin_, end - outBegin_, MSG_DONTWAIT | MSG_NOSIGNAL);
     if (sent >= 0) {
       outBegin_ += static_cast<std::size_t>(sent);
     } else if (errno == EAGAIN || errno == EWOULDBLOCK) {
@@ -252,7 +210,7 @@ void ServiceConnection::trimOutput() {
 }
 
 ClientStatus ServiceConnection::flush() {
-  if (fd_ < 0) return whyNoCalls();
+  if (!isConnected()) return whyNoCalls();
   if (!wantsWrite()) return {};
   if (const int error = writeUpTo(out_.size()); error != 0) return lostWhileSending(error);
   trimOutput();
@@ -275,7 +233,7 @@ ClientStatus ServiceConnection::lostWhileSending(int error) {
 // Reading
 
 ClientStatus ServiceConnection::process() {
-  if (fd_ < 0) return whyNoCalls();
+  if (!isConnected()) return whyNoCalls();
   const auto self = shared_from_this();
   const uint64_t generation = generation_;
   if (ClientStatus status = flush(); !status.ok()) return status;
@@ -284,59 +242,53 @@ ClientStatus ServiceConnection::process() {
 }
 
 ServiceConnection::Received ServiceConnection::receive(int flags) {
-  if (inBegin_ == inEnd_) {
-    inBegin_ = inEnd_ = 0;
-    if (in_.size() != kReadBytes) in_ = std::vector<uint8_t>(kReadBytes);
-  } else if (inEnd_ == in_.size()) {  // inside a frame
-    in_.erase(in_.begin(), in_.begin() + static_cast<std::ptrdiff_t>(inBegin_));
-    inEnd_ -= inBegin_;
-    inBegin_ = 0;
-    in_.resize(std::max(kReadBytes, 2 * in_.size()));
-  }
-  ssize_t got = recv(fd_, in_.data() + inEnd_, in_.size() - inEnd_, flags);
+  const std::span<uint8_t> space = reader_.space();
+  const ssize_t got = recv(socket_.get(), space.data(), space.size(), flags);
   if (got < 0 && (errno == EAGAIN || errno == EWOULDBLOCK || errno == EINTR))
     return Received::Nothing;
   if (got < 0) return lost(std::string("the service went away: ") + std::strerror(errno));
   if (got == 0)
     return lost(goodbyeSeen_ ? "the service ended" : "the service closed the connection");
-  inEnd_ += static_cast<std::size_t>(got);
+  reader_.received(static_cast<std::size_t>(got));
   return runFrames();
 }
 
+// A callback may come here again, for the frames that follow the one it is about.
 ServiceConnection::Received ServiceConnection::runFrames() {
   const uint64_t generation = generation_;
-  while (inEnd_ - inBegin_ >= kLengthBytes) {
-    const uint8_t* head = in_.data() + inBegin_;
-    const std::size_t length = head[0] | std::size_t{head[1]} << 8 | std::size_t{head[2]} << 16 |
-                               std::size_t{head[3]} << 24;
-    if (length > largestFrame_)
-      return lost("the service sent a frame of " + std::to_string(length) + " bytes");
-    if (inEnd_ - inBegin_ - kLengthBytes < length) break;
-    // Behind us before its callback runs: that may come here again.
-    inBegin_ += kLengthBytes + length;
-    if (!runFrame({head + kLengthBytes, length}))
-      return lost("the service sent something that is not the protocol");
+  for (;;) {
+    std::span<const uint8_t> body;
+    switch (reader_.next(body)) {
+      case FrameReader::Next::Incomplete:
+        return Received::Something;
+      case FrameReader::Next::TooLarge:
+        return lost("the service sent a frame of " + std::to_string(reader_.nextLength()) +
+                    " bytes");
+      case FrameReader::Next::Frame:
+        if (!runFrame(body)) return lost("the service sent something that is not the protocol");
+    }
     if (generation != generation_) return Received::Ended;
   }
-  return Received::Something;
 }
 
 bool ServiceConnection::runFrame(std::span<const uint8_t> bytes) {
   const std::optional<Frame> frame = Frame::decode(bytes);
   if (!frame || frame->empty()) return false;
   const std::size_t size = frame->size();
-  const Value kind = (*frame)[0];
-  if (kind.kind() != ValueKind::Integer) return false;
-  if (kind.asInt64() == kGoodbye) return goodbyeSeen_ = true;
+  if ((*frame)[0].kind() != ValueKind::Integer) return false;
+  const auto is = [kind = (*frame)[0].asInt64()](FrameKind wanted) {
+    return kind == static_cast<int64_t>(wanted);
+  };
+  if (is(FrameKind::Goodbye)) return goodbyeSeen_ = true;
   if (size < 2) return false;
-  if (kind.asInt64() == kHello) return runHello(*frame);
+  if (is(FrameKind::Hello)) return runHello(*frame);
   const Value number = (*frame)[1];
-  if (kind.asInt64() == kReply && helloSeen_ && size >= 3) {
+  if (is(FrameKind::Reply) && helloSeen_ && size >= 3) {
     const Value value = (*frame)[2];
     answer(number, {}, &value);
     return true;
   }
-  if (kind.asInt64() != kError || size < 4) return false;
+  if (!is(FrameKind::Error) || size < 4) return false;
   ClientStatus status = failure(Code::Refused, "");
   status.wireCode = (*frame)[2].asInt64();
   status.text = (*frame)[3].asString();
@@ -350,13 +302,15 @@ bool ServiceConnection::runFrame(std::span<const uint8_t> bytes) {
 // [0, version, limits]
 bool ServiceConnection::runHello(const Frame& frame) {
   const Value version = frame[1];
-  if (helloSeen_ || version.kind() != ValueKind::Integer || version.asInt64() != kProtocolVersion)
+  if (helloSeen_ || version.kind() != ValueKind::Integer ||
+      version.asInt64() != wire::kProtocolVersion)
     return false;
   helloSeen_ = true;
   if (frame.size() < 3) return true;
   const std::optional<Value> limit = frame[2].asDictionary().find("max_frame_bytes");
   if (limit && limit->kind() == ValueKind::Integer && limit->asInt64() > 0)
-    largestFrame_ = std::min<uint64_t>(limit->asUInt64(), kLargestFrameBytes);
+    largestFrame_ = std::min<uint64_t>(limit->asUInt64(), wire::kMaxAnnouncedFrameBytes);
+  reader_.setLimit(largestFrame_);
   return true;
 }
 
@@ -377,7 +331,7 @@ void ServiceConnection::answer(const Value& number, const ClientStatus& status,
 void ServiceConnection::setReceiveTimeout(Patience patience) {
   if (patience == receiveTimeout_) return;
   const timeval limit = timeOf(patience);
-  if (setsockopt(fd_, SOL_SOCKET, SO_RCVTIMEO, &limit, sizeof limit) == 0)
+  if (setsockopt(socket_.get(), SOL_SOCKET, SO_RCVTIMEO, &limit, sizeof limit) == 0)
     receiveTimeout_ = patience;
 }
 
@@ -385,7 +339,7 @@ void ServiceConnection::setReceiveTimeout(Patience patience) {
 // wait is the read itself, bounded by the descriptor's own time-out; only what is left of the
 // patience after it, and a socket that takes nothing, need a poll.
 ClientStatus ServiceConnection::waitStep(Wait& wait) {
-  if (fd_ < 0) return ended_;
+  if (!isConnected()) return ended_;
   if (ClientStatus status = flush(); !status.ok()) return status;
   if (std::exchange(wait.first, false) && !wantsWrite() && wait.patience > Patience(0)) {
     setReceiveTimeout(wait.patience);
@@ -395,7 +349,7 @@ ClientStatus ServiceConnection::waitStep(Wait& wait) {
   }
   const auto left = std::chrono::ceil<Patience>(wait.deadline - SteadyClock::now()).count();
   if (left <= 0) return failure(Code::TimedOut, "no answer from the service in time");
-  pollfd ready{fd_, static_cast<short>(POLLIN | (wantsWrite() ? POLLOUT : 0)), 0};
+  pollfd ready{socket_.get(), static_cast<short>(POLLIN | (wantsWrite() ? POLLOUT : 0)), 0};
   const int events = poll(&ready, 1, static_cast<int>(std::min<int64_t>(left, INT_MAX)));
   if (events < 0 && errno != EINTR) {
     lost(std::string("cannot wait for the service: ") + std::strerror(errno));

@@ -12,26 +12,13 @@
 #include <string>
 #include <vector>
 
+#include "base/UniqueFd.h"
 #include "client/PendingCalls.h"
 #include "client/ReportingClient.h"
-#include "propertylist/CborWriter.h"
+#include "wire/FrameReader.h"
+#include "wire/FrameWriter.h"
 
 namespace vx {
-
-// The operations of the service, by the numbers they have on the wire.
-enum class ServiceOperation : uint8_t {
-  CreateReportingSession = 1,
-  SetServiceType,
-  GetServiceNameForReporterID,
-  SetConfiguration,
-  StartReportingSessionForID,
-  SendMessage,
-  StopReportingSessionForID,
-  DestroyReportingSession,
-  ReporterID,
-  GetAllReporters,
-  KillService,
-};
 
 // Owned by its ReportingClient, and by whatever function of its own is running: a callback may
 // destroy the client. Not thread-safe. Bounds: Options, and one frame of the service.
@@ -40,13 +27,12 @@ class ServiceConnection : public std::enable_shared_from_this<ServiceConnection>
   using Patience = std::chrono::milliseconds;
 
   explicit ServiceConnection(const ReportingClient::Options& options) : options_(options) {}
-  ~ServiceConnection();
 
   ClientStatus open(const std::string& path, Patience patience);
-  ClientStatus adopt(int connectedFd, Patience patience);
+  ClientStatus adopt(UniqueFd connected, Patience patience);
   const std::string& socketPath() const { return socketPath_; }
-  bool isConnected() const { return fd_ >= 0; }
-  int fd() const { return fd_; }
+  bool isConnected() const { return static_cast<bool>(socket_); }
+  int fd() const { return socket_.get(); }
   ClientStatus sayGoodbye(Patience patience);
   // Every pending call fails with this reason, once.
   void disconnect(const ClientStatus& why);
@@ -57,13 +43,12 @@ class ServiceConnection : public std::enable_shared_from_this<ServiceConnection>
   ClientStatus process();
   ClientStatus flush();
 
-  // A call: when acceptsCalls(), beginCall(), write that many arguments to the writer, endCall().
-  // endCall() says whether the call was taken; only then is the answer ever delivered.
+  // A call: when acceptsCalls(), beginCall(), write that many arguments, endCall(). endCall() says
+  // whether the call was taken; only then is the answer ever delivered.
   bool acceptsCalls() const { return acceptsCalls_; }
   ClientStatus whyNoCalls() const;
-  std::size_t beginCall(ServiceOperation operation, std::size_t arguments);
-  CborWriter writer() { return CborWriter(out_); }
-  ClientStatus endCall(std::size_t start, CallAnswer answer);
+  wire::FrameWriter beginCall(wire::Operation operation, std::size_t arguments);
+  ClientStatus endCall(wire::FrameWriter& call, CallAnswer answer);
 
   // Works until the condition holds; a callback may be what makes it hold.
   template <class Condition>
@@ -88,7 +73,7 @@ class ServiceConnection : public std::enable_shared_from_this<ServiceConnection>
     bool first = true;
   };
 
-  ClientStatus begin(int connectedFd, Patience patience);
+  ClientStatus begin(UniqueFd connected, Patience patience);
   ClientStatus waitStep(Wait& wait);
   void setReceiveTimeout(Patience patience);
 
@@ -103,12 +88,9 @@ class ServiceConnection : public std::enable_shared_from_this<ServiceConnection>
   bool runHello(const Frame& frame);
   void answer(const Value& number, const ClientStatus& status, const Value* value);
 
-  std::size_t beginFrame();
-  void endFrame(std::size_t start);
-
   const ReportingClient::Options options_;
   std::string socketPath_;
-  int fd_ = -1;
+  UniqueFd socket_;
   bool acceptsCalls_ = false;
   bool helloSeen_ = false;
   bool goodbyeSeen_ = false;
@@ -119,9 +101,8 @@ class ServiceConnection : public std::enable_shared_from_this<ServiceConnection>
   std::string serviceError_;      // what the service said about the connection before closing it
   ClientStatus ended_;            // why the last connection ended
 
-  std::vector<uint8_t> in_;  // read, not yet run: from inBegin_ to inEnd_
-  std::size_t inBegin_ = 0;
-  std::size_t inEnd_ = 0;
+  wire::ReadBuffers readBuffers_;
+  wire::FrameReader reader_{readBuffers_};
   std::vector<uint8_t> out_;  // not yet written: from outBegin_
   std::size_t outBegin_ = 0;
   std::size_t writeAt_ = 0;  // bytes in out_ at which the next write is due

@@ -11,10 +11,16 @@ inline constexpr int64_t kProtocolVersion = 1;
 
 // A frame: its length as 32 bits, little-endian, and that many bytes of CBOR.
 inline constexpr std::size_t kLengthBytes = 4;
-// The most that a service may be configured to take, and what it takes by default.
+// The most that a service may be configured to take, what it takes by default, and what either side
+// goes by until the service's hello has said otherwise.
 inline constexpr uint32_t kMaxFrameBytes = 1u << 20;
+// What a client believes of a service that announces more than that.
+inline constexpr uint32_t kMaxAnnouncedFrameBytes = 64u << 20;
 
 enum class FrameKind : uint8_t { Hello = 0, Call = 1, Reply = 2, Error = 3, Goodbye = 4 };
+
+// Elements of a call before its arguments: kind, number, operation.
+inline constexpr std::size_t kCallHead = 3;
 
 // Codes of error frames.
 enum class ErrorCode : uint8_t {
