@@ -32,7 +32,6 @@ enum class ErrorCode : uint8_t {
   TooManyConnections = 6,
   UnsupportedVersion = 7,
   Abandoned = 8,
-  ReadsTooSlowly = 10,
 };
 
 }  // namespace vx::wire

@@ -112,7 +112,10 @@ class RunningPlatform final : public LinuxPlatform {
   }
 
   bool open(const Directories& directories, std::string& problem) {
-    if (!listener_.open(directories.runtime, problem)) return false;
+    if (const Status opened = listener_.open(directories.runtime); !opened.ok()) {
+      problem = opened.text();
+      return false;
+    }
     watcher_.emplace(directories.configuration + "/preferences", directories.runtime + "/notify",
                      std::vector<PreferencesWatcher::Notification>{
                          {std::string(kPreferencesNotification), std::string(kPreferencesFile)}},

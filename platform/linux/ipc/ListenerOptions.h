@@ -9,11 +9,14 @@
 namespace vx::lnx {
 
 struct ListenerOptions {
+  // The most that maxFrameBytes may be.
+  static constexpr uint32_t kLargestFrameBytes = wire::kMaxFrameBytes;
+
   uint32_t maxConnections = 1024;
   uint32_t maxConnectionsPerUser = 256;
   uint32_t maxSessionsPerConnection = 1024;
   uint32_t maxCallsInFlight = 1024;
-  uint32_t maxFrameBytes = wire::kMaxFrameBytes;
+  uint32_t maxFrameBytes = kLargestFrameBytes;
   uint32_t maxUnreadReplyBytes = 256u << 10;
   std::chrono::milliseconds stalledClientTimeout{10000};
 };

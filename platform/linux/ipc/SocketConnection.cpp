@@ -1,83 +1,56 @@
 #include "platform/linux/ipc/SocketConnection.h"
 
 #include <sys/socket.h>
-#include <unistd.h>
 
 #include <cerrno>
-#include <cstring>
 
-#include "propertylist/CborWriter.h"
+#include "platform/linux/ipc/ArgumentReading.h"
 
 namespace vx::lnx {
 
 namespace {
 
-using wire::kLengthBytes;
-using wire::kProtocolVersion;
-constexpr std::size_t kReadBytes = 64 << 10;
+using wire::FrameKind;
+using wire::FrameReader;
+using WireError = wire::ErrorCode;
+
 // Frames run before the replies they cause get their turn, which bounds how far replies overshoot
 // their limit.
 constexpr int kFramesPerTurn = 512;
-// A buffer larger than this is given back when it is empty.
-constexpr std::size_t kKeptBufferBytes = 64 << 10;
+// An operation whose answer may be as large as a frame uses up this much of a turn.
+constexpr int kLargeReplyCost = 64;
 
-uint32_t readLength(const uint8_t* at) {
-  return uint32_t{at[0]} | uint32_t{at[1]} << 8 | uint32_t{at[2]} << 16 | uint32_t{at[3]} << 24;
-}
-
-void writeLength(uint8_t* at, std::size_t length) {
-  for (int i = 0; i < 4; ++i) at[i] = static_cast<uint8_t>(length >> (8 * i));
+// None for other kinds.
+std::optional<int64_t> readInteger(const Value& value) {
+  if (value.kind() != ValueKind::Integer) return std::nullopt;
+  return value.asInt64();
 }
 
 }  // namespace
 
-std::string ListenerCounters::text() const {
-  std::string out;
-  auto add = [&out](const char* name, uint64_t value) {
-    out += out.empty() ? "" : " ";
-    out += name;
-    out += "=" + std::to_string(value);
-  };
-  add("accepted", accepted);
-  add("calls", calls);
-  add("refused_connections", refusedConnections);
-  add("descriptor_exhaustions", descriptorExhaustions);
-  add("malformed_frames", malformedFrames);
-  add("oversized_frames", oversizedFrames);
-  add("unknown_operations", unknownOperations);
-  add("wrong_arguments", wrongArguments);
-  add("too_many_sessions", tooManySessions);
-  add("unsupported_versions", unsupportedVersions);
-  add("second_replies", secondReplies);
-  add("abandoned_calls", abandonedCalls);
-  add("oversized_replies", oversizedReplies);
-  add("slow_clients_cut", slowClientsCut);
-  add("reading_pauses", readingPauses);
-  return out;
-}
-
-SocketConnection::SocketConnection(ConnectionHost& host, int fd, pid_t pid, uid_t uid)
+SocketConnection::SocketConnection(ConnectionHost& host, UniqueFd socket, pid_t pid, uid_t uid)
     : host_(host),
-      fd_(fd),
+      socket_(std::move(socket)),
       pid_(pid),
       uid_(uid),
       queue_(host.executor().makeSerial("com.quorvel.sonik.reporting.connection",
-                                        QualityOfService::UserInteractive)) {}
-
-SocketConnection::~SocketConnection() {
-  if (fd_ >= 0) ::close(fd_);
+                                        QualityOfService::UserInteractive)),
+      reader_(host.readBuffers()) {
+  reader_.setLimit(host.limits().maxFrameBytes);
 }
 
 std::string SocketConnection::description() const {
-  return "<ClientConnection fd " + std::to_string(fd_) + " pid " + std::to_string(pid_) + " uid " +
-         std::to_string(uid_) + ">";
+  return "<ClientConnection fd " + std::to_string(socket_.get()) + " pid " + std::to_string(pid_) +
+         " uid " + std::to_string(uid_) + ">";
 }
 
 void SocketConnection::resume() {
+  assertInteractive();
+  VX_DCHECK(interface_ != nullptr && object_ != nullptr);
   if (state_ != State::Accepted) return;
   state_ = State::Open;
   interest_ = EPOLLIN;
-  if (!host_.loop().add(fd_, interest_, *this)) {
+  if (!host_.loop().add(socket_.get(), interest_, *this)) {
     interest_ = 0;
     queue_->async([self = shared_from_this()] { self->finishReading(End::Interrupted); });
   }
@@ -87,6 +60,7 @@ void SocketConnection::resume() {
 // Reading
 
 void SocketConnection::onReady(uint32_t events) {
+  assertInteractive();
   if (events & (EPOLLOUT | EPOLLERR)) flush();
   if (events & (EPOLLIN | EPOLLHUP | EPOLLERR)) scheduleRead();
 }
@@ -101,9 +75,9 @@ void SocketConnection::scheduleRead() {
 }
 
 bool SocketConnection::mustPause() const {
-  const auto& limits = host_.limits();
-  return callsInFlight_ >= limits.maxCallsInFlight ||
-         out_.size() - outOffset_ >= limits.maxUnreadReplyBytes;
+  const ListenerOptions& limits = host_.limits();
+  return calls_.inFlight() >= limits.maxCallsInFlight ||
+         replies_.unreadBytes() >= limits.maxUnreadReplyBytes;
 }
 
 void SocketConnection::pauseReading() {
@@ -112,297 +86,261 @@ void SocketConnection::pauseReading() {
 }
 
 void SocketConnection::continueReading() {
+  assertInteractive();
   waitingForHost_ = false;
   updateInterest();
   scheduleRead();
 }
 
 void SocketConnection::readPass() {
+  queue_->assertIsCurrent();
   if (state_ != State::Open || waitingForHost_) return;
   // Complete frames left over from the read before come first; only when they are through is more
   // read.
-  if (hasCompleteFrame()) {
-    inOffset_ += runFrames(std::span<const uint8_t>(in_).subspan(inOffset_));
-  } else {
-    std::span<uint8_t> buffer = host_.readBuffer();
-    const std::size_t had = in_.size() - inOffset_;
-    const bool inPlace = had <= buffer.size() - kReadBytes;
-    ssize_t got = 0;
-    if (inPlace) {
-      if (had != 0) std::memcpy(buffer.data(), in_.data() + inOffset_, had);
-      got = recv(fd_, buffer.data() + had, kReadBytes, MSG_DONTWAIT);
-    } else {  // inside a large frame
-      in_.resize(in_.size() + kReadBytes);
-      got = recv(fd_, in_.data() + inOffset_ + had, kReadBytes, MSG_DONTWAIT);
-      in_.resize(inOffset_ + had + static_cast<std::size_t>(got > 0 ? got : 0));
-    }
-    if (got < 0 && (errno == EAGAIN || errno == EINTR)) return;
-    if (got <= 0) return finishReading(End::Interrupted);
-    if (inPlace) {
-      const std::span<const uint8_t> bytes(buffer.data(), had + static_cast<std::size_t>(got));
-      const std::size_t used = runFrames(bytes);
-      if (state_ != State::Open) return;
-      keepRest(bytes.subspan(used));
-    } else {
-      inOffset_ += runFrames(std::span<const uint8_t>(in_).subspan(inOffset_));
-    }
-  }
+  if (!reader_.hasNext() && !readSocket()) return;
+  runFrames();
   if (state_ != State::Open) return;
-  if (inOffset_ == in_.size()) keepRest({});
+  reader_.keepRest();
   if (waitingForHost_ || mustPause()) return pauseReading();
   // More bytes in the socket than one read takes are left to the next pass, so that this one's
   // replies leave first.
-  if (hasCompleteFrame()) scheduleRead();
+  if (reader_.hasNext()) scheduleRead();
 }
 
-// Whether in_ starts with a whole frame, or with a length that will be refused.
-bool SocketConnection::hasCompleteFrame() const {
-  const std::size_t had = in_.size() - inOffset_;
-  if (had < kLengthBytes) return false;
-  const std::size_t length = readLength(in_.data() + inOffset_);
-  return had - kLengthBytes >= length || length > host_.limits().maxFrameBytes;
-}
-
-void SocketConnection::keepRest(std::span<const uint8_t> rest) {
-  inOffset_ = 0;
-  std::vector<uint8_t>& spare = host_.spareBuffer();
-  if (!rest.empty()) {
-    if (in_.capacity() == 0) in_.swap(spare);
-    in_.assign(rest.begin(), rest.end());
-    return;
+bool SocketConnection::readSocket() {
+  const std::span<uint8_t> space = reader_.space();
+  const ssize_t got = recv(socket_.get(), space.data(), space.size(), MSG_DONTWAIT);
+  if (got < 0 && (errno == EAGAIN || errno == EINTR)) return false;
+  if (got <= 0) {
+    finishReading(End::Interrupted);
+    return false;
   }
-  // Most connections are idle most of the time: they keep no buffer.
-  in_.clear();
-  if (spare.capacity() < in_.capacity() && in_.capacity() <= 2 * kReadBytes) spare.swap(in_);
-  if (in_.capacity() != 0) in_ = std::vector<uint8_t>();
+  reader_.received(static_cast<std::size_t>(got));
+  return true;
 }
 
-std::size_t SocketConnection::runFrames(std::span<const uint8_t> bytes) {
-  std::size_t used = 0;
+void SocketConnection::runFrames() {
   turnBudget_ = kFramesPerTurn;
-  while (turnBudget_-- > 0 && bytes.size() - used >= kLengthBytes) {
-    if (mustPause()) break;
+  while (turnBudget_-- > 0 && state_ == State::Open && reader_.unread() >= wire::kLengthBytes) {
+    if (mustPause()) return;
     if (host_.readingPaused()) {
       waitingForHost_ = true;
       host_.waitForReading(shared_from_this());
-      break;
+      return;
     }
-    const std::size_t length = readLength(bytes.data() + used);
-    if (length > host_.limits().maxFrameBytes) {
-      ++host_.counters().oversizedFrames;
-      fail(WireError::FrameTooLarge, "a frame of " + std::to_string(length) +
-                                         " bytes; the limit is " +
-                                         std::to_string(host_.limits().maxFrameBytes));
-      return used;
+    std::span<const uint8_t> body;
+    switch (reader_.next(body)) {
+      case FrameReader::Next::Incomplete:
+        return;
+      case FrameReader::Next::TooLarge:
+        ++host_.counters().oversizedFrames;
+        return fail(WireError::FrameTooLarge, "a frame of " + std::to_string(reader_.nextLength()) +
+                                                  " bytes; the limit is " +
+                                                  std::to_string(host_.limits().maxFrameBytes));
+      case FrameReader::Next::Frame:
+        runFrame(body);
     }
-    if (bytes.size() - used - kLengthBytes < length) break;
-    runFrame(bytes.subspan(used + kLengthBytes, length));
-    if (state_ != State::Open) return used;
-    used += kLengthBytes + length;
   }
-  return used;
 }
 
-void SocketConnection::runFrame(std::span<const uint8_t> frame) {
+void SocketConnection::runFrame(std::span<const uint8_t> body) {
   DecodeError error;
-  const std::optional<Frame> items = Frame::decode(frame, &error);
-  std::optional<int64_t> kind;
-  if (items && !items->empty()) kind = readInteger((*items)[0]);
-  if (!items || !kind) {
-    ++host_.counters().malformedFrames;
-    return fail(WireError::MalformedFrame,
-                !items ? error.text + " at byte " + std::to_string(error.offset)
-                       : "the first element of a frame must be its kind, an integer");
-  }
-  if (*kind == static_cast<int64_t>(FrameKind::Hello)) return runHello(*items);
-  if (!helloSeen_) {
-    ++host_.counters().malformedFrames;
-    return fail(WireError::MalformedFrame, "the first frame must be a hello: [0, 1]");
-  }
-  if (*kind == static_cast<int64_t>(FrameKind::Call)) return runCall(*items);
+  const std::optional<Frame> frame = Frame::decode(body, &error);
+  if (!frame) return failMalformed(error.text + " at byte " + std::to_string(error.offset));
+  const std::optional<int64_t> kind = frame->empty() ? std::nullopt : readInteger((*frame)[0]);
+  if (!kind) return failMalformed("the first element of a frame must be its kind, an integer");
+  if (*kind == static_cast<int64_t>(FrameKind::Hello)) return runHello(*frame);
+  if (!helloSeen_) return failMalformed("the first frame must be a hello: [0, 1]");
+  if (*kind == static_cast<int64_t>(FrameKind::Call)) return runCall(*frame);
   if (*kind == static_cast<int64_t>(FrameKind::Goodbye)) return finishReading(End::Orderly);
-  ++host_.counters().malformedFrames;
-  fail(WireError::MalformedFrame, "unknown kind of frame " + std::to_string(*kind));
+  failMalformed("unknown kind of frame " + std::to_string(*kind));
 }
 
 void SocketConnection::runHello(const Frame& frame) {
-  std::optional<int64_t> version;
-  if (frame.size() >= 2) version = readInteger(frame[1]);
-  if (version != kProtocolVersion) {
+  const std::optional<int64_t> version = frame.size() < 2 ? std::nullopt : readInteger(frame[1]);
+  if (version != wire::kProtocolVersion) {
     ++host_.counters().unsupportedVersions;
-    return fail(
-        WireError::UnsupportedVersion,
-        "this service speaks version " + std::to_string(kProtocolVersion) + " of the protocol");
+    return fail(WireError::UnsupportedVersion, "this service speaks version " +
+                                                   std::to_string(wire::kProtocolVersion) +
+                                                   " of the protocol");
   }
   if (helloSeen_) return;
   helloSeen_ = true;
-  const auto& limits = host_.limits();
-  const std::size_t start = beginFrame();
-  CborWriter writer(out_);
-  writer.array(3);
-  writer.integer(static_cast<int64_t>(FrameKind::Hello));
-  writer.integer(kProtocolVersion);
-  writer.dictionary(5);
-  writer.string("interface");
-  writer.string(interface_ != nullptr ? interface_->name : "");
-  auto limit = [&writer](std::string_view name, uint64_t value) {
-    writer.string(name);
-    writer.unsignedInteger(value);
-  };
-  limit("max_frame_bytes", limits.maxFrameBytes);
-  limit("max_calls_in_flight", limits.maxCallsInFlight);
-  limit("max_unread_reply_bytes", limits.maxUnreadReplyBytes);
-  limit("max_sessions", limits.maxSessionsPerConnection);
-  endFrame(start);
+  replies_.hello(interface_->name, host_.limits());
+  wantFlush();
+}
+
+// ---------------------------------------------------------------------------------------------------------------------
+// Calls
+
+void SocketConnection::runCall(const Frame& frame) {
+  ++host_.counters().calls;
+  std::optional<int64_t> number;
+  std::optional<int64_t> operationNumber;
+  if (frame.size() >= wire::kCallHead) {
+    number = readInteger(frame[1]);
+    operationNumber = readInteger(frame[2]);
+  }
+  if (!number || *number < 0 || !operationNumber)
+    return failMalformed("a call is [1, number, operation, argument...]");
+  const auto callNumber = static_cast<uint64_t>(*number);
+  if (*operationNumber < 1 ||
+      static_cast<uint64_t>(*operationNumber) > interface_->operations.size()) {
+    ++host_.counters().unknownOperations;
+    return sendError(callNumber, WireError::UnknownOperation,
+                     "there is no operation " + std::to_string(*operationNumber));
+  }
+  const OperationDescription& operation =
+      interface_->operations[static_cast<std::size_t>(*operationNumber - 1)];
+  CallArguments arguments;
+  if (const Status read = readArguments(operation, frame, arguments); !read.ok()) {
+    ++host_.counters().wrongArguments;
+    return sendError(callNumber, WireError::WrongArguments, read.text());
+  }
+  if (!admitResource(operation, arguments)) {
+    ++host_.counters().tooManySessions;
+    return sendError(callNumber, WireError::TooManySessions,
+                     "this connection holds " + std::to_string(resources_.size()) +
+                         " sessions already; destroy some first");
+  }
+  if (operation.reply == ReplyKind::Int64Array) turnBudget_ -= kLargeReplyCost;
+  const uint64_t token =
+      calls_.open(callNumber, operation.replyMayBeHeld ? CallTable::Answer::MayBeHeld
+                                                       : CallTable::Answer::Soon);
+  operation.invoke(*object_, arguments, Reply(weak_from_this(), token));
+}
+
+bool SocketConnection::admitResource(const OperationDescription& operation,
+                                     const CallArguments& arguments) {
+  if (operation.resource == ResourceEffect::Release) resources_.erase(arguments.int64(0));
+  if (operation.resource != ResourceEffect::Acquire) return true;
+  if (resources_.size() >= host_.limits().maxSessionsPerConnection &&
+      !resources_.contains(arguments.int64(0))) {
+    return false;
+  }
+  resources_.insert(arguments.int64(0));
+  return true;
+}
+
+void SocketConnection::settle(CallTable::Call& call) {
+  const std::size_t before = calls_.inFlight();
+  calls_.settle(call);
+  if (calls_.inFlight() == before) return;
+  if (before >= host_.limits().maxCallsInFlight && state_ == State::Open) {
+    updateInterest();
+    scheduleRead();
+  }
+  if (state_ == State::Draining && calls_.inFlight() == 0) wantFlush();
+}
+
+void SocketConnection::reply(uint64_t token, ReplyValue value) {
+  if (!host_.executor().isInteractiveThread()) {
+    queue_->async([self = shared_from_this(), token, value = std::move(value)]() mutable {
+      self->reply(token, std::move(value));
+    });
+    return;
+  }
+  CallTable::Call* const call = calls_.find(token);
+  if (call == nullptr || state_ == State::Closed) return;
+  if (call->settled) {
+    ++host_.counters().secondReplies;
+    return;
+  }
+  if (replies_.reply(call->number, value, host_.limits().maxFrameBytes) == ReplyStream::Fits::Yes) {
+    wantFlush();
+  } else {
+    ++host_.counters().oversizedReplies;
+    sendError(call->number, WireError::FrameTooLarge, "the answer does not fit into one frame");
+  }
+  settle(*call);
+}
+
+void SocketConnection::release(uint64_t token) {
+  if (!host_.executor().isInteractiveThread()) {
+    queue_->async([self = shared_from_this(), token] { self->release(token); });
+    return;
+  }
+  CallTable::Call* const call = calls_.find(token);
+  if (call == nullptr) return;
+  if (!call->settled) {
+    if (state_ == State::Open) {
+      ++host_.counters().abandonedCalls;
+      sendError(call->number, WireError::Abandoned,
+                "the service let go of this call without an answer");
+    }
+    settle(*call);
+  }
+  calls_.close(token);
 }
 
 // ---------------------------------------------------------------------------------------------------------------------
 // Writing
 
-std::size_t SocketConnection::beginFrame() {
-  const std::size_t start = out_.size();
-  out_.resize(start + kLengthBytes);
-  return start;
-}
-
-void SocketConnection::endFrame(std::size_t start) {
-  writeLength(out_.data() + start, out_.size() - start - kLengthBytes);
-  wantFlush();
-}
-
 void SocketConnection::wantFlush() {
+  assertInteractive();
   if (flushQueued_ || state_ == State::Closed) return;
   flushQueued_ = true;
   host_.flushAtPassEnd(shared_from_this());
 }
 
-void SocketConnection::sendReply(uint64_t number, const ReplyValue& value) {
-  const std::size_t start = beginFrame();
-  CborWriter writer(out_);
-  writer.array(3);
-  writer.integer(static_cast<int64_t>(FrameKind::Reply));
-  writer.unsignedInteger(number);
-  if (const bool* boolean = std::get_if<bool>(&value)) {
-    writer.boolean(*boolean);
-  } else if (const uint16_t* code = std::get_if<uint16_t>(&value)) {
-    writer.unsignedInteger(*code);
-  } else if (const Error* error = std::get_if<Error>(&value)) {
-    writer.dictionary(error->reason.empty() ? 2 : 3);
-    writer.string("domain");
-    writer.string(error->domain);
-    writer.string("code");
-    writer.integer(error->code);
-    if (!error->reason.empty()) {
-      writer.string("reason");
-      writer.string(error->reason);
-    }
-  } else if (const Payload* dictionary = std::get_if<Payload>(&value)) {
-    writer.encoded(dictionary->encoded());
-  } else if (const auto* numbers = std::get_if<std::vector<int64_t>>(&value)) {
-    writer.array(numbers->size());
-    for (const int64_t element : *numbers) writer.integer(element);
-  } else {
-    writer.null();
-  }
-  if (out_.size() - start - kLengthBytes > host_.limits().maxFrameBytes) {
-    ++host_.counters().oversizedReplies;
-    out_.resize(start);
-    return sendError(number, WireError::FrameTooLarge, "the answer does not fit into one frame");
-  }
-  endFrame(start);
-}
-
 void SocketConnection::sendError(std::optional<uint64_t> number, WireError code,
                                  std::string_view text) {
-  const std::size_t start = beginFrame();
-  CborWriter writer(out_);
-  writer.array(4);
-  writer.integer(static_cast<int64_t>(FrameKind::Error));
-  if (number)
-    writer.unsignedInteger(*number);
-  else
-    writer.null();
-  writer.integer(static_cast<int64_t>(code));
-  writer.string(text);
-  endFrame(start);
+  replies_.error(number, code, text);
+  wantFlush();
 }
 
 void SocketConnection::sendGoodbye() {
   if (goodbyeSent_) return;
   goodbyeSent_ = true;
-  const std::size_t start = beginFrame();
-  CborWriter writer(out_);
-  writer.array(1);
-  writer.integer(static_cast<int64_t>(FrameKind::Goodbye));
-  endFrame(start);
+  replies_.goodbye();
+  wantFlush();
 }
 
 void SocketConnection::flush() {
+  assertInteractive();
   flushQueued_ = false;
   if (state_ == State::Closed) return;
-  if (outOffset_ < out_.size()) {
+  if (!replies_.empty()) {
     const bool wasFull = mustPause();
-    const ssize_t sent =
-        send(fd_, out_.data() + outOffset_, out_.size() - outOffset_, MSG_DONTWAIT | MSG_NOSIGNAL);
-    if (sent < 0 && errno != EAGAIN && errno != EINTR) {
-      // The peer is gone. Whoever reads from it finds out; when nobody reads any more, this was the
-      // end.
-      out_.clear();
-      outOffset_ = 0;
-      if (state_ == State::Draining) return closeNow();
+    if (replies_.writeTo(socket_.get(), host_.clock()) == ReplyStream::Peer::Gone) {
+      // Whoever reads from it finds out; when nobody reads any more, this was the end.
+      if (state_ == State::Draining) closeNow();
       return;
-    }
-    if (sent > 0) outOffset_ += static_cast<std::size_t>(sent);
-    if (outOffset_ != out_.size() && (sent > 0 || lastProgress_ == Monotonic{})) {
-      lastProgress_ = host_.clock().monotonic();
-    }
-    if (outOffset_ == out_.size()) {
-      outOffset_ = 0;
-      lastProgress_ = Monotonic{};
-      if (out_.capacity() > kKeptBufferBytes)
-        out_ = {};
-      else
-        out_.clear();
-    } else if (outOffset_ > kKeptBufferBytes) {
-      out_.erase(out_.begin(), out_.begin() + static_cast<std::ptrdiff_t>(outOffset_));
-      outOffset_ = 0;
     }
     if (wasFull && !mustPause()) scheduleRead();
   }
-  if (state_ == State::Draining && callsInFlight_ == 0 && out_.empty()) return closeNow();
+  if (state_ == State::Draining && calls_.inFlight() == 0 && replies_.empty()) return closeNow();
   updateInterest();
 }
 
 void SocketConnection::updateInterest() {
+  assertInteractive();
   if (state_ == State::Closed || state_ == State::Accepted) return;
   uint32_t wanted = 0;
   if (state_ == State::Open && !waitingForHost_ && !mustPause()) wanted |= EPOLLIN;
-  if (outOffset_ < out_.size() && !flushQueued_) wanted |= EPOLLOUT;
+  if (!replies_.empty() && !flushQueued_) wanted |= EPOLLOUT;
   if (wanted == interest_) return;
   if ((wanted ^ interest_) & EPOLLOUT) host_.unreadChanged(*this, (wanted & EPOLLOUT) != 0);
   // Without any interest the descriptor leaves the set: epoll would go on reporting a hang-up.
   if (wanted == 0)
-    host_.loop().remove(fd_, *this);
+    host_.loop().remove(socket_.get(), *this);
   else if (interest_ == 0)
-    (void)host_.loop().add(fd_, wanted, *this);
+    (void)host_.loop().add(socket_.get(), wanted, *this);
   else
-    host_.loop().modify(fd_, wanted, *this);
+    host_.loop().modify(socket_.get(), wanted, *this);
   interest_ = wanted;
 }
 
 std::optional<Monotonic> SocketConnection::stallDeadline() const {
-  if (outOffset_ == out_.size() || lastProgress_ == Monotonic{}) return std::nullopt;
-  return lastProgress_ + host_.limits().stalledClientTimeout;
+  return replies_.stallDeadline(host_.limits().stalledClientTimeout);
 }
 
+// Without a word: the socket is full, and in the middle of a frame.
 void SocketConnection::cutStalled() {
+  assertInteractive();
   ++host_.counters().slowClientsCut;
-  out_.clear();
-  outOffset_ = 0;
-  const bool open = state_ == State::Open;
-  if (open)
-    sendError(std::nullopt, WireError::ReadsTooSlowly, "replies were not read for too long");
-  if (open) finishReading(End::Interrupted);
+  replies_.clear();
+  finishReading(End::Interrupted);
   closeNow();
 }
 
@@ -414,10 +352,16 @@ void SocketConnection::fail(WireError code, std::string_view text) {
   finishReading(End::Interrupted);
 }
 
+void SocketConnection::failMalformed(std::string_view text) {
+  ++host_.counters().malformedFrames;
+  fail(WireError::MalformedFrame, text);
+}
+
 void SocketConnection::finishReading(End end) {
+  assertInteractive();
   if (state_ != State::Open) return;
   state_ = State::Draining;
-  in_ = {};
+  reader_.clear();
   updateInterest();
   // In their own turns on this connection's queue: the caller may be inside a front half.
   queue_->async([self = shared_from_this(), end] {
@@ -431,6 +375,7 @@ void SocketConnection::finishReading(End end) {
 }
 
 void SocketConnection::shutDown() {
+  assertInteractive();
   if (state_ == State::Accepted) state_ = State::Open;
   if (state_ != State::Open) return wantFlush();
   // What the peer sent before now has been accepted: everything complete runs before the goodbye.
@@ -440,12 +385,11 @@ void SocketConnection::shutDown() {
       self->queue_->asyncAfter(std::chrono::milliseconds(5), [self] { self->shutDown(); });
       return;
     }
-    const std::size_t before = self->in_.size() - self->inOffset_;
+    const std::size_t before = self->reader_.unread();
     const uint64_t calls = self->host_.counters().calls;
     self->readPass();
     if (self->state_ != State::Open) return;
-    const bool moved =
-        self->in_.size() - self->inOffset_ != before || self->host_.counters().calls != calls;
+    const bool moved = self->reader_.unread() != before || self->host_.counters().calls != calls;
     if (moved) return self->shutDown();
     self->sendGoodbye();
     self->finishReading(End::Orderly);
@@ -453,6 +397,7 @@ void SocketConnection::shutDown() {
 }
 
 void SocketConnection::shutDownNow() {
+  assertInteractive();
   if (state_ == State::Accepted) state_ = State::Open;
   sendGoodbye();
   finishReading(End::Orderly);
@@ -460,13 +405,13 @@ void SocketConnection::shutDownNow() {
 }
 
 void SocketConnection::closeNow() {
+  assertInteractive();
   if (state_ == State::Closed) return;
   if (interest_ & EPOLLOUT) host_.unreadChanged(*this, false);
-  if (interest_ != 0) host_.loop().remove(fd_, *this);
+  if (interest_ != 0) host_.loop().remove(socket_.get(), *this);
   interest_ = 0;
   state_ = State::Closed;
-  ::close(fd_);
-  fd_ = -1;
+  socket_.reset();
   host_.closed(*this);
 }
 

@@ -12,40 +12,34 @@
 #include <cstring>
 
 #include "platform/Log.h"
-#include "propertylist/CborWriter.h"
+#include "wire/FrameWriter.h"
 
 namespace vx::lnx {
 
 namespace {
 
-constexpr std::size_t kReadBufferBytes = 128 << 10;
-
-std::string because(const std::string& what) { return what + ": " + std::strerror(errno); }
-
-// Takes <runtime>/service.lock for as long as this process lives.
-int lockDirectory(const std::string& directory, std::string& problem) {
+Result<UniqueFd> lockDirectory(const std::string& directory) {
   const std::string path = directory + "/service.lock";
-  const int fd = ::open(path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW, 0644);
-  if (fd < 0) {
-    problem = because("cannot open " + path);
-    return -1;
-  }
-  if (flock(fd, LOCK_EX | LOCK_NB) != 0) {
+  UniqueFd lock(::open(path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW, 0644));
+  if (!lock) return Status::lastError("cannot open " + path);
+  if (flock(lock.get(), LOCK_EX | LOCK_NB) != 0) {
     char owner[32] = "";
-    const ssize_t got = pread(fd, owner, sizeof owner - 1, 0);
+    const ssize_t got = pread(lock.get(), owner, sizeof owner - 1, 0);
     std::string pid(owner, got > 0 ? static_cast<std::size_t>(got) : 0);
     while (!pid.empty() && pid.back() == '\n') pid.pop_back();
-    problem = "another vxreportingd" + (pid.empty() ? "" : " (pid " + pid + ")") + " serves " +
-              directory + "; stop it, or set RUNTIME_DIRECTORY to a folder of its own";
-    ::close(fd);
-    return -1;
+    return Status::failure("another vxreportingd" + (pid.empty() ? "" : " (pid " + pid + ")") +
+                           " serves " + directory +
+                           "; stop it, or set RUNTIME_DIRECTORY to a folder of its own");
   }
   const std::string pid = std::to_string(getpid()) + "\n";
-  if (ftruncate(fd, 0) != 0 || pwrite(fd, pid.data(), pid.size(), 0) < 0) {
+  if (ftruncate(lock.get(), 0) != 0 || pwrite(lock.get(), pid.data(), pid.size(), 0) < 0) {
     // Only a courtesy to whoever finds the lock taken.
   }
-  return fd;
+  return lock;
 }
+
+// Given up to turn a client away when descriptors have run out.
+UniqueFd spareDescriptor() { return UniqueFd(::open("/dev/null", O_RDONLY | O_CLOEXEC)); }
 
 }  // namespace
 
@@ -56,8 +50,7 @@ SocketListener::SocketListener(EventLoop& loop, Executor& executor, Clock& clock
       clock_(clock),
       limits_(limits),
       queue_(executor.makeSerial("com.quorvel.sonik.reporting.listener",
-                                 QualityOfService::UserInteractive)),
-      readBuffer_(kReadBufferBytes) {
+                                 QualityOfService::UserInteractive)) {
   loop_.addPassEndHook([this] { runPassEnd(); });
   loop_.addDeadline(
       [this]() -> std::optional<Monotonic> {
@@ -71,120 +64,111 @@ SocketListener::SocketListener(EventLoop& loop, Executor& executor, Clock& clock
       [this] { cutStalled(); });
 }
 
-SocketListener::~SocketListener() {
-  if (fd_ >= 0) ::close(fd_);
-  if (spareFd_ >= 0) ::close(spareFd_);
-  if (lockFd_ >= 0) ::close(lockFd_);
+Status SocketListener::open(const std::string& runtimeDirectory) {
+  if (mkdir(runtimeDirectory.c_str(), 0755) != 0 && errno != EEXIST) {
+    return Status::lastError("cannot create the runtime directory " + runtimeDirectory)
+        .withHint("set RUNTIME_DIRECTORY to a folder that can be written");
+  }
+  Result<UniqueFd> lock = lockDirectory(runtimeDirectory);
+  if (!lock.ok()) return lock.status();
+  lock_ = std::move(*lock);
+  spare_ = spareDescriptor();
+  const int activated = sd_listen_fds(1);
+  return activated > 0 ? adoptActivated(activated) : bindAt(runtimeDirectory + "/service.socket");
 }
 
-bool SocketListener::open(const std::string& runtimeDirectory, std::string& problem) {
-  if (mkdir(runtimeDirectory.c_str(), 0755) != 0 && errno != EEXIST) {
-    problem = because("cannot create the runtime directory " + runtimeDirectory) +
-              " (set RUNTIME_DIRECTORY to a folder that can be written)";
-    return false;
-  }
-  lockFd_ = lockDirectory(runtimeDirectory, problem);
-  if (lockFd_ < 0) return false;
-  spareFd_ = ::open("/dev/null", O_RDONLY | O_CLOEXEC);
+Status SocketListener::adoptActivated(int sockets) {
+  if (sockets > 1 || sd_is_socket_unix(SD_LISTEN_FDS_START, SOCK_STREAM, 1, nullptr, 0) <= 0)
+    return Status::failure("socket activation must pass exactly one listening Unix stream socket");
+  socket_.reset(SD_LISTEN_FDS_START);
+  fcntl(socket_.get(), F_SETFL, fcntl(socket_.get(), F_GETFL) | O_NONBLOCK);
+  return {};
+}
 
-  const int activated = sd_listen_fds(1);
-  if (activated > 0) {
-    if (activated > 1 || sd_is_socket_unix(SD_LISTEN_FDS_START, SOCK_STREAM, 1, nullptr, 0) <= 0) {
-      problem = "socket activation must pass exactly one listening Unix stream socket";
-      return false;
-    }
-    fd_ = SD_LISTEN_FDS_START;
-    fcntl(fd_, F_SETFL, fcntl(fd_, F_GETFL) | O_NONBLOCK);
-    return true;
-  }
-
-  path_ = runtimeDirectory + "/service.socket";
+Status SocketListener::bindAt(const std::string& path) {
   sockaddr_un address{};
   address.sun_family = AF_UNIX;
-  if (path_.size() >= sizeof address.sun_path) {
-    problem = "the socket path " + path_ + " is longer than the " +
-              std::to_string(sizeof address.sun_path - 1) + " bytes a Unix socket allows";
-    path_.clear();
-    return false;
+  if (path.size() >= sizeof address.sun_path) {
+    return Status::failure("the socket path " + path + " is longer than the " +
+                           std::to_string(sizeof address.sun_path - 1) +
+                           " bytes a Unix socket allows");
   }
-  std::memcpy(address.sun_path, path_.c_str(), path_.size() + 1);
-  fd_ = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0);
-  unlink(path_.c_str());  // left behind by a process that was killed: the lock says that nobody
-                          // serves it
-  if (fd_ < 0 || bind(fd_, reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0 ||
-      chmod(path_.c_str(), 0666) != 0 || listen(fd_, SOMAXCONN) != 0) {
-    problem = because("cannot listen on " + path_);
-    return false;
+  std::memcpy(address.sun_path, path.c_str(), path.size() + 1);
+  socket_.reset(socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
+  // Left behind by a process that was killed: the lock says that nobody serves it.
+  unlink(path.c_str());
+  if (!socket_ ||
+      bind(socket_.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0 ||
+      chmod(path.c_str(), 0666) != 0 || listen(socket_.get(), SOMAXCONN) != 0) {
+    return Status::lastError("cannot listen on " + path);
   }
-  return true;
+  path_ = path;
+  return {};
 }
 
 void SocketListener::onReady(uint32_t) {
+  VX_DCHECK(executor_.isInteractiveThread());
   for (int i = 0; i < kAcceptsPerPass && acceptOne(); ++i) {
   }
 }
 
 bool SocketListener::acceptOne() {
-  const int fd = accept4(fd_, nullptr, nullptr, SOCK_CLOEXEC);
-  if (fd < 0) {
+  UniqueFd peer(accept4(socket_.get(), nullptr, nullptr, SOCK_CLOEXEC));
+  if (!peer) {
     if (errno == EMFILE || errno == ENFILE) return turnAwayForLackOfDescriptors();
     return errno == ECONNABORTED || errno == EINTR;
   }
-  ucred peer{};
-  socklen_t length = sizeof peer;
-  if (getsockopt(fd, SOL_SOCKET, SO_PEERCRED, &peer, &length) != 0) {
-    ::close(fd);
-    return true;
-  }
+  admit(std::move(peer));
+  return true;
+}
+
+void SocketListener::admit(UniqueFd peer) {
+  ucred who{};
+  socklen_t length = sizeof who;
+  if (getsockopt(peer.get(), SOL_SOCKET, SO_PEERCRED, &who, &length) != 0) return;
   if (connections_.size() >= limits_.maxConnections) {
-    turnAway(fd,
-             "the service holds " + std::to_string(connections_.size()) + " connections already");
-    return true;
+    return turnAway(
+        peer, "the service holds " + std::to_string(connections_.size()) + " connections already");
   }
-  uint32_t& ofUser = connectionsOfUser_[peer.uid];
+  uint32_t& ofUser = connectionsOfUser_[who.uid];
   if (ofUser >= limits_.maxConnectionsPerUser) {
-    turnAway(fd, "user " + std::to_string(peer.uid) + " holds " + std::to_string(ofUser) +
-                     " connections already");
-    return true;
+    return turnAway(peer, "user " + std::to_string(who.uid) + " holds " + std::to_string(ofUser) +
+                              " connections already");
   }
   ++ofUser;
   ++counters_.accepted;
-  auto connection = std::make_shared<SocketConnection>(*this, fd, peer.pid, peer.uid);
+  auto connection = std::make_shared<SocketConnection>(*this, std::move(peer), who.pid, who.uid);
   connections_.emplace(connection.get(), connection);
   queue_->async([this, connection] {
     const std::shared_ptr<ServiceListenerDelegate> delegate = delegate_.lock();
     if (delegate == nullptr || !delegate->listener(*this, connection)) closed(*connection);
   });
-  return true;
 }
 
-void SocketListener::turnAway(int fd, const std::string& why) {
+void SocketListener::turnAway(const UniqueFd& peer, const std::string& why) {
   ++counters_.refusedConnections;
   VX_LOG(nullptr, Error, "refused a connection: %s", why.c_str());
-  std::vector<uint8_t> frame(4);
-  CborWriter writer(frame);
-  writer.array(4);
-  writer.integer(static_cast<int64_t>(FrameKind::Error));
-  writer.null();
-  writer.integer(static_cast<int64_t>(WireError::TooManyConnections));
-  writer.string(why);
-  frame[0] = static_cast<uint8_t>(frame.size() - 4);
-  frame[1] = static_cast<uint8_t>((frame.size() - 4) >> 8);
-  (void)send(fd, frame.data(), frame.size(), MSG_DONTWAIT | MSG_NOSIGNAL);
-  ::close(fd);
+  std::vector<uint8_t> frame;
+  wire::FrameWriter::error(frame, std::nullopt, wire::ErrorCode::TooManyConnections, why);
+  (void)send(peer.get(), frame.data(), frame.size(), MSG_DONTWAIT | MSG_NOSIGNAL);
 }
 
 bool SocketListener::turnAwayForLackOfDescriptors() {
   ++counters_.descriptorExhaustions;
-  if (spareFd_ < 0) return false;
-  ::close(spareFd_);
-  const int fd = accept4(fd_, nullptr, nullptr, SOCK_CLOEXEC);
-  if (fd >= 0) turnAway(fd, "the service has run out of file descriptors");
-  spareFd_ = ::open("/dev/null", O_RDONLY | O_CLOEXEC);
-  return fd >= 0;
+  if (!spare_) return false;
+  spare_.reset();
+  bool turnedAway = false;
+  {
+    const UniqueFd peer(accept4(socket_.get(), nullptr, nullptr, SOCK_CLOEXEC));
+    turnedAway = static_cast<bool>(peer);
+    if (turnedAway) turnAway(peer, "the service has run out of file descriptors");
+  }
+  spare_ = spareDescriptor();
+  return turnedAway;
 }
 
 void SocketListener::waitForReading(const std::shared_ptr<SocketConnection>& connection) {
+  VX_DCHECK(executor_.isInteractiveThread());
   waiting_.push_back(connection);
 }
 
@@ -199,6 +183,7 @@ void SocketListener::congestionEnded() {
 }
 
 void SocketListener::unreadChanged(SocketConnection& connection, bool unread) {
+  VX_DCHECK(executor_.isInteractiveThread());
   if (unread)
     unread_.insert(&connection);
   else
@@ -206,6 +191,7 @@ void SocketListener::unreadChanged(SocketConnection& connection, bool unread) {
 }
 
 void SocketListener::closed(SocketConnection& connection) {
+  VX_DCHECK(executor_.isInteractiveThread());
   const auto found = connections_.find(&connection);
   if (found == connections_.end()) return;
   const auto user = connectionsOfUser_.find(connection.user());
@@ -217,12 +203,14 @@ void SocketListener::closed(SocketConnection& connection) {
 }
 
 void SocketListener::runPassEnd() {
+  VX_DCHECK(executor_.isInteractiveThread());
   if (!waiting_.empty() && !readingPaused()) congestionEnded();
   for (std::size_t i = 0; i < toFlush_.size(); ++i) toFlush_[i]->flush();
   toFlush_.clear();
 }
 
 void SocketListener::cutStalled() {
+  VX_DCHECK(executor_.isInteractiveThread());
   const Monotonic now = clock_.monotonic();
   const std::vector<SocketConnection*> unread(unread_.begin(), unread_.end());
   for (SocketConnection* connection : unread) {
@@ -234,15 +222,14 @@ void SocketListener::cutStalled() {
 void SocketListener::stopListening() {
   if (!listening_) return;
   listening_ = false;
-  loop_.remove(fd_, *this);
-  ::close(fd_);
-  fd_ = -1;
+  loop_.remove(socket_.get(), *this);
+  socket_.reset();
   if (!path_.empty()) unlink(path_.c_str());
 }
 
 void SocketListener::resume() {
   executor_.adoptInteractiveThread();
-  listening_ = loop_.add(fd_, EPOLLIN, *this);
+  listening_ = loop_.add(socket_.get(), EPOLLIN, *this);
   if (hooks_.listening) hooks_.listening();
   loop_.run();
 

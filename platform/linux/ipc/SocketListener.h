@@ -11,6 +11,8 @@
 #include <unordered_set>
 #include <vector>
 
+#include "base/Status.h"
+#include "base/UniqueFd.h"
 #include "platform/ServiceListener.h"
 #include "platform/linux/execution/EventLoop.h"
 #include "platform/linux/ipc/ListenerOptions.h"
@@ -34,11 +36,10 @@ class SocketListener final : public ServiceListener,
   };
 
   SocketListener(EventLoop& loop, Executor& executor, Clock& clock, const ListenerOptions& limits);
-  ~SocketListener() override;
 
   // Takes the activated socket, or locks the runtime directory and binds <runtime>/service.socket.
-  // False and one clear sentence in `problem` when that cannot be.
-  [[nodiscard]] bool open(const std::string& runtimeDirectory, std::string& problem);
+  // A failure says what to do about it.
+  Status open(const std::string& runtimeDirectory);
   void setHooks(Hooks hooks) { hooks_ = std::move(hooks); }
 
   // ServiceListener
@@ -57,8 +58,7 @@ class SocketListener final : public ServiceListener,
   Clock& clock() override { return clock_; }
   const ListenerOptions& limits() const override { return limits_; }
   ListenerCounters& counters() override { return counters_; }
-  std::span<uint8_t> readBuffer() override { return readBuffer_; }
-  std::vector<uint8_t>& spareBuffer() override { return spareBuffer_; }
+  wire::ReadBuffers& readBuffers() override { return readBuffers_; }
   bool readingPaused() override { return hooks_.congested(); }
   void waitForReading(const std::shared_ptr<SocketConnection>& connection) override;
   void flushAtPassEnd(const std::shared_ptr<SocketConnection>& connection) override {
@@ -72,11 +72,14 @@ class SocketListener final : public ServiceListener,
   static constexpr int kAcceptsPerPass = 64;
 
   void onReady(uint32_t events) override;
-  bool acceptOne();
+  Status adoptActivated(int sockets);
+  Status bindAt(const std::string& path);
+  bool acceptOne();  // false when there are none, or not now
+  void admit(UniqueFd peer);
   // Accepts and turns away one connection with the descriptor kept for that. False when there is
   // none to spare.
   bool turnAwayForLackOfDescriptors();
-  void turnAway(int fd, const std::string& why);
+  void turnAway(const UniqueFd& peer, const std::string& why);
   void runPassEnd();
   void cutStalled();
   void stopListening();
@@ -89,13 +92,12 @@ class SocketListener final : public ServiceListener,
   ListenerCounters counters_;
   std::weak_ptr<ServiceListenerDelegate> delegate_;
   std::shared_ptr<WorkQueue> queue_;
-  int fd_ = -1;
-  int lockFd_ = -1;
-  int spareFd_ = -1;  // given up for a moment to turn a client away when descriptors have run out
+  UniqueFd socket_;
+  UniqueFd lock_;   // <runtime>/service.lock, taken as long as this process lives
+  UniqueFd spare_;  // given up for a moment to turn a client away when descriptors have run out
   bool listening_ = false;
   std::string path_;  // bound here, to be removed at the end; empty for an activated socket
-  std::vector<uint8_t> readBuffer_;
-  std::vector<uint8_t> spareBuffer_;
+  wire::ReadBuffers readBuffers_;
   std::unordered_map<SocketConnection*, std::shared_ptr<SocketConnection>> connections_;
   std::unordered_map<uid_t, uint32_t> connectionsOfUser_;
   std::vector<std::shared_ptr<SocketConnection>> toFlush_;

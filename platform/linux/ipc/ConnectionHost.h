@@ -1,0 +1,36 @@
+// What a connection needs of the listener that owns it.
+#pragma once
+
+#include <memory>
+
+#include "base/Clock.h"
+#include "platform/linux/execution/EventLoop.h"
+#include "platform/linux/ipc/ListenerCounters.h"
+#include "platform/linux/ipc/ListenerOptions.h"
+#include "wire/FrameReader.h"
+
+namespace vx::lnx {
+
+class SocketConnection;
+
+// Outlives its connections. Everything is called on the interactive thread.
+class ConnectionHost {
+ public:
+  virtual ~ConnectionHost() = default;
+  virtual EventLoop& loop() = 0;
+  virtual Executor& executor() = 0;
+  virtual Clock& clock() = 0;
+  virtual const ListenerOptions& limits() const = 0;
+  virtual ListenerCounters& counters() = 0;
+  virtual wire::ReadBuffers& readBuffers() = 0;
+  // True while what has been accepted must drain first. The connection then waits for
+  // continueReading().
+  virtual bool readingPaused() = 0;
+  virtual void waitForReading(const std::shared_ptr<SocketConnection>& connection) = 0;
+  virtual void flushAtPassEnd(const std::shared_ptr<SocketConnection>& connection) = 0;
+  // Replies wait because the peer does not read (or no longer do): see stallDeadline().
+  virtual void unreadChanged(SocketConnection& connection, bool unread) = 0;
+  virtual void closed(SocketConnection& connection) = 0;
+};
+
+}  // namespace vx::lnx
