@@ -1,6 +1,6 @@
 #include <gmock/gmock.h>
-#include <sys/un.h>
 
+#include <algorithm>
 #include <memory>
 #include <thread>
 
@@ -9,28 +9,11 @@
 
 namespace vx {
 
-TemporaryListener::TemporaryListener() {
-  char folder[] = "/tmp/vx-client-XXXXXX";
-  folder_ = mkdtemp(folder);
-  path_ = folder_ + "/service.socket";
-  sockaddr_un address{};
-  address.sun_family = AF_UNIX;
-  std::memcpy(address.sun_path, path_.c_str(), path_.size() + 1);
-  fd_ = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-  EXPECT_EQ(bind(fd_, reinterpret_cast<const sockaddr*>(&address), sizeof address), 0);
-  EXPECT_EQ(listen(fd_, 0), 0);
-}
-
-TemporaryListener::~TemporaryListener() {
-  close(fd_);
-  unlink(path_.c_str());
-  rmdir(folder_.c_str());
-}
-
 namespace {
 
 using testing::ElementsAre;
 using testing::HasSubstr;
+using wire::ErrorCode;
 using Code = ClientStatus::Code;
 using std::chrono::milliseconds;
 
@@ -46,9 +29,9 @@ class ReportingClientTest : public testing::Test {
  protected:
   void connect(const ReportingClient::Options& options = {}) {
     client = std::make_unique<ReportingClient>(options);
-    const ClientStatus status = client->adopt(service.pair());
+    const ClientStatus status = client->adopt(service.connect());
     ASSERT_TRUE(status.ok()) << status.text;
-    service.read();  // the hello
+    service.frames();  // the hello
   }
   // A call whose outcome goes into `outcomes`.
   ClientStatus create(int64_t reporterID) {
@@ -68,15 +51,15 @@ class ReportingClientTest : public testing::Test {
 
 TEST_F(ReportingClientTest, WritesTheFramesOfTheProtocol) {
   client = std::make_unique<ReportingClient>();
-  ASSERT_TRUE(client->adopt(service.pair()).ok());
+  ASSERT_TRUE(client->adopt(service.connect()).ok());
   EXPECT_TRUE(client->sendMessageAsync(message(), kCategory, 1).ok());
   EXPECT_TRUE(client->sendMessageAsync(Payload(), 9, 0, {42, -1}).ok());
   EXPECT_TRUE(client->setServiceTypeAsync(7, 42, nullptr).ok());
-  EXPECT_THAT(service.read(), ElementsAre(Bytes{0x82, 0x00, 0x01}))
+  EXPECT_THAT(service.frames(), ElementsAre(Bytes{0x82, 0x00, 0x01}))
       << "calls are gathered, not written one by one";
   EXPECT_TRUE(client->wantsWrite());
   EXPECT_TRUE(client->process().ok());
-  EXPECT_THAT(service.read(),
+  EXPECT_THAT(service.frames(),
               ElementsAre(Bytes{0x87, 0x01, 0x01, 0x06, 0xa2, 0x64, 'g',  'a',  'i',  'n',
                                 0xfb, 0x3f, 0xe0, 0,    0,    0,    0,    0,    0,    0x62,
                                 'o',  'n',  0xf5, 0x1a, 0x08, 0x00, 0x00, 0x05, 0x01, 0xf6},
@@ -89,7 +72,7 @@ TEST_F(ReportingClientTest, AnswersInAnyOrderReachTheirOwnCalls) {
   connect();
   createThree();
   service.write(trueReply(3));
-  service.write(errorFrame(1, 8, "dropped"));
+  service.write(errorFrame(1, ErrorCode::Abandoned, "dropped"));
   service.write(trueReply(2));
   EXPECT_TRUE(client->process().ok());
   EXPECT_THAT(outcomes, ElementsAre("ok", "dropped", "ok"));
@@ -108,9 +91,175 @@ TEST_F(ReportingClientTest, AHeldStartOutlivesManyLaterCalls) {
   EXPECT_EQ(outcomes.size(), 999U);
   EXPECT_FALSE(ended);
   EXPECT_EQ(client->pendingCalls(), 1U);
+  service.write(trueReply(999));  // answered already
+  ASSERT_TRUE(client->process().ok());
+  EXPECT_EQ(client->unknownAnswers(), 1U);
+  EXPECT_EQ(outcomes.size(), 999U);
   service.write(trueReply(1));
   client->process();
   EXPECT_TRUE(ended);
+}
+
+TEST_F(ReportingClientTest, AHeldStartIsToldThatTheServiceDied) {
+  connect();
+  std::vector<Code> told;
+  client->startReportingSession(1, [&](const auto& r) { told.push_back(r.status.code); });
+  for (int64_t number = 2; number <= 300; ++number) {
+    ASSERT_TRUE(create(number).ok());
+    if (number <= 290) service.write(trueReply(static_cast<uint64_t>(number)));
+    ASSERT_TRUE(client->process().ok());
+  }
+  ASSERT_EQ(outcomes.size(), 289U);
+  EXPECT_EQ(client->pendingCalls(), 11U);
+  service.close();
+  EXPECT_EQ(client->process().code, Code::Disconnected);
+  EXPECT_THAT(told, ElementsAre(Code::Disconnected));
+  EXPECT_EQ(outcomes.size(), 299U);
+  EXPECT_EQ(client->pendingCalls(), 0U);
+  client.reset();
+  EXPECT_EQ(told.size(), 1U);
+}
+
+TEST_F(ReportingClientTest, ManyCallsAnsweredBackwards) {
+  connect();
+  std::vector<int64_t> order;
+  for (int64_t id = 1; id <= 200; ++id) {
+    client->createReportingSessionAsync(id, [&order, id](const auto&) { order.push_back(id); });
+  }
+  for (uint64_t number = 200; number > 0; --number) service.write(trueReply(number));
+  ASSERT_TRUE(client->process().ok());
+  ASSERT_EQ(order.size(), 200U);
+  EXPECT_TRUE(std::is_sorted(order.rbegin(), order.rend()));
+}
+
+TEST_F(ReportingClientTest, EveryBlockingFormMakesItsCallAndReadsItsAnswer) {
+  connect();
+  const auto reply = [this](uint64_t number, const Bytes& value) {
+    service.write(replyFrame(number, [&](CborWriter& w) { w.encoded(value); }));
+  };
+  const Bytes yes{0xf5};
+  reply(1, yes);
+  EXPECT_TRUE(client->createReportingSession(-7).value);
+  reply(2, yes);
+  EXPECT_TRUE(client->setServiceType(65535, 7).value);
+  reply(3, {0x19, 0xff, 0xfe});
+  EXPECT_EQ(client->getServiceType(7).value, 65534);
+  reply(4, yes);
+  EXPECT_TRUE(client->setConfiguration(message(), 7).value);
+  reply(5, {0xf6});
+  EXPECT_TRUE(client->sendMessage(message(), kCategory, 6).ok());
+  reply(6, {0xa2, 0x64, 'c', 'o', 'd', 'e', 1, 0x66, 'd', 'o', 'm', 'a', 'i', 'n', 0x61, 'd'});
+  EXPECT_EQ(client->sendMessage(Payload(), 0xFFFFFFFF, 65535, {7, -1}).code, Code::ReportingError);
+  reply(7, {0xf4});
+  const auto stopped = client->stopReportingSession(7);
+  EXPECT_TRUE(stopped.ok());
+  EXPECT_FALSE(stopped.value);
+  reply(8, yes);
+  EXPECT_TRUE(client->destroyReportingSession(7).value);
+  reply(9, {0x82, 0x20, 0x18, 42});
+  EXPECT_THAT(client->getAllReporters().value, ElementsAre(-1, 42));
+  client->startReportingSession(7, nullptr);
+  EXPECT_TRUE(client->killService().ok());
+  EXPECT_THAT(
+      service.texts(),
+      ElementsAre("1 1 1 -7", "1 2 2 65535 7", "1 3 3 7", "1 4 4 {gain=0.5,on=1} 7",
+                  "1 5 6 {gain=0.5,on=1} 134217733 6 null", "1 6 6 {} 4294967295 65535 (7,-1)",
+                  "1 7 7 7", "1 8 8 7", "1 9 10", "1 10 5 7", "1 11 11"));
+}
+
+TEST_F(ReportingClientTest, AnAnswerOfAnotherKindRefusesThatCallAlone) {
+  connect();
+  uint64_t number = 0;
+  const auto answered = [&](const Bytes& value, const auto& makeCall) {
+    service.write(replyFrame(++number, [&](CborWriter& w) { w.encoded(value); }));
+    return makeCall();
+  };
+  const auto create = [&] { return client->createReportingSession(1).status.code; };
+  const auto type = [&] { return client->getServiceType(1).status.code; };
+  EXPECT_EQ(answered({0x61, 'x'}, create), Code::Refused);
+  EXPECT_EQ(answered({0x1a, 0, 1, 0, 0}, type), Code::Refused) << "65536";
+  EXPECT_EQ(answered({0x20}, type), Code::Refused) << "-1";
+  EXPECT_EQ(answered({0xa0}, [&] { return client->validateReporter(1).status.code; }),
+            Code::Refused);
+  EXPECT_EQ(answered({0x81, 0x61, 'x'}, [&] { return client->getAllReporters().status.code; }),
+            Code::Refused);
+  EXPECT_EQ(answered({0x61, 'x'}, [&] { return client->sendMessage(message(), 1, 1).code; }),
+            Code::Refused);
+  service.write(errorFrame(7, ErrorCode::TooManySessions, "enough"));
+  const ClientStatus refused = client->createReportingSession(2).status;
+  EXPECT_EQ(refused.code, Code::Refused);
+  EXPECT_EQ(refused.wireCode, 5);
+  EXPECT_TRUE(client->isConnected());
+}
+
+TEST_F(ReportingClientTest, CallsUpToTheLimits) {
+  ReportingClient::Options options;
+  options.maxPendingCalls = 2;
+  client = std::make_unique<ReportingClient>(options);
+  const Bytes fits = [&] {
+    Bytes out;
+    FrameWriter call = FrameWriter::call(out, 1, wire::Operation::SendMessage, 4);
+    call.items().encoded(message().encoded());
+    call.items().unsignedInteger(kCategory);
+    call.items().integer(1);
+    call.items().null();
+    return out;
+  }();
+  const uint64_t bytes = fits.size() - wire::kLengthBytes;
+  for (const uint64_t limit : {bytes - 1, bytes, bytes + 1}) {
+    ASSERT_TRUE(client->adopt(service.connect(helloFrame(1, limit))).ok());
+    const ClientStatus taken = client->sendMessageAsync(message(), kCategory, 1);
+    EXPECT_EQ(taken.code, limit < bytes ? Code::TooLarge : Code::Ok) << limit;
+    EXPECT_TRUE(create(1).ok());
+    EXPECT_EQ(create(2).code, limit < bytes ? Code::Ok : Code::BufferFull);
+    EXPECT_EQ(create(3).code, Code::BufferFull);
+    EXPECT_EQ(client->pendingCalls(), 2U);
+  }
+  EXPECT_THAT(service.texts(), testing::SizeIs(3)) << "what was refused left no bytes";
+  service.write(framed(Bytes(bytes + 2, 0x80)));
+  EXPECT_THAT(client->process().text, HasSubstr("a frame of " + std::to_string(bytes + 2)));
+}
+
+TEST_F(ReportingClientTest, AServiceThatGreetsOtherwiseIsNotConnected) {
+  const Bytes greetings[] = {helloFrame(2), trueReply(1), goodbyeFrame() + trueReply(1),
+                             errorFrame(std::nullopt, ErrorCode::TooManyConnections, "full")};
+  for (const Bytes& greeting : greetings) {
+    ReportingClient lone;
+    const int fd = service.connect(greeting);
+    shutdown(service.fd(), SHUT_WR);
+    const ClientStatus status = lone.adopt(fd);
+    EXPECT_EQ(status.code, Code::Disconnected);
+    EXPECT_FALSE(lone.isConnected());
+    EXPECT_EQ(status.text.find("full") != std::string::npos, &greeting == &greetings[3]);
+  }
+  ReportingClient patient;
+  EXPECT_EQ(patient.adopt(service.connect({}), kShort).code, Code::TimedOut);
+  EXPECT_FALSE(patient.isConnected());
+  service.texts();
+  EXPECT_TRUE(service.ended()) << "the descriptor is given back";
+}
+
+TEST_F(ReportingClientTest, ACallbackMayConnectAnew) {
+  connect();
+  FakeService second;
+  ClientStatus again;
+  client->createReportingSessionAsync(1, [&](const auto& result) {
+    outcomes.push_back(result.status.text);
+    again = client->adopt(second.connect());
+  });
+  ASSERT_TRUE(create(2).ok());
+  FakeService third;
+  EXPECT_TRUE(client->adopt(third.connect()).ok());
+  EXPECT_TRUE(again.ok());
+  EXPECT_THAT(outcomes, ElementsAre("the connection was made anew", outcomes[0]));
+  EXPECT_THAT(third.texts(), ElementsAre());
+  EXPECT_TRUE(third.ended()) << "the callback's connection stays";
+  second.write(trueReply(3));  // numbering goes on
+  EXPECT_TRUE(client->createReportingSession(3).value);
+  EXPECT_THAT(second.texts(), ElementsAre("0 1", "1 3 1 3"));
+  client->disconnect();
+  EXPECT_EQ(client->fd(), -1);
+  EXPECT_EQ(create(4).code, Code::NotConnected);
 }
 
 TEST_F(ReportingClientTest, ASwitchedOffServiceRefusesWithDomainAndCode) {
@@ -148,11 +297,11 @@ TEST_F(ReportingClientTest, AServiceThatDiesFailsEveryCallOnce) {
 TEST_F(ReportingClientTest, TheServicesReasonForClosingIsPassedOn) {
   connect();
   createThree();
-  service.write(errorFrame(-1, 10, "replies were not read for too long"));
+  service.write(errorFrame(std::nullopt, ErrorCode::MalformedFrame, "a frame was broken"));
   service.close();
   while (client->process().ok()) {
   }
-  EXPECT_THAT(outcomes, testing::Each(HasSubstr("not read for too long")));
+  EXPECT_THAT(outcomes, testing::Each(HasSubstr("a frame was broken")));
   EXPECT_EQ(outcomes.size(), 3U);
 }
 
@@ -194,13 +343,15 @@ TEST_F(ReportingClientTest, AFullBufferRefusesWholeCallsAndRecovers) {
   }
   EXPECT_EQ(refusal.code, Code::BufferFull);
   EXPECT_EQ(client->pendingCalls(), taken);
-  std::size_t arrived = service.read().size();
-  EXPECT_TRUE(create(1).ok()) << "the socket has room again";
+  std::vector<std::string> arrived = service.texts();
+  EXPECT_TRUE(create(1).ok()) << "the socket takes more again";
   while (client->wantsWrite()) {
     ASSERT_TRUE(client->process().ok());
-    arrived += service.read().size();
+    for (std::string& text : service.texts()) arrived.push_back(std::move(text));
   }
-  EXPECT_EQ(arrived, taken + 1);
+  ASSERT_EQ(arrived.size(), taken + 1);
+  for (std::size_t i = 0; i < arrived.size(); ++i)
+    EXPECT_THAT(arrived[i], testing::StartsWith("1 " + std::to_string(i + 1) + " "));
   EXPECT_FALSE(service.holdsHalfAFrame());
 }
 
@@ -227,7 +378,7 @@ TEST_F(ReportingClientTest, GoodbyeWaitsForTheServiceAndEndsTheCalls) {
   ASSERT_TRUE(create(1).ok());
   std::thread daemon([this] {
     std::size_t frames = 0;
-    while (frames < 2) frames += service.read().size();
+    while (frames < 2) frames += service.frames().size();
     service.write(trueReply(1));
     service.close();
   });
@@ -235,6 +386,12 @@ TEST_F(ReportingClientTest, GoodbyeWaitsForTheServiceAndEndsTheCalls) {
   daemon.join();
   EXPECT_THAT(outcomes, ElementsAre("ok"));
   EXPECT_EQ(create(2).code, Code::NotConnected);
+  EXPECT_EQ(client->goodbye().code, Code::NotConnected);
+
+  connect();
+  ASSERT_TRUE(create(3).ok());
+  EXPECT_EQ(client->goodbye(kShort).code, Code::TimedOut);
+  EXPECT_THAT(outcomes, ElementsAre("ok", "said goodbye"));
 }
 
 TEST_F(ReportingClientTest, ACallbackMayDestroyTheClient) {

@@ -1,0 +1,109 @@
+// One end of a socket, worked by a test: writes bytes, and shows the frames that have come.
+// Confined to the test's thread; never blocks unless said.
+#pragma once
+
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <poll.h>
+#include <sys/socket.h>
+
+#include <cstdint>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "base/UniqueFd.h"
+#include "propertylist/Payload.h"
+#include "wire/FrameReader.h"
+#include "wire/FrameWriter.h"
+
+namespace vx {
+
+using Bytes = std::vector<uint8_t>;
+using wire::FrameKind;
+using wire::FrameWriter;
+
+inline Bytes operator+(Bytes a, const Bytes& b) {
+  a.insert(a.end(), b.begin(), b.end());
+  return a;
+}
+
+inline Bytes goodbyeFrame() {
+  Bytes out;
+  FrameWriter::goodbye(out);
+  return out;
+}
+
+class SocketEnd {
+ public:
+  SocketEnd() = default;
+  explicit SocketEnd(UniqueFd socket) : socket_(std::move(socket)) {}
+
+  // A new pair; returns the other end.
+  UniqueFd pair() {
+    int ends[2];
+    EXPECT_EQ(socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, ends), 0);
+    close();
+    socket_.reset(ends[0]);
+    return UniqueFd(ends[1]);
+  }
+  void write(const Bytes& bytes) {
+    ASSERT_EQ(writeSome(bytes), static_cast<ssize_t>(bytes.size()));
+  }
+  ssize_t writeSome(const Bytes& bytes) {
+    return send(socket_.get(), bytes.data(), bytes.size(), MSG_NOSIGNAL | MSG_DONTWAIT);
+  }
+  // At most so many bytes of what has arrived. Returns how many.
+  std::size_t readSome(std::size_t most) {
+    const std::span<uint8_t> space = reader_.space();
+    const ssize_t got =
+        recv(socket_.get(), space.data(), std::min(most, space.size()), MSG_DONTWAIT);
+    ended_ = ended_ || got == 0 || (got < 0 && errno == ECONNRESET);
+    if (got > 0) reader_.received(static_cast<std::size_t>(got));
+    return got > 0 ? static_cast<std::size_t>(got) : 0;
+  }
+  // The bodies of all frames that have arrived whole, and not been given before.
+  std::vector<Bytes> frames() {
+    std::vector<Bytes> bodies;
+    do {
+      std::span<const uint8_t> body;
+      while (reader_.next(body) == wire::FrameReader::Next::Frame)
+        bodies.emplace_back(body.begin(), body.end());
+    } while (readSome(SIZE_MAX) > 0);
+    return bodies;
+  }
+  // The same as text: "2 5 1" for the reply true to call 5; errors without their sentence.
+  std::vector<std::string> texts() {
+    std::vector<std::string> all;
+    for (const Bytes& body : frames()) {
+      const Frame frame = Frame::decode(body).value();
+      const bool error = frame[0].asInt64() == static_cast<int64_t>(FrameKind::Error);
+      std::string& text = all.emplace_back();
+      for (std::size_t i = 0; i < frame.size() - (error ? 1 : 0); ++i)
+        text +=
+            (i == 0 ? "" : " ") + (frame[i].kind() == ValueKind::Null ? "null" : frame[i].text());
+    }
+    return all;
+  }
+  // Waits for bytes, or the end.
+  void await() {
+    pollfd ready{socket_.get(), POLLIN, 0};
+    ASSERT_EQ(poll(&ready, 1, 20000), 1) << "nothing came";
+  }
+  bool holdsHalfAFrame() const { return reader_.unread() != 0; }
+  bool ended() const { return ended_; }  // seen by a read
+  int fd() const { return socket_.get(); }
+  void close() {
+    socket_.reset();
+    reader_.clear();
+    ended_ = false;
+  }
+
+ private:
+  UniqueFd socket_;
+  wire::ReadBuffers buffers_;
+  wire::FrameReader reader_{buffers_};
+  bool ended_ = false;
+};
+
+}  // namespace vx
