@@ -72,10 +72,12 @@ TEST_F(ReportingClientTest, AnswersInAnyOrderReachTheirOwnCalls) {
   connect();
   createThree();
   service.write(trueReply(3));
+  service.write(trueReply(3));
   service.write(errorFrame(1, ErrorCode::Abandoned, "dropped"));
   service.write(trueReply(2));
   EXPECT_TRUE(client->process().ok());
   EXPECT_THAT(outcomes, ElementsAre("ok", "dropped", "ok"));
+  EXPECT_EQ(client->unknownAnswers(), 1U);
   EXPECT_EQ(client->pendingCalls(), 0U);
 }
 
@@ -98,6 +100,7 @@ TEST_F(ReportingClientTest, AHeldStartOutlivesManyLaterCalls) {
   service.write(trueReply(1));
   client->process();
   EXPECT_TRUE(ended);
+  EXPECT_EQ(client->pendingCalls(), 0U);
 }
 
 TEST_F(ReportingClientTest, AHeldStartIsToldThatTheServiceDied) {
@@ -332,7 +335,7 @@ TEST_F(ReportingClientTest, WhatIsNotTheProtocolEndsTheConnection) {
 
 TEST_F(ReportingClientTest, AFullBufferRefusesWholeCallsAndRecovers) {
   ReportingClient::Options options;
-  options.maxBufferedBytes = 64 << 10;
+  options.maxBufferedBytes = options.writeAtBytes = 512 << 10;  // more than a socket takes at once
   connect(options);
   std::size_t taken = 0;
   ClientStatus refusal;

@@ -216,13 +216,15 @@ TEST_F(ConnectionTest, WrongCallsAreAnsweredAndDoNothing) {
   EXPECT_THAT(object->calls, ElementsAre("take 65535 4294967295 {a=1} [1 -1 ]"));
   send(callFrame(2, kEcho, 2, [](CborWriter& w) { w.integer(1), w.integer(2); }));
   call(3, 0);
-  call(4, kTake + 1);
-  EXPECT_THAT(answers(), ElementsAre("3 2 4", "3 3 3", "3 4 3"));
-  EXPECT_EQ(counted.wrongArguments, 7U);
+  call(4, kMessage + 1);
+  send(callFrame(5, kMessage, 1, [](CborWriter& w) { w.null(); }));
+  send(callFrame(6, kMessage, 1, [](CborWriter& w) { w.encoded(Bytes{0xa1, 0x61, 'a', 1}); }));
+  EXPECT_THAT(answers(), ElementsAre("3 2 4", "3 3 3", "3 4 3", "3 5 4", "2 6 {a=1}"));
+  EXPECT_EQ(counted.wrongArguments, 8U);
   EXPECT_EQ(counted.unknownOperations, 2U);
   send({5, 0, 0, 0, 0x84, 1, 0x20, 1, 1});  // a call whose number is negative
   EXPECT_THAT(answers(), ElementsAre("3 null 1"));
-  EXPECT_EQ(counted.calls, 11U);
+  EXPECT_EQ(counted.calls, 13U);
 }
 
 TEST_F(ConnectionTest, ResourcesOfOnePeerAreLimited) {
@@ -311,10 +313,9 @@ TEST_F(ConnectionTest, APeerThatReadsSlowlyGetsEveryByteOnceAndInOrder) {
 
 TEST_F(ConnectionTest, APeerThatReadsNothingMoreIsCut) {
   connect();
-  object->list.assign(300000, 1);
-  options.maxUnreadReplyBytes = 1000;
+  object->list.assign(1000000, 1);
   Bytes calls;
-  for (uint64_t i = 1; i <= 4; ++i) list(calls, i);
+  list(calls, 1);
   EXPECT_EQ(connection->stallDeadline(), std::nullopt);
   send(calls);
   const Monotonic start = platform.clock.monotonic();
@@ -331,6 +332,21 @@ TEST_F(ConnectionTest, APeerThatReadsNothingMoreIsCut) {
   EXPECT_FALSE(unreadSays);
   EXPECT_THAT(events, ElementsAre("interrupted", "invalidated"));
   EXPECT_EQ(counted.slowClientsCut, 1U);
+
+  options.maxUnreadReplyBytes = 2 << 20;  // the goodbye is read, and the end waits for the reply
+  connect();
+  object->list.assign(1000000, 1);
+  send(calls + goodbyeFrame());
+  EXPECT_TRUE(unreadSays);
+  connection->cutStalled();
+  EXPECT_FALSE(unreadSays);
+  EXPECT_EQ(closes, 2);
+}
+
+TEST_F(ConnectionTest, OneReadMayTakeSeveralTurns) {
+  connect();
+  send(echoes(600));
+  EXPECT_THAT(answers(), SizeIs(600));
 }
 
 TEST_F(ConnectionTest, RepliesMadeLaterOvershootTheirLimitByOneTurn) {
@@ -404,11 +420,16 @@ TEST_F(ConnectionTest, ACallLetGoIsAnsweredWithAnError) {
   object->kept.clear();
   run();
   EXPECT_THAT(answers(), ElementsAre("3 1 8", "2 2 1"));
+  options.maxCallsInFlight = 2;
   call(3, kHold);
+  call(4, kKeep);
   send(goodbyeFrame());
-  object->kept.clear();
-  run();
-  EXPECT_THAT(answers(), IsEmpty());
+  for (const bool last : {false, true}) {
+    object->kept.erase(object->kept.begin());
+    run();
+    EXPECT_THAT(answers(), IsEmpty()) << "not after the goodbye";
+    EXPECT_EQ(peer.ended(), last);
+  }
   EXPECT_EQ(counted.abandonedCalls, 1U);
 }
 

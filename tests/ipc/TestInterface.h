@@ -11,7 +11,16 @@
 
 namespace vx::lnx {
 
-enum TestOperation : uint8_t { kEcho = 1, kKeep, kHold, kAcquire, kRelease, kList, kTake };
+enum TestOperation : uint8_t {
+  kEcho = 1,
+  kKeep,
+  kHold,
+  kAcquire,
+  kRelease,
+  kList,
+  kTake,
+  kMessage
+};
 
 struct TestObject final : ExportedObject {
   std::vector<std::string> calls;    // operation and first argument
@@ -59,7 +68,11 @@ inline const InterfaceDescription& testInterface() {
     static_cast<TestObject&>(object).calls.push_back(text);
     reply(std::monostate());
   };
-  static constexpr std::array<OperationDescription, 7> kOperations = {{
+  static constexpr std::array kDictionary = {ArgumentKind::Dictionary};
+  static constexpr auto message = [](ExportedObject&, CallArguments& arguments, Reply reply) {
+    reply(arguments.dictionary(0));
+  };
+  static constexpr std::array<OperationDescription, 8> kOperations = {{
       {.name = "echo", .arguments = kInteger, .reply = ReplyKind::Boolean, .invoke = echo},
       {.name = "keep", .arguments = kInteger, .reply = ReplyKind::Boolean, .invoke = keep},
       {.name = "hold",
@@ -79,6 +92,10 @@ inline const InterfaceDescription& testInterface() {
        .invoke = echo},
       {.name = "list", .arguments = {}, .reply = ReplyKind::Int64Array, .invoke = list},
       {.name = "take", .arguments = kAll, .reply = ReplyKind::OptionalError, .invoke = take},
+      {.name = "message",
+       .arguments = kDictionary,
+       .reply = ReplyKind::Dictionary,
+       .invoke = message},
   }};
   static constexpr InterfaceDescription kInterface{.name = "Test", .operations = kOperations};
   return kInterface;

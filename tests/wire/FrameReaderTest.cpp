@@ -102,6 +102,22 @@ TEST_F(FrameReaderTest, FramesLargerThanAReadAreGathered) {
   }
 }
 
+TEST_F(FrameReaderTest, ReadsOnWhileFramesWait) {
+  std::vector<Bytes> sent;
+  std::vector<Bytes> got;
+  Bytes stream;
+  for (uint8_t i = 0; i < 250; ++i) {
+    const Bytes f = frame(sent.emplace_back(body(2000, i)));
+    stream.insert(stream.end(), f.begin(), f.end());
+  }
+  for (std::size_t at = 0; at < stream.size();) {
+    at += feed(reader, std::span<const uint8_t>(stream).subspan(at));
+    for (const Bytes& b : take(reader, 3)) got.push_back(b);
+  }
+  for (const Bytes& b : take(reader)) got.push_back(b);
+  EXPECT_EQ(got, sent);
+}
+
 TEST_F(FrameReaderTest, TheLimitIsOnTheBody) {
   reader.setLimit(100);
   std::span<const uint8_t> next;
