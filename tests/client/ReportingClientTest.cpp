@@ -416,6 +416,19 @@ TEST_F(ReportingClientTest, ACallbackMayDestroyTheClient) {
   EXPECT_THAT(outcomes, ElementsAre());
 }
 
+TEST_F(ReportingClientTest, WhatACallbackCallsIsWrittenAtOnce) {
+  connect();
+  client->createReportingSessionAsync(1, [this](const auto&) { EXPECT_TRUE(create(2).ok()); });
+  service.write(trueReply(1));
+  EXPECT_TRUE(client->process().ok());
+  EXPECT_THAT(service.texts(), ElementsAre("1 1 1 1", "1 2 1 2"));
+  client->createReportingSessionAsync(
+      3, [this](const auto&) { EXPECT_EQ(create(4).code, Code::NotConnected); });
+  service.write(trueReply(3));
+  EXPECT_EQ(client->goodbye(kShort).code, Code::TimedOut);
+  EXPECT_THAT(service.texts(), ElementsAre("1 3 1 3", "4"));
+}
+
 TEST_F(ReportingClientTest, ACallbackMayReadOn) {
   connect();
   client->createReportingSessionAsync(1, [this](const auto&) {

@@ -290,7 +290,7 @@ TEST_F(ConnectionTest, APeerThatReadsSlowlyGetsEveryByteOnceAndInOrder) {
   const int small = 2304;  // the least that the kernel grants
   setsockopt(peer.fd(), SOL_SOCKET, SO_RCVBUF, &small, sizeof small);
   object->list.assign(20000, 1);
-  options.maxUnreadReplyBytes = 50000;
+  options.maxUnreadReplyBytes = 300000;
   Bytes calls;
   for (uint64_t i = 1; i <= 40; ++i) list(calls, i);
   send(calls);
