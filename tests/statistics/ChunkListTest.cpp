@@ -13,17 +13,16 @@ namespace {
 TEST(ChunkList, HoldsWhatAVectorWould) {
   ChunkList<int, 8, 2, 2> list;
   for (const int count : {0, 1, 2, 3, 6, 7, 14, 15, 22, 100, 5}) {
-    std::vector<int> expected(static_cast<std::size_t>(count));
+    std::vector<int> expected(static_cast<std::size_t>(count)), held;
     std::iota(expected.begin(), expected.end(), count);
     list.clear();
     if (count % 2 == 0) list.append(expected);
     if (count % 2 != 0)
       for (const int i : expected) list.push_back(i);
-    EXPECT_EQ(list.size(), expected.size());
-    EXPECT_EQ(list.empty(), count == 0);
-    std::vector<int> held;
     list.forEachChunk([&](auto chunk) { held.insert(held.end(), chunk.begin(), chunk.end()); });
     EXPECT_EQ(held, expected);
+    EXPECT_EQ(list.size(), expected.size());
+    EXPECT_EQ(list.empty(), count == 0);
   }
 }
 

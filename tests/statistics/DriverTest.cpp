@@ -4,26 +4,21 @@
 namespace vx {
 namespace {
 
-class DriverTest : public ::testing::Test {
+class DriverTest : public PlatformTest {
  protected:
-  std::vector<std::string> subscribed(const VXReportingDriverUtility& utility) {
-    std::vector<std::string> names;
-    for (const auto& s : utility.ioChannelSubscriptions()) names.push_back(s.driver->description());
-    return names;
+  void counters(std::initializer_list<std::pair<const char*, const char*>> values) {
+    for (const auto& [name, value] : values) drivers.count(name, value);
   }
-  DriverChannels drivers;
-  fakes::FakePlatform p{drivers};
 };
 
 TEST_F(DriverTest, SubscribesInListOrderToGroupsWithChannels) {
-  drivers.count("Haptics/Stats/x", "1");
-  drivers.count("QuorvelAE2MCA/x", "1");
-  drivers.count("Codec/MCA/x", "1");
+  counters({{"Haptics/Stats/x", "1"}, {"QuorvelAE2MCA/x", "1"}, {"Codec/MCA/x", "1"}});
   std::filesystem::create_directory(drivers.path / "Speaker");
   std::filesystem::create_symlink("Broken", drivers.path / "Broken");
   const VXReportingDriverUtility utility;
-  EXPECT_THAT(subscribed(utility),
-              ElementsAre("QuorvelAE2MCA-(null)", "(null)-MCA", "Haptics-Stats"));
+  std::vector<std::string> names;
+  for (const auto& s : utility.ioChannelSubscriptions()) names.push_back(s.driver->description());
+  EXPECT_THAT(names, ElementsAre("QuorvelAE2MCA-(null)", "(null)-MCA", "Haptics-Stats"));
   EXPECT_THAT(p.log.lines,
               ElementsAre("vxrd info creating channelreporting driver utility",
                           "vxrd default subscribed to group group QuorvelAE2MCA-(null)",
@@ -43,26 +38,23 @@ TEST_F(DriverTest, NoGroupsNoWordsNoStatistics) {
 }
 
 TEST_F(DriverTest, OnlyGrowthOfAtLeastOneIsReported) {
-  auto counters = [&](std::initializer_list<std::pair<const char*, const char*>> values) {
-    for (const auto& [name, value] : values) drivers.count(name, value);
-  };
   counters({{"Speaker/up", "1"}, {"Speaker/same", "5"}, {"Speaker/down", "9"}});
   counters({{"Speaker/one", "0"}, {"Codec/MCA/c", "3"}, {"Haptics/Stats/c", "3"}});
   const VXReportingDriverUtility utility;
   const auto snapShot = utility.getSnapShot();
   counters({{"Speaker/up", "11"}, {"Speaker/down", "2"}, {"Speaker/one", "1"}});
   counters({{"Codec/MCA/c", "4"}, {"Haptics/Stats/c", "5"}});
-  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(snapShot)->text(),
-            "{Speaker_one=1,Speaker_up=10,MCA_c=1,Haptics_Stats_c=2}");
-  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(nullptr)->find("Speaker_up")->text(),
-            "11");
+  const auto since = [&](const auto& from) {
+    return *utility.getDriverStatisticsRelativeToSnapShot(from);
+  };
+  EXPECT_EQ(since(snapShot).text(), "{Speaker_one=1,Speaker_up=10,MCA_c=1,Haptics_Stats_c=2}");
+  EXPECT_EQ(since(nullptr).find("Speaker_up")->text(), "11");
   drivers.nameless = true;
-  EXPECT_TRUE(utility.getDriverStatisticsRelativeToSnapShot(snapShot)->contains("Speaker_"));
+  EXPECT_TRUE(since(snapShot).contains("Speaker_"));
 }
 
 TEST_F(DriverTest, FailuresOfOneDriverLeaveTheOthersAlone) {
-  drivers.count("Speaker/s", "broken");
-  drivers.count("Haptics/Stats/h", "10");
+  counters({{"Speaker/s", "broken"}, {"Haptics/Stats/h", "10"}});
   const VXReportingDriverUtility utility;
   auto snapShot = utility.getSnapShot();
   EXPECT_EQ(snapShot->size(), 1u);

@@ -3,12 +3,7 @@
 namespace vx {
 namespace {
 
-class PreferencesTest : public ServiceTest {
- protected:
-  void notify(int token = fakes::FakeServices::kToken) {
-    onQueue([&] { (*p.services.notifyHandler)(token); });
-  }
-};
+class PreferencesTest : public ServiceTest {};
 
 TEST_F(PreferencesTest, NothingIsReadBeforeTheFirstNotification) {
   p.services.preferences["disable_reporting"] = "true";
@@ -31,23 +26,25 @@ TEST_F(PreferencesTest, SessionsLearnBeforeTheSwitchMoves) {
   auto& client = connect();
   create(client, 1);
   p.services.preferences = {{"disable_reporting", "true"}, {"device_name", "Pocket"}};
-  EXPECT_THAT(during([&] { notify(); }),
+  notify();
+  EXPECT_THAT(gained(),
               ElementsAre("log vxrs default re-reading sonik defaults",
                           "log vxrs info defaults {device_name=Pocket,disable_reporting=1}"));
-  EXPECT_EQ(session(client, 1)->userInfo()->snapshot().text(),
-            "{device_name=Pocket,disable_reporting=1}");
+  const auto told = [&](ReporterID id) {
+    return session(client, id)->userInfo()->snapshot().text();
+  };
+  EXPECT_EQ(told(1), "{device_name=Pocket,disable_reporting=1}");
   create(client, 2);
   p.services.preferences.erase("device_name");
-  notify(3);                                                         // somebody else's
-  EXPECT_EQ(session(client, 2)->userInfo()->snapshot().size(), 0u);  // until the next notification
+  notify(3);  // somebody else's
+  EXPECT_EQ(told(2), "{}") << "until the next notification";
   notify();
   EXPECT_EQ(onQueue([&] { return service->getDefaults(); })->text(), "{disable_reporting=1}");
-  EXPECT_EQ(session(client, 2)->userInfo()->snapshot().text(), "{disable_reporting=1}");
+  EXPECT_EQ(told(2), "{disable_reporting=1}");
 }
 
 TEST_F(PreferencesTest, OffRefusesMessagesAndHidesOthersSessions) {
-  auto& a = connect(200);
-  auto& b = connect(201);
+  auto &a = connect(200), &b = connect(201);
   started(b, 1);
   create(b, 2);
   p.services.preferences["disable_reporting"] = "true";
@@ -55,14 +52,16 @@ TEST_F(PreferencesTest, OffRefusesMessagesAndHidesOthersSessions) {
   p.log.lines.clear();
   start(a, 2);
   EXPECT_FALSE(session(b, 2)->started());
-  EXPECT_THAT(during([&] { send(a, message(), 1, 1); }),
+  send(a, message, 1, 1);
+  EXPECT_THAT(gained(),
               ElementsAre("trace 0x21042824", "reply send com.quorvel.audio.reporting 1"));
   EXPECT_EQ(onQueue([&] { return service->findReportingSessionForID(1); }), nullptr);
   EXPECT_NE(session(b, 1), nullptr);
   EXPECT_THAT(p.log.lines, IsEmpty());
   p.services.preferences.clear();
   notify();
-  EXPECT_THAT(during([&] { send(a, message(), 1, 1); }, {"reply"}), ElementsAre("reply send"));
+  send(a, message, 1, 1);
+  EXPECT_THAT(gained({"reply"}), ElementsAre("reply send"));
 }
 
 }  // namespace

@@ -4,6 +4,8 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <fstream>
+#include <iterator>
 #include <memory>
 #include <optional>
 #include <string>
@@ -12,16 +14,18 @@
 #include "Statistics/Service/VXReportingServiceDelegate.h"
 #include "Statistics/VXReportingProcessState.h"
 #include "tests/fakes/FakePlatform.h"
+#include "tests/propertylist/Dictionary.h"
 #include "tests/statistics/DriverChannels.h"
 
 namespace vx {
 
-using ::testing::AllOf;
+using namespace std::chrono_literals;
 using ::testing::Contains;
 using ::testing::ElementsAre;
 using ::testing::HasSubstr;
 using ::testing::IsEmpty;
 using ::testing::Not;
+using ::testing::Pair;
 
 // The test's own code is an item of the service queue while this lives.
 class OnServiceQueue {
@@ -37,88 +41,50 @@ class OnServiceQueue {
   const WorkQueue* const outer_;
 };
 
-class ServiceTest : public ::testing::Test {
+class PlatformTest : public ::testing::Test {
+ protected:
+  void run() { p.queues.runAll(); }
+  void mark() { marked_ = p.journal.size(); }
+  // What the journal gained since the last verb, or mark(): only lines that hold one of
+  // `interesting` (all when empty).
+  fakes::Journal gained(const std::vector<std::string>& interesting = {}) {
+    fakes::Journal lines;
+    for (; marked_ < p.journal.size(); ++marked_) {
+      bool wanted = interesting.empty();
+      for (const std::string& part : interesting)
+        wanted = wanted || p.journal[marked_].find(part) != std::string::npos;
+      if (wanted) lines.push_back(p.journal[marked_]);
+    }
+    return lines;
+  }
+  static std::string dataFile(const std::string& name) {
+    std::ifstream file(VX_TEST_DATA "/" + name);
+    return {std::istreambuf_iterator<char>(file), {}};
+  }
+
+  DriverChannels drivers;
+  fakes::FakePlatform p{drivers};
+
+ private:
+  std::size_t marked_ = 0;
+};
+
+class ServiceTest : public PlatformTest {
  protected:
   static constexpr MessageCategory kSetup = 0x08000005;
+  using Client = VXReportingServerInstance;
 
   ServiceTest() {
-    p.services.processNames[200] = "player";
-    p.services.processNames[201] = "phone";
+    p.services.processNames = {{200, "player"}, {201, "phone"}};
     service = VXReportingServiceDelegate::create();
   }
   ~ServiceTest() override {
-    p.queues.runAll();
+    run();
     clients.clear();
     connections.clear();
     service.reset();
-    p.queues.runAll();
+    run();
   }
-
-  // A registered client.
-  VXReportingServerInstance& connect(int32_t pid = 200) {
-    auto connection = std::make_shared<fakes::FakeConnection>(pid);
-    connections.push_back(connection);
-    service->listener(p.listener, connection);
-    clients.push_back(std::static_pointer_cast<VXReportingServerInstance>(connection->object));
-    p.queues.runAll();
-    return *clients.back();
-  }
-  void create(VXReportingServerInstance& client, ReporterID id) {
-    client.createReportingSession(id, booleans("create"));
-    p.queues.runAll();
-  }
-  void start(VXReportingServerInstance& client, ReporterID id) {
-    client.startReportingSessionForID(id, booleans("start"));
-    p.queues.runAll();
-  }
-  void started(VXReportingServerInstance& client, ReporterID id, ServiceType type = 0) {
-    create(client, id);
-    client.setServiceType(type, id, booleans("type"));
-    start(client, id);
-  }
-  void configure(VXReportingServerInstance& client, ReporterID id, std::optional<Payload> with) {
-    client.setConfiguration(std::move(with), id, booleans("configure"));
-    p.queues.runAll();
-  }
-  void stop(VXReportingServerInstance& client, ReporterID id) {
-    client.stopReportingSessionForID(id, booleans("stop"));
-    p.queues.runAll();
-  }
-  void send(VXReportingServerInstance& client, const Payload& message, MessageCategory category,
-            MessageType type, std::optional<std::vector<ReporterID>> ids = std::nullopt) {
-    client.sendMessage(message, category, type, std::move(ids),
-                       [this](const std::optional<Error>& error) {
-                         p.journal.push_back(error ? "reply send " + error->domain + " " +
-                                                         std::to_string(error->code)
-                                                   : "reply send");
-                       });
-    p.queues.runAll();
-  }
-  Function<void(bool)> booleans(const std::string& name) {
-    return [this, name](bool value) {
-      p.journal.push_back("reply " + name + (value ? " true" : " false"));
-    };
-  }
-  std::shared_ptr<VXReportingSession> session(VXReportingServerInstance& client, ReporterID id) {
-    const OnServiceQueue here{p};
-    return client.findReportingSessionForID(id, VXReportingServerInstance::Lookup::OwnMap);
-  }
-  // What the journal gained while `steps` ran, only lines that contain one of `interesting` (all
-  // when empty).
-  template <class Steps>
-  fakes::Journal during(const Steps& steps, std::vector<std::string> interesting = {}) {
-    const std::size_t before = p.journal.size();
-    steps();
-    fakes::Journal gained;
-    for (std::size_t i = before; i < p.journal.size(); ++i) {
-      bool wanted = interesting.empty();
-      for (const std::string& part : interesting)
-        wanted = wanted || p.journal[i].find(part) != std::string::npos;
-      if (wanted) gained.push_back(p.journal[i]);
-    }
-    return gained;
-  }
-  static Payload message() { return PayloadBuilder().set("a", 1).build(); }
 
   // What belongs to the service queue, done there.
   template <class Steps>
@@ -126,13 +92,91 @@ class ServiceTest : public ::testing::Test {
     const OnServiceQueue here{p};
     return steps();
   }
+  // A registered client.
+  Client& connect(int32_t pid = 200) {
+    mark();
+    auto connection = std::make_shared<fakes::FakeConnection>(pid);
+    connections.push_back(connection);
+    service->listener(p.listener, connection);
+    clients.push_back(std::static_pointer_cast<Client>(connection->object));
+    run();
+    return *clients.back();
+  }
+  void create(Client& client, ReporterID id) {
+    mark();
+    client.createReportingSession(id, booleans("create"));
+    run();
+  }
+  void start(Client& client, ReporterID id) {
+    mark();
+    client.startReportingSessionForID(id, booleans("start"));
+    run();
+  }
+  void started(Client& client, ReporterID id) {
+    create(client, id);
+    start(client, id);
+  }
+  void configure(Client& client, ReporterID id, std::optional<Payload> with) {
+    client.setConfiguration(std::move(with), id, booleans("configure"));
+    run();
+  }
+  void stop(Client& client, ReporterID id) {
+    mark();
+    client.stopReportingSessionForID(id, booleans("stop"));
+    run();
+  }
+  void send(Client& client, const Payload& message, MessageCategory category, MessageType type,
+            std::optional<std::vector<ReporterID>> ids = std::nullopt, std::string_view skip = "") {
+    mark();
+    client.sendMessage(message, category, type, std::move(ids),
+                       [this](const std::optional<Error>& error) {
+                         p.journal.push_back(error ? "reply send " + error->domain + " " +
+                                                         std::to_string(error->code)
+                                                   : "reply send");
+                       });
+    p.queues.runAll(skip);
+  }
+  void notify(int token = fakes::FakeServices::kToken) {
+    mark();
+    onQueue([&] { (*p.services.notifyHandler)(token); });
+  }
+  Function<void(bool)> booleans(const std::string& name) {
+    return [this, name](bool value) {
+      p.journal.push_back("reply " + name + (value ? " true" : " false"));
+    };
+  }
+  std::shared_ptr<VXReportingSession> session(Client& client, ReporterID id) {
+    return onQueue([&] { return client.findReportingSessionForID(id, Client::Lookup::OwnMap); });
+  }
 
-  DriverChannels drivers;
-  fakes::FakePlatform p{drivers};
+  const Payload message = dictionary("a", 1);
   VXReportingProcessState processState;
   std::shared_ptr<VXReportingServiceDelegate> service;
   std::vector<std::shared_ptr<fakes::FakeConnection>> connections;
-  std::vector<std::shared_ptr<VXReportingServerInstance>> clients;
+  std::vector<std::shared_ptr<Client>> clients;
+};
+
+// Sessions alone, as the service queue sees them.
+class SessionTest : public ServiceTest {
+ protected:
+  std::shared_ptr<VXReportingSession> make(ServiceType type = 0, ReporterID id = 42) {
+    auto made = VXReportingSession::initWithID(id, {200});
+    if (type != kServiceTypeUnknown) made->setServiceType(type);
+    return made;
+  }
+  std::shared_ptr<VXReportingSession> startedSession(ServiceType type = 3) {
+    auto made = make(type);
+    made->start();
+    run();
+    return made;
+  }
+  static std::vector<std::string> texts(const std::optional<std::vector<Payload>>& payloads) {
+    std::vector<std::string> all;
+    for (const Payload& payload : payloads.value_or(std::vector<Payload>()))
+      all.push_back(payload.text());
+    return all;
+  }
+  const OnServiceQueue here_{p};
 };
 
 }  // namespace vx

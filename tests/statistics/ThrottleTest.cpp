@@ -7,27 +7,19 @@
 namespace vx {
 namespace {
 
-using namespace std::chrono_literals;
-
-class ThrottleTest : public ::testing::Test {
+class ThrottleTest : public PlatformTest {
  protected:
   ~ThrottleTest() override { p.threading.threadBody = nullptr; }
-  static PayloadBuilder payload(int a = 1) { return PayloadBuilder().set("a", a); }
-  static PayloadBuilder held(double seconds, int a = 1) {
-    return payload(a).set("_throttle_seconds", seconds);
+  static Payload held(double seconds, int a = 1) {
+    return dictionary("a", a, "_throttle_seconds", seconds);
   }
-  void add(const std::string& name, const PayloadBuilder& message) {
-    throttle->addMessageBlock(
-        [this, name] { ran.push_back(name + "@" + std::to_string(elapsed())); }, 1, message.build(),
-        1, 1);
+  void add(const std::string& name, const Payload& message = dictionary("a", 1)) {
+    addBlock([this, name] { ran.push_back(name + "@" + std::to_string(elapsed())); }, message);
   }
-  void addAt(std::chrono::milliseconds when, const std::string& name,
-             const PayloadBuilder& message) {
-    p.threading.at(when, [this, name, message] { add(name, message); });
+  void addBlock(std::function<void()> block, const Payload& message = dictionary("a", 1)) {
+    throttle->addMessageBlock(std::move(block), 1, message, 1, 1);
   }
-  int64_t elapsed() const {
-    return std::chrono::duration_cast<std::chrono::milliseconds>(p.clock.steady - begin).count();
-  }
+  int64_t elapsed() const { return (p.clock.steady - begin) / 1ms; }
   // Lets the worker's thread run for a while.
   void work(std::chrono::milliseconds time) {
     const Monotonic end = p.clock.steady + time;
@@ -39,58 +31,48 @@ class ThrottleTest : public ::testing::Test {
     p.threading.onSleep = nullptr;
   }
 
-  fakes::FakePlatform p;
   const Monotonic begin = p.clock.steady;
   std::shared_ptr<VXReportingBlockThrottle> throttle = VXReportingBlockThrottle::create();
   std::vector<std::string> ran;
 };
 
 TEST_F(ThrottleTest, KeysTellMessagesApart) {
-  auto key = [](const PayloadBuilder& message, ReporterID reporter = 42) {
-    return VXReportingBlockThrottle::buildMessageKey(message.build(), reporter, 0x08000005, 1);
+  auto key = [](const Payload& message, ReporterID reporter = 42) {
+    return VXReportingBlockThrottle::buildMessageKey(message, reporter, 0x08000005, 1);
   };
-  EXPECT_EQ(key(PayloadBuilder().set("b", 2).set("a", "x").set("systemuptime_sec", 100)),
+  EXPECT_EQ(key(dictionary("b", 2, "a", "x", "systemuptime_sec", 100)),
             "a|x|b|2|systemuptime_sec|^|reporterID|42|Session_Setup|Start");
   EXPECT_EQ(VXReportingBlockThrottle::buildMessageKey(Payload(), -1, 0xFFFFFFFF, 0xFFFF),
             "reporterID|-1|Undefined|Unknown");
-  EXPECT_EQ(key(PayloadBuilder().set("a", 1).set("B", 2), -5),
-            "B|2|a|1|reporterID|-5|Session_Setup|Start");
+  EXPECT_EQ(key(dictionary("a", 1, "B", 2), -5), "B|2|a|1|reporterID|-5|Session_Setup|Start");
   for (const char* hidden : {"systemuptime_sec", "processuptime_ms", "vxreporting_timestamp",
                              "_throttle_seconds", "_comparison_field_blacklist"})
-    EXPECT_EQ(key(PayloadBuilder().set(hidden, 1)), key(PayloadBuilder().set(hidden, 2)));
+    EXPECT_EQ(key(dictionary(hidden, 1)), key(dictionary(hidden, 2)));
   for (const char* seen : {"Volume", "VolumeOperationTime", "System_uptime_sec"})
-    EXPECT_NE(key(PayloadBuilder().set(seen, 1)), key(PayloadBuilder().set(seen, 2)));
-  const auto ignoring = [](int level) {
-    return PayloadBuilder()
-        .set("_comparison_field_blacklist", ArrayBuilder().add("level"))
-        .set("level", level);
+    EXPECT_NE(key(dictionary(seen, 1)), key(dictionary(seen, 2)));
+  EXPECT_EQ(key(dictionary("Volume", 1, "VolumeOperationTime", 1)),
+            key(dictionary("Volume", 2, "VolumeOperationTime", 3)));
+  const auto ignoring = [&](const auto& list, int level) {
+    return key(dictionary("_comparison_field_blacklist", list, "level", level, "5", level));
   };
-  EXPECT_EQ(key(ignoring(1)), key(ignoring(7)));
-  EXPECT_NE(key(ignoring(1)),
-            key(PayloadBuilder().set("_comparison_field_blacklist", ArrayBuilder().add("level"))));
-  EXPECT_NE(key(PayloadBuilder().set("_comparison_field_blacklist", "level").set("level", 1)),
-            key(PayloadBuilder().set("_comparison_field_blacklist", "level").set("level", 2)));
-  const auto number = [](int level) {
-    return PayloadBuilder()
-        .set("_comparison_field_blacklist", ArrayBuilder().add(5))
-        .set("5", level);
-  };
-  EXPECT_NE(key(number(1)), key(number(2)));  // a number is no key
-  EXPECT_EQ(key(PayloadBuilder().set("Volume", 1).set("VolumeOperationTime", 1)),
-            key(PayloadBuilder().set("Volume", 2).set("VolumeOperationTime", 3)));
+  const auto levels = ArrayBuilder().add("level").add("5"), numbers = ArrayBuilder().add(5);
+  EXPECT_EQ(ignoring(levels, 1), ignoring(levels, 7));
+  EXPECT_NE(ignoring(levels, 1), key(dictionary("_comparison_field_blacklist", levels)));
+  EXPECT_NE(ignoring("level", 1), ignoring("level", 2));
+  EXPECT_THAT(ignoring(numbers, 1), HasSubstr("5|1")) << "a number is no key";
 }
 
 TEST_F(ThrottleTest, DelaysAreReadWithTheirAsymmetries) {
-  auto delay = [](const PayloadBuilder& message) {
-    return VXReportingBlockThrottle::determineSleepTime(message.build());
+  auto delay = [](const auto& seconds) {
+    return VXReportingBlockThrottle::determineSleepTime(dictionary("_throttle_seconds", seconds));
   };
-  EXPECT_EQ(delay(payload()), 0.5);
-  EXPECT_EQ(delay(held(4.99)), static_cast<double>(4.99f));
-  EXPECT_EQ(delay(held(-1)), -1.0);
+  EXPECT_EQ(VXReportingBlockThrottle::determineSleepTime(dictionary("a", 1)), 0.5);
+  EXPECT_EQ(delay(4.99), static_cast<double>(4.99f));
+  EXPECT_EQ(delay(-1.0), -1.0);
   EXPECT_THAT(p.log.lines, IsEmpty());
-  EXPECT_EQ(delay(held(5)), 0.5);
-  EXPECT_EQ(delay(payload().set("_throttle_seconds", "2")), 0.5);
-  EXPECT_EQ(delay(payload().set("_throttle_seconds", true)), 0.5);
+  EXPECT_EQ(delay(5.0), 0.5);
+  EXPECT_EQ(delay("2"), 0.5);
+  EXPECT_EQ(delay(true), 0.5);
   EXPECT_THAT(p.log.lines,
               ElementsAre("system info Rejecting large throttle time. {time=5, max=5.000000}",
                           "system info Rejecting non KFNumber value of throttle time. {time=2}",
@@ -98,19 +80,28 @@ TEST_F(ThrottleTest, DelaysAreReadWithTheirAsymmetries) {
 }
 
 TEST_F(ThrottleTest, OnlyTheLastOfABurstRunsOneDelayAfterIt) {
-  add("first", payload());
-  addAt(200ms, "second", payload());
-  addAt(400ms, "third", payload());
+  p.log.verbose = true;
+  add("first");
+  p.threading.at(200ms, [&] { add("second"); });
+  p.threading.at(400ms, [&] { add("third"); });
   work(2s);
   EXPECT_THAT(ran, ElementsAre("third@900"));
   EXPECT_EQ(throttle->timersInFlight(), 0u);
+  p.log.lines.resize(3);
+  EXPECT_THAT(p.log.lines,
+              ElementsAre("system debug calling workingRunLoop run from inside thread block",
+                          "system debug Dropping duplicate message for a|1|reporterID|1|Generic|"
+                          "Start",
+                          "system debug Dropping duplicate message for a|1|reporterID|1|Generic|"
+                          "Start"));
 }
 
 TEST_F(ThrottleTest, DifferentKeysRunEachAfterItsOwnDelay) {
   add("slow", held(1.5, 1));
   add("fast", held(0.25, 2));
+  p.threading.at(100ms, [&] { add("late", held(0.25, 3)); });  // waits for the loop, long due
   work(2s);
-  EXPECT_THAT(ran, ElementsAre("fast@250", "slow@1500"));
+  EXPECT_THAT(ran, ElementsAre("fast@250", "slow@1500", "late@1600"));
 }
 
 TEST_F(ThrottleTest, ZeroAndLessRunOnTheNextPassAndKeysMayComeAgain) {
@@ -125,22 +116,15 @@ TEST_F(ThrottleTest, ZeroAndLessRunOnTheNextPassAndKeysMayComeAgain) {
   EXPECT_THAT(ran, ElementsAre("now@200", "again@400", "absurd@600", "absurd@600", "absurd@600"));
 }
 
-TEST_F(ThrottleTest, KeysAddedWhileTheLoopIsBusyWaitForIt) {
-  add("long", held(3, 1));
-  addAt(100ms, "short", held(0.25, 2));
-  work(4s);
-  EXPECT_THAT(ran, ElementsAre("long@3000", "short@3100"));  // due long ago: at once when attached
-}
-
 TEST_F(ThrottleTest, DuplicateDuringItsOwnBlockIsLost) {
-  throttle->addMessageBlock([this] { add("never", payload()); }, 1, payload().build(), 1, 1);
+  addBlock([this] { add("never"); });
   work(3s);
   EXPECT_THAT(ran, IsEmpty());
   EXPECT_EQ(throttle->timersInFlight(), 0u);
 }
 
 TEST_F(ThrottleTest, ThrowingBlockLeavesThroughTheThreadAfterTheCleanUp) {
-  throttle->addMessageBlock([] { throw std::runtime_error("block"); }, 1, payload().build(), 1, 1);
+  addBlock([] { throw std::runtime_error("block"); });
   EXPECT_THROW(work(2s), std::runtime_error);
   EXPECT_EQ(throttle->timersInFlight(), 0u);
 }
@@ -148,7 +132,7 @@ TEST_F(ThrottleTest, ThrowingBlockLeavesThroughTheThreadAfterTheCleanUp) {
 TEST_F(ThrottleTest, WaitingLooksTenTimesAndGivesUp) {
   throttle->waitForCompletion();
   EXPECT_THAT(p.threading.sleeps, IsEmpty());
-  add("stuck", payload());  // no worker runs meanwhile
+  add("stuck");  // no worker runs meanwhile
   throttle->waitForCompletion();
   EXPECT_EQ(p.threading.sleeps, std::vector<std::chrono::nanoseconds>(10, 500ms));
   EXPECT_THAT(
@@ -162,29 +146,18 @@ TEST_F(ThrottleTest, WaitingLooksTenTimesAndGivesUp) {
 
 TEST_F(ThrottleTest, WaitingEndsAsSoonAsNothingIsLeft) {
   p.log.verbose = true;
-  add("soon", payload());
+  add("soon");
   p.threading.at(700ms, [this] { work(100ms); });
   throttle->waitForCompletion();
   EXPECT_LT(elapsed(), 1600);
   EXPECT_THAT(p.log.lines, Contains("system debug Waiting up to 5 seconds for blockThrottle queue "
                                     "to be empty."));
+  EXPECT_THAT(p.log.lines, Contains("system debug sleeping in thread"));
   EXPECT_THAT(p.log.lines, Not(Contains(HasSubstr("Giving up"))));
   throttle->setShouldKeepRunning(false);
   p.threading.sleeps.clear();
   p.threading.threadBody();
   EXPECT_THAT(p.threading.sleeps, IsEmpty()) << "a thread that is not to run does not begin";
-}
-
-TEST_F(ThrottleTest, VerboseLinesOnRequest) {
-  p.log.verbose = true;
-  add("first", payload());
-  add("second", payload());
-  work(200ms);
-  EXPECT_THAT(
-      p.log.lines,
-      ElementsAre("system debug Dropping duplicate message for a|1|reporterID|1|Generic|Start",
-                  "system debug calling workingRunLoop run from inside thread block",
-                  "system debug sleeping in thread"));
 }
 
 }  // namespace
