@@ -96,21 +96,6 @@ TEST_F(RoutingTest, StartTakesItsSnapshotAfterStartingAndHoldsTheReply) {
   EXPECT_TRUE(session(client, 1)->hasTransactionCompleteBlock());
 }
 
-TEST_F(RoutingTest, StopOfASessionNeverStartedStillAsksTheDrivers) {
-  auto& client = connect();
-  create(client, 1);
-  stop(client, 1);
-  EXPECT_THAT(gained({"nothing", "0x21042830", "reply"}),
-              ElementsAre("log vxrs default nothing interesting to fetch from the drivers",
-                          "reply stop true"));
-  stop(client, 0);
-  EXPECT_THAT(gained(), ElementsAre("trace 0x2104281C", "reply stop true"));
-  for (const ReporterID nobody : {0, 99}) {
-    start(client, nobody);
-    EXPECT_THAT(gained({"trace", "reply"}), ElementsAre("trace 0x21042818", "reply start true"));
-  }
-}
-
 TEST_F(RoutingTest, AnotherClientsSessionCanBeStartedButNotStopped) {
   auto &owner = connect(200), &other = connect(201);
   create(owner, 1);

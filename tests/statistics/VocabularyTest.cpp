@@ -5,19 +5,19 @@ namespace vx {
 namespace {
 
 TEST(Vocabulary, EveryCodeHasAName) {
-  std::string services, kinds, types;
-  for (ServiceType type = 0; type < 14; ++type)
-    services += std::string(VXReportingServiceTypeName(type)) + " ";
-  EXPECT_EQ(services,
+  const auto names = [](auto name, uint16_t count) {
+    std::string text;
+    for (uint16_t code = 0; code < count; ++code) text += std::string(name(code)) + " ";
+    return text;
+  };
+  EXPECT_EQ(names(VXReportingServiceTypeName, 14),
             "generic ondi telephony haptics alarms standalone soundautoconfig longformaudio "
             "nonlongformaudio audiodeviceusage alerts test apiusage telephony ");
-  for (MessageCategory kind = 0; kind < 12; ++kind) kinds += VXReportingCategoryName(kind) + " ";
-  EXPECT_EQ(kinds,
+  EXPECT_EQ(names(VXReportingCategoryName, 12),
             "Undefined Generic Record Playback PlaybackAndRecord Setup ClientRequest RouteChange "
             "Error ChannelReporting Performance Volume ");
-  for (MessageType type = 0; type < 7; ++type)
-    types += std::string(VXReportingMessageTypeName(type)) + " ";
-  EXPECT_EQ(types, "Generic Start Stop Setup Error IssueDetector Undefined ");
+  EXPECT_EQ(names(VXReportingMessageTypeName, 7),
+            "Generic Start Stop Setup Error IssueDetector Undefined ");
   EXPECT_EQ(VXReportingServiceTypeName(65534), "telephony");
   EXPECT_EQ(VXReportingServiceTypeName(65535), "unknown");
   EXPECT_EQ(VXReportingMessageTypeName(65534), "Undefined");
