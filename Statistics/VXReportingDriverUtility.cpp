@@ -15,7 +15,7 @@ const LogScope* scope() { return driverLogScope.load(std::memory_order_acquire);
 
 std::string orNull(const std::optional<std::string>& name) { return name.value_or("(null)"); }
 
-// The entry's key: group, subgroup and channel name, each as far as there is one, with "_" behind
+// The entry's key: group, subgroup and channel name, each as far as there is one, with "_" after
 // the first two.
 std::string channelKey(const VXReportingDriver& driver,
                        std::optional<std::string_view> channelName) {

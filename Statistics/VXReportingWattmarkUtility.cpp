@@ -26,8 +26,8 @@ void VXReportingWattmarkUtility::handleEvent(const Payload* payload, MessageCate
     if (session != nullptr) userInfo = session->userInfo()->snapshot();
     const std::optional<HostApplicationDisplayID> application =
         VXReportingHostApplicationDisplayID(userInfo);
-    if (application) {  // always, since the lookup falls back to "Unknown"; kept for the day it
-                        // does not
+    // Always there while the lookup falls back to "Unknown"; kept for the day it does not.
+    if (application) {
       application->storeUnder("ApplicationName", record);
     } else {
       VX_LOG(nullptr, Error, "failed to get app name for wattmark");

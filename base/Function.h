@@ -1,4 +1,4 @@
-// A move-only callable with room for 48 bytes of captures, so that queueing work costs no
+// A move-only callable with capacity for 48 bytes of captures, so that queueing work costs no
 // allocation of its own. std::function must copy, and allocates beyond 16 bytes;
 // std::move_only_function is C++23.
 #pragma once

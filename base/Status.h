@@ -24,7 +24,7 @@ class [[nodiscard]] Status {
   bool ok() const { return text_.empty(); }
   int code() const { return code_; }  // errno's value; 0 when there is none
   const std::string& text() const { return text_; }
-  // The same failure with more to say behind the sentence, " (set X to ...)"; success stays
+  // The same failure with more to say after the sentence, " (set X to ...)"; success stays
   // success.
   Status withHint(std::string_view hint) const;
   // As the platform's interfaces say it; none for success.

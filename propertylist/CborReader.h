@@ -26,7 +26,7 @@ inline constexpr uint8_t kHalf = 0xF9;
 inline constexpr uint8_t kSingle = 0xFA;
 inline constexpr uint8_t kDouble = 0xFB;
 
-// The initial byte and the argument behind it:
+// The initial byte and the argument after it:
 //
 //   | major 3 bits | info 5 bits | 0, 1, 2, 4 or 8 bytes of argument, big-endian |
 //
@@ -34,7 +34,7 @@ inline constexpr uint8_t kDouble = 0xFB;
 struct Head {
   uint8_t initial = 0;
   uint64_t argument = 0;
-  const uint8_t* next = nullptr;  // first byte behind the head
+  const uint8_t* next = nullptr;  // first byte after the head
   uint8_t major() const { return initial >> 5; }
 };
 
@@ -63,7 +63,7 @@ inline std::string_view text(const uint8_t* at) {
   return {reinterpret_cast<const char*>(h.next), h.argument};
 }
 
-// First byte behind the item. Nested items cost no stack.
+// First byte after the item. Nested items cost no stack.
 inline const uint8_t* skip(const uint8_t* at) {
   for (uint64_t items = 1; items > 0; --items) {
     const Head h = head(at);

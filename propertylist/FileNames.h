@@ -10,7 +10,7 @@ namespace vx {
 // identifiers such as com.example.app are unchanged. Every other byte, '%' included, becomes %XX
 // (two upper-case hexadecimal digits); so does a leading '.', so that no name is hidden or leads
 // out of its directory. The empty text becomes a lone "%": an encoded text has a '%' only with
-// two digits behind it, so this is no other text's name.
+// two digits after it, so this is no other text's name.
 //
 // Two different texts have two different names as long as these have at most 120 bytes. A longer
 // name is cut to 120, never inside a character or %XX, and closed with "%~" and the 16 hexadecimal

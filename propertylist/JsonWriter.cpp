@@ -22,8 +22,8 @@ class Sink {
   Sink(const Sink&) = delete;
   Sink& operator=(const Sink&) = delete;
 
-  // Room for `count` characters at the returned place; wrote() says where they end.
-  char* room(std::size_t count) {
+  // Capacity for `count` characters at the returned place; wrote() says where they end.
+  char* reserve(std::size_t count) {
     if (static_cast<std::size_t>(end_ - at_) < count) {
       size_ = static_cast<std::size_t>(at_ - out_.data());
       grow(std::max(count, size_));
@@ -32,10 +32,12 @@ class Sink {
   }
   void wrote(char* end) { at_ = end; }
   void put(char c) {
-    *room(1) = c;
+    *reserve(1) = c;
     ++at_;
   }
-  void put(std::string_view text) { wrote(std::copy(text.begin(), text.end(), room(text.size()))); }
+  void put(std::string_view text) {
+    wrote(std::copy(text.begin(), text.end(), reserve(text.size())));
+  }
 
  private:
   void grow(std::size_t more) {
@@ -76,12 +78,12 @@ char* writeEscaped(char* out, uint8_t c) {
   return out;
 }
 
-// In pieces, so that a long text with much to escape claims no six times its room.
+// In pieces, so that a long text with much to escape claims no six times its size.
 void putEscaping(Sink& sink, std::string_view text) {
   constexpr std::size_t kPiece = 1024;
   for (; !text.empty(); text.remove_prefix(std::min(kPiece, text.size()))) {
     const std::string_view piece = text.substr(0, kPiece);
-    char* out = sink.room(piece.size() * kMaxEscaped);
+    char* out = sink.reserve(piece.size() * kMaxEscaped);
     for (const char signedChar : piece) {
       const auto c = static_cast<uint8_t>(signedChar);
       if (kEscapes[c] == 0)
@@ -117,7 +119,7 @@ bool copyText(char* out, std::string_view text) {
 }
 
 void putString(Sink& sink, std::string_view text) {
-  char* const out = sink.room(text.size() + 2);
+  char* const out = sink.reserve(text.size() + 2);
   if (!copyText(out + 1, text)) {
     *out = '"';
     out[text.size() + 1] = '"';
@@ -138,7 +140,7 @@ class Emitter {
   Emitter(Sink& sink, NonFinite nonFinite, Layout layout, std::size_t indent)
       : sink_(sink), nonFinite_(nonFinite), layout_(layout), indent_(indent) {}
 
-  // Returns the first byte behind the item.
+  // Returns the first byte after the item.
   const uint8_t* item(const uint8_t* at) {
     const cbor::Head head = cbor::head(at);
     switch (head.major()) {
@@ -153,7 +155,7 @@ class Emitter {
       case cbor::kSimple:
         return simple(head);
       default:
-        sink_.wrote(writeNumber(sink_.room(kMaxScalarText), head));
+        sink_.wrote(writeNumber(sink_.reserve(kMaxScalarText), head));
         return head.next;
     }
   }
@@ -189,7 +191,7 @@ class Emitter {
   }
 
   const uint8_t* date(const cbor::Head& head) {
-    char* out = sink_.room(kMaxScalarText + 2);
+    char* out = sink_.reserve(kMaxScalarText + 2);
     *out++ = '"';
     out = writeNumber(out, head);
     *out++ = '"';
@@ -210,7 +212,7 @@ class Emitter {
   void floating(const cbor::Head& head) {
     const double value = cbor::floatingOf(head);
     if (std::isfinite(value))
-      sink_.wrote(writeNumber(sink_.room(kMaxScalarText), head));
+      sink_.wrote(writeNumber(sink_.reserve(kMaxScalarText), head));
     else if (nonFinite_ == NonFinite::Refuse)
       sink_.put("null");
     else
@@ -219,7 +221,7 @@ class Emitter {
 
   void newLine() {
     if (layout_ == Layout::Compact) return;
-    char* const out = sink_.room(1 + indent_);
+    char* const out = sink_.reserve(1 + indent_);
     *out = '\n';
     sink_.wrote(std::fill_n(out + 1, indent_, ' '));
   }
@@ -320,7 +322,7 @@ void appendJsonString(std::string& out, std::string_view text) {
 
 void appendJsonText(std::string& out, std::string_view part) {
   Sink sink(out, part.size());
-  char* const at = sink.room(part.size());
+  char* const at = sink.reserve(part.size());
   if (copyText(at, part))
     putEscaping(sink, part);
   else

@@ -22,7 +22,7 @@ enum class NonFinite {
 // Compact: no white space.
 void appendJson(std::string& out, const Payload& payload, NonFinite nonFinite = NonFinite::AsText);
 void appendJson(std::string& out, const Value& value, NonFinite nonFinite = NonFinite::AsText);
-// For a payload that begins with all of `beginning`'s entries: what its text has behind theirs,
+// For a payload that begins with all of `beginning`'s entries: what its text has after theirs,
 // with the comma that separates them and the closing brace (`,"k":1}`). Otherwise false, and
 // nothing is appended.
 bool appendJsonTail(std::string& out, const Payload& payload, const Payload& beginning,

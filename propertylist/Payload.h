@@ -73,7 +73,7 @@ class Value {
   // equal text.
   void appendText(std::string& out) const;
   // The same for a value that is no string, array or dictionary: at most kMaxScalarText characters;
-  // returns the first place behind them.
+  // returns the first place after them.
   static constexpr std::size_t kMaxScalarText = 48;
   char* writeScalarText(char* out) const;
   std::string text() const {
@@ -144,7 +144,7 @@ class DictionaryView {
     void readEntry();
     std::string_view key_;
     const uint8_t* value_ = nullptr;
-    const uint8_t* next_ = nullptr;  // behind the value
+    const uint8_t* next_ = nullptr;  // after the value
     std::size_t left_ = 0;
   };
   DictionaryView() = default;
@@ -187,7 +187,7 @@ class Payload {
   ~Payload() { release(); }
 
   // Validates bytes that come from outside: exactly one definite-length dictionary of the kinds
-  // above, UTF-8 strings, unique keys, nesting at most kMaxNesting, nothing behind it. No
+  // above, UTF-8 strings, unique keys, nesting at most kMaxNesting, nothing after it. No
   // allocation before a length is believed.
   static std::optional<Payload> decode(std::span<const uint8_t> bytes,
                                        DecodeError* error = nullptr);

@@ -1,4 +1,4 @@
-// The one allocation behind a Payload. For the files that implement Payload only.
+// The one allocation of a Payload. For the files that implement Payload only.
 #pragma once
 
 #include <cstddef>
@@ -32,9 +32,9 @@ struct Payload::Block {
   // The bytes are the caller's to fill.
   static Block* allocate(std::size_t size, Traits traits) {
     if (size > kMaxSize) throw std::length_error("a property list is limited to 1 GiB");
-    void* room = ::operator new(sizeof(Block) + size);
-    return new (room) Block(static_cast<uint32_t>(size) | (traits.spaceInKeys ? kSpaceFlag : 0) |
-                            (traits.mayHoldNonFinite ? kNonFiniteFlag : 0));
+    void* memory = ::operator new(sizeof(Block) + size);
+    return new (memory) Block(static_cast<uint32_t>(size) | (traits.spaceInKeys ? kSpaceFlag : 0) |
+                              (traits.mayHoldNonFinite ? kNonFiniteFlag : 0));
   }
 
  private:

@@ -193,7 +193,7 @@ void PayloadBuilder::add(std::string_view key, const Entry& entry) {
     index(entries_.size() - 1);
 }
 
-// The new value lies at `value`, behind everything else.
+// The new value lies at `value`, after everything else.
 void PayloadBuilder::replace(Entry& entry, std::size_t value) {
   const std::size_t oldSize = entry.valueEnd - entry.value;
   const std::size_t newSize = body_.size() - value;

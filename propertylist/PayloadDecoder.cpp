@@ -32,7 +32,7 @@ bool keyOrder(const OpenKey& a, const OpenKey& b) {
 }
 
 // The keys of all open dictionaries, innermost last. The first few need no allocation; beyond them
-// the room grows with keys that have really been read.
+// the capacity grows with keys that have really been read.
 class KeyStack {
  public:
   std::size_t size() const { return size_; }
@@ -140,7 +140,7 @@ bool Validator::run() {
     if (!readValue()) return false;
   }
   if (elements_ != nullptr) endElement(rootCount_);
-  return at_ == end_ || fail(at_, "bytes behind the end");
+  return at_ == end_ || fail(at_, "bytes after the end");
 }
 
 // The frame's element before number `next` ends here, and that one begins.

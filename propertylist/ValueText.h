@@ -1,5 +1,5 @@
 // Text of numbers and dates, shared by Value::appendText and the JSON writer. Each function writes
-// at most kMaxScalarText characters and returns the first place behind them; nothing allocates.
+// at most kMaxScalarText characters and returns the first place after them; nothing allocates.
 #pragma once
 
 #include <cstddef>
