@@ -24,6 +24,7 @@ PATIENCE = float(os.environ.get("VX_PATIENCE", 60))
 # In memory where that can be had: how long a daemon takes to end must not depend on who else writes to the disk.
 tempfile.tempdir = "/dev/shm" if os.access("/dev/shm", os.W_OK) else None
 
+INTERNAL = "[device]\ninternal_build = true\n"
 (CREATE, SET_TYPE, GET_TYPE, CONFIGURE, START, SEND, STOP, DESTROY, VALIDATE, REPORTERS, KILL) = range(1, 12)
 HELLO, CALL, REPLY, ERROR, GOODBYE = range(5)
 
@@ -36,6 +37,12 @@ def frame(*items):
     return framed(dumps(items))
 
 
+def replace(path, text):
+    with open(path + ".new", "w") as f:
+        f.write(text)
+    os.rename(path + ".new", path)
+
+
 class Client:
     """One connection. Calls may be sent without waiting; answers are kept by call number."""
 
@@ -46,8 +53,7 @@ class Client:
         self.number = 0
         self.data = b""
         self.answers = {}
-        self.connection_error = None
-        self.goodbye = False
+        self.connection_error, self.goodbye = None, False
         if hello:
             self.raw(frame(HELLO, 1))
             self.hello = self.next_frame()
@@ -80,9 +86,7 @@ class Client:
         f = self.next_frame()
         if f is None:
             return False
-        if f[0] == HELLO:
-            self.hello = f
-        elif f[0] == GOODBYE:
+        if f[0] == GOODBYE:
             self.goodbye = True
         elif f[0] == ERROR and f[1] is None:
             self.connection_error = f
@@ -116,6 +120,12 @@ class Client:
         number = self.post(START, reporter)
         self.call(VALIDATE, reporter)  # a later call's answer: the start has run
         return number
+
+    def session(self, reporter, configuration=None, message={"a": 1}):
+        """A whole one, with one message."""
+        self.started(reporter, 2, configuration)
+        self.call(SEND, message, 3, 1, [reporter])
+        self.call(STOP, reporter)
 
     def close(self):
         self.socket.close()
@@ -151,28 +161,20 @@ class Daemon:
                                             preexec_fn=self.preexec, close_fds=self.preexec is None)
         if wait:
             self.wait_until(self.listening, "the daemon listens")
-            # The probe above was a client too; what follows starts from a clean list.
+            # The probe was a client too; what follows starts from a clean list.
             self.wait_until(lambda: "dealloc" in self.log()[before:], "the probe is gone")
-            self.quiet_before = len(self.log())
 
     def listening(self):
         if self.process.poll() is not None:
             raise AssertionError(f"the daemon ended with {self.process.returncode}:\n{self.log()}")
-        try:
-            s = socket.socket(socket.AF_UNIX, socket.SOCK_STREAM)
-            s.connect(self.socket_path)
-            return True
-        except OSError:
-            return False
-        finally:
-            s.close()
+        with socket.socket(socket.AF_UNIX, socket.SOCK_STREAM) as s:
+            return s.connect_ex(self.socket_path) == 0
 
     def wait_until(self, condition, what):
         end = time.monotonic() + PATIENCE
         while time.monotonic() < end:
-            value = condition()
-            if value:
-                return value
+            if condition():
+                return
             time.sleep(0.01)
         raise AssertionError(f"waited in vain until {what}; the log ends:\n{self.log()[-3000:]}")
 
@@ -180,9 +182,6 @@ class Daemon:
         c = Client(self.socket_path, **options)
         self.clients.append(c)
         return c
-
-    def log_since_start(self):
-        return self.log()[self.quiet_before:]
 
     def log(self):
         with open(self.log_path, errors="replace") as f:
@@ -209,11 +208,8 @@ class Daemon:
             raise AssertionError("the daemon did not end:\n" + self.log()[-3000:])
 
     def rows(self, query, *arguments):
-        connection = sqlite3.connect(f"file:{self.database}?mode=ro", uri=True, timeout=PATIENCE)
-        try:
+        with contextlib.closing(sqlite3.connect(f"file:{self.database}?mode=ro", uri=True, timeout=PATIENCE)) as connection:
             return connection.execute(query, arguments).fetchall()
-        finally:
-            connection.close()
 
     def wait_for_messages(self, count):
         """Stopping has a limit of time, which much that is not stored yet may pass on a busy machine."""

@@ -1,32 +1,18 @@
 """Preferences, summaries and orientation, on real files and a real bus."""
 import itertools
 import json
-import os
 import re
-import resource
 import select
-import shutil
-import subprocess
-import time
-import unittest
 
 from harness import *
-
-SETTLE = "[preferences]\nsettle_ms = 20\n"
-INTERNAL = "[device]\ninternal_build = true\n"
 
 
 class PreferencesTest(DaemonTest):
     def setUp(self):
-        self.d = self.daemon(config=SETTLE)
+        self.d = self.daemon(config="[preferences]\nsettle_ms = 20\n")
         self.file = f"{self.d.folder}/etc/preferences/com.quorvel.sonik.toml"
         os.makedirs(os.path.dirname(self.file), exist_ok=True)
         self.c = self.d.client()
-
-    def replace(self, text):
-        with open(self.file + ".new", "w") as f:
-            f.write(text)
-        os.rename(self.file + ".new", self.file)
 
     def assert_switched(self, off):
         want = {"domain": "com.quorvel.audio.reporting", "code": 1} if off else None
@@ -38,15 +24,10 @@ class PreferencesTest(DaemonTest):
         self.assert_switched(off=True)
         subprocess.run(["sed", "-i", "s/true/false/", self.file], check=True)
         self.assert_switched(off=False)
-        self.replace("disable_reporting = true\n")
+        replace(self.file, "disable_reporting = true\n")
         self.assert_switched(off=True)
-        self.replace("disable_reporting = = false\n")  # a broken file leaves the last good values
+        replace(self.file, "disable_reporting = = false\n")  # a broken file leaves the last good values
         self.d.wait_until(lambda: re.search(r"com.quorvel.sonik.toml:1:\d+", self.d.log()), "line and column are logged")
-        self.assert_switched(off=True)
-        os.rename(self.file, self.file + "~")
-        self.replace("device_name = 'x'\n")
-        self.assert_switched(off=False)
-        self.replace("disable_reporting = true\n")
         self.assert_switched(off=True)
         os.remove(self.file)
         self.assert_switched(off=False)
@@ -54,7 +35,7 @@ class PreferencesTest(DaemonTest):
     def test_defaults_reach_sessions_and_verbose_keys_take_effect(self):
         self.assertNotIn("creating session for reporter", self.d.log())
         self.c.call(CREATE, 1)
-        self.replace("device_name = 'Pocket'\nreporting_server_verbose = true\n")
+        replace(self.file, "device_name = 'Pocket'\nreporting_server_verbose = true\n")
         # The keys are told to the sessions before a verbose line can appear.
         self.d.wait_until(lambda: self.c.call(CREATE, 2) and "creating session for reporter 2" in self.d.log(),
                           "verbose lines appear")
@@ -62,69 +43,43 @@ class PreferencesTest(DaemonTest):
         self.c.call(STOP, 1)
         self.assertEqual(self.d.stop(), 0)
         ((info,),) = self.d.rows("SELECT user_info FROM relay_sessions WHERE session_id = 1")
-        self.assertEqual(json.loads(info)["device_name"], "Pocket")
-        self.assertEqual(json.loads(info)["disable_reporting"], 0)
+        info = json.loads(info)
+        self.assertEqual((info["device_name"], info["disable_reporting"]), ("Pocket", 0))
 
 
 class SummaryTest(DaemonTest):
-    def run_session(self, d, application, reporter=3):
-        c = d.client()
-        c.started(reporter, 2, {"HostApplicationDisplayID": application})
-        c.call(SEND, {"a b": 1, "text": "ü\n\"", "nested": {"x": [1, 2.5, True]}}, 3, 1, [reporter])
-        c.call(SEND, {"a_b": 2}, 3, 1, [reporter])
-        c.call(STOP, reporter)
-        return c
-
     def test_file_and_event(self):
         d = self.daemon(config=INTERNAL)
-        self.run_session(d, "com.example.phone")
+        c = d.client()
+        message = {"a b": 1, "text": "ü\n\"", "nested": {"x": [1, 2.5, True]}}
+        c.session(3, {"HostApplicationDisplayID": "com.example.phone"}, message)
         (path,) = d.summaries()
         self.assertRegex(os.path.basename(path), r"^\d{8}-\d{6}[+-]\d{4}-sonik-com\.example\.phone-telephony\.json$")
         with open(path) as f:
-            text = f.read()
-        content = json.loads(text)
-        self.assertGreater(text.count("\n"), 10)
-        self.assertEqual(content[0], {"HostApplicationDisplayID": "com.example.phone"})
-        self.assertEqual(content[1], {"Playback_Start_1": {"a_b": 1, "text": "ü\n\"", "nested": {"x": [1, 2.5, True]}}})
-        self.assertEqual(content[2], {"Playback_Start_2": {"a_b": 2}})
-        summary = content[-1]["Undefined_Unknown_1"]
-        self.assertEqual(summary["VX_Session_Summary_Event"], "2")
-        self.assertEqual(summary["a_b"], "1,2")
+            first, second, *_, last = json.load(f)
+        self.assertEqual(first, {"HostApplicationDisplayID": "com.example.phone"})
+        message["a_b"] = message.pop("a b")
+        self.assertEqual(second, {"Playback_Start_1": message})
+        self.assertEqual(last["Undefined_Unknown_1"]["VX_Session_Summary_Event"], "2")
         self.assertEqual(os.stat(os.path.dirname(path)).st_mode & 0o777, 0o777)
         # Names that would lead elsewhere name a file of this folder all the same.
         hostile = ["../../x", "", "x" * 4096, "nul\0byte"]
         for reporter, application in enumerate(hostile, 10):
-            self.run_session(d, application, reporter)
-        found = [os.path.relpath(os.path.join(p, n), f"{d.folder}/log")
-                 for p, _, names in os.walk(f"{d.folder}/log") for n in names]
-        self.assertEqual([os.path.dirname(f) for f in found], ["Audio/Reporting"] * (len(hostile) + 1), found)
-        self.assertEqual(d.stop(), 0)
-        last = d.rows("SELECT category, type, payload FROM relay_messages WHERE id ="
-                      " (SELECT max(m.id) FROM relay_messages m JOIN relay_sessions s ON s.id = relay_session"
-                      " WHERE session_id = 3)")
-        self.assertEqual([(last[0][0], last[0][1], json.loads(last[0][2]))], [(0xFFFF, 0xFFFF, summary)])
-
-    def test_full_and_unwritable_directories(self):
-        d = self.daemon(config=INTERNAL)
-        c = self.run_session(d, "first")
-        whole = d.summaries()
-        c.started(4, 2)
-        for i in range(50):
-            c.call(SEND, {"text": "x" * 200}, 3, 1, [4])
-        # No file of the daemon may grow any more: to the writer that is a full disk.
-        resource.prlimit(d.process.pid, resource.RLIMIT_FSIZE, (4096, resource.RLIM_INFINITY))
-        self.assertIs(c.call(STOP, 4), True)
-        resource.prlimit(d.process.pid, resource.RLIMIT_FSIZE, (resource.RLIM_INFINITY, resource.RLIM_INFINITY))
-        self.assertRegex(d.log(), r"jsonOutput writeToURL: .*[Ff]ile too large")
-        self.assertEqual(d.summaries(), whole)
+            c.session(reporter, {"HostApplicationDisplayID": application})
+        found = [os.path.relpath(p, f"{d.folder}/log") for p, _, names in os.walk(f"{d.folder}/log") for _ in names]
+        self.assertEqual(found, ["Audio/Reporting"] * (len(hostile) + 1))
         shutil.rmtree(f"{d.folder}/log")
         os.symlink("/proc/self", f"{d.folder}/log")  # nobody makes a folder or a file there, root included
-        self.run_session(d, "second", reporter=5)
-        self.assertEqual(d.log().count("can't create logging directory at"), 1)
-        self.assertEqual(d.log().count("jsonOutput writeToURL:"), 2)
+        c.session(20)
+        for said in ("can't create logging directory at", "jsonOutput writeToURL:"):
+            self.assertEqual(d.log().count(said), 1)
         os.remove(f"{d.folder}/log")
-        self.run_session(d, "third", reporter=6)
+        c.session(21)
         self.assertEqual(len(d.summaries()), 1)
+        self.assertEqual(d.stop(), 0)
+        ((category, payload),) = d.rows("SELECT category, payload FROM relay_messages WHERE id = (SELECT max(m.id) FROM"
+                                        " relay_messages m JOIN relay_sessions s ON s.id = relay_session WHERE session_id = 3)")
+        self.assertEqual((category, json.loads(payload)), (0xFFFF, last["Undefined_Unknown_1"]))
 
 
 class Sensor:
@@ -145,7 +100,7 @@ class Sensor:
         return [line.decode() for line in lines]
 
     def turn(self, *words):
-        """Once the daemon has asked for the present word, which is no change, turns the device, and waits until it knows."""
+        """Turns the device, and waits until the daemon knows."""
         for word in words:
             self.process.stdin.write(f"{word}\n".encode())
         return self.answers(len(words))
@@ -177,6 +132,7 @@ class OrientationTest(DaemonTest):
     def sensor(self, refusals=0):
         sensor = Sensor(self.address, refusals)
         self.addCleanup(sensor.leave)
+        # Once the daemon has asked for the present word, which is no change.
         self.assertEqual(sensor.answers(refusals + 1), ["refused"] * refusals + ["asked"])
         return sensor
 
@@ -187,50 +143,36 @@ class OrientationTest(DaemonTest):
         with open(self.d.summaries()[-1]) as f:
             return list(json.load(f)[-1].values())[0].get(key, "").split(",")
 
-    def test_sensor_that_wakes_up_vanishes_and_comes_back(self):
-        self.start_bus()
+    def test_bus_that_comes_late_and_dies_and_sensor_that_wakes_up_and_comes_back(self):
         self.c.started(1, 7)
+        self.d.wait_until(lambda: "device orientation is off for now" in self.d.log(), "the bus is looked for")
+        bus = self.start_bus()
         sensor = self.sensor(refusals=2)
         self.assertEqual(sensor.turn("normal", "left-up"), ["told"] * 2)
         sensor.leave()
         sensor = self.sensor()
         self.assertEqual(sensor.turn("right-up"), ["told"])
-        self.assertEqual(self.words("device_orientation"), ["normal", "left-up", "undefined", "right-up"])
-
-    def test_bus_that_comes_late_and_dies_under_registered_handlers(self):
-        self.c.started(1, 7)
-        self.d.wait_until(lambda: "device orientation is off for now" in self.d.log(), "the bus is looked for")
-        bus = self.start_bus()
-        sensor = self.sensor()
-        self.assertEqual(sensor.turn("normal"), ["told"])
         bus.kill()
         bus.wait()
         self.d.wait_until(lambda: "the system bus is gone" in self.d.log(), "the loss is noticed")
         self.assert_unharmed(self.d)
         os.remove(f"{self.folder}/bus")
         self.start_bus()
-        sensor.leave()
-        sensor = self.sensor()
-        self.assertEqual(sensor.turn("left-up"), ["told"])
-        self.assertEqual(self.words("device_orientation")[-1], "left-up")
+        self.assertEqual(self.sensor().turn("bottom-up"), ["told"])
+        words = self.words("device_orientation")
+        self.assertEqual(words[:4], ["normal", "left-up", "undefined", "right-up"])
+        self.assertEqual(words[-1], "bottom-up")
         self.assertEqual(self.d.log().count("device orientation is off for now"), 1)  # nothing is said of what lasts
         self.assertEqual(self.d.stop(), 0)
 
     def test_interface_orientation_from_the_state_file(self):
         # Nobody sees when the file has been read: sessions of growing length, until one is told of the change.
-        state = f"{self.folder}/run/interface-orientation"
         for reporter in itertools.count(1):
             self.c.started(reporter, 2, {"HostApplicationDisplayID": f"{reporter:04}"})
             for word in ("portrait", "landscape-left"):
-                with open(state + ".new", "w") as f:
-                    f.write(word + "\n")
-                os.rename(state + ".new", state)
+                replace(f"{self.folder}/run/interface-orientation", word + "\n")
                 time.sleep(0.05 * reporter)
             words = self.words("ui_orientation", reporter)
             self.assertLess(reporter, 20, words)
             if words[-1] == "landscape-left":
                 break
-
-
-if __name__ == "__main__":
-    unittest.main()
