@@ -18,10 +18,9 @@ class Latch {
   bool wait() {
     const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(30);
     MutexLock lock(mutex_);
-    while (!open_) {
-      if (!changed_.waitUntil(mutex_, deadline)) return open_;
+    while (!open_ && changed_.waitUntil(mutex_, deadline)) {
     }
-    return true;
+    return open_;
   }
   bool isOpen() {
     MutexLock lock(mutex_);

@@ -6,13 +6,21 @@
 #include "platform/linux/device/LinuxOrientation.h"
 #include "platform/linux/device/OrientationHandlers.h"
 #include "tests/linux/FolderTest.h"
-#include "tests/linux/Latch.h"
 
 namespace vx::lnx {
 namespace {
 
 using OrientationTest = FolderTest;
 using Told = std::vector<std::string>;
+
+bool threadRuns(const std::string& name) {
+  for (const auto& task : std::filesystem::directory_iterator("/proc/self/task")) {
+    std::string found;
+    std::getline(std::ifstream(task.path() / "comm") >> std::ws, found);
+    if (found == name) return true;
+  }
+  return false;
+}
 
 TEST_F(OrientationTest, HandlersAreToldOfChangesAlone) {
   OrientationWords words;
@@ -95,24 +103,20 @@ TEST_F(OrientationTest, TheStateFileIsReadWheneverItIsWrittenOrRenamedOver) {
 TEST_F(OrientationTest, TheNotifierTellsFromAThreadOfItsOwn) {
   LinuxOrientation orientation({.deviceSensor = false, .interfaceStateFile = folder + "/state"});
   orientation.registerDeviceOrientationHandler("off", [](int64_t) { FAIL(); });
+  const auto end = std::chrono::steady_clock::now() + std::chrono::seconds(30);
   for (int round = 0; round < 2; ++round) {
-    struct Heard {
-      Latch once;
-      std::atomic<int64_t> value{-1};
-    };
-    const auto heard = std::make_shared<Heard>();
-    orientation.registerInterfaceOrientationHandler("id", [heard](int64_t value) {
-      heard->value = value;
-      heard->once.open();
-    });
-    for (int i = 0; !heard->once.isOpen(); ++i) {
+    const auto heard = std::make_shared<std::atomic<int64_t>>(-1);
+    orientation.registerInterfaceOrientationHandler("id", [heard](int64_t v) { *heard = v; });
+    for (int i = 0; *heard < 0 && std::chrono::steady_clock::now() < end; ++i) {
       write("new", i % 2 == 0 ? "portrait" : "landscape-left");
       std::filesystem::rename(folder + "/new", folder + "/state");
       std::this_thread::yield();
     }
-    EXPECT_THAT(orientation.orientationText(heard->value),
+    EXPECT_THAT(orientation.orientationText(*heard),
                 ::testing::AnyOf("portrait", "landscape-left"));
     orientation.unregisterInterfaceOrientationHandler("id");
+    while (threadRuns("vx-orientation") && std::chrono::steady_clock::now() < end) {
+    }
   }
 }
 

@@ -77,9 +77,24 @@ TEST(FreedMemory, GoesBackInOneStepTwoSecondsAfterAMegabyteWasFreed) {
   SystemThreading threading(p.queues.background());
   SystemClock clock;
   auto& s = p.services;
-  fakes::NoChannels none;
-  Platform real{p.listener, p.queues, clock, threading, s, s, s,     s, s,
-                p.vyr,      s,        s,     none,      s, s, p.log, s, s};
+  Platform real{p.listener,
+                p.queues,
+                clock,
+                threading,
+                s,
+                s,
+                s,
+                s,
+                s,
+                p.vyr,
+                s,
+                s,
+                fakes::FakePlatform::noChannels(),
+                s,
+                s,
+                p.log,
+                s,
+                s};
   installPlatform(&real);
   const auto throttle = VXReportingBlockThrottle::create();
   std::atomic<bool> ran{false};
