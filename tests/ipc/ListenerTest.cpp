@@ -12,31 +12,23 @@
 
 #include "platform/linux/execution/SystemThreading.h"
 #include "platform/linux/ipc/SocketListener.h"
-#include "tests/fakes/FakePlatform.h"
 #include "tests/ipc/TestInterface.h"
+#include "tests/linux/FolderTest.h"
 #include "tests/wire/SocketEnd.h"
 
 namespace vx::lnx {
 namespace {
 
-using testing::HasSubstr;
-
 // A listener that serves on a thread of its own, in a folder of its own.
-class ListenerTest : public testing::Test, public ServiceListenerDelegate {
+class ListenerTest : public FolderTest, public ServiceListenerDelegate {
  protected:
-  ListenerTest() {
-    char folder[] = "/tmp/vx-ipc-XXXXXX";
-    directory = mkdtemp(folder);
-  }
-  ~ListenerTest() override {
-    stop();
-    std::filesystem::remove_all(directory);
-  }
+  ~ListenerTest() override { stop(); }
 
   void serve() {
     machine = std::make_unique<Machine>(options);
-    const Status opened = machine->listener.open(directory + "/run");
+    const Status opened = machine->listener.open(folder + "/run");
     ASSERT_TRUE(opened.ok()) << opened.text();
+    listening_ = {};
     delegate_ = std::shared_ptr<ServiceListenerDelegate>(this, [](auto*) {});
     machine->listener.setDelegate(delegate_);
     machine->listener.setHooks({.congested =
@@ -59,7 +51,7 @@ class ListenerTest : public testing::Test, public ServiceListenerDelegate {
     if (machine) machine->executor.stop(Monotonic::max());
     machine.reset();
   }
-  std::string path() const { return directory + "/run/service.socket"; }
+  std::string path() const { return folder + "/run/service.socket"; }
   std::unique_ptr<SocketEnd> dial() {
     UniqueFd socket(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
     sockaddr_un address{};
@@ -67,7 +59,7 @@ class ListenerTest : public testing::Test, public ServiceListenerDelegate {
     std::strncpy(address.sun_path, path().c_str(), sizeof address.sun_path - 1);
     EXPECT_EQ(::connect(socket.get(), reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
     auto client = std::make_unique<SocketEnd>(std::move(socket));
-    (void)client->writeSome(clientHello());  // one that is turned away may be gone already
+    (void)client->writeSome(frame(0, 1));  // one that is turned away may be gone already
     return client;
   }
   // What the service says next; empty at the end of the stream.
@@ -83,7 +75,7 @@ class ListenerTest : public testing::Test, public ServiceListenerDelegate {
   std::string greeting() { return next(*clients.emplace_back(dial())); }
   // The oldest client says goodbye and is gone.
   void leave() {
-    clients.front()->write(goodbyeFrame());
+    clients.front()->write(frame(4));
     EXPECT_EQ(next(*clients.front()), "");
     clients.pop_front();
   }
@@ -104,8 +96,6 @@ class ListenerTest : public testing::Test, public ServiceListenerDelegate {
     EventLoop loop{executor, clock};
     SocketListener listener;
   };
-  fakes::FakePlatform platform;
-  std::string directory;
   ListenerOptions options;
   std::atomic<bool> congested{false};
   std::atomic<bool> askedInVain{false};
@@ -124,63 +114,49 @@ const std::string kWelcome = "0 1 {inter";
 const std::string kTooMany = "3 null 6";
 
 TEST_F(ListenerTest, AnybodyMayConnectAndNothingIsLeftBehind) {
-  std::filesystem::create_directory(directory + "/run");
-  std::ofstream(path()) << "left behind";
+  write("run/service.socket", "left behind");
   const mode_t mask = umask(077);
   serve();
   umask(mask);
   struct stat info {};
   ASSERT_EQ(stat(path().c_str(), &info), 0);
   EXPECT_EQ(info.st_mode, S_IFSOCK | 0666U);
-  EXPECT_EQ(greeting(), kWelcome);
+  Machine second(options);
+  const std::string refusals[][2] = {
+      {"/run", "another vxreportingd (pid " + std::to_string(getpid()) + ") serves "},
+      {"/none/run", "No such file or directory (set RUNTIME_DIRECTORY"},
+      {"/" + std::string(100, 'x'), "longer than the 107 bytes"}};
+  for (const auto& [place, why] : refusals)
+    EXPECT_THAT(second.listener.open(folder + place).text(), HasSubstr(why));
+  second.executor.stop(Monotonic::max());
+  EXPECT_EQ(greeting(), kWelcome) << "the first one serves on";
   stop();
   EXPECT_EQ(next(*clients[0]), "4");
   EXPECT_EQ(next(*clients[0]), "");
   EXPECT_FALSE(std::filesystem::exists(path()));
 }
 
-TEST_F(ListenerTest, WhatKeepsItFromOpeningIsSaid) {
-  serve();
-  Machine second(options);
-  EXPECT_THAT(second.listener.open(directory + "/run").text(),
-              HasSubstr("another vxreportingd (pid " + std::to_string(getpid()) + ") serves "));
-  EXPECT_EQ(greeting(), kWelcome) << "the first one serves on";
-  EXPECT_THAT(second.listener.open(directory + "/none/run").text(),
-              HasSubstr("No such file or directory (set RUNTIME_DIRECTORY"));
-  const std::string deep = directory + "/" + std::string(100, 'x');
-  EXPECT_THAT(second.listener.open(deep).text(), HasSubstr("longer than the 107 bytes"));
-  second.executor.stop(Monotonic::max());
-}
-
-TEST_F(ListenerTest, ConnectionsOfOneUserAreLimited) {
-  options.maxConnectionsPerUser = 2;
-  serve();
-  for (int round = 0; round < 3; ++round) {
-    while (clients.size() < 2) EXPECT_EQ(greeting(), kWelcome);
-    EXPECT_EQ(greeting(), kTooMany);
-    EXPECT_EQ(next(*clients.back()), "");
+TEST_F(ListenerTest, ConnectionsAreLimitedPerUserAndInAll) {
+  for (uint32_t ListenerOptions::*limit :
+       {&ListenerOptions::maxConnectionsPerUser, &ListenerOptions::maxConnections}) {
+    options = {};
+    options.*limit = 2;
+    serve();
+    for (int round = 0; round < 3; ++round) {
+      while (clients.size() < 2) EXPECT_EQ(greeting(), kWelcome);
+      EXPECT_EQ(greeting(), kTooMany);
+      EXPECT_EQ(next(*clients.back()), "");
+      clients.pop_back();
+      leave();
+    }
+    refusing = true;
+    EXPECT_EQ(greeting(), "") << "turned down by the delegate";
+    refusing = false;
     clients.pop_back();
-    leave();
+    EXPECT_EQ(greeting(), kWelcome) << "its place is free";
+    stop();
+    clients.clear();
   }
-  EXPECT_EQ(greeting(), kWelcome);
-  refusing = true;
-  clients.pop_back();
-  leave();
-  EXPECT_EQ(next(*dial()), "") << "turned down by the delegate";
-  refusing = false;
-  EXPECT_EQ(greeting(), kWelcome) << "its place is free";
-  stop();
-  EXPECT_EQ(machine, nullptr);
-}
-
-TEST_F(ListenerTest, ConnectionsInAllAreLimited) {
-  options.maxConnections = 1;
-  serve();
-  EXPECT_EQ(greeting(), kWelcome);
-  EXPECT_EQ(greeting(), kTooMany);
-  clients.pop_back();
-  leave();
-  EXPECT_EQ(greeting(), kWelcome);
 }
 
 TEST_F(ListenerTest, AClientThatReadsNothingIsCut) {
@@ -190,34 +166,29 @@ TEST_F(ListenerTest, AClientThatReadsNothingIsCut) {
   serve();
   EXPECT_EQ(greeting(), kWelcome);
   EXPECT_EQ(greeting(), kWelcome);
-  clients[0]->write(callFrame(1, kList, 0, [](CborWriter&) {}));
+  clients[0]->write(frame(1, 1, kList));
   pollfd hungUp{clients[0]->fd(), 0, 0};
   EXPECT_EQ(poll(&hungUp, 1, 20000), 1);
-  clients[1]->write(callFrame(1, kEcho, 1));
+  clients[1]->write(frame(1, 1, kEcho, 1));
   EXPECT_EQ(next(*clients[1]), "2 1 1") << "the other one notices nothing";
 }
 
-TEST_F(ListenerTest, ReadingGoesOnWhenTheCongestionEnds) {
+TEST_F(ListenerTest, ReadingGoesOnWhenTheCongestionEndsOrTheServiceStops) {
   serve();
-  congested = true;
-  clients.push_back(dial());
-  askedInVain.wait(false);
-  congested = false;
-  machine->listener.congestionEnded();
-  EXPECT_EQ(next(*clients[0]), kWelcome);
-}
-
-TEST_F(ListenerTest, StoppingRunsWhatWasSentBefore) {
-  serve();
-  EXPECT_EQ(greeting(), kWelcome);
-  congested = true;  // so that it lies there when the stop comes
-  clients[0]->write(callFrame(1, kEcho, 1) + callFrame(2, kHold, 2));
-  askedInVain.wait(false);
-  machine->loop.stop();
-  congested = false;
-  machine->listener.congestionEnded();
-  stop();
-  EXPECT_EQ(next(*clients[0]), "2 1 1");
+  for (const bool stopping : {false, true}) {
+    congested = true;
+    askedInVain = false;
+    if (stopping)
+      clients[0]->write(frame(1, 1, kEcho, 1) + frame(1, 2, kHold, 2));
+    else
+      clients.push_back(dial());
+    askedInVain.wait(false);
+    if (stopping) machine->loop.stop();
+    congested = false;
+    machine->listener.congestionEnded();
+    if (stopping) stop();
+    EXPECT_EQ(next(*clients[0]), stopping ? "2 1 1" : kWelcome);
+  }
   object->kept.clear();
 }
 

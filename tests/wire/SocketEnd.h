@@ -9,29 +9,52 @@
 
 #include <cstdint>
 #include <string>
+#include <string_view>
+#include <type_traits>
 #include <utility>
 #include <vector>
 
 #include "base/UniqueFd.h"
+#include "propertylist/CborWriter.h"
 #include "propertylist/Payload.h"
 #include "wire/FrameReader.h"
-#include "wire/FrameWriter.h"
 
 namespace vx {
 
 using Bytes = std::vector<uint8_t>;
-using wire::FrameKind;
-using wire::FrameWriter;
-
 inline Bytes operator+(Bytes a, const Bytes& b) {
   a.insert(a.end(), b.begin(), b.end());
   return a;
 }
 
-inline Bytes goodbyeFrame() {
-  Bytes out;
-  FrameWriter::goodbye(out);
-  return out;
+inline Bytes framed(const Bytes& body) {
+  Bytes length;
+  for (std::size_t i = 0; i < wire::kLengthBytes; ++i)
+    length.push_back(static_cast<uint8_t>(body.size() >> (8 * i)));
+  return length + body;
+}
+
+// A frame of booleans, integers, nullptr, texts, and Bytes that are one encoded item.
+template <class... Items>
+Bytes frame(const Items&... items) {
+  Bytes body;
+  CborWriter w(body);
+  const auto put = [&w](const auto& item) {
+    using Item = std::decay_t<decltype(item)>;
+    if constexpr (std::is_same_v<Item, bool>)
+      w.boolean(item);
+    else if constexpr (std::is_integral_v<Item> || std::is_enum_v<Item>)
+      w.integer(static_cast<int64_t>(item));
+    else if constexpr (std::is_null_pointer_v<Item>)
+      w.null();
+    else if constexpr (std::is_convertible_v<const Item&, std::string_view>)
+      w.string(item);
+    else
+      w.encoded(item);
+  };
+  w.array(sizeof...(items));
+  (put(items), ...);
+  return framed(body);
 }
 
 class SocketEnd {
@@ -77,7 +100,7 @@ class SocketEnd {
     std::vector<std::string> all;
     for (const Bytes& body : frames()) {
       const Frame frame = Frame::decode(body).value();
-      const bool error = frame[0].asInt64() == static_cast<int64_t>(FrameKind::Error);
+      const bool error = frame[0].asInt64() == static_cast<int64_t>(wire::FrameKind::Error);
       std::string& text = all.emplace_back();
       for (std::size_t i = 0; i < frame.size() - (error ? 1 : 0); ++i)
         text +=
