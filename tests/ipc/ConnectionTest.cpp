@@ -1,21 +1,12 @@
-#include <gmock/gmock.h>
-#include <sys/socket.h>
-
-#include <memory>
 #include <thread>
 #include <utility>
 
-#include "platform/linux/execution/SystemThreading.h"
 #include "platform/linux/ipc/SocketConnection.h"
-#include "tests/fakes/FakePlatform.h"
-#include "tests/ipc/TestInterface.h"
-#include "tests/wire/SocketEnd.h"
+#include "tests/ipc/IpcTest.h"
 
 namespace vx::lnx {
 namespace {
 
-using testing::ElementsAre;
-using testing::IsEmpty;
 using testing::SizeIs;
 
 const std::string kTestHello =
@@ -24,10 +15,9 @@ const std::string kTestHello =
 
 // One connection on a real loop, with a host of which the test is the other half. Time is the
 // test's.
-class ConnectionTest : public testing::Test, public ConnectionHost {
+class ConnectionTest : public IpcTest, public ConnectionHost {
  protected:
   ConnectionTest() {
-    executor_.adoptInteractiveThread();
     loop_.addPassEndHook([this] {
       for (const auto& c : std::exchange(toFlush_, {})) c->flush();
     });
@@ -38,7 +28,6 @@ class ConnectionTest : public testing::Test, public ConnectionHost {
     peer.close();
     run();
     connection.reset();
-    executor_.stop(Monotonic::max());
   }
 
   void accept() {
@@ -54,10 +43,6 @@ class ConnectionTest : public testing::Test, public ConnectionHost {
   void connect() {
     accept();
     ASSERT_THAT(ask(frame(0, 1)), SizeIs(1));
-  }
-  void pass() { loop_.runOnce(Monotonic{}); }
-  void run() {
-    for (int i = 0; i < 12; ++i) pass();
   }
   void send(const Bytes& bytes) {
     peer.write(bytes);
@@ -84,7 +69,7 @@ class ConnectionTest : public testing::Test, public ConnectionHost {
   // ConnectionHost
   EventLoop& loop() override { return loop_; }
   Executor& executor() override { return executor_; }
-  Clock& clock() override { return platform.clock; }
+  Clock& clock() override { return p.clock; }
   const ListenerOptions& limits() const override { return options; }
   ListenerCounters& counters() override { return counted; }
   wire::ReadBuffers& readBuffers() override { return buffers_; }
@@ -96,22 +81,15 @@ class ConnectionTest : public testing::Test, public ConnectionHost {
   void unreadChanged(SocketConnection&, bool unread) override { unreadSays = unread; }
   void closed(SocketConnection&) override { ++closes; }
 
-  fakes::FakePlatform platform;
-  ListenerOptions options;
   ListenerCounters counted;
-  bool congested = false;
   bool unreadSays = false;
   int waits = 0;
   int closes = 0;
   SocketEnd peer;
-  std::shared_ptr<TestObject> object = std::make_shared<TestObject>();
   std::shared_ptr<SocketConnection> connection;
   std::vector<std::string> events;
 
  private:
-  SystemClock steady_;
-  Executor executor_;
-  EventLoop loop_{executor_, steady_};
   wire::ReadBuffers buffers_;
   std::vector<std::shared_ptr<SocketConnection>> toFlush_;
 };
@@ -263,8 +241,8 @@ TEST_F(ConnectionTest, APeerThatReadsNothingMoreIsCut) {
   object->list.assign(1000000, 1);
   EXPECT_EQ(connection->stallDeadline(), std::nullopt);
   send(calls(kList, 1, 1));
-  const Monotonic start = platform.clock.monotonic();
-  platform.clock.advance(seconds(3));
+  const Monotonic start = p.clock.monotonic();
+  p.clock.advance(seconds(3));
   run();
   EXPECT_EQ(connection->stallDeadline(), start + seconds(10));
   while (peer.readSome(10000) > 0 && connection->stallDeadline() < start + seconds(13)) pass();
@@ -414,7 +392,7 @@ TEST_F(ConnectionTest, ShutDownWaitsForAnswersUntilTimeRunsOut) {
   run();
   EXPECT_THAT(events, IsEmpty());
   answer(0);
-  while (events.empty()) loop().runOnce(SystemClock().monotonic() + std::chrono::milliseconds(5));
+  runUntil([&] { return !events.empty(); });
   run();
   EXPECT_THAT(answers(), ElementsAre("2 1 1", "2 2 1", "4"));
 

@@ -1,7 +1,6 @@
-// An exported object whose calls the test sees and answers as it likes.
+// An exported object whose calls the test sees and answers as it likes, and a loop that runs when
+// the test says so.
 #pragma once
-
-#include <gtest/gtest.h>
 
 #include <array>
 #include <string>
@@ -9,19 +8,15 @@
 
 #include "platform/ClientConnection.h"
 #include "platform/WorkQueue.h"
+#include "platform/linux/execution/EventLoop.h"
+#include "platform/linux/execution/SystemThreading.h"
+#include "platform/linux/ipc/ListenerOptions.h"
+#include "tests/linux/FolderTest.h"
+#include "tests/wire/SocketEnd.h"
 
 namespace vx::lnx {
 
-enum TestOperation : uint8_t {
-  kEcho = 1,
-  kKeep,
-  kHold,
-  kAcquire,
-  kRelease,
-  kList,
-  kTake,
-  kMessage
-};
+enum : uint8_t { kEcho = 1, kKeep, kHold, kAcquire, kRelease, kList, kTake, kMessage };
 
 struct TestObject final : ExportedObject {
   std::vector<std::string> calls;    // operation and arguments
@@ -49,12 +44,12 @@ struct TestObject final : ExportedObject {
     test.answer(std::move(reply), test.list);
   }
   static void runTake(ExportedObject& object, CallArguments& arguments, Reply reply) {
-    std::string& text = note(object, "take " + std::to_string(arguments.uint16(0)) + " " +
-                                         std::to_string(arguments.uint32(1)))
-                            .calls.back();
+    std::string text =
+        "take " + std::to_string(arguments.uint16(0)) + " " + std::to_string(arguments.uint32(1));
     if (const auto dictionary = arguments.optionalDictionary(2)) text += " " + dictionary->text();
     if (const auto numbers = arguments.optionalInt64Array(3))
       text += " " + testing::PrintToString(*numbers);
+    note(object, text);
     reply(std::monostate());
   }
   static void runMessage(ExportedObject&, CallArguments& arguments, Reply reply) {
@@ -82,5 +77,26 @@ inline const InterfaceDescription& testInterface() {
   static constexpr InterfaceDescription kInterface{.name = "Test", .operations = kOperations};
   return kInterface;
 }
+
+class IpcTest : public FolderTest {
+ protected:
+  IpcTest() { executor_.adoptInteractiveThread(); }
+  ~IpcTest() override { executor_.stop(Monotonic::max()); }
+  void pass() { loop_.runOnce(Monotonic{}); }
+  void run() {
+    for (int i = 0; i < 12; ++i) pass();
+  }
+  template <class Condition>
+  void runUntil(const Condition& met) {
+    while (!met()) loop_.runOnce(clock_.monotonic() + std::chrono::milliseconds(5));
+  }
+
+  SystemClock clock_;
+  Executor executor_;
+  EventLoop loop_{executor_, clock_};
+  ListenerOptions options;
+  bool congested = false;
+  std::shared_ptr<TestObject> object = std::make_shared<TestObject>();
+};
 
 }  // namespace vx::lnx

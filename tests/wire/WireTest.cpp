@@ -1,7 +1,9 @@
 #include <algorithm>
 
+#include "Statistics/Service/VXReportingServiceProtocol.h"
 #include "tests/wire/SocketEnd.h"
 #include "wire/FrameReader.h"
+#include "wire/Operations.h"
 
 namespace vx::wire {
 namespace {
@@ -72,6 +74,14 @@ TEST(FrameReader, ALengthAboveTheLimitIsRefusedBeforeTheBodyComes) {
   EXPECT_TRUE(reader.hasNext());
   EXPECT_EQ(reader.next(body), Next::TooLarge);
   EXPECT_EQ(reader.nextLength(), (1U << 24) + 101);
+}
+
+// Neither side sees the other: the service describes its operations, clients know their numbers.
+TEST(Operations, ClientsAndServiceMeanTheSameNumbers) {
+  const auto& described = vxReportingServiceInterface().operations;
+  ASSERT_EQ(described.size(), kOperationNames.size());
+  for (std::size_t i = 0; i < described.size(); ++i)
+    EXPECT_EQ(described[i].name, kOperationNames[i]) << "operation " << i + 1;
 }
 
 }  // namespace
