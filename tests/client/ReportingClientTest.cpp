@@ -59,21 +59,6 @@ class ReportingClientTest : public testing::Test {
   std::vector<std::string> outcomes;
 };
 
-TEST_F(ReportingClientTest, WritesTheFramesOfTheProtocol) {
-  connect();
-  EXPECT_TRUE(client->sendMessageAsync(message, kCategory, 1).ok());
-  EXPECT_TRUE(client->setServiceTypeAsync(7, 42, nullptr).ok());
-  EXPECT_THAT(service.frames(), IsEmpty()) << "calls are gathered, not written one by one";
-  EXPECT_TRUE(client->wantsWrite());
-  EXPECT_TRUE(client->process().ok());
-  EXPECT_THAT(service.frames(),
-              ElementsAre(Bytes{0x87, 0x01, 0x01, 0x06, 0xa2, 0x64, 'g',  'a',  'i',  'n',
-                                0xfb, 0x3f, 0xe0, 0,    0,    0,    0,    0,    0,    0x62,
-                                'o',  'n',  0xf5, 0x1a, 0x08, 0x00, 0x00, 0x05, 0x01, 0xf6},
-                          Bytes{0x85, 0x01, 0x02, 0x02, 0x07, 0x18, 0x2a}));
-  EXPECT_FALSE(client->wantsWrite());
-}
-
 TEST_F(ReportingClientTest, AnswersInAnyOrderReachTheirOwnCalls) {
   connect();
   create(1, 200);
@@ -183,10 +168,12 @@ TEST_F(ReportingClientTest, CallsUpToTheLimits) {
     const ClientStatus taken = client->sendMessageAsync(message, kCategory, 1);
     EXPECT_EQ(taken.code, limit < bytes ? Code::TooLarge : Code::Ok) << limit;
     EXPECT_TRUE(create(1).ok());
+    EXPECT_THAT(service.texts(), IsEmpty()) << "calls are gathered, not written one by one";
     EXPECT_EQ(create(2).code, limit < bytes ? Code::Ok : Code::BufferFull);
     EXPECT_EQ(create(3).code, Code::BufferFull);
     EXPECT_EQ(client->pendingCalls(), 2U);
     EXPECT_TRUE(client->flush().ok());
+    EXPECT_FALSE(client->wantsWrite());
     EXPECT_THAT(service.texts(), testing::SizeIs(2)) << "what was refused left no bytes";
   }
   EXPECT_THAT(receive(framed(Bytes(bytes + 2, 0x80))).text,
@@ -357,13 +344,11 @@ TEST_F(ReportingClientTest, ACallbackMayCallAndReadOn) {
 
 TEST_F(ReportingClientTest, ConnectingSaysWhereAndWhatToDo) {
   ReportingClient lone;
-  const ClientStatus missing = lone.connect("/nonexistent/service.socket");
-  EXPECT_EQ(missing.code, Code::NotConnected);
-  EXPECT_THAT(missing.text, HasSubstr("/nonexistent/service.socket"));
-  EXPECT_THAT(missing.text, HasSubstr("vxreportingd"));
   EXPECT_EQ(lone.connect(std::string(108, 'x')).code, Code::NotConnected);
   setenv("VXREPORTING_SOCKET", "/nonexistent/named.socket", 1);
-  EXPECT_THAT(lone.connect().text, HasSubstr("/nonexistent/named.socket"));
+  const ClientStatus missing = lone.connect();
+  EXPECT_EQ(missing.code, Code::NotConnected);
+  EXPECT_THAT(missing.text, testing::MatchesRegex(".*/nonexistent/named.socket.*vxreportingd.*"));
   unsetenv("VXREPORTING_SOCKET");
 }
 

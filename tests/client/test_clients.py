@@ -7,7 +7,8 @@ import sys
 from harness import DaemonTest
 
 VXREPORT = os.environ["VXREPORT"]
-PAGE = os.path.join(os.path.dirname(__file__), "../../docs/protocol.md")
+with open(os.path.join(os.path.dirname(__file__), "../../docs/protocol.md")) as f:
+    PAGE = f.read()
 
 
 def run(daemon, *command, stdin=""):
@@ -18,22 +19,19 @@ def run(daemon, *command, stdin=""):
 class ClientsTest(DaemonTest):
     def test_the_client_of_the_protocol_page_works_as_printed(self):
         daemon = self.daemon()
-        with open(PAGE) as f:
-            program = re.search(r"```python\n(.*?)```", f.read(), re.S).group(1)
+        program = re.search(r"```python\n(.*?)```", PAGE, re.S).group(1)
         ended = run(daemon, sys.executable, "-c", program)
         self.assertEqual((ended.stdout.split(), ended.stderr), (["True", "True", "None", "True", "True"], ""))
 
     def test_the_frames_printed_on_the_protocol_page_are_answered_as_printed(self):
-        with open(PAGE) as f:
-            page = f.read()
         frames = {text: bytes.fromhex(code) for code, text in
-                  re.findall(r"^ {4}((?:[0-9a-f]{2} +)+)(\[.*\])$", page, re.M)}
+                  re.findall(r"^ {4}((?:[0-9a-f]{2} +)+)(\[.*\])$", PAGE, re.M)}
         client = self.daemon().client()
         client.raw(frames["[1, 3, 2, 7, 42]"] + frames['[1, 4, 1, "x"]'] + frames["[4]"])
         client.until_closed()
         self.assertEqual(client.answers[3], [[2, 3, True]])
         self.assertEqual(client.answers[4][0][:3], [3, 4, 4])
-        self.assertIn(client.answers[4][0][3][:44], page)
+        self.assertIn(client.answers[4][0][3][:44], PAGE)
 
     def test_a_script_of_vxreport_holds_one_connection(self):
         daemon = self.daemon()

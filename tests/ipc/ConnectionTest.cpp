@@ -144,6 +144,7 @@ TEST_F(ConnectionTest, FramesUpToTheLimit) {
 }
 
 TEST_F(ConnectionTest, WrongCallsAreAnsweredAndDoNothing) {
+  options.maxSessionsPerConnection = 2;
   connect();
   const Bytes entry{0xa1, 0x61, 'a', 1};
   const Bytes empty{0xa0};
@@ -160,23 +161,21 @@ TEST_F(ConnectionTest, WrongCallsAreAnsweredAndDoNothing) {
       {frame(1, 1, kMessage + 1, 0), "3 1 3"},
       {frame(1, 1, kMessage, nullptr), "3 1 4"},
       {frame(1, 1, kMessage, entry), "2 1 {a=1}"},
+      {frame(1, 1, kAcquire, 1), "2 1 1"},
+      {frame(1, 1, kAcquire, 2), "2 1 1"},
+      {frame(1, 1, kAcquire, 2), "2 1 1"},
+      {frame(1, 1, kAcquire, 3), "3 1 5"},
+      {frame(1, 1, kRelease, 1), "2 1 1"},
+      {frame(1, 1, kAcquire, 3), "2 1 1"},
       {frame(1, -2, kEcho, 1), "3 null 1"}};
   for (const auto& [sent, answer] : cases)
     EXPECT_THAT(ask(sent), ElementsAre(answer)) << testing::PrintToString(sent);
-  EXPECT_THAT(object->calls, ElementsAre("take 65535 4294967295 {a=1} { 1, -1 }"));
+  EXPECT_THAT(object->calls, ElementsAre("take 65535 4294967295 {a=1} { 1, -1 }", "echo 1",
+                                         "echo 2", "echo 2", "echo 1", "echo 3"));
   EXPECT_EQ(counted.wrongArguments, 8U);
   EXPECT_EQ(counted.unknownOperations, 2U);
-  EXPECT_EQ(counted.calls, 13U);
-}
-
-TEST_F(ConnectionTest, ResourcesOfOnePeerAreLimited) {
-  options.maxSessionsPerConnection = 2;
-  connect();
-  Bytes sent;
-  for (const int id : {1, 2, 2, 3}) sent = sent + frame(1, 1, kAcquire, id);
-  EXPECT_THAT(ask(sent + frame(1, 1, kRelease, 1) + frame(1, 1, kAcquire, 3)),
-              ElementsAre("2 1 1", "2 1 1", "2 1 1", "3 1 5", "2 1 1", "2 1 1"));
   EXPECT_EQ(counted.tooManySessions, 1U);
+  EXPECT_EQ(counted.calls, 19U);
 }
 
 TEST_F(ConnectionTest, ReadsNoMoreWhileTooManyCallsAreUnanswered) {
@@ -296,17 +295,21 @@ TEST_F(ConnectionTest, CongestionHoldsFramesBack) {
 
 TEST_F(ConnectionTest, AGoodbyeLetsCallsEndFirst) {
   connect();
-  call(1, kHold);
-  call(2, kKeep);
-  EXPECT_THAT(ask(calls(kEcho, 3, 3) + frame(4) + calls(kEcho, 4, 4)), ElementsAre("2 3 1"));
+  send(calls(kHold, 1, 2) + calls(kKeep, 3, 4));
+  EXPECT_THAT(ask(calls(kEcho, 5, 5) + frame(4) + calls(kEcho, 6, 6)), ElementsAre("2 5 1"));
+  EXPECT_THAT(object->calls, SizeIs(5));
   EXPECT_THAT(events, ElementsAre("invalidated"));
-  EXPECT_FALSE(peer.ended());
   EXPECT_EQ(connection->exportedObject(), nullptr);
-  answer(1);
-  EXPECT_THAT(answers(), ElementsAre("2 2 1"));
+  answer(2);
+  EXPECT_THAT(answers(), ElementsAre("2 3 1"));
+  object->kept.erase(object->kept.begin());
+  run();
+  EXPECT_FALSE(peer.ended());
+  object->kept.pop_back();
+  EXPECT_THAT(ask({}), IsEmpty()) << "no error after the goodbye";
   EXPECT_TRUE(peer.ended()) << "held answers are not waited for";
   EXPECT_EQ(closes, 1);
-  EXPECT_THAT(object->calls, SizeIs(3));
+  EXPECT_EQ(counted.abandonedCalls, 0U);
 }
 
 TEST_F(ConnectionTest, AnAbruptEndIsAnInterruptionAfterTheLastWholeFrame) {
@@ -324,25 +327,8 @@ TEST_F(ConnectionTest, AnAbruptEndIsAnInterruptionAfterTheLastWholeFrame) {
   EXPECT_EQ(counted.abandonedCalls, 0U);
 }
 
-TEST_F(ConnectionTest, ACallLetGoIsAnsweredWithAnError) {
-  options.maxCallsInFlight = 1;
-  connect();
-  send(calls(kKeep, 1, 1) + calls(kEcho, 2, 2));
-  object->kept.clear();
-  run();
-  EXPECT_THAT(answers(), ElementsAre("3 1 8", "2 2 1"));
-  options.maxCallsInFlight = 2;
-  send(calls(kHold, 3, 3) + calls(kKeep, 4, 4) + frame(4));
-  for (const bool last : {false, true}) {
-    object->kept.erase(object->kept.begin());
-    run();
-    EXPECT_THAT(answers(), IsEmpty()) << "not after the goodbye";
-    EXPECT_EQ(peer.ended(), last);
-  }
-  EXPECT_EQ(counted.abandonedCalls, 1U);
-}
-
-TEST_F(ConnectionTest, RepliesComeFromAnyThreadAndOnce) {
+TEST_F(ConnectionTest, EveryCallIsAnsweredOnceFromAnyThread) {
+  options.maxCallsInFlight = 3;
   connect();
   send(calls(kKeep, 1, 3));
   object->kept[2](true);
@@ -356,6 +342,7 @@ TEST_F(ConnectionTest, RepliesComeFromAnyThreadAndOnce) {
   EXPECT_EQ(counted.secondReplies, 1U);
   EXPECT_EQ(counted.abandonedCalls, 1U);
   send(calls(kKeep, 4, 6));  // these take places that were left
+  ASSERT_THAT(object->kept, SizeIs(3));
   object->kept[1](uint16_t{9});
   object->kept[0](Error{"d", -2, "why"});
   run();
