@@ -1,3 +1,4 @@
+#include <poll.h>
 #include <sys/stat.h>
 #include <sys/un.h>
 

@@ -1,10 +1,8 @@
 // One end of a socket, worked by a test: writes bytes, and shows the frames that have come.
-// Confined to the test's thread; never blocks unless said.
+// Confined to the test's thread; never blocks.
 #pragma once
 
-#include <fcntl.h>
 #include <gtest/gtest.h>
-#include <poll.h>
 #include <sys/socket.h>
 
 #include <cstdint>
@@ -71,10 +69,8 @@ class SocketEnd {
     return UniqueFd(ends[1]);
   }
   void write(const Bytes& bytes) {
-    ASSERT_EQ(writeSome(bytes), static_cast<ssize_t>(bytes.size()));
-  }
-  ssize_t writeSome(const Bytes& bytes) {
-    return send(socket_.get(), bytes.data(), bytes.size(), MSG_NOSIGNAL | MSG_DONTWAIT);
+    ASSERT_EQ(send(fd(), bytes.data(), bytes.size(), MSG_NOSIGNAL | MSG_DONTWAIT),
+              static_cast<ssize_t>(bytes.size()));
   }
   // At most so many bytes of what has arrived. Returns how many.
   std::size_t readSome(std::size_t most) {
@@ -85,33 +81,15 @@ class SocketEnd {
     if (got > 0) reader_.received(static_cast<std::size_t>(got));
     return got > 0 ? static_cast<std::size_t>(got) : 0;
   }
-  // The bodies of all frames that have arrived whole, and not been given before.
-  std::vector<Bytes> frames() {
-    std::vector<Bytes> bodies;
-    do {
-      std::span<const uint8_t> body;
-      while (reader_.next(body) == wire::FrameReader::Next::Frame)
-        bodies.emplace_back(body.begin(), body.end());
-    } while (readSome(SIZE_MAX) > 0);
-    return bodies;
-  }
-  // The same as text: "2 5 1" for the reply true to call 5; errors without their sentence.
+  // The frames that have arrived whole and not been given before: "2 5 1" for the reply true to
+  // call 5; errors without their sentence.
   std::vector<std::string> texts() {
     std::vector<std::string> all;
-    for (const Bytes& body : frames()) {
-      const Frame frame = Frame::decode(body).value();
-      const bool error = frame[0].asInt64() == static_cast<int64_t>(wire::FrameKind::Error);
-      std::string& text = all.emplace_back();
-      for (std::size_t i = 0; i < frame.size() - (error ? 1 : 0); ++i)
-        text +=
-            (i == 0 ? "" : " ") + (frame[i].kind() == ValueKind::Null ? "null" : frame[i].text());
-    }
+    std::span<const uint8_t> body;
+    do {
+      while (reader_.next(body) == wire::FrameReader::Next::Frame) all.push_back(textOf(body));
+    } while (readSome(SIZE_MAX) > 0);
     return all;
-  }
-  // Waits for bytes, or the end.
-  void await() {
-    pollfd ready{socket_.get(), POLLIN, 0};
-    ASSERT_EQ(poll(&ready, 1, 20000), 1) << "nothing came";
   }
   bool holdsHalfAFrame() const { return reader_.unread() != 0; }
   bool ended() const { return ended_; }  // seen by a read
@@ -123,6 +101,15 @@ class SocketEnd {
   }
 
  private:
+  static std::string textOf(std::span<const uint8_t> body) {
+    const Frame frame = Frame::decode(body).value();
+    const std::size_t size = frame.size() - (frame[0].text() == "3" ? 1 : 0);
+    std::string text;
+    for (std::size_t i = 0; i < size; ++i)
+      text += (i == 0 ? "" : " ") + (frame[i].kind() == ValueKind::Null ? "null" : frame[i].text());
+    return text;
+  }
+
   UniqueFd socket_;
   wire::ReadBuffers buffers_;
   wire::FrameReader reader_{buffers_};
