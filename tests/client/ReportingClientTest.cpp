@@ -181,9 +181,9 @@ TEST_F(ReportingClientTest, CallsUpToTheLimits) {
 }
 
 TEST_F(ReportingClientTest, AServiceThatGreetsOtherwiseIsNotConnected) {
-  const std::pair<Bytes, const char*> greetings[] = {{hello(2), ""},
-                                                     {yes(1), ""},
-                                                     {frame(4) + yes(1), ""},
+  const std::pair<Bytes, const char*> greetings[] = {{hello(2), "the service sent"},
+                                                     {yes(1), "the service sent"},
+                                                     {frame(4) + yes(1), "the service sent"},
                                                      {frame(3, nullptr, 6, "full"), "full"}};
   ReportingClient lone;
   for (const auto& [greeting, reason] : greetings) {
