@@ -23,7 +23,7 @@ uint32_t& EventPairing::slotOf(const StoreRecords& batch, const void* identity) 
 }
 
 void EventPairing::pair(StoreRecords& batch) {
-  thread_.assertIsCurrent();
+  thread_.assertHere();
   std::size_t messages = 0;
   for (std::size_t i = 0; i < batch.size(); ++i)
     messages += std::holds_alternative<RelayMessageRecord>(batch[i].what) ? 1 : 0;
@@ -48,7 +48,7 @@ void EventPairing::pair(StoreRecords& batch) {
 }
 
 void EventPairing::hold(StoreRecords& batch, double youngerThan, Monotonic now) {
-  thread_.assertIsCurrent();
+  thread_.assertHere();
   for (std::size_t i = 0; i < batch.size(); ++i) {
     StoreRecord& record = batch[i];
     const auto* event = std::get_if<AnalyticsRecord>(&record.what);
@@ -62,12 +62,13 @@ void EventPairing::hold(StoreRecords& batch, double youngerThan, Monotonic now) 
 }
 
 void EventPairing::join(StoreRecords& batch) {
-  thread_.assertIsCurrent();
+  thread_.assertHere();
   for (StoreRecord& event : held_) batch.push_back(std::move(event));
   held_.clear();
 }
 
 std::optional<Monotonic> EventPairing::heldSince() const {
+  thread_.assertHere();
   return held_.empty() ? std::nullopt : std::optional<Monotonic>(heldSince_);
 }
 

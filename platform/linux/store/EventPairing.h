@@ -7,8 +7,8 @@
 #include <vector>
 
 #include "base/Clock.h"
+#include "base/ThreadChecker.h"
 #include "platform/linux/store/StoreRecord.h"
-#include "platform/linux/store/ThreadConfinement.h"
 
 namespace vx::lnx {
 
@@ -41,7 +41,7 @@ class EventPairing {
  private:
   uint32_t& slotOf(const StoreRecords& batch, const void* identity);
 
-  ThreadConfinement thread_;
+  ThreadChecker thread_;
   std::vector<uint32_t> slots_;  // open addressing: index in the batch by a payload's identity
   std::vector<StoreRecord> held_ GUARDED_BY(thread_);
   Monotonic heldSince_{};

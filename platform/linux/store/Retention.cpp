@@ -24,7 +24,7 @@ const RetainedTable kTables[] = {{"relay_messages", "relay_messages"},
 }  // namespace
 
 std::vector<LedgerNote> Retention::apply() {
-  thread_.assertIsCurrent();
+  thread_.assertHere();
   batches_ = 0;
   removalsLeft_ = kRemovalsPerPass;
   std::vector<LedgerNote> notes;

@@ -9,10 +9,10 @@
 #include <vector>
 
 #include "base/Clock.h"
+#include "base/ThreadChecker.h"
 #include "platform/linux/store/Database.h"
 #include "platform/linux/store/StoreOptions.h"
 #include "platform/linux/store/StoreRecord.h"
-#include "platform/linux/store/ThreadConfinement.h"
 
 namespace vx::lnx {
 
@@ -52,7 +52,7 @@ class Retention {
   sqlite3* const database_;
   const StoreOptions options_;
   Clock& clock_;
-  ThreadConfinement thread_;
+  ThreadChecker thread_;
   int removalsLeft_ = 0;  // of this pass
   std::optional<Monotonic> lastAgeCheck_;
   std::size_t batches_ = 0;  // since the last pass

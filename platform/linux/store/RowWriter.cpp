@@ -58,7 +58,7 @@ RowWriter::RowWriter(sqlite3* database, std::size_t mostText, Clock& clock)
 Result<RowWriter::Written> RowWriter::write(const StoreRecords& batch, std::size_t first,
                                             std::size_t last,
                                             const std::vector<LedgerNote>& notes) {
-  thread_.assertIsCurrent();
+  thread_.assertHere();
   written_ = {};
   leftOut_.clear();
   const int code = writeTransaction(batch, first, last, notes);

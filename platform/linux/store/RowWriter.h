@@ -10,10 +10,10 @@
 
 #include "base/Clock.h"
 #include "base/Status.h"
+#include "base/ThreadChecker.h"
 #include "platform/linux/store/Database.h"
 #include "platform/linux/store/StoreRecord.h"
 #include "platform/linux/store/StoreTables.h"
-#include "platform/linux/store/ThreadConfinement.h"
 
 namespace vx::lnx {
 
@@ -56,7 +56,7 @@ class RowWriter {
   sqlite3* const database_;
   const std::size_t mostText_;
   Clock& clock_;
-  ThreadConfinement thread_;
+  ThreadChecker thread_;
   Insertion<RelaySessionRow> insertRelaySession_;
   Insertion<RelayMessageRow> insertRelayMessage_;
   Insertion<EventRow> insertEvent_;
