@@ -29,12 +29,9 @@ INTERNAL = "[device]\ninternal_build = true\n"
 HELLO, CALL, REPLY, ERROR, GOODBYE = range(5)
 
 
-def framed(body):
-    return struct.pack("<I", len(body)) + body
-
-
 def frame(*items):
-    return framed(dumps(items))
+    body = dumps(items)
+    return struct.pack("<I", len(body)) + body
 
 
 def replace(path, text):
@@ -53,10 +50,10 @@ class Client:
         self.number = 0
         self.data = b""
         self.answers = {}
-        self.connection_error, self.goodbye = None, False
+        self.goodbye = False
         if hello:
             self.raw(frame(HELLO, 1))
-            self.hello = self.next_frame()
+            self.next_frame()
 
     def raw(self, data):
         self.socket.sendall(data)
@@ -88,8 +85,6 @@ class Client:
             return False
         if f[0] == GOODBYE:
             self.goodbye = True
-        elif f[0] == ERROR and f[1] is None:
-            self.connection_error = f
         else:
             self.answers.setdefault(f[1], []).append(f)
         return True

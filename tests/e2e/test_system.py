@@ -1,50 +1,32 @@
 """Preferences, summaries and orientation, on real files and a real bus."""
-import itertools
 import json
-import re
 import select
 
 from harness import *
 
 
 class PreferencesTest(DaemonTest):
-    def setUp(self):
-        self.d = self.daemon(config="[preferences]\nsettle_ms = 20\n")
-        self.file = f"{self.d.folder}/etc/preferences/com.quorvel.sonik.toml"
-        os.makedirs(os.path.dirname(self.file), exist_ok=True)
-        self.c = self.d.client()
-
-    def assert_switched(self, off):
-        want = {"domain": "com.quorvel.audio.reporting", "code": 1} if off else None
-        self.d.wait_until(lambda: self.c.call(SEND, {"a": 1}, 3, 1, []) == want, f"reporting is {'off' if off else 'on'}")
-
-    def test_switching_off_and_on_however_the_file_is_edited(self):
-        with open(self.file, "w") as f:
-            f.write("disable_reporting = true\n")
-        self.assert_switched(off=True)
-        subprocess.run(["sed", "-i", "s/true/false/", self.file], check=True)
-        self.assert_switched(off=False)
-        replace(self.file, "disable_reporting = true\n")
-        self.assert_switched(off=True)
-        replace(self.file, "disable_reporting = = false\n")  # a broken file leaves the last good values
-        self.d.wait_until(lambda: re.search(r"com.quorvel.sonik.toml:1:\d+", self.d.log()), "line and column are logged")
-        self.assert_switched(off=True)
-        os.remove(self.file)
-        self.assert_switched(off=False)
-
-    def test_defaults_reach_sessions_and_verbose_keys_take_effect(self):
-        self.assertNotIn("creating session for reporter", self.d.log())
-        self.c.call(CREATE, 1)
-        replace(self.file, "device_name = 'Pocket'\nreporting_server_verbose = true\n")
-        # The keys are told to the sessions before a verbose line can appear.
-        self.d.wait_until(lambda: self.c.call(CREATE, 2) and "creating session for reporter 2" in self.d.log(),
-                          "verbose lines appear")
-        self.c.post(START, 1)
-        self.c.call(STOP, 1)
-        self.assertEqual(self.d.stop(), 0)
-        ((info,),) = self.d.rows("SELECT user_info FROM relay_sessions WHERE session_id = 1")
-        info = json.loads(info)
-        self.assertEqual((info["device_name"], info["disable_reporting"]), ("Pocket", 0))
+    def test_edits_reach_messages_sessions_and_the_log(self):
+        d = self.daemon(config="[preferences]\nsettle_ms = 20\n")
+        file = f"{d.folder}/etc/preferences/com.quorvel.sonik.toml"
+        os.makedirs(os.path.dirname(file))
+        c = d.client()
+        sent = lambda: c.call(SEND, {"a": 1}, 3, 1, [])
+        c.call(CREATE, 1)
+        replace(file, "device_name = 'Pocket'\ndisable_reporting = true\nreporting_server_verbose = true\n")
+        d.wait_until(lambda: sent() == {"domain": "com.quorvel.audio.reporting", "code": 1}, "reporting is off")
+        d.wait_until(lambda: c.call(CREATE, 2) and "creating session for reporter 2" in d.log(), "verbose lines appear")
+        self.assertNotIn("creating session for reporter 1", d.log())
+        replace(file, "disable_reporting = = false\n")  # a broken file leaves the last good values
+        d.wait_until(lambda: "com.quorvel.sonik.toml:1:" in d.log(), "the line is logged")
+        self.assertIsNotNone(sent())
+        replace(file, "device_name = 'Pocket'\n")
+        d.wait_until(lambda: sent() is None, "reporting is on")
+        c.post(START, 1)
+        c.call(STOP, 1)
+        self.assertEqual(d.stop(), 0)
+        ((info,),) = d.rows("SELECT user_info FROM relay_sessions WHERE session_id = 1")
+        self.assertEqual(json.loads(info)["device_name"], "Pocket")
 
 
 class SummaryTest(DaemonTest):
@@ -62,23 +44,8 @@ class SummaryTest(DaemonTest):
         self.assertEqual(second, {"Playback_Start_1": message})
         self.assertEqual(last["Undefined_Unknown_1"]["VX_Session_Summary_Event"], "2")
         self.assertEqual(os.stat(os.path.dirname(path)).st_mode & 0o777, 0o777)
-        # Names that would lead elsewhere name a file of this folder all the same.
-        hostile = ["../../x", "", "x" * 4096, "nul\0byte"]
-        for reporter, application in enumerate(hostile, 10):
-            c.session(reporter, {"HostApplicationDisplayID": application})
-        found = [os.path.relpath(p, f"{d.folder}/log") for p, _, names in os.walk(f"{d.folder}/log") for _ in names]
-        self.assertEqual(found, ["Audio/Reporting"] * (len(hostile) + 1))
-        shutil.rmtree(f"{d.folder}/log")
-        os.symlink("/proc/self", f"{d.folder}/log")  # nobody makes a folder or a file there, root included
-        c.session(20)
-        for said in ("can't create logging directory at", "jsonOutput writeToURL:"):
-            self.assertEqual(d.log().count(said), 1)
-        os.remove(f"{d.folder}/log")
-        c.session(21)
-        self.assertEqual(len(d.summaries()), 1)
         self.assertEqual(d.stop(), 0)
-        ((category, payload),) = d.rows("SELECT category, payload FROM relay_messages WHERE id = (SELECT max(m.id) FROM"
-                                        " relay_messages m JOIN relay_sessions s ON s.id = relay_session WHERE session_id = 3)")
+        ((category, payload),) = d.rows("SELECT category, payload FROM relay_messages ORDER BY id DESC LIMIT 1")
         self.assertEqual((category, json.loads(payload)), (0xFFFF, last["Undefined_Unknown_1"]))
 
 
@@ -166,13 +133,14 @@ class OrientationTest(DaemonTest):
         self.assertEqual(self.d.stop(), 0)
 
     def test_interface_orientation_from_the_state_file(self):
-        # Nobody sees when the file has been read: sessions of growing length, until one is told of the change.
-        for reporter in itertools.count(1):
+        # Nobody sees when the file has been read: sessions of growing length, until two were told of the change.
+        told = 0
+        for reporter in range(1, 20):
             self.c.started(reporter, 2, {"HostApplicationDisplayID": f"{reporter:04}"})
             for word in ("portrait", "landscape-left"):
                 replace(f"{self.folder}/run/interface-orientation", word + "\n")
                 time.sleep(0.05 * reporter)
-            words = self.words("ui_orientation", reporter)
-            self.assertLess(reporter, 20, words)
-            if words[-1] == "landscape-left":
-                break
+            told += self.words("ui_orientation", reporter)[-1] == "landscape-left"
+            if told == 2:
+                return
+        self.fail(f"told {told} times")
