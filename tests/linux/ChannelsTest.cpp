@@ -1,13 +1,10 @@
 #include <sys/stat.h>
-#include <sys/wait.h>
-#include <unistd.h>
 
 #include <cerrno>
 #include <climits>
 #include <map>
 
 #include "platform/linux/device/CounterChannels.h"
-#include "platform/linux/device/ProcProcessInfo.h"
 #include "tests/linux/FolderTest.h"
 
 namespace vx::lnx {
@@ -152,18 +149,6 @@ TEST_F(ChannelsTest, MappedSourcesFollowTheKernel) {
   EXPECT_FALSE(alsa.error);
   Group codec(channels, std::nullopt, "MCA");
   EXPECT_EQ(codec.values(codec.sample()).count("rx_packets"), 1u);
-}
-
-TEST(ProcessNames, OfOwnLiveAndGoneProcesses) {
-  ProcProcessInfo processes;
-  EXPECT_EQ(processes.shortCommandName(getpid()), processes.ownProcessName());
-  EXPECT_EQ(processes.ownProcessName(), "linux_test");
-  EXPECT_EQ(processes.shortCommandName(0), std::nullopt);
-  EXPECT_EQ(processes.shortCommandName(-1), std::nullopt);
-  const pid_t child = fork();
-  if (child == 0) _exit(0);
-  waitpid(child, nullptr, 0);
-  EXPECT_EQ(processes.shortCommandName(child), std::nullopt);
 }
 
 }  // namespace

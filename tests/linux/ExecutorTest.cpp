@@ -47,19 +47,30 @@ TEST_F(ExecutorTest, SleepingLoopIsWokenOncePerSleepAndRunsInOrder) {
   EXPECT_TRUE(executor.prepareToSleep());
 }
 
-TEST_F(ExecutorTest, DelayedInteractiveWorkJoinsWhenDue) {
-  const Queue queue = interactive();
-  bool ran = false;
-  queue->asyncAfter(20ms, [&] { ran = true; });
-  EXPECT_FALSE(executor.runInteractive(10));
-  const auto due = executor.nextInteractiveDue();
-  ASSERT_TRUE(due);
-  EXPECT_FALSE(ran);
-  std::this_thread::sleep_until(
-      std::chrono::time_point_cast<std::chrono::steady_clock::duration>(*due));
-  executor.runInteractive(10);
-  EXPECT_TRUE(ran);
-  EXPECT_FALSE(executor.nextInteractiveDue());
+TEST_F(ExecutorTest, DelayedWorkJoinsInOrderOfItsTimeAndKeepsItsQueue) {
+  const Monotonic start = std::chrono::steady_clock::now();
+  std::vector<int> ran;
+  Queue queue = utility();
+  const WorkQueue& q = *queue;
+  queue->asyncAfter(30ms, [&] {
+    EXPECT_GE(std::chrono::steady_clock::now() - start, 30ms);
+    EXPECT_TRUE(q.isCurrent());
+    EXPECT_FALSE(executor.background().isCurrent());
+    ran.push_back(3);
+  });
+  queue->asyncAfter(10ms, [&] { ran.push_back(1); });
+  queue->asyncAfter(20ms, [&] { ran.push_back(2); });
+  queue->async([&] { ran.push_back(0); });
+  EXPECT_FALSE(queue->isCurrent());
+  queue.reset();
+  Latch done;
+  executor.background().asyncAfter(31ms, [&] {
+    EXPECT_TRUE(executor.background().isCurrent());
+    done.open();
+  });
+  EXPECT_TRUE(done.wait());
+  EXPECT_TRUE(executor.drain(soon()));
+  EXPECT_EQ(ran, (std::vector<int>{0, 1, 2, 3}));
 }
 
 TEST_F(ExecutorTest, ManyQueuesKeepTheirOrderAcrossThreads) {

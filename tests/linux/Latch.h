@@ -22,10 +22,6 @@ class Latch {
     }
     return open_;
   }
-  bool isOpen() {
-    MutexLock lock(mutex_);
-    return open_;
-  }
 
  private:
   Mutex mutex_;

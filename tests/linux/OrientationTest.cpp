@@ -1,9 +1,5 @@
-#include <atomic>
-#include <thread>
-
 #include "platform/linux/device/InterfaceStateFile.h"
 #include "platform/linux/device/KernelRandom.h"
-#include "platform/linux/device/LinuxOrientation.h"
 #include "platform/linux/device/OrientationHandlers.h"
 #include "tests/linux/FolderTest.h"
 
@@ -12,15 +8,6 @@ namespace {
 
 using OrientationTest = FolderTest;
 using Told = std::vector<std::string>;
-
-bool threadRuns(const std::string& name) {
-  for (const auto& task : std::filesystem::directory_iterator("/proc/self/task")) {
-    std::string found;
-    std::getline(std::ifstream(task.path() / "comm") >> std::ws, found);
-    if (found == name) return true;
-  }
-  return false;
-}
 
 TEST_F(OrientationTest, HandlersAreToldOfChangesAlone) {
   OrientationWords words;
@@ -96,28 +83,6 @@ TEST_F(OrientationTest, TheStateFileIsReadWheneverItIsWrittenOrRenamedOver) {
   file.stop();
   file.start();
   EXPECT_EQ(p.log.lines.size(), 2u);  // it had been there
-}
-
-// Its thread comes and goes with the handlers; a word is written until it is heard, since nobody
-// says when the file is being watched.
-TEST_F(OrientationTest, TheNotifierTellsFromAThreadOfItsOwn) {
-  LinuxOrientation orientation({.deviceSensor = false, .interfaceStateFile = folder + "/state"});
-  orientation.registerDeviceOrientationHandler("off", [](int64_t) { FAIL(); });
-  const auto end = std::chrono::steady_clock::now() + std::chrono::seconds(30);
-  for (int round = 0; round < 2; ++round) {
-    const auto heard = std::make_shared<std::atomic<int64_t>>(-1);
-    orientation.registerInterfaceOrientationHandler("id", [heard](int64_t v) { *heard = v; });
-    for (int i = 0; *heard < 0 && std::chrono::steady_clock::now() < end; ++i) {
-      write("new", i % 2 == 0 ? "portrait" : "landscape-left");
-      std::filesystem::rename(folder + "/new", folder + "/state");
-      std::this_thread::yield();
-    }
-    EXPECT_THAT(orientation.orientationText(*heard),
-                ::testing::AnyOf("portrait", "landscape-left"));
-    orientation.unregisterInterfaceOrientationHandler("id");
-    while (threadRuns("vx-orientation") && std::chrono::steady_clock::now() < end) {
-    }
-  }
 }
 
 TEST(KernelRandomTest, StaysBelowItsBoundAndReachesEveryValue) {

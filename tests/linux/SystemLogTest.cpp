@@ -2,8 +2,6 @@
 #include <time.h>
 #include <unistd.h>
 
-#include <thread>
-
 #include "platform/linux/diagnostics/SystemLog.h"
 #include "tests/linux/FolderTest.h"
 
@@ -99,32 +97,6 @@ TEST_F(SystemLogTest, AnAllowanceComesBackAsSlowlyAsConfigured) {
   EXPECT_EQ(wantedAfter(10h), 6);   // no more than the burst
   limit(1 << 16, 0.01);             // one more than there are bits for
   EXPECT_EQ(wanted(site, 20), 20);
-}
-
-TEST_F(SystemLogTest, ThreadsShareOneStatementsAllowance) {
-  limit(50, 0.001);
-  std::atomic<int> taken{0};
-  std::vector<std::thread> threads;
-  for (int i = 0; i < 4; ++i) threads.emplace_back([&] { taken += wanted(site, 300'000); });
-  for (std::thread& thread : threads) thread.join();
-  EXPECT_EQ(taken, 50);
-}
-
-TEST_F(SystemLogTest, PreferencesMayLogAndRegisterWhileTheyAreRead) {
-  log.setPreferences(services);
-  const LogScope* inner = nullptr;
-  services.preferences = {{"outer", "true"}};
-  services.onOpen = [&](std::string_view) {
-    services.onOpen = nullptr;
-    inner = log.registerScope(true, 1, "in", "d", "inner", 31);
-  };
-  const LogScope* outer = log.registerScope(true, 1, "out", "d", "outer", 31);
-  ASSERT_NE(inner, nullptr);
-  EXPECT_TRUE(log.isLogEnabled(5, outer));
-  EXPECT_FALSE(log.isLogEnabled(5, inner));
-  EXPECT_FALSE(log.isLogEnabled(5, nullptr));
-  EXPECT_TRUE(log.isLogEnabled(4, nullptr));
-  EXPECT_EQ(log.registerScope(false, 1, "off", "d", "k", 31), nullptr);
 }
 
 TEST_F(SystemLogTest, ARefreshOpensEachDomainOnceForAllItsScopes) {
