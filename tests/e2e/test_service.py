@@ -69,11 +69,9 @@ class Service(DaemonTest):
             self.assertIs(c.call(STOP, number), True)
         d.wait_for_messages(clients * (messages + 1))
         self.assertEqual(d.stop(), 0)
-        per_session = d.rows("SELECT s.session_id, count(*), count(DISTINCT json_extract(m.payload, '$.i')),"
-                             " min(json_extract(m.payload, '$.client')), max(json_extract(m.payload, '$.client'))"
-                             " FROM relay_messages m JOIN relay_sessions s ON s.id = m.relay_session"
-                             " WHERE m.category = 3 GROUP BY s.session_id ORDER BY s.session_id")
-        self.assertEqual(per_session, [(i, messages, messages, i, i) for i in range(1, clients + 1)])
+        self.assertEqual(d.rows("SELECT count(DISTINCT payload) FROM relay_messages JOIN relay_sessions s"
+                                " ON s.id = relay_session AND session_id = json_extract(payload, '$.client')"),
+                         [(clients * messages,)])
 
     def test_no_back_ends_ends_the_wait_with_dropped_messages(self):
         d = self.daemon(config="[relay]\nbackends = []\n")

@@ -64,9 +64,6 @@ class FakePlatform {
     installPlatform(&platform_);
   }
   ~FakePlatform() { installPlatform(nullptr); }
-  FakePlatform(const FakePlatform&) = delete;
-  FakePlatform& operator=(const FakePlatform&) = delete;
-
   static ChannelReportService& noChannels() {
     static lnx::CounterChannels none({"", {}});
     return none;

@@ -181,9 +181,8 @@ class FakeServices final : public AnalyticsEventService,
   int32_t integer(Name name, int32_t defaultValue) override {
     return name == "DeviceClassNumber" ? deviceClass : defaultValue;
   }
-  std::unique_ptr<PreferencesDomain> open(Name domain) override {
+  std::unique_ptr<PreferencesDomain> open(Name) override {
     ++preferenceReads;
-    if (const auto hook = onOpen) hook(domain);
     return std::make_unique<Domain>(preferences);
   }
   uint32_t registerHandler(Name name, int& token, std::shared_ptr<WorkQueue> queue,
@@ -245,7 +244,6 @@ class FakeServices final : public AnalyticsEventService,
   int32_t deviceClass = 0;
   Texts preferences;  // "true" and "false" read as booleans too
   int preferenceReads = 0;
-  std::function<void(Name domain)> onOpen;
   uint32_t notifyStatus = 0;
   std::shared_ptr<WorkQueue> notifyQueue;
   std::shared_ptr<Function<void(int)>> notifyHandler;

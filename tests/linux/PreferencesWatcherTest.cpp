@@ -53,17 +53,11 @@ TEST_F(PreferencesWatcherTest, SettlesBeforeItFires) {
   EXPECT_EQ(pass(99ms), 0);
   EXPECT_EQ(*watcher.nextDue() - p.clock.monotonic(), 1ms);
   EXPECT_EQ(pass(1ms), 1);
-  for (int i = 0; i < 200; ++i) {
-    edit();
-    if (i % 10 == 0) pass(1ms);
-  }
-  EXPECT_EQ(fired, 1);
-  EXPECT_EQ(pass(100ms), 2);
   for (int i = 0; i < 30; ++i) {  // never left alone: told all the same, now and then
     edit();
     pass(90ms);
   }
-  EXPECT_EQ(fired, 3);
+  EXPECT_EQ(fired, 2);
   pass(100ms);
   const int before = fired;
   edit("preferences/other.toml");
@@ -88,21 +82,12 @@ TEST_F(PreferencesWatcherTest, FollowsALinkToTheFileBehindIt) {
   EXPECT_EQ(pass(1s), 1);
   edit("here/other.toml");
   EXPECT_EQ(pass(1s), 1);
-  pointLinkAt(folder + "/there/d.toml");
+  pointLinkAt("../there/d.toml");
   EXPECT_EQ(pass(1s), 2);
   edit("here/d.toml");
   EXPECT_EQ(pass(1s), 2);
   edit("there/d.toml");
   EXPECT_EQ(pass(1s), 3);
-  edit("preferences/real.toml");
-  pointLinkAt("real.toml");
-  EXPECT_EQ(pass(1s), 4);
-  for (int i = 5; i < 8; ++i) {
-    edit("preferences/real.toml");
-    EXPECT_EQ(pass(1s), i);
-  }
-  std::filesystem::remove(folder + "/preferences/d.toml");
-  EXPECT_EQ(pass(1s), 8);
 }
 
 TEST_F(PreferencesWatcherTest, PollsWhereInotifyCannotBeHad) {

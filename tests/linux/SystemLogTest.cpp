@@ -99,26 +99,21 @@ TEST_F(SystemLogTest, AnAllowanceComesBackAsSlowlyAsConfigured) {
   EXPECT_EQ(wanted(site, 20), 20);
 }
 
-TEST_F(SystemLogTest, ARefreshOpensEachDomainOnceForAllItsScopes) {
+TEST_F(SystemLogTest, ScopesAreAsVerboseAsTheirKeys) {
   log.refreshVerbose();  // without any
   log.setPreferences(services);
+  services.preferences = {{"ka", "true"}};
   const LogScope* a = log.registerScope(true, 1, "a", "d", "ka", 31);
   const LogScope* b = log.registerScope(true, 1, "b", "d", "kb", 31);
-  const LogScope* c = log.registerScope(true, 1, "c", "other", "ka", 31);
-  std::vector<std::string> opened;
-  services.onOpen = [&](std::string_view domain) { opened.emplace_back(domain); };
-  services.preferences = {{"ka", "true"}};
-  log.refreshVerbose();
-  EXPECT_THAT(opened, ElementsAre("d", "other"));
-  limit(0, 0);
-  for (const auto& [scope, verbose] : {std::pair(a, true), {b, false}, {c, true}}) {
-    EXPECT_EQ(log.isLogEnabled(5, scope), verbose);
-    EXPECT_EQ(log.wantsLine(scope, LogLevel::Debug, site), verbose);
-  }
-  EXPECT_FALSE(log.wantsLine(a, LogLevel::Info, site));
-  services.preferences.clear();
+  EXPECT_TRUE(log.isLogEnabled(5, a));
+  EXPECT_FALSE(log.isLogEnabled(5, b));
+  EXPECT_FALSE(log.isLogEnabled(5, nullptr));
+  EXPECT_TRUE(log.isLogEnabled(4, nullptr));
+  EXPECT_EQ(log.registerScope(false, 1, "off", "d", "k", 31), nullptr);
+  services.preferences = {{"kb", "true"}};
   log.refreshVerbose();
   EXPECT_FALSE(log.isLogEnabled(5, a));
+  EXPECT_TRUE(log.isLogEnabled(5, b));
 }
 
 }  // namespace
