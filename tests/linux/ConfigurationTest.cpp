@@ -65,10 +65,6 @@ TEST_F(ConfigurationTest, RangesEndWhereTheySay) {
   EXPECT_EQ(configuration.listener.maxFrameBytes, 1u << 20);
   EXPECT_THAT(configuration.relay.backends, ElementsAre("store"));
   EXPECT_THAT(configuration.drivers.mapped, IsEmpty());
-  EXPECT_THAT(
-      complaintsOf("[relay]\nbackends = [\n\"stoer\"]\n"),
-      ElementsAre(file + "3: relay.backends: \"stoer\" is not known; must be one of \"store\""));
-  EXPECT_THAT(configuration.relay.backends, IsEmpty());
 }
 
 // The parser recurses once per part of a key, without a limit of its own.

@@ -2,31 +2,21 @@
 #pragma once
 
 #include <chrono>
-
-#include "base/Mutex.h"
+#include <future>
 
 namespace vx::lnx {
 
 class Latch {
  public:
-  void open() {
-    MutexLock lock(mutex_);
-    open_ = true;
-    changed_.notifyAll();
-  }
+  void open() { promise_.set_value(); }
   // False when it has taken too long for any machine.
-  bool wait() {
-    const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(30);
-    MutexLock lock(mutex_);
-    while (!open_ && changed_.waitUntil(mutex_, deadline)) {
-    }
-    return open_;
+  bool wait() const {
+    return opened_.wait_for(std::chrono::seconds(30)) == std::future_status::ready;
   }
 
  private:
-  Mutex mutex_;
-  CondVar changed_;
-  bool open_ GUARDED_BY(mutex_) = false;
+  std::promise<void> promise_;
+  const std::shared_future<void> opened_ = promise_.get_future().share();
 };
 
 }  // namespace vx::lnx

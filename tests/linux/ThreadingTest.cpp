@@ -40,22 +40,6 @@ TEST(RunLoopTest, TimersFireInOrderOfTimeAndMoveAndGoFromOtherThreads) {
   EXPECT_EQ(fired, (std::vector<int>{1, 2, 3}));
 }
 
-TEST(SystemConditionTest, SignalEndsAWaitAndTheDeadlineDoesToo) {
-  fakes::FakePlatform p;
-  SystemThreading threading(p.queues.background());
-  SystemClock clock;
-  const std::shared_ptr<Condition> condition = threading.makeCondition();
-  condition->lock();
-  EXPECT_FALSE(condition->waitUntil(clock.monotonic() + 5ms));
-  const auto thread = threading.startThread("signaller", [condition] {
-    condition->lock();
-    condition->signal();
-    condition->unlock();
-  });
-  EXPECT_TRUE(condition->waitUntil(clock.monotonic() + 30s));
-  condition->unlock();
-}
-
 TEST(FreedMemory, GoesBackInOneStepTwoSecondsAfterAMegabyteWasFreed) {
   fakes::FakePlatform p;
   int trims = 0;
