@@ -127,8 +127,7 @@ class FakeThreading final : public Threading {
   }
   // Moves time, running events on the way.
   void passTimeUntil(Monotonic when) {
-    while (passEventBefore(when)) {
-    }
+    while (passEventBefore(when)) continue;
   }
   Function<void()> threadBody;    // of the last thread started
   std::function<void()> onSleep;  // before each sleep of a thread

@@ -2,6 +2,7 @@
 // in one journal, so that orders of steps can be asserted across services.
 #pragma once
 
+#include <iomanip>
 #include <sstream>
 
 #include "tests/fakes/FakeExecution.h"
@@ -161,9 +162,7 @@ class FakeServices final : public AnalyticsEventService,
     powers.push_back({client, std::string(name), record});
   }
   void emit(uint32_t code, uint64_t, uint64_t, uint64_t, uint64_t) override {
-    char text[24];
-    std::snprintf(text, sizeof text, "trace 0x%08X", code);
-    note(journal_, text);
+    note(journal_, std::hex, std::uppercase, std::setfill('0'), "trace 0x", std::setw(8), code);
     traces.push_back(code);
   }
   int32_t ownProcessIdentifier() override { return 1000; }
