@@ -5,7 +5,11 @@
 namespace vx {
 namespace {
 
-class ClientTest : public ServiceTest {};
+class ClientTest : public ServiceTest {
+ protected:
+  const Payload message = dictionary("EngineOnTime", 2, "HostApplicationDisplayID", "liar");
+  const Payload configuration = dictionary("HostApplicationDisplayID", "app");
+};
 
 TEST_F(ClientTest, CreationRegistersInOrder) {
   EXPECT_THAT(p.log.registrations,
@@ -22,7 +26,7 @@ TEST_F(ClientTest, CreationRegistersInOrder) {
 }
 
 // Each operation through its description: what the connection checks and bounds by, then what the
-// operation traces, logs and answers (but the session's own lines).
+// operation traces, logs and answers (but the session's own lines), and what others are handed.
 TEST_F(ClientTest, TheExportedInterface) {
   struct Target final : public ReplyTarget {
     explicit Target(fakes::Journal& to) : journal(to) {}
@@ -31,52 +35,77 @@ TEST_F(ClientTest, TheExportedInterface) {
       if (const auto* yes = std::get_if<bool>(&value)) text = *yes ? "true" : "false";
       if (const auto* type = std::get_if<uint16_t>(&value)) text = std::to_string(*type);
       if (const auto* answer = std::get_if<Payload>(&value)) text = answer->text();
+      if (const auto* error = std::get_if<Error>(&value)) text = error->domain;
       if (const auto* all = std::get_if<std::vector<int64_t>>(&value))
-        text = std::to_string(all->at(0));
+        text = ::testing::PrintToString(*all);
       journal.push_back("reply " + text);
     }
     void release(uint64_t) override {}
     fakes::Journal& journal;
   };
   const auto target = std::make_shared<Target>(p.journal);
-  connect();
+  for (const int32_t pid : {200, 201, 202}) connect(pid);
+  p.services.preferences["device_name"] = "Early";  // not read before the first notification
   p.log.verbose = true;
   const std::string expected = dataFile("interface.txt");
   std::istringstream file(expected);
   std::string seen;
   for (std::string line; std::getline(file, line);) {
-    if (line[0] == ' ') continue;  // calls are not indented: number, its numbers, what it is
+    if (line[0] == ' ') continue;
     std::istringstream words(line);
-    std::size_t number = 0;
-    words >> number;
-    const OperationDescription& operation = connections[0]->interface->operations[number];
-    std::string called = std::to_string(number), shown = " " + std::string(operation.name) + "(";
-    CallArguments arguments;
-    for (std::size_t i = 0; i < operation.arguments.size(); ++i) {
-      const char kind = "iwud?*"[static_cast<int>(operation.arguments[i])];
-      shown += kind;
-      int64_t value = 0;
-      if (kind == 'd' || kind == '?') {
-        arguments.set(i, std::optional(message));
-      } else if (kind == '*') {
-        arguments.set(i, std::optional(std::vector<int64_t>{5, 0}));
-      } else {
-        words >> value;
-        called += " " + std::to_string(value);
-        if (kind == 'i') arguments.set(i, value);
-        if (kind != 'i') arguments.set(i, static_cast<uint64_t>(value));
-      }
-    }
-    seen += called + shown + ")" + "bwedn"[static_cast<int>(operation.reply)];
-    if (operation.replyMayBeHeld) seen += " held";
-    if (operation.resource == ResourceEffect::Acquire) seen += " acquires";
-    if (operation.resource == ResourceEffect::Release) seen += " releases";
+    std::string who, what, list;
+    words >> who >> what;
     mark();
-    operation.invoke(*clients[0], arguments, Reply(target, 1));
+    std::string called = who + " " + what, shown;
+    if (who == "notify") {  // the token, and the preferences of now
+      p.services.preferences.clear();
+      for (std::string key, value; words >> key >> value; called += " " + key + " " + value)
+        p.services.preferences[key] = value;
+      notify(std::stoi(what));
+    } else if (what == "lost") {
+      connections.at(static_cast<std::size_t>(who[0] - 'a'))->invalidation();
+    } else {  // the client, the operation's number and its numbers
+      const auto client = static_cast<std::size_t>(who[0] - 'a');
+      const OperationDescription& operation =
+          connections.at(client)->interface->operations[std::stoul(what)];
+      shown = " " + std::string(operation.name) + "(";
+      CallArguments arguments;
+      for (std::size_t i = 0; i < operation.arguments.size(); ++i) {
+        const char kind = "iwud?*"[static_cast<int>(operation.arguments[i])];
+        shown += kind;
+        if (kind == 'd') arguments.set(i, std::optional(message));
+        if (kind == '?') arguments.set(i, std::optional(configuration));
+        if (kind == 'd' || kind == '?') continue;
+        words >> list;
+        called += " " + list;
+        if (kind == 'i') arguments.set(i, int64_t{std::stoll(list)});
+        if (kind == 'w' || kind == 'u') arguments.set(i, uint64_t{std::stoull(list)});
+        if (kind != '*') continue;
+        std::optional<std::vector<int64_t>> ids;
+        if (list != "all") ids.emplace();
+        std::istringstream numbers(list);
+        for (int64_t id = 0; numbers >> id; numbers.ignore()) ids->push_back(id);
+        arguments.set(i, ids);
+      }
+      shown += std::string(")") + "bwedn"[static_cast<int>(operation.reply)];
+      if (operation.replyMayBeHeld) shown += " held";
+      if (operation.resource == ResourceEffect::Acquire) shown += " acquires";
+      if (operation.resource == ResourceEffect::Release) shown += " releases";
+      operation.invoke(*clients[client], arguments, Reply(target, 1));
+    }
     run();
+    seen += called + shown + "\n";
     for (const std::string& gain : gained())
-      if (!gain.starts_with("log vxrr")) seen += "\n  " + gain;
-    seen += "\n";
+      if (!gain.starts_with("log vxrr")) seen += "  " + gain + "\n";
+    const auto handed = [&](auto& items, const auto& payload) {
+      for (const auto& item : items) seen += "    " + payload(item).text() + "\n";
+      items.clear();
+    };
+    handed(p.services.events, [](const auto& event) { return (*event.builder)(); });
+    handed(p.services.powers, [](const auto& power) { return power.record; });
+    handed(p.vyr.sessions, [](const auto& session) { return session->userInfo; });
+    handed(p.vyr.sent, [](const auto& sent) { return sent.payload; });
+    handed(p.vyr.oneOffs, [](const auto& single) { return single.userInfo; });
   }
   EXPECT_EQ(seen, expected);
   p.log.verbose = false;
@@ -141,61 +170,12 @@ TEST_F(ClientTest, UptimeIsSentOnInvalidationOnlyAndOnce) {
   EXPECT_EQ(p.services.events.size(), 2u);
 }
 
-TEST_F(ClientTest, LostConnectionStopsStartedSessionsAndKeepsTheirReplies) {
-  auto& client = connect();
-  started(client, 1);
-  create(client, 2);
-  const auto old = session(client, 2);
-  old->setStarted(true);
-  create(client, 2);
-  EXPECT_THAT(gained({"0x21042830", "flush"}), IsEmpty());
-  EXPECT_TRUE(old->started()) << "replaced, not stopped";
-  EXPECT_NE(session(client, 2), old);
-  connections[0]->interruption();
-  connections[0]->invalidation();
-  run();
-  EXPECT_THAT(
-      gained({"0x21042830", "reply", "removing"}),
-      ElementsAre("trace 0x21042830", "log vxrs default removing 200 from the server client list"));
-  const OnServiceQueue here{p};
-  EXPECT_FALSE(client.clientReportingSessionMap().at(1)->started());
-  EXPECT_EQ(client.clientReportingSessionMap().size(), 2u);
-}
-
-TEST_F(ClientTest, LookupsOfOwnMapAndAcrossClients) {
-  auto &a = connect(200), &b = connect(201), &c = connect(202);
-  for (auto* client : {&a, &b}) create(*client, 7);
-  create(b, 8);
-  a.setServiceType(3, 7, booleans("type"));
-  b.setServiceType(4, 7, booleans("type"));
-  auto typeOf = [&](Client& client, ReporterID id) {
-    ServiceType answer = 0;
-    client.getServiceNameForReporterID(id, [&](ServiceType type) { answer = type; });
-    run();
-    return answer;
-  };
-  EXPECT_EQ(typeOf(b, 7), 4) << "its own comes first";
-  EXPECT_EQ(typeOf(c, 7), 3) << "then the client that was registered first";
-  // What is not its own stays as it is.
-  a.setServiceType(9, 8, booleans("type"));
-  configure(a, 8, message);
-  a.destroyReportingSession(8, booleans("destroy"));
-  EXPECT_EQ(typeOf(b, 8), 65535);
-  EXPECT_EQ(session(b, 8)->userInfo()->snapshot().size(), 0u);
-  for (const auto& [id, answer] : {std::pair(ReporterID{7}, "{reporterID=7,serviceType=3}"),
-                                   {8, "{reporterID=8,serviceType=65535}"},
-                                   {99, "{reporterID=0,serviceType=65535}"}})
-    c.reporterID(id, [expected = answer](const Payload& p) { EXPECT_EQ(p.text(), expected); });
-  c.getAllReporters([](const auto& all) { EXPECT_THAT(all, ElementsAre(7, 7, 8)); });
-  run();
-  const OnServiceQueue here{p};
-  EXPECT_NE(service->findReportingSessionForID(8), nullptr);
-  EXPECT_EQ(p.log.lines.back(), "vxrs info found reporting session 8 for client 201");
-  EXPECT_EQ(service->findReportingSessionForID(99), nullptr);
-  EXPECT_EQ(p.log.lines.back(), "vxrs error failed to find reporting session 99");
-  create(a, 0);
-  EXPECT_EQ(service->findReportingSessionForID(0), nullptr);
-  EXPECT_NE(session(a, 0), nullptr);
+TEST_F(ClientTest, AbsentSwitchIsTheIntegerZeroPresentOneABoolean) {
+  const auto defaults = [] { return VXReportingServiceDelegate::VXReportingDefaults(); };
+  EXPECT_EQ(defaults().find("disable_reporting")->kind(), ValueKind::Integer);
+  p.services.preferences = {{"disable_reporting", "false"}, {"device_name", "<table>"}};
+  EXPECT_EQ(defaults().find("disable_reporting")->kind(), ValueKind::Boolean);
+  EXPECT_FALSE(defaults().contains("device_name"));
 }
 
 }  // namespace
