@@ -26,6 +26,7 @@ using ::testing::HasSubstr;
 using ::testing::IsEmpty;
 using ::testing::Not;
 using ::testing::Pair;
+using ::testing::UnorderedElementsAre;
 
 // The test's own code is an item of the service queue while this lives.
 class OnServiceQueue {
