@@ -59,22 +59,6 @@ class ReportingClientTest : public testing::Test {
   std::vector<std::string> outcomes;
 };
 
-TEST_F(ReportingClientTest, AnswersInAnyOrderReachTheirOwnCalls) {
-  connect();
-  create(1, 200);
-  Bytes answers = yes(200);
-  std::vector<std::string> expected;
-  for (int64_t number = 200; number > 1; --number) {
-    answers = answers + yes(number);
-    expected.push_back(std::to_string(number) + " ok");
-  }
-  expected.emplace_back("1 dropped");
-  EXPECT_TRUE(receive(answers + frame(3, 1, 8, "dropped")).ok());
-  EXPECT_EQ(outcomes, expected);
-  EXPECT_EQ(client->unknownAnswers(), 1U);
-  EXPECT_EQ(client->pendingCalls(), 0U);
-}
-
 TEST_F(ReportingClientTest, AHeldStartOutlivesManyLaterCalls) {
   for (const bool answered : {true, false}) {
     connect();
@@ -96,67 +80,67 @@ TEST_F(ReportingClientTest, AHeldStartOutlivesManyLaterCalls) {
   }
 }
 
+// An answer of another kind refuses that call alone.
 TEST_F(ReportingClientTest, EveryBlockingFormMakesItsCallAndReadsItsAnswer) {
   connect();
+  const auto said = [](const ClientStatus& status, const std::string& value = "ok") {
+    if (status.code == Code::ReportingError)
+      return status.domain + " " + std::to_string(status.wireCode);
+    return status.ok() ? value : status.code == Code::Refused ? "refused" : status.text;
+  };
+  const auto shown = [&](const auto& r) { return said(r.status, testing::PrintToString(r.value)); };
+  const auto create = [&] { return shown(client->createReportingSession(-7)); };
+  const auto type = [&] { return shown(client->getServiceType(7)); };
+  const auto all = [&] { return shown(client->getAllReporters()); };
+  const auto send = [&] { return said(client->sendMessage(message, kCategory, 6)); };
+  const auto validate = [&] {
+    const auto r = client->validateReporter(7);
+    return said(r.status, std::to_string(r.value.reporterID * 10 + r.value.serviceType));
+  };
+  const Payload valid = PayloadBuilder().set("reporterID", 7).set("serviceType", 9).build();
+  const Payload error = PayloadBuilder().set("code", 9).set("domain", "d").build();
+  const auto bytes = [](const Payload& p) { return Bytes(p.encoded().begin(), p.encoded().end()); };
+  const std::string sent = " 6 {gain=0.5,on=1} 134217733 6 null";
+  const struct {
+    Bytes answer;
+    std::function<std::string()> call;
+    std::string outcome, frame;
+  } cases[] = {
+      {{0xf5}, create, "true", " 1 -7"},
+      {{0x61, 'x'}, create, "refused", " 1 -7"},
+      {{0xf5}, [&] { return shown(client->setServiceType(65535, 7)); }, "true", " 2 65535 7"},
+      {{0x19, 0xff, 0xfe}, type, "65534", " 3 7"},
+      {{0x1a, 0, 1, 0, 0}, type, "refused", " 3 7"},
+      {{0x20}, type, "refused", " 3 7"},
+      {{0xf5},
+       [&] { return shown(client->setConfiguration(message, 7)); },
+       "true",
+       " 4 {gain=0.5,on=1} 7"},
+      {{0xf6}, send, "ok", sent},
+      {{0x61, 'x'}, send, "refused", sent},
+      {bytes(error),
+       [&] {
+         return said(client->sendMessage(Payload(), 0xFFFFFFFF, 65535, {7, -1}));
+       },
+       "d 9", " 6 {} 4294967295 65535 (7,-1)"},
+      {{0xf4}, [&] { return shown(client->stopReportingSession(7)); }, "false", " 7 7"},
+      {{0xf5}, [&] { return shown(client->destroyReportingSession(7)); }, "true", " 8 7"},
+      {{0x82, 0x20, 0x18, 42}, all, "{ -1, 42 }", " 10"},
+      {{0x81, 0x61, 'x'}, all, "refused", " 10"},
+      {bytes(valid), validate, "79", " 9 7"},
+      {{0xa0}, validate, "refused", " 9 7"}};
   int number = 0;
-  const auto reply = [&](const auto& value) { service.write(frame(2, ++number, value)); };
-  reply(true);
-  EXPECT_TRUE(client->createReportingSession(-7).value);
-  reply(true);
-  EXPECT_TRUE(client->setServiceType(65535, 7).value);
-  reply(65534);
-  EXPECT_EQ(client->getServiceType(7).value, 65534);
-  reply(true);
-  EXPECT_TRUE(client->setConfiguration(message, 7).value);
-  reply(nullptr);
-  EXPECT_TRUE(client->sendMessage(message, kCategory, 6).ok());
-  reply(PayloadBuilder().set("code", 9).set("domain", "d").build().encoded());
-  const ClientStatus refused = client->sendMessage(Payload(), 0xFFFFFFFF, 65535, {7, -1});
-  EXPECT_EQ(refused.code, Code::ReportingError);
-  EXPECT_EQ(refused.domain, "d");
-  EXPECT_EQ(refused.wireCode, 9);
-  reply(false);
-  const auto stopped = client->stopReportingSession(7);
-  EXPECT_TRUE(stopped.ok() && !stopped.value);
-  reply(true);
-  EXPECT_TRUE(client->destroyReportingSession(7).value);
-  reply(Bytes{0x82, 0x20, 0x18, 42});
-  EXPECT_THAT(client->getAllReporters().value, ElementsAre(-1, 42));
-  reply(PayloadBuilder().set("reporterID", 7).set("serviceType", 9).build().encoded());
-  const ReporterValidation validation = client->validateReporter(7).value;
-  EXPECT_EQ(validation.reporterID, 7);
-  EXPECT_EQ(validation.serviceType, 9);
+  for (const auto& [answer, call, outcome, arguments] : cases) {
+    service.write(frame(2, ++number, answer));
+    EXPECT_EQ(call(), outcome) << number;
+    EXPECT_THAT(service.texts(), ElementsAre("1 " + std::to_string(number) + arguments));
+  }
+  service.write(frame(3, ++number, 5, "enough"));
+  EXPECT_EQ(client->createReportingSession(1).status.wireCode, 5);
   client->startReportingSession(7, nullptr);
   client->sendMessageAsync(Payload(), 1, 1, std::vector<int64_t>{});  // not the same as without
   EXPECT_TRUE(client->killService().ok());
-  EXPECT_THAT(service.texts(),
-              ElementsAre("1 1 1 -7", "1 2 2 65535 7", "1 3 3 7", "1 4 4 {gain=0.5,on=1} 7",
-                          "1 5 6 {gain=0.5,on=1} 134217733 6 null",
-                          "1 6 6 {} 4294967295 65535 (7,-1)", "1 7 7 7", "1 8 8 7", "1 9 10",
-                          "1 10 9 7", "1 11 5 7", "1 12 6 {} 1 1 ()", "1 13 11"));
-}
-
-TEST_F(ReportingClientTest, AnAnswerOfAnotherKindRefusesThatCallAlone) {
-  connect();
-  const auto type = [&] { return client->getServiceType(1).status; };
-  const auto create = [&] { return client->createReportingSession(1).status; };
-  const std::pair<Bytes, std::function<ClientStatus()>> cases[] = {
-      {{0x61, 'x'}, create},
-      {{0x1a, 0, 1, 0, 0}, type},
-      {{0x20}, type},
-      {{0xa0}, [&] { return client->validateReporter(1).status; }},
-      {{0x81, 0x61, 'x'}, [&] { return client->getAllReporters().status; }},
-      {{0x61, 'x'}, [&] { return client->sendMessage(message, 1, 1); }}};
-  int number = 0;
-  for (const auto& [value, call] : cases) {
-    service.write(frame(2, ++number, value));
-    EXPECT_EQ(call().code, Code::Refused) << number;
-  }
-  service.write(frame(3, 7, 5, "enough"));
-  const ClientStatus refused = create();
-  EXPECT_EQ(refused.code, Code::Refused);
-  EXPECT_EQ(refused.wireCode, 5);
-  EXPECT_TRUE(client->isConnected());
+  EXPECT_THAT(service.texts(), ElementsAre("1 17 1 1", "1 18 5 7", "1 19 6 {} 1 1 ()", "1 20 11"));
 }
 
 TEST_F(ReportingClientTest, CallsUpToTheLimits) {
@@ -340,16 +324,6 @@ TEST_F(ReportingClientTest, ACallbackMayCallAndReadOn) {
   service.write(yes(5));
   EXPECT_EQ(client->goodbye(kShort).code, Code::TimedOut);
   EXPECT_THAT(service.texts(), ElementsAre("1 5 1 5", "4"));
-}
-
-TEST_F(ReportingClientTest, ConnectingSaysWhereAndWhatToDo) {
-  ReportingClient lone;
-  EXPECT_EQ(lone.connect(std::string(108, 'x')).code, Code::NotConnected);
-  setenv("VXREPORTING_SOCKET", "/nonexistent/named.socket", 1);
-  const ClientStatus missing = lone.connect();
-  EXPECT_EQ(missing.code, Code::NotConnected);
-  EXPECT_THAT(missing.text, testing::MatchesRegex(".*/nonexistent/named.socket.*vxreportingd.*"));
-  unsetenv("VXREPORTING_SOCKET");
 }
 
 }  // namespace
