@@ -3,6 +3,7 @@
 
 #include <gmock/gmock.h>
 
+#include <cstdlib>
 #include <filesystem>
 #include <fstream>
 #include <sstream>
@@ -16,13 +17,13 @@ using ::testing::ElementsAre;
 using ::testing::HasSubstr;
 using ::testing::IsEmpty;
 
-class FolderTest : public ::testing::Test {
- protected:
-  FolderTest() {
+class Folder {
+ public:
+  Folder() {
     std::string pattern = "/tmp/vxtest-XXXXXX";
     folder = mkdtemp(pattern.data());
   }
-  ~FolderTest() override { std::filesystem::remove_all(folder); }
+  ~Folder() { std::filesystem::remove_all(folder); }
   void write(const std::string& name, const std::string& text) {
     std::filesystem::create_directories(std::filesystem::path(folder + "/" + name).parent_path());
     std::ofstream(folder + "/" + name) << text;
@@ -32,8 +33,12 @@ class FolderTest : public ::testing::Test {
     text << std::ifstream(folder + "/" + name).rdbuf();
     return text.str();
   }
-  fakes::FakePlatform p;
   std::string folder;
+};
+
+class FolderTest : public ::testing::Test, protected Folder {
+ protected:
+  fakes::FakePlatform p;
 };
 
 }  // namespace vx::lnx

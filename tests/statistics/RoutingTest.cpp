@@ -8,7 +8,7 @@ namespace {
 class RoutingTest : public ServiceTest {};
 
 TEST_F(RoutingTest, StartTakesItsSnapshotAfterStartingAndHoldsTheReply) {
-  drivers.count("Speaker/x", "1");
+  drivers.write("Speaker/x", "1");
   service = VXReportingServiceDelegate::create();
   auto& client = connect();
   create(client, 1);
@@ -23,7 +23,7 @@ TEST_F(RoutingTest, StartTakesItsSnapshotAfterStartingAndHoldsTheReply) {
   EXPECT_TRUE(startedThen);
   start(client, 1);
   EXPECT_THAT(gained({"sample", "reply"}), ElementsAre("reply start true"));
-  drivers.count("Speaker/x", "4");
+  drivers.write("Speaker/x", "4");
   stop(client, 1);
   EXPECT_THAT(gained({"0x2104281C", "0x21042838", "event com", "fetching", "0x21042830", "reply",
                       "default stopping"}),

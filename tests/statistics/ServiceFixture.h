@@ -13,9 +13,10 @@
 
 #include "Statistics/Service/VXReportingServiceDelegate.h"
 #include "Statistics/VXReportingProcessState.h"
+#include "platform/linux/device/CounterChannels.h"
 #include "tests/fakes/FakePlatform.h"
+#include "tests/linux/FolderTest.h"
 #include "tests/propertylist/Dictionary.h"
-#include "tests/statistics/DriverChannels.h"
 
 namespace vx {
 
@@ -40,6 +41,22 @@ class OnServiceQueue {
  private:
   const WorkQueue*& current_;
   const WorkQueue* const outer_;
+};
+
+class DriverChannels final : public lnx::Folder, public lnx::CounterChannels {
+ public:
+  DriverChannels() : CounterChannels({folder, {}}) {}
+  ChannelDictionaryRef createSamples(ChannelSubscription* subscription,
+                                     const ChannelDictionaryRef& subscribed,
+                                     std::optional<Error>& error) override {
+    if (onSample) onSample();
+    return CounterChannels::createSamples(subscription, subscribed, error);
+  }
+  std::optional<std::string_view> channelName(const ChannelSample& sample) override {
+    return nameless ? std::nullopt : CounterChannels::channelName(sample);
+  }
+  std::function<void()> onSample;
+  bool nameless = false;
 };
 
 class PlatformTest : public ::testing::Test {
