@@ -133,6 +133,7 @@ class Section {
       return;
     }
     std::vector<std::string_view> known;
+    known.reserve(choices.size());
     for (const auto& [name, choice] : choices) known.push_back(name);
     complain(key, *node, "must be one of " + quoted(known));
   }

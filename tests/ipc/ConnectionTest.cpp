@@ -94,6 +94,19 @@ class ConnectionTest : public IpcTest, public ConnectionHost {
   std::vector<std::shared_ptr<SocketConnection>> toFlush_;
 };
 
+TEST_F(ConnectionTest, CallsRunWhereverTheStreamIsCut) {
+  const Bytes stream =
+      frame(0, 1) + frame(1, 1, kEcho, 300) + frame(1, 2, kTake, 7, 8, nullptr, nullptr);
+  for (std::size_t cut = 0; cut <= stream.size(); ++cut) {
+    accept();
+    const auto at = stream.begin() + static_cast<std::ptrdiff_t>(cut);
+    send(Bytes(stream.begin(), at));
+    EXPECT_THAT(ask(Bytes(at, stream.end())), ElementsAre(kTestHello, "2 1 1", "2 2 null")) << cut;
+    EXPECT_THAT(object->calls, ElementsAre("echo 300", "take 7 8"));
+  }
+  EXPECT_EQ(counted.calls, 2 * (stream.size() + 1));
+}
+
 TEST_F(ConnectionTest, TheFirstFrameIsAHelloOfThisVersion) {
   const std::pair<Bytes, const char*> cases[] = {{frame(1, 1, kEcho, 1), "3 null 1"},
                                                  {frame(4), "3 null 1"},
@@ -108,8 +121,7 @@ TEST_F(ConnectionTest, TheFirstFrameIsAHelloOfThisVersion) {
   }
   EXPECT_EQ(counted.unsupportedVersions, 2U);
   EXPECT_EQ(counted.malformedFrames, 2U);
-  accept();
-  EXPECT_THAT(ask(frame(0, 1)), ElementsAre(kTestHello));
+  connect();
   EXPECT_THAT(ask(frame(0, 1)), IsEmpty()) << "a second hello is ignored";
 }
 
@@ -240,6 +252,15 @@ TEST_F(ConnectionTest, APeerThatReadsNothingMoreIsCut) {
   EXPECT_FALSE(unreadSays);
   EXPECT_THAT(events, ElementsAre("interrupted", "invalidated"));
   EXPECT_EQ(counted.slowClientsCut, 1U);
+
+  options.maxUnreadReplyBytes = 2 << 20;  // the goodbye is read, and the end waits for the reply
+  connect();
+  object->list.assign(1000000, 1);
+  send(calls(kList, 1, 1) + frame(4));
+  EXPECT_TRUE(unreadSays);
+  connection->cutStalled();
+  EXPECT_FALSE(unreadSays);
+  EXPECT_EQ(closes, 2);
 }
 
 TEST_F(ConnectionTest, RepliesMadeLaterOvershootTheirLimitByOneTurn) {
@@ -257,6 +278,19 @@ TEST_F(ConnectionTest, RepliesMadeLaterOvershootTheirLimitByOneTurn) {
     run();
   }
   EXPECT_THAT(answers(), SizeIs(610));
+}
+
+TEST_F(ConnectionTest, CongestionHoldsFramesBack) {
+  connect();
+  congested = true;
+  send(calls(kEcho, 1, 2));
+  send(calls(kEcho, 3, 600));  // more than one turn takes
+  EXPECT_THAT(object->calls, IsEmpty());
+  EXPECT_EQ(waits, 1);
+  congested = false;
+  connection->continueReading();
+  run();
+  EXPECT_THAT(answers(), SizeIs(600));
 }
 
 TEST_F(ConnectionTest, AGoodbyeLetsCallsEndFirst) {
@@ -321,27 +355,41 @@ TEST_F(ConnectionTest, EveryCallIsAnsweredOnceFromAnyThread) {
   answer(2);
 }
 
-TEST_F(ConnectionTest, ShutDownRunsWhatHasArrivedAndWaitsForAnswersUntilTimeRunsOut) {
-  options.maxCallsInFlight = 1;
-  for (const bool inTime : {true, false}) {
-    connect();
-    call(1, kHold);
-    send(calls(kKeep, 2, 2));
-    peer.write(calls(kEcho, 3, 701) + Bytes{5, 0, 0, 0, 0x84});
-    connection->shutDown();
-    if (!inTime) connection->shutDownNow();
-    run();
-    EXPECT_THAT(events, SizeIs(inTime ? 0 : 1));
-    if (inTime) answer(1);
-    runUntil([&] { return !events.empty(); });
-    run();
-    EXPECT_THAT(events, ElementsAre("invalidated"));
-    const std::vector<std::string> got = answers();
-    ASSERT_THAT(got, SizeIs(inTime ? 701 : 1));
-    EXPECT_EQ(got.back(), "4");
-    EXPECT_EQ(peer.ended(), inTime);
-  }
+TEST_F(ConnectionTest, ShutDownRunsWhatHasArrived) {
+  connect();
+  call(1, kHold);
+  peer.write(calls(kEcho, 2, 701) + Bytes{5, 0, 0, 0, 0x84});
+  connection->shutDown();
+  run();
+  EXPECT_THAT(object->calls, SizeIs(701));
+  EXPECT_THAT(events, ElementsAre("invalidated"));
+  const std::vector<std::string> got = answers();
+  ASSERT_THAT(got, SizeIs(701));
+  EXPECT_EQ(got[699], "2 701 1");
+  EXPECT_EQ(got[700], "4");
+  EXPECT_TRUE(peer.ended());
   EXPECT_EQ(closes, 1);
+}
+
+TEST_F(ConnectionTest, ShutDownWaitsForAnswersUntilTimeRunsOut) {
+  options.maxCallsInFlight = 1;
+  connect();
+  send(calls(kKeep, 1, 1) + calls(kEcho, 2, 2));
+  connection->shutDown();
+  run();
+  EXPECT_THAT(events, IsEmpty());
+  answer(0);
+  runUntil([&] { return !events.empty(); });
+  run();
+  EXPECT_THAT(answers(), ElementsAre("2 1 1", "2 2 1", "4"));
+
+  connect();
+  call(1, kKeep);
+  connection->shutDown();
+  connection->shutDownNow();
+  run();
+  EXPECT_THAT(answers(), ElementsAre("4"));
+  EXPECT_THAT(events, ElementsAre("invalidated"));
 }
 
 }  // namespace

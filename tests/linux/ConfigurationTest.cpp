@@ -45,6 +45,13 @@ TEST_F(ConfigurationTest, ComplaintsNameFileLineAndKeyAndDefaultsStay) {
   EXPECT_THAT(load(), ElementsAre(HasSubstr("not a regular file")));
 }
 
+TEST_F(ConfigurationTest, RelaysToKnownBackEndsAlone) {
+  EXPECT_THAT(complaintsOf("[relay]\nbackends = [\"cloud\", \"store\", \"store\"]\n"),
+              ElementsAre(AllOf(HasSubstr(file + "2: relay.backends: "), HasSubstr("cloud"),
+                                HasSubstr("\"store\""))));
+  EXPECT_THAT(configuration.relay.backends, ElementsAre("store"));
+}
+
 TEST_F(ConfigurationTest, RangesEndWhereTheySay) {
   EXPECT_THAT(complaintsOf("[log]\nburst = 65535\nrefill_per_second = 1\n[listener]\n"
                            "max_frame_bytes = 1048576\n[drivers]\nmapped = []\n"
