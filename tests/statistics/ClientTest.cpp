@@ -130,6 +130,7 @@ TEST_F(ClientTest, RegistrationPrecedesTheClientsFirstOperation) {
 
 TEST_F(ClientTest, UptimeIsSentOnInvalidationOnlyAndOnce) {
   connect();
+  mark();
   p.clock.advance(2500ms);
   connections[0]->interruption();
   run();

@@ -143,10 +143,10 @@ class ServiceTest : public PlatformTest {
     client.stopReportingSessionForID(id, booleans("stop"));
     run();
   }
-  void send(Client& client, const Payload& message, MessageCategory category, MessageType type,
+  void send(Client& client, const Payload& sent, MessageCategory category, MessageType type,
             std::optional<std::vector<ReporterID>> ids = std::nullopt, std::string_view skip = "") {
     mark();
-    client.sendMessage(message, category, type, std::move(ids),
+    client.sendMessage(sent, category, type, std::move(ids),
                        [this](const std::optional<Error>& error) {
                          p.journal.push_back(error ? "reply send " + error->domain + " " +
                                                          std::to_string(error->code)
