@@ -21,10 +21,10 @@ class StoreTest : public FolderTest {
   static Rows query(sqlite3* database, const std::string& sql) {
     Rows rows;
     auto add = [](void* out, int count, char** values, char**) {
-      std::string row;
+      std::string line;
       for (int i = 0; i < count; ++i)
-        row += (i > 0 ? "|" : "") + std::string(values[i] != nullptr ? values[i] : "null");
-      static_cast<Rows*>(out)->push_back(row);
+        line += (i > 0 ? "|" : "") + std::string(values[i] != nullptr ? values[i] : "null");
+      static_cast<Rows*>(out)->push_back(line);
       return 0;
     };
     EXPECT_EQ(sqlite3_exec(database, sql.c_str(), add, &rows, nullptr), SQLITE_OK)
@@ -58,9 +58,9 @@ class StoreTest : public FolderTest {
         .set(kVyrReportingUserInfoServiceName, "s")
         .build();
   }
-  static RelayOpenRecord opening(std::shared_ptr<RelayRow> row, VyrSessionInfo info,
+  static RelayOpenRecord opening(std::shared_ptr<RelayRow> of, VyrSessionInfo info,
                                  Payload user = userInfo()) {
-    return {std::move(row),
+    return {std::move(of),
             std::make_unique<std::pair<VyrSessionInfo, Payload>>(std::move(info), std::move(user))};
   }
   RelayMessageRecord message(Payload payload) { return {row, std::move(payload), 5, 7}; }

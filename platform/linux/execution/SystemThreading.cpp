@@ -139,7 +139,8 @@ class SystemRunLoop final : public RunLoop {
  private:
   const std::shared_ptr<LoopState> state_ = std::make_shared<LoopState>();
   ThreadChecker thread_;
-  std::vector<std::shared_ptr<SystemTimer>> timers_ GUARDED_BY(thread_);  // bounded by who attaches them
+  std::vector<std::shared_ptr<SystemTimer>> timers_
+      GUARDED_BY(thread_);  // bounded by who attaches them
 };
 
 class SystemThread final : public Thread {};
