@@ -318,6 +318,11 @@ std::span<const uint8_t> Payload::encoded() const {
   return {block_->bytes(), block_->size()};
 }
 
+Payload::Validated Payload::validated() const {
+  if (block_ == nullptr) return {};
+  return {encoded(), {block_->spaceInKeys(), block_->mayHoldNonFinite()}};
+}
+
 std::string Payload::text() const {
   std::string out;
   appendTextOf(out, encoded().data());
@@ -336,8 +341,12 @@ void Payload::release() noexcept {
   if (block_ == nullptr) return;
   // The only owner needs no read-modify-write.
   if (block_->references.load(std::memory_order_acquire) == 1 ||
-      block_->references.fetch_sub(1, std::memory_order_acq_rel) == 1)
-    ::operator delete(block_);
+      block_->references.fetch_sub(1, std::memory_order_acq_rel) == 1) {
+    if (block_->isPlaced()) [[unlikely]]
+      Block::placedReleased.load(std::memory_order_acquire)(block_);
+    else
+      ::operator delete(block_);
+  }
 }
 
 }  // namespace vx

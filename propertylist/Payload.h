@@ -176,6 +176,18 @@ struct DecodeError {
 class Payload {
  public:
   static constexpr int kMaxNesting = 32;
+  static constexpr std::size_t kMaxBytes = 0x1FFFFFFF;  // of the encoding
+
+  // What is known of validated bytes, so that nobody has to look for it again.
+  struct Traits {
+    bool spaceInKeys = false;       // of this dictionary
+    bool mayHoldNonFinite = false;  // anywhere inside; a value replaced since may have been it
+  };
+  // A dictionary's validated bytes; none for the empty dictionary. A view.
+  struct Validated {
+    std::span<const uint8_t> bytes;
+    Traits traits;
+  };
 
   Payload() = default;  // the empty dictionary; allocates nothing
   Payload(const Payload& other) noexcept : block_(other.block_) { retain(); }
@@ -213,6 +225,7 @@ class Payload {
   bool mayHoldNonFinite() const;
   // The CBOR encoding. The empty dictionary encodes as one byte.
   std::span<const uint8_t> encoded() const;
+  Validated validated() const;
   std::string text() const;  // as Value::text
   // The same for all copies of one object, as long as one of them lives; null for the empty
   // dictionary.
@@ -225,6 +238,7 @@ class Payload {
  private:
   friend class PayloadBuilder;
   friend class Frame;
+  friend class PlacedPayload;
   struct Block;
   explicit Payload(Block* adopted) : block_(adopted) {}
   void retain() const noexcept;
@@ -244,7 +258,7 @@ class ArrayBuilder;
 // What is put in always makes a valid Payload: bytes that are not UTF-8 become U+FFFD, a date that
 // is not finite becomes 1970, a Null value changes nothing. Nesting is the caller's affair: one
 // deeper than Payload::kMaxNesting can be built and written, but no peer will accept it.
-// std::length_error beyond 1 GiB.
+// std::length_error beyond 512 MiB.
 class PayloadBuilder {
  public:
   PayloadBuilder() = default;
@@ -372,6 +386,8 @@ class Frame {
   Value operator[](std::size_t i) const { return {elements_[i].begin, elements_[i].end}; }
   // A copy of an element that is a dictionary; validation has noted what else is to be known of it.
   Payload payload(std::size_t i) const;
+  // The bytes such a copy is made of.
+  Payload::Validated validated(std::size_t i) const;
 
  private:
   std::array<Element, kMaxElements> elements_;

@@ -156,7 +156,7 @@ PayloadBuilder& PayloadBuilder::put(std::string_view key, Write write) {
   write(out);
   if (body_.size() > Payload::Block::kMaxSize - 9) {
     body_.resize(start);
-    throw std::length_error("a property list is limited to 1 GiB");
+    throw std::length_error("a property list is limited to 512 MiB");
   }
   if (old == nullptr)
     add(key, {offset(start), offset(value), offset(body_.size()), hash});

@@ -120,7 +120,8 @@ class Validator {
 };
 
 bool Validator::run() {
-  if (end_ - begin_ > static_cast<std::ptrdiff_t>(0x7FFFFFFF)) return fail(begin_, "too large");
+  if (static_cast<std::size_t>(end_ - begin_) > Payload::kMaxBytes)
+    return fail(begin_, "too large");
   cbor::Head head;
   if (!readHead(head)) return false;
   if (elements_ == nullptr && head.major() != cbor::kMap) return fail(begin_, "not a dictionary");
@@ -321,12 +322,17 @@ std::optional<Frame> Frame::decode(std::span<const uint8_t> bytes, DecodeError* 
   return frame;
 }
 
-Payload Frame::payload(std::size_t i) const {
+Payload::Validated Frame::validated(std::size_t i) const {
   const Element& element = elements_[i];
-  const auto size = static_cast<std::size_t>(element.end - element.begin);
-  if (cbor::head(element.begin).argument == 0) return Payload();  // however long its head
-  Payload::Block* block = Payload::Block::allocate(size, {element.spaceInKeys, element.nonFinite});
-  std::memcpy(block->bytes(), element.begin, size);
+  if (cbor::head(element.begin).argument == 0) return {};  // however long its head
+  return {{element.begin, element.end}, {element.spaceInKeys, element.nonFinite}};
+}
+
+Payload Frame::payload(std::size_t i) const {
+  const Payload::Validated from = validated(i);
+  if (from.bytes.empty()) return Payload();
+  Payload::Block* block = Payload::Block::allocate(from.bytes.size(), from.traits);
+  std::memcpy(block->bytes(), from.bytes.data(), from.bytes.size());
   return Payload(block);
 }
 
