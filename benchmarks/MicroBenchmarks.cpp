@@ -2,11 +2,13 @@
 #include <benchmark/benchmark.h>
 
 #include <cstring>
+#include <filesystem>
 #include <string>
 #include <vector>
 
 #include "benchmarks/Workload.h"
 #include "platform/linux/execution/Executor.h"
+#include "platform/linux/journal/Journal.h"
 #include "propertylist/CborWriter.h"
 #include "propertylist/JsonWriter.h"
 #include "propertylist/Payload.h"
@@ -95,6 +97,50 @@ void textOfEveryValue(benchmark::State& state) {  // what the summary event is m
   state.SetItemsProcessed(state.iterations() * static_cast<int64_t>(kEntriesPerPayload));
 }
 BENCHMARK(textOfEveryValue);
+
+// About 200 encoded bytes, as a client sends them.
+Payload smallPayload() {
+  return PayloadBuilder()
+      .set("route", std::string(90, 'r'))
+      .set("device", std::string(90, 'd'))
+      .build();
+}
+
+void copyPayloadToHeap(benchmark::State& state) {  // what a message costs that is not recorded
+  const Payload payload = smallPayload();
+  const std::span<const uint8_t> bytes = payload.encoded();
+  for (auto _ : state) {
+    std::unique_ptr<uint8_t[]> copy(new uint8_t[bytes.size()]);
+    std::memcpy(copy.get(), bytes.data(), bytes.size());
+    benchmark::DoNotOptimize(copy.get());
+    benchmark::ClobberMemory();
+  }
+}
+BENCHMARK(copyPayloadToHeap);
+
+// Recorded, let go of, and its segment used again: a snapshot of nothing every 16384 calls.
+void appendToJournal(benchmark::State& state) {
+  lnx::JournalOptions options;
+  options.folder = "/dev/shm/vx-microbench-journal";
+  std::filesystem::remove_all(options.folder);
+  const auto journal = lnx::Journal::open(options);
+  if (!journal.ok()) return state.SkipWithError(journal.status().text().c_str());
+  const Payload payload = smallPayload();
+  const uint8_t head[] = {1, 2, 3, 4, 5, 6, 7, 8};
+  const lnx::JournalRecord record{1, 1.5, 2, head, payload.validated()};
+  uint64_t calls = 0;
+  bool ok = true;
+  for (auto _ : state) {
+    const auto appended = journal.value()->append(record);
+    ok = ok && appended.ok();
+    if ((++calls & 16383) == 0)
+      ok = ok && journal.value()->beginGeneration().ok() && journal.value()->endSnapshot().ok();
+  }
+  if (!ok) state.SkipWithError("the journal is full");
+  journal.value()->discard();
+  std::filesystem::remove_all(options.folder);
+}
+BENCHMARK(appendToJournal);
 
 void queueAndRunInteractive(benchmark::State& state) {
   lnx::Executor executor;

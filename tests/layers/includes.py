@@ -23,6 +23,7 @@ ALLOWED = {  # layer -> prefixes of the headers it may include beside its own; t
         "settings": (),
         "diagnostics": (LINUX + "execution/",),
         "device": (LINUX + "execution/",),
+        "journal": (LINUX + "execution/",),
         "store": (LINUX + "execution/", LINUX + "RelayBackend.h"),
         "ipc": (LINUX + "execution/", "wire/"),
     }.items()},

@@ -1,0 +1,62 @@
+// The files of a journal.
+#pragma once
+
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "base/Status.h"
+#include "base/UniqueFd.h"
+#include "platform/linux/journal/JournalFormat.h"
+
+namespace vx::lnx {
+
+// One folder of segments. Trusts nothing in it that is not a regular file of this user which nobody
+// else may open, and follows no links. Immutable, so thread-safe; two processes must not write to
+// the same folder. Keeps at most kMaxAside files, and as many journals, that were set aside: the
+// oldest goes first.
+class JournalFolder {
+ public:
+  static constexpr std::size_t kMaxAside = 4;
+
+  enum class IfMissing { Create, Fail };
+  static Result<JournalFolder> open(const std::string& path, IfMissing ifMissing);
+
+  const std::string& path() const { return path_; }
+  // In order; whatever lies behind them.
+  std::vector<std::string> segments() const;
+  // A name that no file here has, from a number; raises the number past it.
+  std::string freshSegment(uint64_t& next) const;
+
+  enum class Access { Read, Write };
+  // A file that passes the checks, with its header; all zero when the file is free or was never
+  // begun.
+  struct Opened {
+    UniqueFd fd;
+    SegmentHeader header{};
+  };
+  Result<Opened> openSegment(const std::string& name, Access access) const;
+  // Allocated whole: a hole in a file system that has become full would be a SIGBUS.
+  Result<UniqueFd> createSegment(const std::string& name) const;
+  void remove(const std::string& name) const;
+  // Renames a file to name.aside-N; false when it could not.
+  bool setAside(const std::string& name) const;
+
+  // Counts an attempt to replay what is here, before it begins: how many there were with this one.
+  Result<uint32_t> beginAttempt() const;
+  void clearAttempts() const;
+
+  // Renames a whole journal to path.aside-N, which it returns.
+  static Result<std::string> moveAside(const std::string& path);
+  // Moves the segments in use into another folder (made if missing), also of another file system:
+  // they are removed here when all of them are durable there.
+  static Status moveTo(const std::string& from, const std::string& to);
+
+ private:
+  JournalFolder(std::string path, UniqueFd fd) : path_(std::move(path)), fd_(std::move(fd)) {}
+  Status copySegment(const std::string& name, const JournalFolder& to, const std::string& as) const;
+  std::string path_;
+  UniqueFd fd_;
+};
+
+}  // namespace vx::lnx

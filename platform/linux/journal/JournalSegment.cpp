@@ -1,0 +1,73 @@
+#include "platform/linux/journal/JournalSegment.h"
+
+#include <sys/mman.h>
+
+#include <utility>
+
+namespace vx::lnx {
+
+namespace {
+
+std::atomic_ref<uint32_t> wordAt(uint32_t& word) { return std::atomic_ref<uint32_t>(word); }
+
+}  // namespace
+
+Result<JournalSegment::Pointer> JournalSegment::map(const UniqueFd& fd, std::string name) {
+  // Twice the size holds an aligned part of the size; the rest is given back.
+  void* const reserved = mmap(nullptr, 2 * kSegmentBytes, PROT_NONE,
+                              MAP_PRIVATE | MAP_ANONYMOUS | MAP_NORESERVE, -1, 0);
+  if (reserved == MAP_FAILED) return Status::lastError("cannot reserve memory for the journal");
+  auto* const first = static_cast<uint8_t*>(reserved);
+  const std::size_t before = -reinterpret_cast<uintptr_t>(reserved) & (kSegmentBytes - 1);
+  uint8_t* const base = first + before;
+  const bool mapped = mmap(base, kSegmentBytes, PROT_READ | PROT_WRITE,
+                           MAP_SHARED | MAP_FIXED | MAP_POPULATE, fd.get(), 0) != MAP_FAILED;
+  const Status status = mapped ? Status() : Status::lastError("cannot map " + name);
+  if (before > 0) munmap(first, before);
+  munmap(base + kSegmentBytes, kSegmentBytes - before);
+  if (!mapped) {
+    munmap(base, kSegmentBytes);
+    return status;
+  }
+  return Pointer(new JournalSegment(base, std::move(name)));
+}
+
+JournalSegment::JournalSegment(uint8_t* base, std::string name)
+    : base_(base), name_(std::move(name)) {
+  header().owner = this;
+}
+
+JournalSegment::~JournalSegment() { munmap(base_, kSegmentBytes); }
+
+JournalSegment* JournalSegment::of(const void* inside) {
+  const auto address = reinterpret_cast<uintptr_t>(inside) & ~uintptr_t{kSegmentBytes - 1};
+  // NOLINTNEXTLINE(performance-no-int-to-ptr)
+  return static_cast<JournalSegment*>(reinterpret_cast<SegmentHeader*>(address)->owner);
+}
+
+void JournalSegment::begin(const JournalEpoch& epoch, uint32_t generation, uint64_t sequence,
+                           uint64_t firstCall) {
+  markFree();
+  uses_.store(kAttached + kWhileOpen, std::memory_order_relaxed);
+  SegmentHeader& head = header();
+  head.magic = SegmentHeader::kMagic;
+  head.version = SegmentHeader::kVersion;
+  head.epoch = epoch;
+  head.sequence = sequence;
+  head.firstCall = firstCall;
+  head.generation = generation;
+  head.reserved = 0;
+  head.checksum = checksumOf(head);
+  reinterpret_cast<EntryHeader*>(at(kFirstEntry))->length = 0;
+  wordAt(head.state).store(SegmentHeader::kInUse, std::memory_order_release);
+}
+
+void JournalSegment::seal(uint32_t calls, uint32_t payloads) {
+  drop(kWhileOpen - calls * kOneCall - payloads * kOnePayload);
+}
+
+void JournalSegment::markFree() {
+  wordAt(header().state).store(SegmentHeader::kFree, std::memory_order_release);
+}
+
+}  // namespace vx::lnx

@@ -1,0 +1,224 @@
+// What lies in the folder: of another process, another store, another user, another place.
+#include <fcntl.h>
+#include <sys/mount.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <fstream>
+
+#include "tests/journal/JournalFixture.h"
+
+namespace vx::lnx {
+namespace {
+
+namespace fs = std::filesystem;
+
+class JournalFilesTest : public JournalFixture {
+ protected:
+  // A journal of a process that has ended with one call undone.
+  void leaveBehind(uint8_t kind = 1) {
+    open();
+    new JournalTicket(append(kind, dictionary(kind))->ticket);  // its process let go of nothing
+    journal.reset();
+  }
+  static void patch(const std::string& path, std::size_t at, uint8_t value) {
+    std::fstream file(path, std::ios::binary | std::ios::in | std::ios::out);
+    file.seekp(static_cast<std::streamoff>(at));
+    file.put(static_cast<char>(value));
+  }
+};
+
+TEST_F(JournalFilesTest, WhatWasLeftStaysUntilItIsForgotten) {
+  leaveBehind(1);
+  leaveBehind(2);
+  open();
+  EXPECT_EQ(journal->counters().segmentsInUse, 2u);
+  const auto third = append(3, dictionary(3));
+  EXPECT_EQ(readKinds(), "1 2 3");
+  EXPECT_THAT(complaints, IsEmpty());
+  journal->forgetRecovered();
+  EXPECT_EQ(readKinds(), "3");
+  EXPECT_GT(third->call, 2u);
+  EXPECT_GT(read().records[0].generation, 2u);
+  journal->discard();
+  EXPECT_THAT(files(), IsEmpty());
+  EXPECT_EQ(append(4, dictionary(4)).status().code(), ENOSPC);
+}
+
+TEST_F(JournalFilesTest, FilesOfOthersAreSetAsideAndReported) {
+  struct Case {
+    const char* what;
+    std::function<void(const std::string&)> spoil;
+    const char* complaint;
+  };
+  const Case cases[] = {
+      {"magic", [](auto& path) { patch(path, 0, 'x'); }, "is no journal segment"},
+      {"version", [](auto& path) { patch(path, offsetof(SegmentHeader, version), 9); },
+       "is of version 9"},
+      {"header", [](auto& path) { patch(path, offsetof(SegmentHeader, sequence), 9); },
+       "has a damaged header"},
+      {"size", [](auto& path) { fs::resize_file(path, kSegmentBytes - 1); },
+       "is not of a segment's size"},
+      {"mode", [](auto& path) { chmod(path.c_str(), 0640); }, "is open to other users"},
+      {"link",
+       [](auto& path) {
+         fs::rename(path, path + ".kept");
+         symlink((path + ".kept").c_str(), path.c_str());
+       },
+       "cannot open"},
+      {"pipe",
+       [](auto& path) {
+         fs::remove(path);
+         mkfifo(path.c_str(), 0600);
+       },
+       "is of another kind"},
+      {"folder",
+       [](auto& path) {
+         fs::remove(path);
+         fs::create_directory(path);
+       },
+       "is of another kind"},
+  };
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.what);
+    fs::remove_all(options.folder);
+    leaveBehind();
+    const std::string path = onlySegment();
+    c.spoil(path);
+    EXPECT_THAT(read().refused, SizeIs(1));
+    EXPECT_EQ(readKinds(), "");
+    open();
+    EXPECT_THAT(complaints, ElementsAre(HasSubstr(c.complaint)));
+    EXPECT_EQ(journal->counters().aside, 1u);
+    EXPECT_FALSE(fs::exists(fs::symlink_status(path)));
+    EXPECT_TRUE(fs::exists(fs::symlink_status(path + ".aside-1")));
+    EXPECT_TRUE(append(2, dictionary(2)).ok());
+  }
+}
+
+TEST_F(JournalFilesTest, FilesOfAnotherStoreOrUserAreSetAside) {
+  leaveBehind();
+  options.epoch[15] = 1;
+  EXPECT_THAT(JournalReader::read(options.folder, options.epoch)->refused,
+              ElementsAre(HasSubstr("another store")));
+  open();
+  EXPECT_THAT(complaints, ElementsAre(HasSubstr("another store")));
+  journal->discard();
+  if (geteuid() != 0) return;
+  leaveBehind();
+  const std::string path = options.folder + "/segment-0000000000000001.vxj";
+  ASSERT_EQ(chown(path.c_str(), 1, 1), 0);
+  open();
+  EXPECT_THAT(complaints, ElementsAre(HasSubstr("belongs to another user")));
+  EXPECT_THAT(files(), SizeIs(2));
+}
+
+TEST_F(JournalFilesTest, KeepsTheLastFewThatWereSetAside) {
+  for (int i = 0; i < 6; ++i) {
+    leaveBehind();
+    patch(options.folder + "/segment-0000000000000001.vxj", 0, 'x');
+  }
+  open();
+  std::vector<std::string> names = files();
+  ASSERT_THAT(names, SizeIs(JournalFolder::kMaxAside));
+  EXPECT_THAT(names[0], HasSubstr(".aside-3"));
+  EXPECT_THAT(names[3], HasSubstr(".aside-6"));
+}
+
+TEST_F(JournalFilesTest, AFileThatWasNeverBegunIsNobodysLoss) {
+  open();
+  std::ofstream(options.folder + "/segment-0000000000000007.vxj").flush();
+  std::ofstream(options.folder + "/segment-0000000000000008.vxj") << std::string(kSegmentBytes, 0);
+  for (const std::string& name : files()) chmod((options.folder + "/" + name).c_str(), 0600);
+  open();
+  EXPECT_THAT(complaints, IsEmpty());
+  EXPECT_THAT(files(), IsEmpty());
+  appendDone(1);
+  struct stat info {};
+  stat(onlySegment().c_str(), &info);
+  EXPECT_EQ(info.st_mode & 0777, 0600u);
+  EXPECT_EQ(static_cast<std::size_t>(info.st_blocks) * 512, kSegmentBytes) << "it has holes";
+}
+
+TEST_F(JournalFilesTest, AFolderOfOthersIsRefused) {
+  fs::create_directory(options.folder);
+  chmod(options.folder.c_str(), 0755);
+  EXPECT_FALSE(Journal::open(options).ok());
+  fs::remove(options.folder);
+  fs::create_directory_symlink(root, options.folder);
+  EXPECT_FALSE(Journal::open(options).ok());
+  options.folder = root + "/none/journal";
+  EXPECT_EQ(Journal::open(options).status().code(), ENOENT);
+}
+
+TEST_F(JournalFilesTest, AttemptsAreCountedUntilTheJournalIsForgotten) {
+  leaveBehind();
+  const auto attempt = [&] {
+    return *JournalFolder::open(options.folder, JournalFolder::IfMissing::Fail)->beginAttempt();
+  };
+  EXPECT_EQ(attempt(), 1u);
+  EXPECT_EQ(attempt(), 2u);
+  open();
+  EXPECT_EQ(attempt(), 3u);
+  journal->forgetRecovered();
+  EXPECT_EQ(attempt(), 1u);
+}
+
+TEST_F(JournalFilesTest, AWholeJournalIsMovedAside) {
+  for (int i = 1; i <= 6; ++i) {
+    leaveBehind(static_cast<uint8_t>(i));
+    const auto moved = JournalFolder::moveAside(options.folder);
+    ASSERT_TRUE(moved.ok()) << moved.status().text();
+    EXPECT_EQ(*moved, options.folder + ".aside-" + std::to_string(i));
+    EXPECT_EQ(JournalReader::read(*moved, kEpoch)->records.at(0).kind, i);
+    EXPECT_FALSE(fs::exists(options.folder));
+  }
+  EXPECT_FALSE(fs::exists(options.folder + ".aside-2"));
+  EXPECT_TRUE(fs::exists(options.folder + ".aside-3"));
+  EXPECT_EQ(JournalFolder::moveAside(options.folder).status().code(), ENOENT);
+}
+
+TEST_F(JournalFilesTest, MovesToAnotherFileSystemAndIsReadThere) {
+  std::string other = "/var/tmp/vxtest-XXXXXX";
+  other = mkdtemp(other.data());
+  leaveBehind(1);
+  leaveBehind(2);
+  const std::string twice = options.folder + "/segment-0000000000000001.vxj";
+  fs::copy_file(twice, root + "/twice");
+  ASSERT_TRUE(JournalFolder::moveTo(options.folder, other).ok());
+  EXPECT_THAT(files(), IsEmpty());
+  EXPECT_THAT(JournalReader::read(other, kEpoch)->records, SizeIs(2));
+  // The process ended between copying and removing: the next move copies it again.
+  fs::copy_file(root + "/twice", twice);
+  options.first = JournalReader::read(other, kEpoch)->next;
+  leaveBehind(3);
+  ASSERT_TRUE(JournalFolder::moveTo(options.folder, other).ok());
+  options.folder = other;
+  EXPECT_EQ(readKinds(), "1 2 3");
+  EXPECT_THAT(files(), SizeIs(4));
+  fs::remove_all(other);
+  EXPECT_FALSE(JournalFolder::moveTo(root + "/none", other).ok());
+}
+
+TEST_F(JournalFilesTest, AFullFileSystemKeepsTheJournalWhereItIs) {
+  const std::string small = root + "/small";
+  fs::create_directory(small);
+  if (mount("none", small.c_str(), "tmpfs", 0, "size=5m,mode=700") != 0) GTEST_SKIP() << "no root";
+  for (uint8_t i = 1; i <= 3; ++i) leaveBehind(i);
+  EXPECT_EQ(JournalFolder::moveTo(options.folder, small).code(), ENOSPC);
+  EXPECT_EQ(readKinds(), "1 2 3");
+  fs::remove_all(small + "/segment-0000000000000001.vxj");
+  const std::string large = options.folder;
+  options.folder = small + "/journal";
+  fs::remove_all(small + "/segment-0000000000000002.vxj");
+  open();
+  int appended = 0;
+  while (append(1, dictionary(1, 500000)).ok()) ++appended;
+  EXPECT_EQ(appended, 8) << "two segments fit";
+  EXPECT_EQ(read().records.size(), 8u);
+  journal.reset();
+  EXPECT_EQ(umount2(small.c_str(), MNT_DETACH), 0);
+}
+
+}  // namespace
+}  // namespace vx::lnx
