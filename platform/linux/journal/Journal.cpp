@@ -200,7 +200,7 @@ inline void Journal::publish(EntryHeader* entry, std::size_t length) {
 Status Journal::beginGeneration() {
   MutexLock lock(mutex_);
   ++next_.generation;
-  const Status rolled = roll(Use::Snapshot);
+  Status rolled = roll(Use::Snapshot);
   if (!rolled.ok()) {
     --next_.generation;
     return rolled;

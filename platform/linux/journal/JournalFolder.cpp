@@ -225,7 +225,7 @@ Status JournalFolder::moveTo(const std::string& from, const std::string& to) {
   for (const std::string& name : source->segments()) {
     const Result<Opened> opened = source->openSegment(name, Access::Read);
     if (!opened.ok() || opened->header.state == SegmentHeader::kFree) continue;
-    const Status copied = source->copySegment(name, *target, target->freshSegment(next));
+    Status copied = source->copySegment(name, *target, target->freshSegment(next));
     if (!copied.ok()) return copied;
     moved.push_back(name);
   }
