@@ -19,13 +19,13 @@ ALLOWED = {  # layer -> prefixes of the headers it may include beside its own; t
     "client": (*PURE, "wire/"),
     "tools": (*PURE, "client/"),
     **{f"platform/linux/{wing}": (*PURE, "platform/", *others) for wing, others in {
-        "execution": (),
+        "execution": (LINUX + "journal/",),
         "settings": (),
         "diagnostics": (LINUX + "execution/",),
         "device": (LINUX + "execution/",),
-        "journal": (LINUX + "execution/",),
-        "store": (LINUX + "execution/", LINUX + "RelayBackend.h"),
-        "ipc": (LINUX + "execution/", "wire/"),
+        "journal": (),
+        "store": (LINUX + "execution/", LINUX + "journal/", LINUX + "RelayBackend.h"),
+        "ipc": (LINUX + "execution/", LINUX + "journal/", "wire/"),
     }.items()},
 }
 ENTRY = "Statistics/Service/main.cpp"

@@ -160,7 +160,7 @@ std::size_t Lane::runOne(std::size_t maxItems) {
     mutex_.unlock();
     {
       const Current current(concurrentQueue_);
-      item->work();
+      item->run();
       item.reset();
     }
     itemsDone(1);

@@ -4,14 +4,25 @@
 #include <utility>
 
 #include "platform/WorkQueue.h"
+#include "platform/linux/execution/CauseScope.h"
 #include "platform/linux/execution/FreeList.h"
 
 namespace vx::lnx {
 
 // One submitted piece of work. Singly linked, so that a queue is two pointers.
 struct WorkItem {
-  explicit WorkItem(Work w) : work(std::move(w)) {}
+  explicit WorkItem(Work w) : cause(Cause::take()), work(std::move(w)) {}
+  // Of work that is dropped at the end, the call is not done: it is found again in the journal.
+  ~WorkItem() {
+    if (work) cause.ticket.abandon();
+  }
+  void run() {
+    const CauseScope scope(cause);
+    work();
+    work = nullptr;
+  }
   WorkItem* next = nullptr;
+  Cause cause;
   Work work;
 #ifndef __SANITIZE_ADDRESS__  // which would not see a use of an item that is done with
   static void* operator new(std::size_t) { return FreeList<WorkItem>::allocate(); }

@@ -23,8 +23,13 @@ class JournalTicket {
     if (entry_ != nullptr) release();
   }
 
+  // Lets go without saying that the call is done: it never will be in this process.
+  void abandon() noexcept { entry_ = nullptr; }
   explicit operator bool() const { return entry_ != nullptr; }
   uint64_t call() const { return entry_ == nullptr ? 0 : entry_->call; }
+  // When the call was accepted, seconds since 1970; and the kind of its record. Of a call only.
+  double time() const { return entry_->time; }
+  uint8_t kind() const { return entry_->kind; }
 
  private:
   friend class Journal;

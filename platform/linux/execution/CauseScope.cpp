@@ -1,0 +1,43 @@
+#include "platform/linux/execution/CauseScope.h"
+
+#include <algorithm>
+
+namespace vx::lnx {
+
+namespace {
+
+struct Bits {
+  uint8_t shift;
+  uint32_t most;
+};
+constexpr Bits kBits[] = {{30, 3}, {8, (1u << 22) - 1}, {4, 15}, {0, 15}};
+constexpr uint8_t kDeepest = std::size(kBits) - 1;
+
+thread_local CauseScope* innermost = nullptr;
+
+}  // namespace
+
+CauseScope::CauseScope(const Cause& cause)
+    : ticket_(cause.ticket),
+      place_(cause.position.place),
+      depth_(cause.position.depth),
+      outer_(std::exchange(innermost, this)) {}
+
+CauseScope::~CauseScope() { innermost = outer_; }
+
+const JournalTicket* CauseScope::current() {
+  return innermost != nullptr && innermost->ticket_ ? &innermost->ticket_ : nullptr;
+}
+
+Cause Cause::take() {
+  CauseScope* const scope = innermost;
+  if (scope == nullptr || !scope->ticket_) return {};
+  const Bits bits = kBits[scope->depth_];
+  // More than a call can cause; they would share the last place rather than take another's.
+  const uint32_t taken = std::min(scope->taken_++, bits.most);
+  return {scope->ticket_,
+          {scope->place_ | taken << bits.shift,
+           std::min<uint8_t>(static_cast<uint8_t>(scope->depth_ + 1), kDeepest)}};
+}
+
+}  // namespace vx::lnx

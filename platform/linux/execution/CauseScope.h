@@ -1,0 +1,63 @@
+// Which recorded call a piece of work goes back to.
+#pragma once
+
+#include <cstdint>
+#include <utility>
+
+#include "platform/linux/journal/JournalTicket.h"
+
+namespace vx::lnx {
+
+// A call, and a place in what it causes.
+//
+// Work that is queued while a call's work runs belongs to that call, on whatever queue and however
+// late, and so does each row appended to the store meanwhile. Each takes the next place, so the
+// same call, run again from the same state, gives its rows the same places: a row is known by
+// (epoch, call, place). The bits of a place, by depth:
+//
+//   | call itself 2 | work it queued 22 | work queued by that 4 | by that in turn 4 |
+struct CausePosition {
+  uint32_t place = 0;
+  uint8_t depth = 0;
+};
+
+// A row's name within an epoch; call 0 stands for none.
+struct RowKey {
+  uint64_t call = 0;
+  uint32_t place = 0;
+  bool operator==(const RowKey&) const = default;
+};
+
+// What queued work or a row to be written holds on to. Its call is not done before it is gone.
+struct Cause {
+  JournalTicket ticket;
+  CausePosition position;
+
+  // For work that the caller queues now, or a row that it appends: takes a place. None outside of
+  // a call.
+  static Cause take();
+  RowKey key() const { return {ticket.call(), ticket ? position.place : 0}; }
+};
+
+// While one lives, the calling thread works because of `cause`. Confined to its thread; scopes
+// nest.
+class CauseScope {
+ public:
+  explicit CauseScope(const Cause& cause);
+  ~CauseScope();
+  CauseScope(const CauseScope&) = delete;
+  CauseScope& operator=(const CauseScope&) = delete;
+
+  // Of the innermost scope; none outside of one.
+  static const JournalTicket* current();
+
+ private:
+  friend struct Cause;
+  const JournalTicket& ticket_;
+  const uint32_t place_;
+  const uint8_t depth_;
+  uint32_t taken_ = 0;
+  CauseScope* const outer_;
+};
+
+}  // namespace vx::lnx
