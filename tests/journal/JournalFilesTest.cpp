@@ -28,18 +28,40 @@ class JournalFilesTest : public JournalFixture {
   }
 };
 
-TEST_F(JournalFilesTest, WhatWasLeftStaysUntilItIsForgotten) {
+TEST_F(JournalFilesTest, WhatWasLeftStaysUntilItsCallsAreDone) {
   leaveBehind(1);
   leaveBehind(2);
   open();
   EXPECT_EQ(journal->counters().segmentsInUse, 2u);
-  const auto third = append(3, dictionary(3));
+  auto third = append(3, dictionary(3));
   EXPECT_EQ(readKinds(), "1 2 3");
   EXPECT_THAT(complaints, IsEmpty());
-  journal->forgetRecovered();
-  EXPECT_EQ(readKinds(), "3");
   EXPECT_GT(third->call, 2u);
-  EXPECT_GT(read().records[0].generation, 2u);
+  EXPECT_GT(read().records[2].generation, 2u);
+
+  const JournalContents left = read();
+  JournalTicket first = journal->resume(left.records[0].place);
+  JournalTicket second = journal->resume(left.records[1].place);
+  EXPECT_EQ(second.call(), left.records[1].call);
+  EXPECT_FALSE(first.wasDone());
+  EXPECT_FALSE(journal->resume({99, kFirstEntry})) << "no such segment";
+  first = {};
+  EXPECT_EQ(readKinds(), "1d 2 3");
+  // Run once more, for what it leaves behind: it stays done whenever this process ends.
+  first = journal->resume(left.records[0].place);
+  EXPECT_TRUE(JournalTicket(first).wasDone());
+  EXPECT_EQ(readKinds(), "1d 2 3");
+
+  ASSERT_TRUE(journal->beginGeneration().ok());
+  EXPECT_FALSE(journal->earlierCallsAreDone());
+  first = second = {};
+  EXPECT_FALSE(journal->earlierCallsAreDone()) << "the third is not";
+  EXPECT_EQ(journal->counters().recycled, 0u);
+  third->ticket = {};
+  EXPECT_TRUE(journal->earlierCallsAreDone());
+  ASSERT_TRUE(journal->endSnapshot().ok());
+  EXPECT_EQ(readKinds(), "");
+  EXPECT_EQ(journal->counters().recycled, 3u);
   journal->discard();
   EXPECT_THAT(files(), IsEmpty());
   EXPECT_EQ(append(4, dictionary(4)).status().code(), ENOSPC);
@@ -77,7 +99,7 @@ TEST_F(JournalFilesTest, FilesOfOthersAreSetAsideAndReported) {
          fs::remove(path);
          fs::create_directory(path);
        },
-       "is of another kind"},
+       "Is a directory"},
   };
   for (const Case& c : cases) {
     SCOPED_TRACE(c.what);
@@ -151,7 +173,7 @@ TEST_F(JournalFilesTest, AFolderOfOthersIsRefused) {
   EXPECT_EQ(Journal::open(options).status().code(), ENOENT);
 }
 
-TEST_F(JournalFilesTest, AttemptsAreCountedUntilTheJournalIsForgotten) {
+TEST_F(JournalFilesTest, AttemptsAreCountedUntilTheyAreCleared) {
   leaveBehind();
   const auto attempt = [&] {
     return *JournalFolder::open(options.folder, JournalFolder::IfMissing::Fail)->beginAttempt();
@@ -160,7 +182,7 @@ TEST_F(JournalFilesTest, AttemptsAreCountedUntilTheJournalIsForgotten) {
   EXPECT_EQ(attempt(), 2u);
   open();
   EXPECT_EQ(attempt(), 3u);
-  journal->forgetRecovered();
+  journal->discard();
   EXPECT_EQ(attempt(), 1u);
 }
 

@@ -40,6 +40,7 @@ Result<std::unique_ptr<Journal>> Journal::open(JournalOptions options,
     std::string complaint = journal->adopt(name);
     if (!complaint.empty() && complaints != nullptr) complaints->push_back(std::move(complaint));
   }
+  journal->sortAdopted();
   return journal;
 }
 
@@ -50,18 +51,22 @@ Journal::Journal(JournalOptions options, JournalFolder folder)
 std::string Journal::adopt(const std::string& name) {
   MutexLock lock(mutex_);
   const Result<JournalFolder::Opened> opened =
-      folder_.openSegment(name, JournalFolder::Access::Read);
+      folder_.openSegment(name, JournalFolder::Access::Write);
   const SegmentHeader header = opened.ok() ? opened->header : SegmentHeader{};
   if (opened.ok() && header.state == SegmentHeader::kFree) {
     folder_.remove(name);
     return {};
   }
+  std::string why = opened.ok() ? name + " is of another store" : opened.status().text();
   if (opened.ok() && header.epoch == options_.epoch) {
-    recovered_.push_back(name);
     next_.goPast(header);
-    return {};
+    Result<JournalSegment::Pointer> segment = JournalSegment::map(opened->fd, name);
+    if (segment.ok()) {
+      sealed_.push_back(std::move(segment).value());
+      return {};
+    }
+    why = segment.status().text();
   }
-  const std::string why = opened.ok() ? name + " is of another store" : opened.status().text();
   if (!folder_.setAside(name)) return why + "; it could not be set aside";
   ++counters_.aside;
   return why + "; set aside";
@@ -72,12 +77,32 @@ Journal::~Journal() {
   if (active_ != nullptr) active_->seal(callsInActive_, payloadsInActive_);
 }
 
-void Journal::forgetRecovered() {
+// Files are numbered in the order in which they were made, and used again in another.
+void Journal::sortAdopted() {
   MutexLock lock(mutex_);
-  for (const std::string& name : recovered_) folder_.remove(name);
-  counters_.recycled += recovered_.size();
-  recovered_.clear();
-  folder_.clearAttempts();
+  std::ranges::stable_sort(
+      sealed_, {}, [](const JournalSegment::Pointer& segment) { return segment->sequence(); });
+}
+
+JournalTicket Journal::resume(JournalPlace place) {
+  MutexLock lock(mutex_);
+  const auto segment = std::ranges::lower_bound(
+      sealed_, place.sequence, {},
+      [](const JournalSegment::Pointer& sealed) { return sealed->sequence(); });
+  if (segment == sealed_.end() || (*segment)->sequence() != place.sequence) return {};
+  if (place.offset < kFirstEntry || place.offset > kSegmentBytes - sizeof(EntryHeader)) return {};
+  auto* const entry = reinterpret_cast<EntryHeader*>((*segment)->at(place.offset));
+  const bool done = entry->waiting == 0 || (entry->waiting & EntryHeader::kWasDone) != 0;
+  store(entry->waiting, done ? EntryHeader::kWasDone | 1 : 1, std::memory_order_relaxed);
+  (*segment)->resumeCall();
+  return JournalTicket(entry);
+}
+
+bool Journal::earlierCallsAreDone() const {
+  MutexLock lock(mutex_);
+  return std::ranges::none_of(sealed_, [this](const auto& segment) REQUIRES(mutex_) {
+    return segment->generation() < next_.generation && segment->hasUndoneCalls();
+  });
 }
 
 void Journal::discard() {
@@ -88,8 +113,6 @@ void Journal::discard() {
   for (const auto* list : {&lingering_, &free_})
     for (const JournalSegment::Pointer& segment : *list) folder_.remove(segment->name());
   for (const JournalSegment::Pointer& segment : sealed_) folder_.remove(segment->name());
-  for (const std::string& name : recovered_) folder_.remove(name);
-  recovered_.clear();
   folder_.clearAttempts();
 }
 
@@ -98,6 +121,11 @@ void Journal::discard() {
 Result<JournalAppended> Journal::append(const JournalRecord& record) {
   MutexLock lock(mutex_);
   return write(record, EntryType::Call, Use::Calls);
+}
+
+Result<JournalAppended> Journal::appendEnd(const JournalRecord& record) {
+  MutexLock lock(mutex_);
+  return write(record, EntryType::Call, Use::Snapshot);
 }
 
 Result<JournalAppended> Journal::appendToSnapshot(const JournalRecord& record) {
@@ -286,7 +314,7 @@ void Journal::makeFree(JournalSegment::Pointer segment) {
 
 // Those that hold something.
 std::size_t Journal::segmentsInUse() const {
-  return (active_ != nullptr ? 1 : 0) + sealed_.size() + lingering_.size() + recovered_.size();
+  return (active_ != nullptr ? 1 : 0) + sealed_.size() + lingering_.size();
 }
 
 JournalCounters Journal::counters() const {

@@ -62,8 +62,8 @@ struct JournalCounters {
 class Journal {
  public:
   // What an earlier process left (of the same epoch) stays, is counted in maxBytes and comes before
-  // what is appended, until forgetRecovered; call numbers go on above its own. Foreign, damaged and
-  // torn files are set aside; `complaints` names them.
+  // what is appended, as an earlier generation does; call numbers go on above its own. Foreign and
+  // damaged files are set aside; `complaints` names them.
   static Result<std::unique_ptr<Journal>> open(JournalOptions options,
                                                std::vector<std::string>* complaints = nullptr);
   // Tickets and payloads may still be held, and may be let go of later.
@@ -80,8 +80,14 @@ class Journal {
   Result<JournalAppended> appendToSnapshot(const JournalRecord& record);
   Status endSnapshot();
 
-  // The rows of what an earlier process left have been written.
-  void forgetRecovered();
+  // A call of an earlier process is run again: it waits as long as there are copies of the ticket.
+  // None when its segment is not here. The entry must have been read from this journal's files, and
+  // is resumed once.
+  JournalTicket resume(JournalPlace place);
+  // As append(), also with the space that is kept for a snapshot.
+  Result<JournalAppended> appendEnd(const JournalRecord& record);
+  // No call of an earlier generation waits any more.
+  bool earlierCallsAreDone() const;
   // Nothing that was recorded is wanted any more: a stop that has committed everything. Appends
   // nothing afterwards.
   void discard();
@@ -92,6 +98,7 @@ class Journal {
   enum class Use { Calls, Snapshot };
   Journal(JournalOptions options, JournalFolder folder);
   std::string adopt(const std::string& name);
+  void sortAdopted();
 
   Result<JournalAppended> write(const JournalRecord& record, EntryType type, Use use)
       REQUIRES(mutex_);
@@ -115,7 +122,6 @@ class Journal {
   std::deque<JournalSegment::Pointer> sealed_ GUARDED_BY(mutex_);      // by sequence
   std::vector<JournalSegment::Pointer> lingering_ GUARDED_BY(mutex_);  // done, with live payloads
   std::vector<JournalSegment::Pointer> free_ GUARDED_BY(mutex_);
-  std::vector<std::string> recovered_ GUARDED_BY(mutex_);
   JournalNumbers next_ GUARDED_BY(mutex_);  // its generation is the one that is being written
   uint64_t nextFile_ GUARDED_BY(mutex_) = 1;
   uint32_t base_ GUARDED_BY(mutex_) = 0;  // the newest generation whose snapshot is complete

@@ -57,6 +57,9 @@ struct EntryHeader {
   static constexpr uint8_t kDictionary = 1;       // the body is one
   static constexpr uint8_t kEmptyDictionary = 2;  // there is one, and it is empty
 
+  // Beside the tickets of a call that is replayed although it was done.
+  static constexpr uint32_t kWasDone = uint32_t{1} << 31;
+
   uint32_t length;    // of the whole entry without padding after it
   uint32_t waiting;   // tickets; a call is done at 0. Not in the checksum
   uint64_t checksum;  // of all that follows but the body's reference count
@@ -85,6 +88,12 @@ struct JournalNumbers {
     sequence = std::max(sequence, header.sequence + 1);
     generation = std::max(generation, header.generation + 1);
   }
+};
+
+// Where an entry lies.
+struct JournalPlace {
+  uint64_t sequence = 0;  // of its segment
+  uint32_t offset = 0;
 };
 
 inline constexpr std::size_t padded(std::size_t bytes) {

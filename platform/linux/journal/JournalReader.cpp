@@ -56,13 +56,15 @@ struct Source {
   std::string name;
 };
 
-void give(JournalContents& contents, const JournalReader::Entry& entry, uint32_t generation) {
+void give(JournalContents& contents, const JournalReader::Entry& entry,
+          const SegmentHeader& segment) {
   const EntryHeader& header = entry.header;
   JournalContents::Record record;
   record.type = header.type;
   record.kind = header.kind;
-  record.done = header.waiting == 0;
-  record.generation = generation;
+  record.done = header.waiting == 0 || (header.waiting & EntryHeader::kWasDone) != 0;
+  record.generation = segment.generation;
+  record.place = {segment.sequence, entry.offset};
   record.call = header.call;
   record.time = header.time;
   record.connection = header.connection;
@@ -99,6 +101,7 @@ JournalReader::Segment JournalReader::readSegment(std::span<const uint8_t> bytes
       return segment;
     }
     if (!note) next = entry->header.call + 1;
+    entry->offset = static_cast<uint32_t>(at);
     segment.entries.push_back(*std::move(entry));
     at = std::min(at + padded(length), bytes.size());
   }
@@ -147,7 +150,7 @@ Result<JournalContents> JournalReader::read(const std::string& path, const Journ
       if (entry.header.type == EntryType::SnapshotComplete)
         contents.base = std::max(contents.base, source.header.generation);
       else
-        give(contents, entry, source.header.generation);
+        give(contents, entry, source.header);
     }
   }
   std::erase_if(contents.records, [&](JournalContents::Record& record) {

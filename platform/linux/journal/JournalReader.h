@@ -27,6 +27,7 @@ struct JournalContents {
     uint64_t call = 0;
     double time = 0;
     uint64_t connection = 0;
+    JournalPlace place;
     std::vector<uint8_t> head;
     std::optional<Payload> dictionary;  // lies on the heap
     std::vector<Note> notes;
@@ -52,6 +53,7 @@ class JournalReader {
   // One segment's bytes, of any length. Views of them.
   struct Entry {
     EntryHeader header;
+    uint32_t offset = 0;
     std::span<const uint8_t> head;
     std::span<const uint8_t> body;  // of a note
     std::optional<Payload> dictionary;

@@ -29,6 +29,8 @@ class JournalSegment {
 
   // From here on the file counts; what it held before does not. Nobody may wait for it any more.
   void begin(const JournalEpoch& epoch, uint32_t generation, uint64_t sequence, uint64_t firstCall);
+  // An earlier process filled it; its calls count once they are resumed.
+  void resumeCall() { uses_.fetch_add(kOneCall, std::memory_order_relaxed); }
   // Nothing more will be appended to it than this.
   void seal(uint32_t calls, uint32_t payloads);
   void markFree();  // a reader has nothing to look for in it

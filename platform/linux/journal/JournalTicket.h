@@ -30,6 +30,8 @@ class JournalTicket {
   // When the call was accepted, seconds since 1970; and the kind of its record. Of a call only.
   double time() const { return entry_->time; }
   uint8_t kind() const { return entry_->kind; }
+  // It is replayed, for the state that it leaves: its rows were written by an earlier process.
+  bool wasDone() const;
 
  private:
   friend class Journal;
