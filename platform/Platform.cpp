@@ -1,18 +1,22 @@
 #include "platform/Platform.h"
 
+#include <atomic>
 #include <cstdlib>
 
 namespace vx {
 
 namespace {
-Platform* installedPlatform = nullptr;
+std::atomic<Platform*> installedPlatform{nullptr};
 }
 
 Platform& platform() {
-  if (installedPlatform == nullptr) std::abort();
-  return *installedPlatform;
+  Platform* const installed = installedPlatform.load(std::memory_order_acquire);
+  if (installed == nullptr) std::abort();
+  return *installed;
 }
 
-void installPlatform(Platform* installed) { installedPlatform = installed; }
+void installPlatform(Platform* installed) {
+  installedPlatform.store(installed, std::memory_order_release);
+}
 
 }  // namespace vx

@@ -42,7 +42,8 @@ struct Platform {
 
 // The installed one. Asking before installPlatform is a programming error.
 Platform& platform();
-// `installed` must outlive every use. Null uninstalls (tests).
+// `installed` must outlive every use. From any thread; another one's use that has begun goes on
+// with what was installed. Null uninstalls (tests).
 void installPlatform(Platform* installed);
 
 }  // namespace vx
