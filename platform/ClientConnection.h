@@ -129,12 +129,16 @@ struct OperationDescription {
   // The reply may be held for as long as the peer likes, so the call does not count as unanswered.
   bool replyMayBeHeld = false;
   ResourceEffect resource = ResourceEffect::None;
+  // What it does survives the process: a call is recorded before it runs, and run again after a
+  // crash. False for questions.
+  bool recorded = true;
   // Runs on the connection's own queue. May invoke `reply` before it returns, later, twice or
   // never.
   void (*invoke)(ExportedObject& object, CallArguments& arguments, Reply reply);
 };
 
-// Operations are numbered from 1 in declaration order on the wire. Lives as long as the process.
+// Operations are numbered from 1 in declaration order on the wire. Each has one dictionary at most
+// among its arguments. Lives as long as the process.
 struct InterfaceDescription {
   std::string_view name;
   std::span<const OperationDescription> operations;

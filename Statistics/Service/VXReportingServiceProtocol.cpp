@@ -45,6 +45,7 @@ constexpr std::array<OperationDescription, 11> kOperations = {{
     {.name = "getServiceNameForReporterID",
      .arguments = kReporter,
      .reply = ReplyKind::UInt16,
+     .recorded = false,
      .invoke =
          [](ExportedObject& object, CallArguments& arguments, Reply reply) {
            service(object).getServiceNameForReporterID(
@@ -90,6 +91,7 @@ constexpr std::array<OperationDescription, 11> kOperations = {{
     {.name = "reporterID",
      .arguments = kReporter,
      .reply = ReplyKind::Dictionary,
+     .recorded = false,
      .invoke =
          [](ExportedObject& object, CallArguments& arguments, Reply reply) {
            service(object).reporterID(
@@ -99,6 +101,7 @@ constexpr std::array<OperationDescription, 11> kOperations = {{
     {.name = "getAllReporters",
      .arguments = {},
      .reply = ReplyKind::Int64Array,
+     .recorded = false,
      .invoke =
          [](ExportedObject& object, CallArguments&, Reply reply) {
            service(object).getAllReporters(
@@ -109,6 +112,7 @@ constexpr std::array<OperationDescription, 11> kOperations = {{
     {.name = "killService",
      .arguments = {},
      .reply = ReplyKind::Boolean,
+     .recorded = false,
      .invoke = [](ExportedObject& object, CallArguments&,
                   Reply reply) { service(object).killService(booleanReply(std::move(reply))); }},
 }};

@@ -72,6 +72,7 @@ class ConnectionTest : public IpcTest, public ConnectionHost {
   Clock& clock() override { return p.clock; }
   const ListenerOptions& limits() const override { return options; }
   ListenerCounters& counters() override { return counted; }
+  CallRecorder& recorder() override { return records; }
   wire::ReadBuffers& readBuffers() override { return buffers_; }
   bool readingPaused() override { return congested; }
   void waitForReading(const std::shared_ptr<SocketConnection>&) override { ++waits; }
@@ -82,6 +83,7 @@ class ConnectionTest : public IpcTest, public ConnectionHost {
   void closed(SocketConnection&) override { ++closes; }
 
   ListenerCounters counted;
+  CallRecorder records;
   bool unreadSays = false;
   int waits = 0;
   int closes = 0;

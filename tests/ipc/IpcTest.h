@@ -65,14 +65,14 @@ inline const InterfaceDescription& testInterface() {
   static constexpr std::array kAll = {UInt16, UInt32, OptionalDictionary, OptionalInt64Array};
   static constexpr std::array kDictionary = {Dictionary};
   static constexpr std::array<OperationDescription, 8> kOperations = {{
-      {"echo", kInteger, ReplyKind::Boolean, false, None, Object::runEcho},
-      {"keep", kInteger, ReplyKind::Boolean, false, None, Object::runKeep},
-      {"hold", kInteger, ReplyKind::Boolean, true, None, Object::runKeep},
-      {"acquire", kInteger, ReplyKind::Boolean, false, Acquire, Object::runEcho},
-      {"release", kInteger, ReplyKind::Boolean, false, Release, Object::runEcho},
-      {"list", {}, ReplyKind::Int64Array, false, None, Object::runList},
-      {"take", kAll, ReplyKind::OptionalError, false, None, Object::runTake},
-      {"message", kDictionary, ReplyKind::Dictionary, false, None, Object::runMessage},
+      {"echo", kInteger, ReplyKind::Boolean, false, None, true, Object::runEcho},
+      {"keep", kInteger, ReplyKind::Boolean, false, None, true, Object::runKeep},
+      {"hold", kInteger, ReplyKind::Boolean, true, None, true, Object::runKeep},
+      {"acquire", kInteger, ReplyKind::Boolean, false, Acquire, true, Object::runEcho},
+      {"release", kInteger, ReplyKind::Boolean, false, Release, true, Object::runEcho},
+      {"list", {}, ReplyKind::Int64Array, false, None, true, Object::runList},
+      {"take", kAll, ReplyKind::OptionalError, false, None, true, Object::runTake},
+      {"message", kDictionary, ReplyKind::Dictionary, false, None, true, Object::runMessage},
   }};
   static constexpr InterfaceDescription kInterface{.name = "Test", .operations = kOperations};
   return kInterface;

@@ -60,4 +60,13 @@ class CauseScope {
   CauseScope* const outer_;
 };
 
+// While one lives, the calling thread works because of no call: what is queued for the service's
+// own sake (an answer that is on its way, memory to be given back) takes no place, because a call
+// that is run again would not queue it.
+class NoCause {
+ private:
+  static inline const Cause kNone;
+  const CauseScope scope_{kNone};
+};
+
 }  // namespace vx::lnx

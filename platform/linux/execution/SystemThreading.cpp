@@ -8,6 +8,7 @@
 
 #include "base/Mutex.h"
 #include "base/ThreadChecker.h"
+#include "platform/linux/execution/CauseScope.h"
 #include "platform/linux/execution/Threads.h"
 
 namespace vx::lnx {
@@ -199,6 +200,7 @@ void SystemThreading::memoryWasFreed(std::size_t approximateBytes) {
 }
 
 void SystemThreading::trimLater() {
+  const NoCause own;
   background_.asyncAfter(kTrimDelay, [this] {
     trim_();
     {

@@ -50,12 +50,10 @@ Wanted readArgument(ArgumentKind wanted, const Frame& frame, CallArguments& argu
     case ArgumentKind::OptionalDictionary:
     case ArgumentKind::Dictionary: {
       const bool optional = wanted == ArgumentKind::OptionalDictionary;
-      if (kind == ValueKind::Dictionary)
-        arguments.set(i, std::optional<Payload>(frame.payload(kCallHead + i)));
-      else if (optional && kind == ValueKind::Null)
-        arguments.set(i, std::optional<Payload>());
-      else
+      if (kind == ValueKind::Dictionary) return nullptr;
+      if (!optional || kind != ValueKind::Null)
         return optional ? "a dictionary or null" : "a dictionary";
+      arguments.set(i, std::optional<Payload>());
       return nullptr;
     }
     case ArgumentKind::OptionalInt64Array:
@@ -85,6 +83,16 @@ Status readArguments(const OperationDescription& operation, const Frame& frame,
     }
   }
   return {};
+}
+
+std::optional<std::size_t> dictionaryElement(const OperationDescription& operation,
+                                             const Frame& frame) {
+  for (std::size_t i = 0; i < operation.arguments.size(); ++i) {
+    const ArgumentKind kind = operation.arguments[i];
+    if (kind != ArgumentKind::Dictionary && kind != ArgumentKind::OptionalDictionary) continue;
+    if (frame[kCallHead + i].kind() == ValueKind::Dictionary) return kCallHead + i;
+  }
+  return std::nullopt;
 }
 
 }  // namespace vx::lnx

@@ -5,6 +5,7 @@
 
 #include "base/Clock.h"
 #include "platform/linux/execution/EventLoop.h"
+#include "platform/linux/ipc/CallRecorder.h"
 #include "platform/linux/ipc/ListenerCounters.h"
 #include "platform/linux/ipc/ListenerOptions.h"
 #include "wire/FrameReader.h"
@@ -22,6 +23,7 @@ class ConnectionHost {
   virtual Clock& clock() = 0;
   virtual const ListenerOptions& limits() const = 0;
   virtual ListenerCounters& counters() = 0;
+  virtual CallRecorder& recorder() = 0;
   virtual wire::ReadBuffers& readBuffers() = 0;
   // True while what has been accepted must drain first. The connection then waits for
   // continueReading().

@@ -52,8 +52,20 @@ void SocketConnection::resume() {
   interest_ = EPOLLIN;
   if (!host_.loop().add(socket_.get(), interest_, *this)) {
     interest_ = 0;
-    queue_->async([self = shared_from_this()] { self->finishReading(End::Interrupted); });
+    async([self = shared_from_this()] { self->finishReading(End::Interrupted); });
   }
+}
+
+Cause SocketConnection::recordAccepted() {
+  assertInteractive();
+  CallRecorder::Accepted accepted = host_.recorder().accepted(pid_, uid_);
+  recordedAs_ = accepted.connection;
+  return {std::move(accepted.ticket), {}};
+}
+
+void SocketConnection::async(Work work) {
+  const NoCause own;
+  queue_->async(std::move(work));
 }
 
 // ---------------------------------------------------------------------------------------------------------------------
@@ -68,7 +80,7 @@ void SocketConnection::onReady(uint32_t events) {
 void SocketConnection::scheduleRead() {
   if (readScheduled_ || state_ != State::Open) return;
   readScheduled_ = true;
-  queue_->async([self = shared_from_this()] {
+  async([self = shared_from_this()] {
     self->readScheduled_ = false;
     self->readPass();
   });
@@ -207,7 +219,23 @@ void SocketConnection::runCall(const Frame& frame) {
   const uint64_t token =
       calls_.open(callNumber, operation.replyMayBeHeld ? CallTable::Answer::MayBeHeld
                                                        : CallTable::Answer::Soon);
+  const Cause cause = recordCall(operation, frame, arguments);
+  const CauseScope scope(cause);
   operation.invoke(*object_, arguments, Reply(weak_from_this(), token));
+}
+
+// The dictionary that the operation gets lies where it was recorded, or else on the heap.
+Cause SocketConnection::recordCall(const OperationDescription& operation, const Frame& frame,
+                                   CallArguments& arguments) {
+  const std::optional<std::size_t> element = dictionaryElement(operation, frame);
+  CallRecorder::Called called;
+  if (operation.recorded && recordedAs_ != CallRecorder::kUnrecorded)
+    called = host_.recorder().called(recordedAs_, frame, element);
+  if (element) {
+    if (!called.dictionary) called.dictionary = frame.payload(*element);
+    arguments.set(*element - wire::kCallHead, std::move(called.dictionary));
+  }
+  return {std::move(called.ticket), {}};
 }
 
 bool SocketConnection::admitResource(const OperationDescription& operation,
@@ -235,7 +263,7 @@ void SocketConnection::settle(CallTable::Call& call) {
 
 void SocketConnection::reply(uint64_t token, ReplyValue value) {
   if (!host_.executor().isInteractiveThread()) {
-    queue_->async([self = shared_from_this(), token, value = std::move(value)]() mutable {
+    async([self = shared_from_this(), token, value = std::move(value)]() mutable {
       self->reply(token, std::move(value));
     });
     return;
@@ -257,7 +285,7 @@ void SocketConnection::reply(uint64_t token, ReplyValue value) {
 
 void SocketConnection::release(uint64_t token) {
   if (!host_.executor().isInteractiveThread()) {
-    queue_->async([self = shared_from_this(), token] { self->release(token); });
+    async([self = shared_from_this(), token] { self->release(token); });
     return;
   }
   CallTable::Call* const call = calls_.find(token);
@@ -364,9 +392,15 @@ void SocketConnection::finishReading(End end) {
   reader_.clear();
   updateInterest();
   // In their own turns on this connection's queue: the caller may be inside a front half.
-  queue_->async([self = shared_from_this(), end] {
-    if (end == End::Interrupted && self->interruption_) self->interruption_();
-    if (self->invalidation_) self->invalidation_();
+  async([self = shared_from_this(), end] {
+    {
+      Cause cause;
+      if (self->recordedAs_ != CallRecorder::kUnrecorded)
+        cause.ticket = self->host_.recorder().ended(self->recordedAs_, end);
+      const CauseScope scope(cause);
+      if (end == End::Interrupted && self->interruption_) self->interruption_();
+      if (self->invalidation_) self->invalidation_();
+    }
     self->interruption_ = nullptr;
     self->invalidation_ = nullptr;
     self->object_ = nullptr;  // calls under way hold it as long as they need it
@@ -379,7 +413,7 @@ void SocketConnection::shutDown() {
   if (state_ == State::Accepted) state_ = State::Open;
   if (state_ != State::Open) return wantFlush();
   // What the peer sent before now has been accepted: everything complete runs before the goodbye.
-  queue_->async([self = shared_from_this()] {
+  async([self = shared_from_this()] {
     if (self->state_ != State::Open) return;
     if (self->waitingForHost_ || self->mustPause()) {  // the listener's own deadline bounds this
       self->queue_->asyncAfter(std::chrono::milliseconds(5), [self] { self->shutDown(); });
@@ -392,7 +426,7 @@ void SocketConnection::shutDown() {
     const bool moved = self->reader_.unread() != before || self->host_.counters().calls != calls;
     if (moved) return self->shutDown();
     self->sendGoodbye();
-    self->finishReading(End::Orderly);
+    self->finishReading(End::ServiceStopped);
   });
 }
 
@@ -400,7 +434,7 @@ void SocketConnection::shutDownNow() {
   assertInteractive();
   if (state_ == State::Accepted) state_ = State::Open;
   sendGoodbye();
-  finishReading(End::Orderly);
+  finishReading(End::ServiceStopped);
   wantFlush();
 }
 

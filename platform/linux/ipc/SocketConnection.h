@@ -64,6 +64,8 @@ class SocketConnection final : public ClientConnection,
   void onReady(uint32_t events) override;
 
   uid_t user() const { return uid_; }
+  // What the service does next belongs to this connection's being accepted.
+  Cause recordAccepted();
   // The listener says that reading may go on.
   void continueReading();
   // Writes what is waiting; closes when that was all that was left to do.
@@ -83,10 +85,12 @@ class SocketConnection final : public ClientConnection,
     Draining,  // no more reading; what was called before is answered, then it closes
     Closed,
   };
-  enum class End : uint8_t { Orderly, Interrupted };
+  using End = CallRecorder::End;
 
   void assertInteractive() const { VX_DCHECK(host_.executor().isInteractiveThread()); }
 
+  // Later, in a turn of its own, and for no call's sake.
+  void async(Work work);
   void scheduleRead();
   void readPass();
   bool readSocket();  // false when there is nothing to run
@@ -96,6 +100,8 @@ class SocketConnection final : public ClientConnection,
   void runFrame(std::span<const uint8_t> body);
   void runHello(const Frame& frame);
   void runCall(const Frame& frame);
+  Cause recordCall(const OperationDescription& operation, const Frame& frame,
+                   CallArguments& arguments);
   bool admitResource(const OperationDescription& operation, const CallArguments& arguments);
   void settle(CallTable::Call& call);
 
@@ -114,6 +120,7 @@ class SocketConnection final : public ClientConnection,
   UniqueFd socket_;
   const pid_t pid_;
   const uid_t uid_;
+  uint64_t recordedAs_ = CallRecorder::kUnrecorded;
   const std::shared_ptr<WorkQueue> queue_;
   State state_ = State::Accepted;
   bool helloSeen_ = false;

@@ -141,7 +141,10 @@ void SocketListener::admit(UniqueFd peer) {
   connections_.emplace(connection.get(), connection);
   queue_->async([this, connection] {
     const std::shared_ptr<ServiceListenerDelegate> delegate = delegate_.lock();
-    if (delegate == nullptr || !delegate->listener(*this, connection)) closed(*connection);
+    if (delegate == nullptr) return closed(*connection);
+    const Cause cause = connection->recordAccepted();
+    const CauseScope scope(cause);
+    if (!delegate->listener(*this, connection)) closed(*connection);
   });
 }
 
@@ -173,6 +176,7 @@ void SocketListener::waitForReading(const std::shared_ptr<SocketConnection>& con
 }
 
 void SocketListener::congestionEnded() {
+  const NoCause own;
   queue_->async([this] {
     std::vector<std::weak_ptr<SocketConnection>> waiting = std::move(waiting_);
     waiting_.clear();
@@ -198,6 +202,7 @@ void SocketListener::closed(SocketConnection& connection) {
   if (--user->second == 0) connectionsOfUser_.erase(user);
   unread_.erase(&connection);
   // Let go in a turn of its own: the caller may be a method of the connection.
+  const NoCause own;
   queue_->async([keep = std::move(found->second)] {});
   connections_.erase(found);
 }

@@ -41,6 +41,8 @@ class SocketListener final : public ServiceListener,
   // A failure says what to do about it.
   Status open(const std::string& runtimeDirectory);
   void setHooks(Hooks hooks) { hooks_ = std::move(hooks); }
+  // Before resume(); outlives this. Without one nothing is recorded.
+  void setRecorder(CallRecorder& recorder) { recorder_ = &recorder; }
 
   // ServiceListener
   void setDelegate(std::weak_ptr<ServiceListenerDelegate> delegate) override {
@@ -58,6 +60,7 @@ class SocketListener final : public ServiceListener,
   Clock& clock() override { return clock_; }
   const ListenerOptions& limits() const override { return limits_; }
   ListenerCounters& counters() override { return counters_; }
+  CallRecorder& recorder() override { return *recorder_; }
   wire::ReadBuffers& readBuffers() override { return readBuffers_; }
   bool readingPaused() override { return hooks_.congested(); }
   void waitForReading(const std::shared_ptr<SocketConnection>& connection) override;
@@ -89,6 +92,8 @@ class SocketListener final : public ServiceListener,
   Clock& clock_;
   const ListenerOptions limits_;
   Hooks hooks_;
+  CallRecorder nothingRecorded_;
+  CallRecorder* recorder_ = &nothingRecorded_;
   ListenerCounters counters_;
   std::weak_ptr<ServiceListenerDelegate> delegate_;
   std::shared_ptr<WorkQueue> queue_;
