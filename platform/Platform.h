@@ -10,6 +10,7 @@
 #include "platform/OrientationNotifier.h"
 #include "platform/Preferences.h"
 #include "platform/ProcessInfoQuery.h"
+#include "platform/RecordedInputs.h"
 #include "platform/ScopedLog.h"
 #include "platform/ServiceListener.h"
 #include "platform/Threading.h"
@@ -38,6 +39,7 @@ struct Platform {
   ScopedLog& log;
   TracePoint& trace;
   DiagnosticFiles& diagnosticFiles;
+  RecordedInputs& inputs;
 };
 
 // The installed one. Asking before installPlatform is a programming error.

@@ -19,11 +19,25 @@ std::shared_ptr<WorkQueue> theServiceQueue;
 std::atomic<const LogScope*> theServerLogScope{nullptr};
 std::atomic<int> preferencesToken{-1};
 
-std::optional<std::string> processName(int32_t processIdentifier) {
+constexpr std::string_view kProcessName = "process name";
+
+std::optional<std::string> askProcessName(int32_t processIdentifier) {
   ProcessInfoQuery& query = platform().processInfo;
   if (processIdentifier == query.ownProcessIdentifier()) return query.ownProcessName();
   if (processIdentifier < 1) return std::nullopt;
   return query.shortCommandName(processIdentifier);
+}
+
+std::optional<std::string> processName(int32_t processIdentifier) {
+  const std::optional<Payload> answer =
+      platform().inputs.once(kProcessName, [&]() -> std::optional<Payload> {
+        const std::optional<std::string> name = askProcessName(processIdentifier);
+        if (!name) return std::nullopt;
+        return PayloadBuilder().set(kProcessName, *name).build();
+      });
+  const std::optional<Value> name = answer ? answer->find(kProcessName) : std::nullopt;
+  if (!name) return std::nullopt;
+  return std::string(name->asString());
 }
 
 }  // namespace
@@ -197,7 +211,9 @@ void VXReportingServiceDelegate::preferencesChanged(int token) {
   static constexpr const char* kFunction = "listenForDefaultsNotification";
   if (token != preferencesToken.load()) return;
   VX_LOG_AS(kFunction, serverLogScope(), Default, "re-reading sonik defaults");
-  defaults_ = VXReportingDefaults();
+  std::optional<Payload> read = platform().inputs.once("preferences", VXReportingDefaults);
+  if (!read) return;  // nor were they the first time
+  defaults_ = std::move(read);
   VX_LOG_AS(kFunction, serverLogScope(), Info, "defaults %s", defaults_->text().c_str());
   for (const auto& client : clients_) {
     for (const auto& [reporterID, session] : client->clientReportingSessionMap())
@@ -219,7 +235,9 @@ std::shared_ptr<DriverSnapShot> VXReportingServiceDelegate::getSnapShot() {
 std::optional<Payload> VXReportingServiceDelegate::getDriverStatisticsRelativeToSnapShot(
     const std::shared_ptr<DriverSnapShot>& snapShot) {
   serviceQueue()->assertIsCurrent();
-  return driverUtility_->getDriverStatisticsRelativeToSnapShot(snapShot);
+  return platform().inputs.once("driver statistics", [&] {
+    return driverUtility_->getDriverStatisticsRelativeToSnapShot(snapShot);
+  });
 }
 
 }  // namespace vx

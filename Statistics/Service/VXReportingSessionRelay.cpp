@@ -1,5 +1,6 @@
 // The session and the reporting relay: set-up, sends and flush, all on the session's own queue, and
 // standalone messages on the background queue.
+#include <algorithm>
 #include <cstdlib>
 
 #include "Statistics/Service/VXReportingSession.h"
@@ -18,6 +19,27 @@ constexpr const char* kConfigurationTimeLimit = "9.0";
 constexpr uint32_t kAlarmDelaySeconds = 60;  // exclusive
 
 float clientVersion() { return std::strtof(kClientVersion, nullptr); }
+
+// How long a standalone message of that service type waits. When it is due is decided once,
+// whatever happens to the process meanwhile.
+std::chrono::nanoseconds standaloneDelay(ServiceType serviceType) {
+  static constexpr std::string_view kDue = "standalone due";
+  const Date now = platform().clock.now();
+  const std::optional<Payload> answer =
+      platform().inputs.once(kDue, [&]() -> std::optional<Payload> {
+        if (serviceType != kServiceTypeAlarms) return std::nullopt;
+        const std::chrono::duration<double> due =
+            now.time_since_epoch() +
+            std::chrono::seconds(platform().random.below(kAlarmDelaySeconds));
+        return PayloadBuilder().set(kDue, PayloadDate{due.count()}).build();
+      });
+  const std::optional<Value> due = answer ? answer->find(kDue) : std::nullopt;
+  if (!due) return {};
+  const std::chrono::duration<double> since1970(due->asDouble());
+  const auto delay =
+      std::chrono::duration_cast<std::chrono::nanoseconds>(since1970) - now.time_since_epoch();
+  return std::max(delay, std::chrono::nanoseconds(0));
+}
 
 uint16_t relayCategory(MessageCategory category) {
   return static_cast<uint16_t>(category & 0xFFFF);
@@ -152,13 +174,12 @@ void VXReportingSession::flushRelay() {
 void VXReportingSession::sendSingleMessage(const Payload& message, MessageCategory category,
                                            MessageType type, ServiceType serviceType,
                                            const std::optional<Payload>&, MessageReply reply) {
-  const uint32_t delay =
-      serviceType == kServiceTypeAlarms ? platform().random.below(kAlarmDelaySeconds) : 0;
+  const std::chrono::nanoseconds delay = standaloneDelay(serviceType);
   VX_VERBOSE(sessionLogScope(), "sending single message after delta %lli for service %i",
-             static_cast<long long>(delay), int{serviceType});
+             static_cast<long long>(std::chrono::round<std::chrono::seconds>(delay).count()),
+             int{serviceType});
   platform().workQueues.background().asyncAfter(
-      std::chrono::seconds(delay),
-      [message, reply = std::move(reply), category, serviceType, type] {
+      delay, [message, reply = std::move(reply), category, serviceType, type] {
         sendSingleMessageNow(message, category, type, serviceType, reply);
       });
 }

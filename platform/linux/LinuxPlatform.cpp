@@ -1,11 +1,13 @@
 #include "platform/linux/LinuxPlatform.h"
 
 #include <fcntl.h>
+#include <linux/magic.h>
 #include <malloc.h>
 #include <signal.h>
 #include <sys/mman.h>
 #include <sys/resource.h>
 #include <sys/signalfd.h>
+#include <sys/vfs.h>
 #include <systemd/sd-daemon.h>
 #include <unistd.h>
 
@@ -30,6 +32,9 @@
 #include "platform/linux/execution/Executor.h"
 #include "platform/linux/execution/SystemThreading.h"
 #include "platform/linux/ipc/SocketListener.h"
+#include "platform/linux/journal/Journal.h"
+#include "platform/linux/recovery/JournalRecorder.h"
+#include "platform/linux/recovery/JournaledInputs.h"
 #include "platform/linux/settings/PreferencesWatcher.h"
 #include "platform/linux/settings/TomlPreferences.h"
 #include "platform/linux/store/LocalStore.h"
@@ -71,6 +76,9 @@ OrientationOptions withDefaults(OrientationOptions orientation, const Directorie
   }
   return orientation;
 }
+
+// Of the store that the journal's calls go to.
+JournalEpoch storeEpoch() { return {}; }
 
 // Messages that sessions keep make the heap grow, and each of its pages is missing when it is first
 // touched: one message in sixteen would wait for the kernel to find one. So the heap grows in
@@ -127,6 +135,7 @@ class RunningPlatform final : public LinuxPlatform {
       return false;
     }
     store_ = std::move(*opened);
+    openJournal(directories.runtime);
     relay_.emplace(backends(), [this](Function<void()> job) { store_->runSoon(std::move(job)); });
     services_.emplace(Platform{
         .serviceListener = listener_,
@@ -147,6 +156,7 @@ class RunningPlatform final : public LinuxPlatform {
         .log = log_,
         .trace = trace_,
         .diagnosticFiles = diagnosticFiles_,
+        .inputs = *inputs_,
     });
     return true;
   }
@@ -154,6 +164,7 @@ class RunningPlatform final : public LinuxPlatform {
   Platform& services() override { return *services_; }
 
   void begin() override {
+    reportOnJournal();
     watcher_->start(PreferencesWatcher::openInotify());
     store_->start();
     connect();
@@ -176,12 +187,42 @@ class RunningPlatform final : public LinuxPlatform {
         static_cast<unsigned long long>(log_.droppedLines()));
     executor_.stop(clock_.monotonic() + kThreadTime);
     const int status = drained && stored ? 0 : 1;
+    if (status == 0 && journal_ != nullptr && journal_->allDone()) journal_->discard();
     // A thread that could not be ended must not find the services destroyed.
     if (status != 0) std::_Exit(status);
     return status;
   }
 
  private:
+  // Without one the service serves all the same.
+  void openJournal(const std::string& runtime) {
+    Result<std::unique_ptr<Journal>> opened =
+        Journal::open({.folder = runtime + "/journal", .epoch = storeEpoch()}, &journalComplaints_);
+    if (opened.ok()) {
+      journal_ = std::move(*opened);
+      recorder_.emplace(*journal_, clock_);
+      recorder_->setUnrecordedHandler([](const Status& why) {
+        VX_LOG(nullptr, Error, "%s: what is accepted from now on may not survive this process",
+               why.text().c_str());
+      });
+      listener_.setRecorder(*recorder_);
+    } else {
+      journalComplaints_.push_back(opened.status().text() +
+                                   ": what is accepted does not survive this process");
+    }
+    inputs_.emplace(journal_.get());
+    struct statfs files {};
+    const std::string& folder = journal_ != nullptr ? runtime + "/journal" : runtime;
+    journalInMemory_ = statfs(folder.c_str(), &files) == 0 && files.f_type == TMPFS_MAGIC;
+  }
+
+  void reportOnJournal() {
+    for (const std::string& complaint : journalComplaints_)
+      VX_LOG(nullptr, Error, "journal: %s", complaint.c_str());
+    if (!journalInMemory_)
+      VX_LOG(nullptr, Info, "the runtime folder is not a tmpfs: each call costs writes to a disk");
+  }
+
   // Those that the configuration names, in its order.
   std::vector<RelayBackend*> backends() {
     std::vector<RelayBackend*> named;
@@ -212,6 +253,13 @@ class RunningPlatform final : public LinuxPlatform {
     (void)loop_.add(signalFd_.get(), EPOLLIN, signalSource_);
 
     loop_.addPassEndHook([this] { heapPages_.askForNew(); });
+    if (recorder_) {
+      watcher_->setPoster([this](std::string_view name, const PreferencesWatcher::Post& post) {
+        const Cause cause{recorder_->preferencesChanged(name), {}};
+        const CauseScope scope(cause);
+        post();
+      });
+    }
     watcher_->setBeforeFire([this](std::string_view) { log_.refreshVerbose(); });
     if (watcher_->fd() >= 0) (void)loop_.add(watcher_->fd(), EPOLLIN, watcherSource_);
     loop_.addDeadline([this] { return watcher_->nextDue(); }, [this] { watcher_->onDue(); });
@@ -236,12 +284,21 @@ class RunningPlatform final : public LinuxPlatform {
         continue;
       }
       const LocalStore::Counters counters = store_->counters();
+      const JournalCounters journal =
+          journal_ != nullptr ? journal_->counters() : JournalCounters{};
       VX_LOG(nullptr, Error,
-             "counters: %s rows=%llu commits=%llu write_failures=%llu relay_backlog=%zu",
+             "counters: %s rows=%llu commits=%llu write_failures=%llu relay_backlog=%zu "
+             "journal_entries=%llu journal_bytes=%llu journal_segments=%llu journal_full=%llu "
+             "unrecorded=%llu",
              listener_.counters().text().c_str(),
              static_cast<unsigned long long>(counters.rowsCommitted),
              static_cast<unsigned long long>(counters.commits),
-             static_cast<unsigned long long>(counters.writeFailures), executor_.utilityBacklog());
+             static_cast<unsigned long long>(counters.writeFailures), executor_.utilityBacklog(),
+             static_cast<unsigned long long>(journal.appended),
+             static_cast<unsigned long long>(journal.bytes),
+             static_cast<unsigned long long>(journal.segmentsInUse),
+             static_cast<unsigned long long>(journal.full),
+             static_cast<unsigned long long>(recorder_ ? recorder_->counters().unrecorded : 0));
     }
   }
 
@@ -264,6 +321,11 @@ class RunningPlatform final : public LinuxPlatform {
   UsdtTracePoint trace_;
   std::optional<PreferencesWatcher> watcher_;
   std::unique_ptr<LocalStore> store_;
+  std::vector<std::string> journalComplaints_;
+  bool journalInMemory_ = false;
+  std::unique_ptr<Journal> journal_;
+  std::optional<JournalRecorder> recorder_;
+  std::optional<JournaledInputs> inputs_;
   std::optional<RelayReporting> relay_;
   std::optional<Platform> services_;
   UniqueFd signalFd_;

@@ -37,6 +37,19 @@ class FakeListener final : public ServiceListener {
   void resume() override {}
 };
 
+// Asks, unless it stands for a call that is run again: then it gives the answer from before.
+class FakeInputs final : public RecordedInputs {
+ public:
+  std::optional<Payload> once(std::string_view what,
+                              const Function<std::optional<Payload>()>& source) override {
+    std::optional<Payload>& answer = answers[std::string(what)];
+    if (!replaying) answer = source();
+    return answer;
+  }
+  std::map<std::string, std::optional<Payload>> answers;  // the last one to each question
+  bool replaying = false;
+};
+
 // All of them, installed for as long as it lives. Driver channels come from outside, where there
 // are any.
 class FakePlatform {
@@ -60,7 +73,8 @@ class FakePlatform {
                   .orientation = services,
                   .log = log,
                   .trace = services,
-                  .diagnosticFiles = services} {
+                  .diagnosticFiles = services,
+                 .inputs = inputs} {
     installPlatform(&platform_);
   }
   ~FakePlatform() { installPlatform(nullptr); }
@@ -77,6 +91,7 @@ class FakePlatform {
   FakeVyrReporting vyr{journal, threading};
   FakeServices services{journal};
   FakeListener listener;
+  FakeInputs inputs;
 
  private:
   Platform platform_;

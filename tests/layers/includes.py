@@ -26,6 +26,7 @@ ALLOWED = {  # layer -> prefixes of the headers it may include beside its own; t
         "journal": (),
         "store": (LINUX + "execution/", LINUX + "journal/", LINUX + "RelayBackend.h"),
         "ipc": (LINUX + "execution/", LINUX + "journal/", "wire/"),
+        "recovery": (*(LINUX + wing for wing in ("execution/", "journal/", "store/", "ipc/")), "wire/"),
     }.items()},
 }
 ENTRY = "Statistics/Service/main.cpp"
@@ -63,7 +64,8 @@ WRONG = {  # one of each wrong arrow: the check itself must be able to fail
     LINUX + "a.cpp": ("Statistics/a.h",),
     LINUX + "store/a.cpp": (LINUX + "ipc/SocketListener.h", "wire/a.h"),
     LINUX + "execution/a.cpp": (LINUX + "store/a.h",),
-    LINUX + "ipc/a.cpp": ("Statistics/a.h", LINUX + "PlatformConfiguration.h"),
+    LINUX + "ipc/a.cpp": ("Statistics/a.h", LINUX + "PlatformConfiguration.h", LINUX + "recovery/a.h"),
+    LINUX + "recovery/a.cpp": ("Statistics/a.h",),
     "client/a.cpp": ("platform/Log.h", LINUX + "ipc/a.h"),
     "wire/a.h": ("platform/Log.h", "client/a.h"),
     "propertylist/a.h": ("wire/a.h", "platform/Log.h"),

@@ -317,6 +317,15 @@ std::size_t Journal::segmentsInUse() const {
   return (active_ != nullptr ? 1 : 0) + sealed_.size() + lingering_.size();
 }
 
+bool Journal::allDone() const {
+  MutexLock lock(mutex_);
+  const auto undone = [](const JournalSegment::Pointer& segment) {
+    return segment->hasUndoneCalls();
+  };
+  return (active_ == nullptr || !active_->hasUndoneCallsOf(callsInActive_)) &&
+         std::ranges::none_of(sealed_, undone);
+}
+
 JournalCounters Journal::counters() const {
   MutexLock lock(mutex_);
   JournalCounters counters = counters_;

@@ -92,6 +92,8 @@ class Journal {
   // nothing afterwards.
   void discard();
 
+  // Whether every call of this process is done.
+  bool allDone() const;
   JournalCounters counters() const;
 
  private:

@@ -37,6 +37,11 @@ class JournalSegment {
 
   // Of a sealed segment.
   bool hasUndoneCalls() const { return (uses_.load(std::memory_order_acquire) & kCalls) != 0; }
+  // Of one that is not sealed, and to which so many calls have been appended.
+  bool hasUndoneCallsOf(uint32_t appended) const {
+    const uint64_t counted = (uses_.load(std::memory_order_acquire) & kCalls) / kOneCall;
+    return counted + appended != kMaxEntriesPerSegment;
+  }
   bool hasPayloads() const { return (uses_.load(std::memory_order_acquire) & kPayloads) != 0; }
 
   void callDone() { drop(kOneCall); }

@@ -213,11 +213,13 @@ void PreferencesWatcher::onDue() {
 
 void PreferencesWatcher::fire(const std::string& name) {
   if (beforeFire_) beforeFire_(name);
-  for (const Registration& registration : registrations_) {
-    if (registration.name != name) continue;
-    registration.queue->async(
-        [handler = registration.handler, token = registration.token] { (*handler)(token); });
-  }
+  poster_(name, [&] {
+    for (const Registration& registration : registrations_) {
+      if (registration.name != name) continue;
+      registration.queue->async(
+          [handler = registration.handler, token = registration.token] { (*handler)(token); });
+    }
+  });
 }
 
 }  // namespace vx::lnx

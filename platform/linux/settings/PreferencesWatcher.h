@@ -54,6 +54,11 @@ class PreferencesWatcher final : public SystemNotify {
 
   // Called before the handlers of a notification are told.
   void setBeforeFire(Function<void(std::string_view name)> hook) { beforeFire_ = std::move(hook); }
+  // Runs the posting of a notification to its handlers' queues; for whoever must know of it first.
+  using Post = Function<void()>;
+  void setPoster(Function<void(std::string_view name, const Post& post)> poster) {
+    poster_ = std::move(poster);
+  }
   int fd() const { return fd_.get(); }  // -1 when inotify cannot be had
   void onReadable();
   std::optional<Monotonic> nextDue() const;
@@ -91,6 +96,9 @@ class PreferencesWatcher final : public SystemNotify {
   Clock& clock_;
   ThreadChecker thread_;
   Function<void(std::string_view)> beforeFire_;
+  Function<void(std::string_view, const Post&)> poster_ = [](std::string_view, const Post& post) {
+    post();
+  };
   std::vector<Watched> watched_;
   std::vector<Registration> registrations_;  // a handful, made at start-up
   int nextToken_ = 1;

@@ -1,0 +1,88 @@
+#include "platform/linux/recovery/JournalRecorder.h"
+
+#include <array>
+#include <chrono>
+
+#include "platform/linux/recovery/Records.h"
+#include "wire/Operations.h"
+#include "wire/Protocol.h"
+
+namespace vx::lnx {
+
+namespace {
+
+constexpr std::size_t kMostHeadKept = 4096;
+
+RecordKind kindOf(const Frame& call) {
+  switch (static_cast<wire::Operation>(call[wire::kCallHead - 1].asInt64())) {
+    case wire::Operation::StopReportingSessionForID:
+      return RecordKind::StopCall;
+    case wire::Operation::DestroyReportingSession:
+      return RecordKind::DestroyCall;
+    default:
+      return RecordKind::Call;
+  }
+}
+
+RecordKind kindOf(CallRecorder::End how) {
+  switch (how) {
+    case CallRecorder::End::Interrupted:
+      return RecordKind::EndedInterrupted;
+    case CallRecorder::End::Orderly:
+      return RecordKind::EndedOrderly;
+    case CallRecorder::End::ServiceStopped:
+      break;
+  }
+  return RecordKind::EndedServiceStopped;
+}
+
+}  // namespace
+
+CallRecorder::Accepted JournalRecorder::accepted(pid_t pid, uid_t uid) {
+  std::array<uint8_t, kAcceptedHeadBytes> head;
+  writeAccepted({pid, uid}, head);
+  JournalAppended appended = append(RecordKind::Accepted, kUnrecorded, head);
+  return {appended.call, std::move(appended.ticket)};
+}
+
+CallRecorder::Called JournalRecorder::called(uint64_t connection, const Frame& call,
+                                             std::optional<std::size_t> dictionary) {
+  writeCall(call, dictionary, head_);
+  std::optional<Payload::Validated> bytes;
+  if (dictionary) bytes = call.validated(*dictionary);
+  JournalAppended appended = append(kindOf(call), connection, head_, bytes);
+  if (head_.capacity() > kMostHeadKept) [[unlikely]]
+    head_ = {};
+  Called called{std::move(appended.ticket), std::nullopt};
+  if (called.ticket && dictionary) called.dictionary = std::move(appended.dictionary);
+  return called;
+}
+
+JournalTicket JournalRecorder::ended(uint64_t connection, End how) {
+  return append(kindOf(how), connection, {}).ticket;
+}
+
+JournalTicket JournalRecorder::preferencesChanged(std::string_view notification) {
+  const auto* const bytes = reinterpret_cast<const uint8_t*>(notification.data());
+  return append(RecordKind::PreferencesChanged, kUnrecorded, {bytes, notification.size()}).ticket;
+}
+
+JournalAppended JournalRecorder::append(RecordKind kind, uint64_t connection,
+                                        std::span<const uint8_t> head,
+                                        const std::optional<Payload::Validated>& dictionary) {
+  const double now = std::chrono::duration<double>(clock_.now().time_since_epoch()).count();
+  Result<JournalAppended> appended =
+      journal_.append({static_cast<uint8_t>(kind), now, connection, head, dictionary});
+  if (!appended.ok()) [[unlikely]] {
+    countUnrecorded(appended.status());
+    return {};
+  }
+  ++counters_.recorded;
+  return std::move(appended).value();
+}
+
+void JournalRecorder::countUnrecorded(const Status& why) {
+  if (counters_.unrecorded++ == 0 && unrecorded_) unrecorded_(why);
+}
+
+}  // namespace vx::lnx

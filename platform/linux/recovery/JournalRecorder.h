@@ -1,0 +1,53 @@
+// Records in the journal what reaches the service, in the order in which it does.
+#pragma once
+
+#include <cstdint>
+#include <string_view>
+#include <vector>
+
+#include "base/Clock.h"
+#include "base/Function.h"
+#include "platform/linux/ipc/CallRecorder.h"
+#include "platform/linux/journal/Journal.h"
+#include "platform/linux/journal/RecordKind.h"
+
+namespace vx::lnx {
+
+// Owned by the platform; used on the interactive thread. What the journal has no space for runs
+// unrecorded, which is counted. A connection that could not be recorded stays so, with its calls:
+// without it they could not be run again.
+class JournalRecorder final : public CallRecorder {
+ public:
+  struct Counters {
+    uint64_t recorded = 0;
+    uint64_t unrecorded = 0;  // calls, connections and their ends
+  };
+
+  JournalRecorder(Journal& journal, Clock& clock) : journal_(journal), clock_(clock) {}
+  // Told about the first that is not recorded, and why.
+  void setUnrecordedHandler(Function<void(const Status& why)> handler) {
+    unrecorded_ = std::move(handler);
+  }
+
+  Accepted accepted(pid_t pid, uid_t uid) override;
+  Called called(uint64_t connection, const Frame& call,
+                std::optional<std::size_t> dictionary) override;
+  JournalTicket ended(uint64_t connection, End how) override;
+  // Before the notification is queued.
+  JournalTicket preferencesChanged(std::string_view notification);
+
+  const Counters& counters() const { return counters_; }
+
+ private:
+  JournalAppended append(RecordKind kind, uint64_t connection, std::span<const uint8_t> head,
+                         const std::optional<Payload::Validated>& dictionary = {});
+  void countUnrecorded(const Status& why);
+
+  Journal& journal_;
+  Clock& clock_;
+  Function<void(const Status&)> unrecorded_;
+  Counters counters_;
+  std::vector<uint8_t> head_;  // of the call that is being recorded
+};
+
+}  // namespace vx::lnx

@@ -1,0 +1,96 @@
+#include "platform/linux/recovery/Records.h"
+
+#include <algorithm>
+#include <cstring>
+#include <string>
+
+#include "platform/linux/ipc/ArgumentReading.h"
+#include "wire/Protocol.h"
+
+namespace vx::lnx {
+
+namespace {
+
+constexpr uint8_t kArrayHead = 0x80;  // of fewer than 24 elements
+constexpr uint8_t kNoNumber = 0;      // the peer's, which only a reply would need
+constexpr uint8_t kEmptyDictionary = 0xA0;
+constexpr std::size_t kWhat = sizeof(uint32_t) + 1;  // where it begins, in a note
+static_assert(Frame::kMaxElements < 24);
+
+template <class T>
+T numberAt(std::span<const uint8_t> bytes, std::size_t offset) {
+  T value;
+  std::memcpy(&value, bytes.data() + offset, sizeof value);
+  return value;
+}
+
+}  // namespace
+
+void writeAccepted(const RecordedClient& client, std::span<uint8_t, kAcceptedHeadBytes> head) {
+  static_assert(sizeof client.pid + sizeof client.uid == kAcceptedHeadBytes);
+  std::memcpy(head.data(), &client.pid, sizeof client.pid);
+  std::memcpy(head.data() + sizeof client.pid, &client.uid, sizeof client.uid);
+}
+
+std::optional<RecordedClient> readAccepted(std::span<const uint8_t> head) {
+  if (head.size() != kAcceptedHeadBytes) return std::nullopt;
+  return RecordedClient{numberAt<pid_t>(head, 0), numberAt<uid_t>(head, sizeof(pid_t))};
+}
+
+void writeCall(const Frame& call, std::optional<std::size_t> dictionary,
+               std::vector<uint8_t>& head) {
+  head.clear();
+  head.push_back(static_cast<uint8_t>(kArrayHead | call.size()));
+  head.push_back(static_cast<uint8_t>(wire::FrameKind::Call));
+  head.push_back(kNoNumber);
+  for (std::size_t i = wire::kCallHead - 1; i < call.size(); ++i) {
+    if (i == dictionary) {
+      head.push_back(kEmptyDictionary);
+      continue;
+    }
+    const std::span<const uint8_t> element = call[i].encoded();
+    head.insert(head.end(), element.begin(), element.end());
+  }
+}
+
+Result<RecordedCall> readCall(std::span<const uint8_t> head,
+                              const std::optional<Payload>& dictionary,
+                              const InterfaceDescription& interface) {
+  DecodeError error;
+  const std::optional<Frame> frame = Frame::decode(head, &error);
+  if (!frame) return Status::failure("a recorded call is no frame: " + error.text);
+  if (frame->size() < wire::kCallHead || frame->size() > Frame::kMaxElements)
+    return Status::failure("a recorded call has no operation");
+  const int64_t number = (*frame)[wire::kCallHead - 1].asInt64();
+  if (number < 1 || static_cast<uint64_t>(number) > interface.operations.size())
+    return Status::failure("there is no operation " + std::to_string(number));
+  RecordedCall call;
+  call.operation = &interface.operations[static_cast<std::size_t>(number - 1)];
+  if (Status read = readArguments(*call.operation, *frame, call.arguments); !read.ok()) return read;
+  if (const auto element = dictionaryElement(*call.operation, *frame))
+    call.arguments.set(*element - wire::kCallHead,
+                       std::optional<Payload>(dictionary.value_or(Payload())));
+  return call;
+}
+
+std::vector<uint8_t> writeInput(uint32_t place, std::string_view what, const Payload& answer) {
+  const std::span<const uint8_t> bytes = answer.encoded();
+  std::vector<uint8_t> note(kWhat + what.size() + bytes.size());
+  std::memcpy(note.data(), &place, sizeof place);
+  note[kWhat - 1] = static_cast<uint8_t>(what.size());
+  std::copy(what.begin(), what.end(), note.begin() + kWhat);
+  std::ranges::copy(bytes, note.end() - static_cast<std::ptrdiff_t>(bytes.size()));
+  return note;
+}
+
+std::optional<RecordedInput> readInput(std::span<const uint8_t> note) {
+  if (note.size() < kWhat || note.size() - kWhat < note[kWhat - 1]) return std::nullopt;
+  const std::size_t length = note[kWhat - 1];
+  std::optional<Payload> answer = Payload::decode(note.subspan(kWhat + length));
+  if (!answer) return std::nullopt;
+  return RecordedInput{numberAt<uint32_t>(note, 0),
+                       {reinterpret_cast<const char*>(note.data()) + kWhat, length},
+                       std::move(*answer)};
+}
+
+}  // namespace vx::lnx
