@@ -19,6 +19,7 @@ int main() {
   vx::Platform& services = linuxPlatform->services();
   vx::installPlatform(&services);
   linuxPlatform->begin();
+  linuxPlatform->recover([] { return vx::VXReportingServiceDelegate::create(); });
   {
     const std::shared_ptr<vx::VXReportingServiceDelegate> delegate =
         vx::VXReportingServiceDelegate::create();

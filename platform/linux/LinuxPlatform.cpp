@@ -33,8 +33,10 @@
 #include "platform/linux/execution/SystemThreading.h"
 #include "platform/linux/ipc/SocketListener.h"
 #include "platform/linux/journal/Journal.h"
+#include "platform/linux/recovery/JournalOpening.h"
 #include "platform/linux/recovery/JournalRecorder.h"
 #include "platform/linux/recovery/JournaledInputs.h"
+#include "platform/linux/recovery/Recovery.h"
 #include "platform/linux/settings/PreferencesWatcher.h"
 #include "platform/linux/settings/TomlPreferences.h"
 #include "platform/linux/store/LocalStore.h"
@@ -135,7 +137,7 @@ class RunningPlatform final : public LinuxPlatform {
       return false;
     }
     store_ = std::move(*opened);
-    openJournal(directories.runtime);
+    openJournal(directories.runtime, directories.state);
     relay_.emplace(backends(), [this](Function<void()> job) { store_->runSoon(std::move(job)); });
     services_.emplace(Platform{
         .serviceListener = listener_,
@@ -169,6 +171,26 @@ class RunningPlatform final : public LinuxPlatform {
     store_->start();
     connect();
   }
+  void recover(const Function<std::shared_ptr<ServiceListenerDelegate>()>& makeDelegate) override {
+    if (left_.records.empty()) return endReplay(journalFolder_);
+    const Monotonic began = clock_.monotonic();
+    executor_.adoptInteractiveThread();
+    recovery_.emplace(RecoveryMeans{*services_, executor_, *journal_, backendNames(),
+                                    [this] { return store_->isCongested(); }},
+                      std::move(left_));
+    const RecoveryOutcome outcome = recovery_->run(makeDelegate);
+    endReplay(journalFolder_);
+    recoveredWaits_ = journal_->beginGeneration().ok();
+    VX_LOG(nullptr, Default,
+           "finished what an earlier process had accepted: calls=%llu undone=%llu connections=%llu "
+           "unreadable=%llu ms=%lld",
+           static_cast<unsigned long long>(outcome.calls),
+           static_cast<unsigned long long>(outcome.undone),
+           static_cast<unsigned long long>(outcome.ended),
+           static_cast<unsigned long long>(outcome.unreadable),
+           static_cast<long long>(
+               std::chrono::round<std::chrono::milliseconds>(clock_.monotonic() - began).count()));
+  }
   SystemLog& log() { return log_; }
 
   int shutDown() override {
@@ -195,11 +217,15 @@ class RunningPlatform final : public LinuxPlatform {
 
  private:
   // Without one the service serves all the same.
-  void openJournal(const std::string& runtime) {
-    Result<std::unique_ptr<Journal>> opened =
-        Journal::open({.folder = runtime + "/journal", .epoch = storeEpoch()}, &journalComplaints_);
+  void openJournal(const std::string& runtime, const std::string& state) {
+    journalFolder_ = runtime + "/journal";
+    Result<OpenedJournal> opened =
+        vx::lnx::openJournal({.folder = journalFolder_, .epoch = storeEpoch()}, state + "/journal");
     if (opened.ok()) {
-      journal_ = std::move(*opened);
+      journal_ = std::move(opened->journal);
+      left_ = std::move(opened->left);
+      poisoned_ = std::move(opened->poisoned);
+      journalComplaints_ = std::move(opened->complaints);
       recorder_.emplace(*journal_, clock_);
       recorder_->setUnrecordedHandler([](const Status& why) {
         VX_LOG(nullptr, Error, "%s: what is accepted from now on may not survive this process",
@@ -212,13 +238,27 @@ class RunningPlatform final : public LinuxPlatform {
     }
     inputs_.emplace(journal_.get());
     struct statfs files {};
-    const std::string& folder = journal_ != nullptr ? runtime + "/journal" : runtime;
+    const std::string& folder = journal_ != nullptr ? journalFolder_ : runtime;
     journalInMemory_ = statfs(folder.c_str(), &files) == 0 && files.f_type == TMPFS_MAGIC;
+  }
+
+  // What was recovered is no longer wanted once nothing waits because of it.
+  void cutJournal() {
+    if (!recoveredWaits_ || !journal_->earlierCallsAreDone()) return;
+    recoveredWaits_ = !journal_->endSnapshot().ok();
   }
 
   void reportOnJournal() {
     for (const std::string& complaint : journalComplaints_)
       VX_LOG(nullptr, Error, "journal: %s", complaint.c_str());
+    if (!poisoned_.empty()) {
+      VX_LOG(nullptr, Error,
+             "processes ended again and again while they finished what an earlier one had "
+             "accepted; it is now in %s",
+             poisoned_.c_str());
+      store_->noteAtStart(
+          {"journal_moved_aside", "", 0, "its replays did not end; now " + poisoned_});
+    }
     if (!journalInMemory_)
       VX_LOG(nullptr, Info, "the runtime folder is not a tmpfs: each call costs writes to a disk");
   }
@@ -230,6 +270,12 @@ class RunningPlatform final : public LinuxPlatform {
       if (name == store_->relayBackend().name()) named.push_back(&store_->relayBackend());
     }
     return named;
+  }
+
+  std::vector<std::string> backendNames() {
+    std::vector<std::string> names;
+    for (const RelayBackend* backend : backends()) names.emplace_back(backend->name());
+    return names;
   }
 
   // Everything that the event loop looks after besides connections.
@@ -253,6 +299,7 @@ class RunningPlatform final : public LinuxPlatform {
     (void)loop_.add(signalFd_.get(), EPOLLIN, signalSource_);
 
     loop_.addPassEndHook([this] { heapPages_.askForNew(); });
+    loop_.addPassEndHook([this] { cutJournal(); });
     if (recorder_) {
       watcher_->setPoster([this](std::string_view name, const PreferencesWatcher::Post& post) {
         const Cause cause{recorder_->preferencesChanged(name), {}};
@@ -321,11 +368,16 @@ class RunningPlatform final : public LinuxPlatform {
   UsdtTracePoint trace_;
   std::optional<PreferencesWatcher> watcher_;
   std::unique_ptr<LocalStore> store_;
+  std::string journalFolder_;
   std::vector<std::string> journalComplaints_;
+  std::string poisoned_;
+  JournalContents left_;
   bool journalInMemory_ = false;
   std::unique_ptr<Journal> journal_;
   std::optional<JournalRecorder> recorder_;
   std::optional<JournaledInputs> inputs_;
+  std::optional<Recovery> recovery_;
+  bool recoveredWaits_ = false;
   std::optional<RelayReporting> relay_;
   std::optional<Platform> services_;
   UniqueFd signalFd_;

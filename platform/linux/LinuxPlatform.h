@@ -5,6 +5,7 @@
 #include <memory>
 #include <string>
 
+#include "base/Function.h"
 #include "platform/Platform.h"
 
 namespace vx::lnx {
@@ -22,6 +23,11 @@ class LinuxPlatform {
 
   // Starts what works in the background. The services must be installed.
   virtual void begin() = 0;
+
+  // Finishes what a process before this one had accepted, if it did not. `makeDelegate` makes the
+  // service that does it, which is gone when this returns. After begin().
+  virtual void recover(
+      const Function<std::shared_ptr<ServiceListenerDelegate>()>& makeDelegate) = 0;
 
   // After the listener's resume has returned: drains the relay queues, commits the store and ends
   // all threads, within five seconds of the request to end. The exit status: 0, or 1 when something

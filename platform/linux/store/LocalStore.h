@@ -30,6 +30,8 @@ class LocalStore final : public AnalyticsEventService, public PowerEventLog {
   static Result<std::unique_ptr<LocalStore>> open(const std::string& stateDirectory,
                                                   const StoreOptions& options, Clock& clock);
 
+  // A row of the ledger; before start().
+  void noteAtStart(LedgerNote note) { writer_.noteAtStart(std::move(note)); }
   // Starts the writer. Logs, so the platform must be installed; what is appended before is kept.
   void start();
 

@@ -1,0 +1,35 @@
+// The journal when a process begins, with what the one before left in it.
+#pragma once
+
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "platform/linux/journal/Journal.h"
+#include "platform/linux/journal/JournalReader.h"
+
+namespace vx::lnx {
+
+// How many processes may end while they replay a journal, before it is believed to be the cause.
+inline constexpr uint32_t kMostReplays = 2;
+
+// The store that the calls in a journal belong to; none when there are none.
+std::optional<JournalEpoch> epochOfJournal(const std::string& folder);
+
+struct OpenedJournal {
+  std::unique_ptr<Journal> journal;
+  JournalContents left;                 // to be replayed
+  std::vector<std::string> complaints;  // what could not be believed
+  std::string poisoned;                 // where one is now whose replays have all failed; or empty
+};
+
+// Counts a replay of what is there, and opens the journal behind it. What an ending process moved
+// to `moved`, where it had more time, is taken back first. After kMostReplays replays that were
+// begun and not ended (endReplay), the journal is moved aside.
+Result<OpenedJournal> openJournal(JournalOptions options, const std::string& moved);
+// What was left has been replayed.
+void endReplay(const std::string& folder);
+
+}  // namespace vx::lnx

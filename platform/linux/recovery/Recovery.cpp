@@ -1,0 +1,156 @@
+#include "platform/linux/recovery/Recovery.h"
+
+#include <algorithm>
+#include <thread>
+#include <utility>
+
+#include "platform/linux/execution/CauseScope.h"
+#include "platform/linux/recovery/Records.h"
+
+namespace vx::lnx {
+
+namespace {
+
+// How long a recovery waits for a store that does not keep up: for as long nobody is served.
+constexpr std::chrono::seconds kPatience{5};
+constexpr std::chrono::milliseconds kLookAgain{1};
+constexpr std::chrono::seconds kBackgroundTime{10};
+
+}  // namespace
+
+Recovery::Recovery(RecoveryMeans means, JournalContents contents)
+    : means_(std::move(means)),
+      contents_(std::move(contents)),
+      platform_(means_.live, means_.backends, inputs_),
+      patience_(kPatience) {}
+
+uint64_t Recovery::firstUndone() const {
+  const auto first =
+      std::ranges::find_if(contents_.records, [](const Record& record) { return !record.done; });
+  return first != contents_.records.end() ? first->call : contents_.next.call;
+}
+
+RecoveryOutcome Recovery::run(const MakeDelegate& makeDelegate) {
+  installPlatform(&platform_.services());
+  delegate_ = makeDelegate();
+  for (const Record& record : contents_.records) {
+    lastTime_ = std::max(lastTime_, record.time);
+    runRecord(record);
+  }
+  endOpenConnections();
+  delegate_.reset();
+  runInteractive();
+  (void)means_.executor.drain(means_.live.clock.monotonic() + kBackgroundTime);
+  installPlatform(&means_.live);
+  return outcome_;
+}
+
+// ---------------------------------------------------------------------------------------------------------------------
+// Records
+
+void Recovery::runRecord(const Record& record) {
+  const Cause cause{means_.journal.resume(record.place), {}};
+  {
+    const CauseScope scope(cause);
+    switch (static_cast<RecordKind>(record.kind)) {
+      case RecordKind::Accepted:
+        accept(record);
+        break;
+      case RecordKind::Call:
+      case RecordKind::StopCall:
+      case RecordKind::DestroyCall:
+        call(record);
+        break;
+      case RecordKind::EndedInterrupted:
+      case RecordKind::EndedOrderly:
+      case RecordKind::EndedServiceStopped:
+      case RecordKind::EndedCrashed:
+        end(record);
+        break;
+      case RecordKind::PreferencesChanged:
+        platform_.notify({reinterpret_cast<const char*>(record.head.data()), record.head.size()});
+        break;
+      default:
+        ++outcome_.unreadable;
+        return;
+    }
+  }
+  ++outcome_.calls;
+  outcome_.undone += record.done ? 0 : 1;
+  runInteractive();
+  waitForStore();
+}
+
+void Recovery::accept(const Record& record) {
+  const std::optional<RecordedClient> client = readAccepted(record.head);
+  if (!client) {
+    ++outcome_.unreadable;
+    return;
+  }
+  const auto connection = std::make_shared<RecoveredConnection>(client->pid, client->uid);
+  if (delegate_->listener(means_.live.serviceListener, connection))
+    connections_.emplace(record.call, connection);
+}
+
+// One whose connection was not recorded, or is over, has nobody to make it.
+void Recovery::call(const Record& record) {
+  const auto found = connections_.find(record.connection);
+  if (found == connections_.end()) return;
+  const std::shared_ptr<ExportedObject> object = found->second->exportedObject();
+  const InterfaceDescription* const interface = found->second->interface();
+  if (object == nullptr || interface == nullptr) return;
+  Result<RecordedCall> call = readCall(record.head, record.dictionary, *interface);
+  if (!call.ok()) {
+    ++outcome_.unreadable;
+    return;
+  }
+  call->operation->invoke(*object, call->arguments, Reply());
+}
+
+void Recovery::end(const Record& record) {
+  const auto found = connections_.find(record.connection);
+  if (found == connections_.end()) return;
+  const std::shared_ptr<RecoveredConnection> connection = std::move(found->second);
+  connections_.erase(found);
+  if (record.kind == static_cast<uint8_t>(RecordKind::EndedInterrupted)) connection->interrupt();
+  connection->invalidate();
+}
+
+// ---------------------------------------------------------------------------------------------------------------------
+// The end
+
+// Recorded before it happens: a recovery that is begun again finds the same end, under the same
+// number, of the same time.
+void Recovery::endOpenConnections() {
+  while (!connections_.empty()) {
+    const auto [number, connection] = *connections_.begin();
+    connections_.erase(connections_.begin());
+    Result<JournalAppended> appended =
+        means_.journal.appendEnd({.kind = static_cast<uint8_t>(RecordKind::EndedCrashed),
+                                  .time = lastTime_,
+                                  .connection = number});
+    Cause cause;
+    if (appended.ok()) cause.ticket = std::move(appended->ticket);
+    {
+      const CauseScope scope(cause);
+      connection->invalidate();
+    }
+    ++outcome_.ended;
+    runInteractive();
+    waitForStore();
+  }
+}
+
+void Recovery::runInteractive() {
+  while (means_.executor.runInteractive(1024)) {
+  }
+}
+
+void Recovery::waitForStore() {
+  while (patience_.count() > 0 && means_.congested()) {
+    std::this_thread::sleep_for(kLookAgain);
+    patience_ -= kLookAgain;
+  }
+}
+
+}  // namespace vx::lnx

@@ -1,0 +1,27 @@
+#include "platform/linux/recovery/ReplayInputs.h"
+
+#include "platform/linux/execution/CauseScope.h"
+#include "platform/linux/recovery/Records.h"
+
+namespace vx::lnx {
+
+ReplayInputs::ReplayInputs(const JournalContents& contents) {
+  for (const JournalContents::Record& record : contents.records)
+    if (!record.notes.empty()) noted_.emplace(record.call, &record);
+}
+
+std::optional<Payload> ReplayInputs::once(std::string_view what,
+                                          const Function<std::optional<Payload>()>&) {
+  const Cause cause = Cause::take();
+  const auto found = noted_.find(cause.ticket.call());
+  if (found == noted_.end()) return std::nullopt;
+  for (const JournalContents::Note& note : found->second->notes) {
+    if (note.kind != kInputNote) continue;
+    std::optional<RecordedInput> input = readInput(note.bytes);
+    if (input && input->place == cause.position.place && input->what == what)
+      return std::move(input->answer);
+  }
+  return std::nullopt;
+}
+
+}  // namespace vx::lnx

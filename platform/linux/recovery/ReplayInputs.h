@@ -1,0 +1,24 @@
+// The recorded inputs of a replay: answers come from the journal.
+#pragma once
+
+#include <cstdint>
+#include <unordered_map>
+
+#include "platform/RecordedInputs.h"
+#include "platform/linux/journal/JournalReader.h"
+
+namespace vx::lnx {
+
+// Thread-safe: immutable. Outside of a recorded call there are no answers.
+class ReplayInputs final : public RecordedInputs {
+ public:
+  // `contents` outlives it.
+  explicit ReplayInputs(const JournalContents& contents);
+  std::optional<Payload> once(std::string_view what,
+                              const Function<std::optional<Payload>()>& source) override;
+
+ private:
+  std::unordered_map<uint64_t, const JournalContents::Record*> noted_;  // by call
+};
+
+}  // namespace vx::lnx
