@@ -9,13 +9,12 @@ using Sharing = StoreRecord::Sharing;
 class EventPairingTest : public StoreTest {
  protected:
   void add(StoreRecord::What what, double time = 10) { batch.push_back({time, std::move(what)}); }
-  // The places of the events behind the message in a place.
-  std::vector<uint32_t> sharersOf(std::size_t place) {
-    std::vector<uint32_t> places;
-    for (uint32_t i = batch[place].nextSharer; i != StoreRecord::kNone; i = batch[i].nextSharer)
-      places.push_back(i);
-    return places;
+  void addOf(const JournalTicket& call, StoreRecord::What what) {
+    batch.push_back({10, std::move(what), {call, {}}});
   }
+  // The place of the event that shares the text of the message in a place.
+  uint32_t eventOf(std::size_t place) { return batch[place].event; }
+  static constexpr uint32_t kNone = StoreRecord::kNone;
   void nextBatch() {
     batch.clear();
     pairing.join(batch);
@@ -34,13 +33,25 @@ TEST_F(EventPairingTest, EventsFindTheirMessageInTheirOrder) {
   add(message(a));  // to a second session
   add(event("e", tagged(a), a));
   add(event("e", tagged(b), b));
+  add(event("e", tagged(a), a));  // one too many
   add(event("e", tagged(Payload()), Payload()));
   pairing.pair(batch);
-  EXPECT_THAT(sharersOf(1), ElementsAre(0, 5));
-  EXPECT_THAT(sharersOf(2), ElementsAre(6));
-  EXPECT_THAT(sharersOf(3), IsEmpty());
-  EXPECT_THAT(sharersOf(4), IsEmpty());
+  EXPECT_EQ(eventOf(1), 0u);
+  EXPECT_EQ(eventOf(2), 6u);
+  EXPECT_EQ(eventOf(3), kNone);
+  EXPECT_EQ(eventOf(4), 5u);
   EXPECT_EQ(batch[7].sharing, Sharing::No);
+  EXPECT_EQ(batch[8].sharing, Sharing::No);
+}
+
+TEST_F(EventPairingTest, EventOfAnotherCallIsNotInTheRow) {
+  const Payload a = numbered(1);
+  const JournalTicket first = recorded();
+  addOf(first, message(a));
+  addOf(recorded(), event("e", tagged(a), a));
+  addOf(first, event("e", tagged(a), a));
+  pairing.pair(batch);
+  EXPECT_EQ(eventOf(0), 2u);
 }
 
 TEST_F(EventPairingTest, EachOfManyMessagesIsFound) {
@@ -49,7 +60,7 @@ TEST_F(EventPairingTest, EachOfManyMessagesIsFound) {
   for (const Payload& payload : payloads) add(message(payload));
   for (const Payload& payload : payloads) add(event("e", payload, payload));
   pairing.pair(batch);
-  for (uint32_t i = 0; i < 700; ++i) ASSERT_THAT(sharersOf(i), ElementsAre(700 + i));
+  for (uint32_t i = 0; i < 700; ++i) ASSERT_EQ(eventOf(i), 700 + i);
 }
 
 TEST_F(EventPairingTest, YoungEventWaitsOneBatchForItsMessage) {
@@ -68,7 +79,7 @@ TEST_F(EventPairingTest, YoungEventWaitsOneBatchForItsMessage) {
   EXPECT_EQ(pairing.heldSince(), std::nullopt);
   add(message(late));
   pairing.pair(batch);
-  EXPECT_THAT(sharersOf(2), ElementsAre(0));
+  EXPECT_EQ(eventOf(2), 0u);
   pairing.hold(batch, 10, Monotonic(6s));
   EXPECT_EQ(pairing.heldSince(), std::nullopt);  // not twice
   EXPECT_EQ(EventPairing::unwrittenRows(batch, 0), 3u);
@@ -76,15 +87,33 @@ TEST_F(EventPairingTest, YoungEventWaitsOneBatchForItsMessage) {
 
 TEST_F(EventPairingTest, WhatIsWrittenIsNeitherLostNorKept) {
   const Payload a = numbered(1);
-  add(message(a));
-  add(message(numbered(2)));
-  add(event("e", a, a));
+  const Payload b = numbered(2);
+  addOf(recorded(), event("early", b, b));
+  addOf(batch[0].cause.ticket, message(a));
+  addOf(batch[0].cause.ticket, message(b));
+  addOf(recorded(), RelayEndRecord{row});
+  addOf(batch[0].cause.ticket, event("e", a, a));
   pairing.pair(batch);
-  EXPECT_EQ(EventPairing::unwrittenRows(batch, 0), 3u);
-  EventPairing::markWritten(batch, 0, 1);
-  EXPECT_EQ(EventPairing::unwrittenRows(batch, 1), 1u);
-  EXPECT_EQ(std::get<RelayMessageRecord>(batch[0].what).payload.identity(), nullptr);
-  EXPECT_NE(std::get<RelayMessageRecord>(batch[1].what).payload.identity(), nullptr);
+  EXPECT_EQ(EventPairing::unwrittenRows(batch, 0), 4u);
+  EventPairing::markWritten(batch, 0, 2);
+  EXPECT_EQ(EventPairing::unwrittenRows(batch, 2), 2u);  // with the early one
+  EXPECT_EQ(std::get<RelayMessageRecord>(batch[1].what).payload.identity(), nullptr);
+  EXPECT_NE(std::get<RelayMessageRecord>(batch[2].what).payload.identity(), nullptr);
+  EXPECT_FALSE(batch[4].cause.ticket);
+  EXPECT_TRUE(batch[0].cause.ticket);  // its message is not
+  EventPairing::abandon(batch, 2);
+  batch.clear();
+  EXPECT_EQ(undone(), 2);
+}
+
+TEST_F(EventPairingTest, CallOfWhatIsWrittenIsDone) {
+  const Payload a = numbered(1);
+  addOf(recorded(), message(a));
+  addOf(batch[0].cause.ticket, event("e", a, a));
+  addOf(recorded(), power(1));
+  pairing.pair(batch);
+  EventPairing::markWritten(batch, 0, 3);
+  EXPECT_EQ(undone(), 0);
 }
 
 }  // namespace

@@ -18,6 +18,9 @@ class LocalStoreTest : public StoreTest {
     Result<std::unique_ptr<LocalStore>> opened = LocalStore::open(folder, options, clock);
     ASSERT_TRUE(opened.ok()) << opened.status().text();
     store = std::move(*opened);
+    store->setEndWord([](const JournalTicket& call) -> std::string_view {
+      return call.kind() == 1 ? "stopped" : "";
+    });
     store->start();
   }
   bool close(std::chrono::seconds within = 60s) { return store->close(clock.monotonic() + within); }
@@ -201,6 +204,50 @@ TEST_F(LocalStoreTest, SecondOpenerAndNewerSchemaAreRefused) {
   query("PRAGMA user_version = 99");
   const auto refused = LocalStore::open(folder, options, clock);
   EXPECT_THAT(refused.status().text(), HasSubstr("newer version"));
+}
+
+// As after a crash: the same calls run again, from the first that is not known to be done.
+TEST_F(LocalStoreTest, ReplayWritesWhatIsMissingAndNothingTwice) {
+  const Cause calls[] = {{recorded(1.5), {}}, {recorded(2.5), {}}, {recorded(3.5), {}}};
+  const Payload payload = numbered(1);
+  auto run = [&](int upTo) {
+    const auto relay = [&] {
+      const CauseScope scope(calls[0]);
+      return session(42);
+    }();
+    for (int call = 1; call < upTo; ++call) {
+      const CauseScope scope(calls[call]);
+      relay->send(5, 1, payload);
+      store->sendEventLazy(
+          "e", [payload] { return tagged(payload); }, payload);
+      power(call);
+      relay->send(6, 1, Payload());
+    }
+    if (upTo == 3) {
+      const CauseScope scope(calls[2]);
+      relay->flush([](const std::optional<Error>&) {});
+    }
+  };
+  open();
+  const JournalEpoch epoch = store->epoch();
+  run(2);
+  reopen();
+  EXPECT_EQ(store->epoch(), epoch);
+  store->beginReplay(2);  // the first is found although it is older
+  run(3);
+  store->endReplay();
+  power(3);
+  EXPECT_TRUE(close());
+  EXPECT_EQ(store->counters().rowsCommitted, 5u);
+  EXPECT_THAT(query("SELECT session_id, call, place, ended_at, ended_how FROM relay_sessions"),
+              ElementsAre("42|1|0|3.5|stopped"));
+  EXPECT_THAT(query("SELECT relay_session, call, place, category, event_place FROM relay_messages"),
+              ElementsAre("1|2|0|5|1073741824", "1|2|3221225472|6|null", "1|3|0|5|1073741824",
+                          "1|3|3221225472|6|null"));
+  EXPECT_THAT(query("SELECT time, payload FROM analytics_events WHERE id > 2"),
+              ElementsAre("3.5|{\"i\":1,\"app\":\"x\\\"y\"}"));
+  EXPECT_THAT(query("SELECT call, record, time = 3.5 FROM power_records"),
+              ElementsAre("2|{\"i\":1}|0", "3|{\"i\":2}|1", "null|{\"i\":3}|0"));
 }
 
 }  // namespace

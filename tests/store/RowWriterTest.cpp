@@ -27,8 +27,8 @@ class RowWriterTest : public StoreTest {
     return PayloadBuilder().set("f", std::string(bytes - 8, 'x')).build();
   }
 
-  Database database = openStoreDatabase(":memory:").database;
-  RowWriter writer{database.get(), kMostText, p.clock};
+  Database database = openStoreDatabase(":memory:", kEpoch).database;
+  RowWriter writer{database.get(), kMostText, nullptr, p.clock};
   StoreRecords batch;
   RowWriter::Written written;
 };
@@ -44,13 +44,15 @@ TEST_F(RowWriterTest, EveryColumnIsWhatWasGivenAndOfItsKind) {
   EXPECT_TRUE(write({{"what", "", 0, "why"}, {"what", "t", 3, "why"}}).ok());
   EXPECT_EQ(written.rows, 5u);
   EXPECT_THAT(query("SELECT * FROM relay_sessions"),
-              ElementsAre("1|1.5|-1|null|null|||null|null|{}",
+              ElementsAre("1|1.5|-1|null|null|||null|null|{}|null|null|null|null",
                           "2|2.0|1099511627776|19|2.5|c|s|1|0|{\"clientName\":\"c\","
-                          "\"serviceName\":\"s\"}"));
-  EXPECT_THAT(query("SELECT * FROM relay_messages"),
-              ElementsAre("1|2.5|2|65535|65534|{\"x\":0.5,\"t\":true}"));
-  EXPECT_THAT(query("SELECT * FROM analytics_events"), ElementsAre("1|3.0|name|{\"i\":1}"));
-  EXPECT_THAT(query("SELECT * FROM power_records"), ElementsAre("1|4.0|28|Lumo_Haptics|{\"i\":2}"));
+                          "\"serviceName\":\"s\"}|null|null|null|null"));
+  EXPECT_THAT(
+      query("SELECT * FROM relay_messages"),
+      ElementsAre("1|2.5|2|65535|65534|{\"x\":0.5,\"t\":true}|null|null|null|null|null|null"));
+  EXPECT_THAT(query("SELECT * FROM analytics_events"), ElementsAre("2|3.0|name|{\"i\":1}"));
+  EXPECT_THAT(query("SELECT * FROM power_records"),
+              ElementsAre("1|4.0|28|Lumo_Haptics|{\"i\":2}|null|null"));
   EXPECT_THAT(query("SELECT id, time = 1576800000, event, table_name, rows, detail "
                     "FROM store_ledger"),
               ElementsAre("1|1|what|null|0|why", "2|1|what|t|3|why"));
@@ -80,14 +82,15 @@ TEST_F(RowWriterTest, EventsShareTheTextOfTheirMessages) {
                   "alone|{\"i\":6,\"app\":\"x\\\"y\"}", "before|{\"i\":1,\"app\":\"x\\\"y\"}",
                   "empty|{\"app\":\"x\\\"y\"}", "replaced|{\"app\":\"x\\\"y\",\"i\":5}",
                   "same|{\"i\":3}"));
-  EXPECT_THAT(query("SELECT message FROM analytics_entries WHERE message IS NOT NULL ORDER BY id"),
-              ElementsAre("1", "2", "2", "3"));
+  EXPECT_THAT(query("SELECT payload, event_tail FROM relay_messages WHERE event_tail IS NOT NULL"),
+              ElementsAre("{\"i\":1}|,\"app\":\"x\\\"y\"}", "{\"i\":2}|,\"app\":\"x\\\"y\"}",
+                          "{\"i\":3}|}"));
 }
 
 TEST_F(RowWriterTest, EventNamesAreKeptOnce) {
   for (const char* name : {"a", "b", "a"}) add(event(name, numbered(1)));
   EXPECT_TRUE(write().ok());
-  RowWriter next(database.get(), kMostText, p.clock);  // after a restart
+  RowWriter next(database.get(), kMostText, nullptr, p.clock);  // after a restart
   add(event("b", numbered(1)));
   EXPECT_TRUE(next.write(batch, 0, 1, {}).ok());
   EXPECT_THAT(query("SELECT id, name FROM event_names"), ElementsAre("1|a", "2|b"));
@@ -131,6 +134,39 @@ TEST_F(RowWriterTest, PayloadTooLargeIsLeftOutWithALedgerRow) {
               ElementsAre("left_out|relay_messages|1|a payload of 101 bytes",
                           "left_out|analytics_events|1|a payload of 101 bytes",
                           "left_out|power_records|1|a payload of 101 bytes"));
+}
+
+TEST_F(RowWriterTest, EventHasItsOwnTimeAndIsValidWhateverItsSize) {
+  const Payload small = numbered(1);
+  const Payload large = PayloadBuilder(small).set("f", std::string(kMostText, 'x')).build();
+  add(message(small), 2);
+  add(event("e", large, small), 1.75);
+  const Payload other = numbered(2);
+  add(message(other), 3);
+  add(event("f", tagged(other), other));
+  EXPECT_TRUE(write().ok());
+  EXPECT_THAT(query("SELECT name, time, json_valid(payload) FROM analytics_events"),
+              ElementsAre("f|1.5|1", "e|1.75|1"));
+  EXPECT_EQ(written.rows, 4u);
+}
+
+TEST_F(RowWriterTest, EveryFewThousandRowsAreMarkedForTheNextReplay) {
+  for (int i = 0; i < 5000; ++i) {
+    batch.push_back({1, message(Payload()), {i < 2 ? recorded() : JournalTicket(), {}}});
+    if (i == 4095 || i == 4500) {
+      EXPECT_TRUE(write().ok());
+    }
+  }
+  batch.push_back({1, message(Payload()), {recorded(), {}}});
+  EXPECT_TRUE(write().ok());
+  EXPECT_THAT(query("SELECT call, last_row FROM store_marks"), ElementsAre("2|4096"));
+  auto known = [&](uint64_t first, uint64_t call) {
+    return KnownRows::load(database.get(), first)->find({call, 0}).value_or(0);
+  };
+  EXPECT_EQ(known(1, 1), 1);
+  EXPECT_EQ(known(2, 1), 0);
+  EXPECT_EQ(known(2, 2), 2);
+  EXPECT_EQ(known(3, 3), 5001);
 }
 
 TEST_F(RowWriterTest, EventWhoseBuilderFailsIsLeftOut) {

@@ -9,9 +9,28 @@ namespace {
 
 class StoreFileTest : public StoreTest {
  protected:
-  OpenedStore open() { return openStoreDatabase(folder + "/telemetry.db"); }
+  OpenedStore open() { return openStoreDatabase(folder + "/telemetry.db", kEpoch); }
   static Rows query(const OpenedStore& opened, const std::string& sql) {
     return StoreTest::query(opened.database.get(), sql);
+  }
+  // Each table and view with its columns.
+  static constexpr const char* kColumns =
+      "SELECT s.name, group_concat(c.name || ' ' || c.type) FROM sqlite_master s,"
+      " pragma_table_info(s.name) c WHERE s.type IN ('table', 'view') GROUP BY 1 ORDER BY 1";
+  static constexpr const char* kReaders =
+      "SELECT id, session_id, service_name, application, category, type, payload"
+      " FROM session_messages UNION ALL"
+      " SELECT id, time, client_identifier, name, record, '', '' FROM power_records UNION ALL"
+      " SELECT id, time, event, table_name, rows, detail, '' FROM store_ledger UNION ALL"
+      " SELECT id, at, process, seconds, '', '', '' FROM client_uptimes";
+  static std::string textOf(const std::string& name) {
+    std::stringstream text;
+    text << std::ifstream(std::string(VX_STORE_DATA) + "/" + name).rdbuf();
+    return text.str();
+  }
+  void removeStore() {
+    for (const char* suffix : {"", "-wal", "-shm"})
+      std::filesystem::remove(folder + "/telemetry.db" + suffix);
   }
 };
 
@@ -60,32 +79,34 @@ TEST_F(StoreFileTest, SecondLockIsRefusedUntilTheFirstIsGone) {
 }
 
 TEST_F(StoreFileTest, NewerSchemaIsRefusedAndLeftAlone) {
-  query(open(), "PRAGMA user_version = 3");
+  query(open(), "PRAGMA user_version = 4");
   const OpenedStore opened = open();
   EXPECT_EQ(opened.fault, StoreFault::Unusable);
-  EXPECT_THAT(opened.status.text(), HasSubstr("newer version of the service (schema 3)"));
-  EXPECT_THAT(StoreTest::query("PRAGMA user_version"), ElementsAre("3"));
+  EXPECT_THAT(opened.status.text(), HasSubstr("newer version of the service (schema 4)"));
+  EXPECT_THAT(StoreTest::query("PRAGMA user_version"), ElementsAre("4"));
 }
 
-TEST_F(StoreFileTest, EventsOfTheFirstSchemaAreKept) {
-  StoreTest::query(
-      "CREATE TABLE relay_messages(id INTEGER PRIMARY KEY, time REAL NOT NULL, payload TEXT);"
-      "CREATE TABLE analytics_events(id INTEGER PRIMARY KEY, time REAL NOT NULL,"
-      " name TEXT NOT NULL, payload TEXT NOT NULL);"
-      "CREATE VIEW client_uptimes AS SELECT id FROM analytics_events;"
-      "INSERT INTO analytics_events VALUES(3, 4e9, 'a', '{\"i\":1}'),"
-      "(7, 5e9, 'b', '{\"i\":2}'), (9, 4e9, 'a', '{\"i\":3}');"
-      "PRAGMA user_version = 1");
-  const OpenedStore opened = open();
-  ASSERT_TRUE(opened.status.ok()) << opened.status.text();
-  EXPECT_THAT(query(opened, "SELECT * FROM analytics_events ORDER BY id"),
-              ElementsAre("3|4000000000.0|a|{\"i\":1}", "7|5000000000.0|b|{\"i\":2}",
-                          "9|4000000000.0|a|{\"i\":3}"));
-  EXPECT_THAT(query(opened, "SELECT name FROM event_names ORDER BY name"), ElementsAre("a", "b"));
-  EXPECT_THAT(query(opened, "SELECT count(*) FROM client_uptimes"), ElementsAre("0"));
-  EXPECT_THAT(query(opened, "PRAGMA user_version"), ElementsAre("2"));
-  EXPECT_THAT(query(opened, "SELECT name FROM sqlite_master WHERE name = 'events_before'"),
-              IsEmpty());
+// Files as the service of that time made them.
+TEST_F(StoreFileTest, EarlierSchemasAreBroughtUpToDateAndKeepTheirRows) {
+  const Rows fresh = query(open(), kColumns);
+  for (const char* version : {"1", "2"}) {
+    removeStore();
+    StoreTest::query(textOf(std::string("schema-") + version + ".sql"));
+    const Rows kept = StoreTest::query(kReaders);
+    const OpenedStore opened = openStoreDatabase(folder + "/telemetry.db", {9});
+    ASSERT_TRUE(opened.status.ok()) << opened.status.text();
+    EXPECT_EQ(query(opened, kReaders), kept);
+    EXPECT_THAT(query(opened,
+                      "SELECT id, name, json_extract(payload, '$.HostApplicationDisplayID')"
+                      " FROM analytics_events ORDER BY id"),
+                ElementsAre("3|com.quorvel.sonik.Playback.Error|a",
+                            "7|com.quorvel.sonik.vxreportingclientuptime|null",
+                            "9|com.quorvel.sonik.Playback.Error|null"));
+    EXPECT_EQ(query(opened, kColumns), fresh);
+    EXPECT_EQ(opened.epoch, JournalEpoch{9});
+  }
+  EXPECT_EQ(open().epoch, JournalEpoch{9});  // has one
+  EXPECT_THAT(query(open(), "PRAGMA user_version"), ElementsAre("3"));
 }
 
 TEST_F(StoreFileTest, MigrationThatFailsChangesNothing) {

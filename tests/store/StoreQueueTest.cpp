@@ -14,7 +14,7 @@ class StoreQueueTest : public StoreTest {
     options.queueBytes = 20 * kRecord;
     p.clock.steady = Monotonic(1s);  // past for the machine: nothing really waits
   }
-  bool append(std::size_t bytes = 0) { return queue().append({1.0, power(1)}, bytes); }
+  bool append(std::size_t bytes = 0) { return queue().append(power(1), bytes); }
   Turn take() { return queue().tryTake(batch, heldSince); }
   bool flush() {
     FlushHandler handler = [this](const std::optional<Error>&) { ++flushed; };
@@ -93,6 +93,37 @@ TEST_F(StoreQueueTest, ClosedQueueGivesWhatItHasAndTakesNothing) {
   EXPECT_EQ(take(), Turn::Batch);
   EXPECT_EQ(batch.records.size(), 1u);
   EXPECT_EQ(take(), Turn::End);
+}
+
+TEST_F(StoreQueueTest, RecordKeepsItsCallAndInAReplayItsTime) {
+  options.commit.rows = 2;
+  const Cause call{recorded(7.5), {0, 1}};
+  for (const bool replaying : {false, true}) {
+    queue().setReplaying(replaying);
+    const CauseScope scope(call);
+    append();
+    append();
+    EXPECT_EQ(take(), Turn::Batch);
+    EXPECT_EQ(batch.records[1].cause.key(), (RowKey{1, 1u << 8}));
+    EXPECT_EQ(batch.records[1].time, replaying ? 7.5 : 1576800000);
+  }
+  append();
+  EXPECT_EQ(take(), Turn::Nothing);
+  queue().append(power(1), 0);
+  take();
+  EXPECT_EQ(batch.records[0].time, 1576800000);  // of no call
+}
+
+TEST_F(StoreQueueTest, WhatIsRefusedOrNeverTakenLeavesItsCallUndone) {
+  for (const bool closed : {false, true}) {
+    const Cause call{recorded(), {}};
+    const CauseScope scope(call);
+    if (closed) queue().close({});
+    append();
+    made.reset();
+    if (closed) queue();
+  }
+  EXPECT_EQ(undone(), 2);
 }
 
 TEST_F(StoreQueueTest, CongestedAboveTheBoundUntilHalfIsReleased) {

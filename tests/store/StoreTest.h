@@ -6,6 +6,8 @@
 #include <utility>
 #include <vector>
 
+#include "platform/linux/journal/Journal.h"
+#include "platform/linux/journal/JournalReader.h"
 #include "platform/linux/store/Database.h"
 #include "platform/linux/store/StoreFile.h"
 #include "platform/linux/store/StoreRecord.h"
@@ -40,6 +42,21 @@ class StoreTest : public FolderTest {
     return query(opened, sql);
   }
 
+  // A call that has been recorded, as those that cause rows are.
+  JournalTicket recorded(double time = 7.5, uint8_t kind = 1) {
+    if (journal == nullptr)
+      journal = std::move(*Journal::open({.folder = folder + "/journal", .epoch = kEpoch}));
+    return journal->append({.kind = kind, .time = time})->ticket;
+  }
+  // How many of the recorded calls are not done.
+  int undone() {
+    journal.reset();
+    const auto contents = JournalReader::read(folder + "/journal", kEpoch);
+    int calls = 0;
+    for (const auto& call : contents->records) calls += call.done ? 0 : 1;
+    return calls;
+  }
+
   static Payload numbered(int i) { return PayloadBuilder().set("i", i).build(); }
   // The payload with one entry more, as its event has it.
   static Payload tagged(const Payload& payload) {
@@ -69,6 +86,8 @@ class StoreTest : public FolderTest {
   }
   static PowerRecord power(int i) { return {28, "n", numbered(i)}; }
 
+  static constexpr JournalEpoch kEpoch{1, 2, 3};
+  std::unique_ptr<Journal> journal;
   std::shared_ptr<RelayRow> row = std::make_shared<RelayRow>();
 };
 

@@ -25,6 +25,11 @@ Statement& Statement::bind(std::string_view text) {
   return *this;
 }
 
+Statement& Statement::bind(std::span<const uint8_t> bytes) {
+  sqlite3_bind_blob64(statement_.get(), next_++, bytes.data(), bytes.size(), SQLITE_STATIC);
+  return *this;
+}
+
 Statement& Statement::bindNull() {
   sqlite3_bind_null(statement_.get(), next_++);
   return *this;
@@ -38,7 +43,15 @@ int Statement::run() {
 }
 
 bool Statement::row() {
-  return statement_ != nullptr && sqlite3_step(statement_.get()) == SQLITE_ROW;
+  if (statement_ == nullptr) return false;
+  code_ = sqlite3_step(statement_.get());
+  return code_ == SQLITE_ROW;
+}
+
+std::span<const uint8_t> Statement::blob(int column) const {
+  const void* bytes = sqlite3_column_blob(statement_.get(), column);
+  const int size = sqlite3_column_bytes(statement_.get(), column);
+  return {static_cast<const uint8_t*>(bytes), static_cast<std::size_t>(size)};
 }
 
 std::string Statement::text(int column) const {

@@ -6,6 +6,7 @@
 #include <cstdint>
 #include <memory>
 #include <optional>
+#include <span>
 #include <string>
 #include <string_view>
 
@@ -27,6 +28,8 @@ class Statement {
   Statement& bind(double value);
   // The text must stay until run().
   Statement& bind(std::string_view text);
+  // A blob, which must stay until run().
+  Statement& bind(std::span<const uint8_t> bytes);
   Statement& bindNull();
   // NULL for none.
   template <class T>
@@ -38,9 +41,16 @@ class Statement {
   int run();
   // Steps to the next row; false at the end or on an error.
   bool row();
+  // Of the last step: SQLITE_ROW, SQLITE_DONE, or SQLite's extended error code.
+  int code() const { return code_; }
   int64_t integer(int column) const { return sqlite3_column_int64(statement_.get(), column); }
   double real(int column) const { return sqlite3_column_double(statement_.get(), column); }
   std::string text(int column) const;
+  bool isNull(int column) const {
+    return sqlite3_column_type(statement_.get(), column) == SQLITE_NULL;
+  }
+  // Until the next step.
+  std::span<const uint8_t> blob(int column) const;
   void reset();
 
  private:
@@ -49,7 +59,7 @@ class Statement {
   };
   std::unique_ptr<sqlite3_stmt, Finalizer> statement_;
   int next_ = 1;
-  int code_ = SQLITE_OK;  // of the preparation
+  int code_ = SQLITE_OK;
 };
 
 int execute(sqlite3* database, const char* sql);

@@ -29,22 +29,28 @@ void EventPairing::pair(StoreRecords& batch) {
     messages += std::holds_alternative<RelayMessageRecord>(batch[i].what) ? 1 : 0;
   if (messages == 0 || messages == batch.size()) return;
   slots_.assign(std::bit_ceil(2 * messages), StoreRecord::kNone);
-  for (std::size_t i = 0; i < batch.size(); ++i) {
+  next_.assign(batch.size(), StoreRecord::kNone);
+  for (std::size_t i = batch.size(); i-- > 0;) {
     const auto* message = std::get_if<RelayMessageRecord>(&batch[i].what);
     if (message == nullptr || message->payload.identity() == nullptr) continue;
     uint32_t& slot = slotOf(batch, message->payload.identity());
-    if (slot == StoreRecord::kNone) slot = static_cast<uint32_t>(i);
+    next_[i] = std::exchange(slot, static_cast<uint32_t>(i));
   }
-  // Backwards, so that the events behind one message keep their order.
-  for (std::size_t i = batch.size(); i-- > 0;) {
+  for (std::size_t i = 0; i < batch.size(); ++i) {
     const auto* event = std::get_if<AnalyticsRecord>(&batch[i].what);
     if (event == nullptr || event->message.identity() == nullptr) continue;
-    const uint32_t slot = slotOf(batch, event->message.identity());
-    if (slot == StoreRecord::kNone) continue;
+    uint32_t& slot = slotOf(batch, event->message.identity());
+    if (slot == StoreRecord::kNone || batch[slot].event != StoreRecord::kNone ||
+        batch[slot].cause.ticket.call() != batch[i].cause.ticket.call())
+      continue;
     batch[i].sharing = StoreRecord::Sharing::Shares;
-    batch[i].nextSharer = std::exchange(batch[slot].nextSharer, static_cast<uint32_t>(i));
+    batch[slot].event = static_cast<uint32_t>(i);
+    if (next_[slot] != StoreRecord::kNone) slot = next_[slot];
   }
-  if (slots_.capacity() > kKeptSlots) std::vector<uint32_t>().swap(slots_);
+  if (slots_.capacity() > kKeptSlots) {
+    std::vector<uint32_t>().swap(slots_);
+    std::vector<uint32_t>().swap(next_);
+  }
 }
 
 void EventPairing::hold(StoreRecords& batch, double youngerThan, Monotonic now) {
@@ -74,23 +80,37 @@ std::optional<Monotonic> EventPairing::heldSince() const {
 
 void EventPairing::markWritten(StoreRecords& batch, std::size_t first, std::size_t last) {
   for (std::size_t i = first; i < last; ++i) {
-    auto* message = std::get_if<RelayMessageRecord>(&batch[i].what);
+    StoreRecord& record = batch[i];
+    if (record.sharing == StoreRecord::Sharing::Shares) continue;  // when its message is
+    record.cause = {};
+    auto* message = std::get_if<RelayMessageRecord>(&record.what);
     if (message == nullptr) continue;
     message->payload = Payload();
-    for (uint32_t k = batch[i].nextSharer; k != StoreRecord::kNone; k = batch[k].nextSharer)
-      batch[k].sharing = StoreRecord::Sharing::Written;
+    if (record.event == StoreRecord::kNone) continue;
+    batch[record.event].sharing = StoreRecord::Sharing::Written;
+    batch[record.event].cause = {};
   }
 }
 
 uint64_t EventPairing::unwrittenRows(const StoreRecords& batch, std::size_t first) {
   uint64_t rows = 0;
-  for (std::size_t i = first; i < batch.size(); ++i) {
-    rows += !std::holds_alternative<std::monostate>(batch[i].what) &&
-                    batch[i].sharing != StoreRecord::Sharing::Written
+  for (std::size_t i = 0; i < batch.size(); ++i) {
+    const StoreRecord& record = batch[i];
+    if (record.makesNoRow()) continue;
+    // An event before `first` may share the text of a message after it.
+    rows += record.sharing == StoreRecord::Sharing::Shares ||
+                    (i >= first && record.sharing != StoreRecord::Sharing::Written)
                 ? 1
                 : 0;
   }
   return rows;
+}
+
+void EventPairing::abandon(StoreRecords& batch, std::size_t first) {
+  for (std::size_t i = 0; i < batch.size(); ++i) {
+    if (i >= first || batch[i].sharing == StoreRecord::Sharing::Shares)
+      batch[i].cause.ticket.abandon();
+  }
 }
 
 }  // namespace vx::lnx

@@ -20,8 +20,8 @@ namespace vx::lnx {
 // what it holds back is at most the events of one batch, and for one batch.
 class EventPairing {
  public:
-  // Gives each event of the batch that has its message there its place after that message. The
-  // events behind one message keep their order.
+  // Gives each relay message of the batch the event that says what it says, if it is of the same
+  // call. A message that goes to several sessions has as many events: the first one the first.
   void pair(StoreRecords& batch);
   // Takes the events out that have no message in the batch although they name one, if they are
   // younger than `time` (seconds since 1970) and were not held before: the message is likely to
@@ -32,17 +32,20 @@ class EventPairing {
   // Since when events are held; none when there are none.
   std::optional<Monotonic> heldSince() const;
 
-  // Records [first, last) and all that have their place after them are committed. Lets go of their
-  // messages.
+  // Records [first, last) and the events that share their text are committed. Lets go of their
+  // messages and of their calls, which are done if nothing else waits.
   static void markWritten(StoreRecords& batch, std::size_t first, std::size_t last);
   // How many rows of the records from `first` on are not.
   static uint64_t unwrittenRows(const StoreRecords& batch, std::size_t first);
+  // None of them will be: their calls are not done.
+  static void abandon(StoreRecords& batch, std::size_t first);
 
  private:
   uint32_t& slotOf(const StoreRecords& batch, const void* identity);
 
   ThreadChecker thread_;
   std::vector<uint32_t> slots_;  // open addressing: index in the batch by a payload's identity
+  std::vector<uint32_t> next_;   // of a relay message with the same payload, by index
   std::vector<StoreRecord> held_ GUARDED_BY(thread_);
   Monotonic heldSince_{};
 };

@@ -1,6 +1,7 @@
 #include "platform/linux/store/LocalStore.h"
 
-#include <chrono>
+#include <sys/random.h>
+
 #include <utility>
 
 #include "platform/Log.h"
@@ -8,31 +9,43 @@
 
 namespace vx::lnx {
 
-Result<std::unique_ptr<LocalStore>> LocalStore::open(const std::string& stateDirectory,
-                                                     const StoreOptions& options, Clock& clock) {
+namespace {
+
+JournalEpoch randomEpoch() {
+  JournalEpoch epoch{};
+  (void)getrandom(epoch.data(), epoch.size(), 0);  // never short for so few
+  return epoch;
+}
+
+}  // namespace
+
+Result<std::unique_ptr<LocalStore>> LocalStore::open(
+    const std::string& stateDirectory, const StoreOptions& options, Clock& clock,
+    const std::optional<JournalEpoch>& epochIfNew) {
   Result<UniqueFd> lock = lockStore(stateDirectory);
   if (!lock.ok()) return lock.status();
   const std::string path = stateDirectory + "/telemetry.db";
   std::string damage;
-  OpenedStore opened = openStoreDatabase(path);
+  const JournalEpoch fresh = epochIfNew ? *epochIfNew : randomEpoch();
+  OpenedStore opened = openStoreDatabase(path, fresh);
   if (opened.fault == StoreFault::Damaged) {
     const Result<std::string> aside = moveAside(path);
     if (!aside.ok()) return aside.status();
     damage = opened.status.text() + "; now " + *aside;
-    opened = openStoreDatabase(path);
+    opened = openStoreDatabase(path, fresh);
   }
   if (!opened.status.ok()) return opened.status;
-  return std::unique_ptr<LocalStore>(new LocalStore(
-      std::move(*lock), path, std::move(opened.database), std::move(damage), options, clock));
+  return std::unique_ptr<LocalStore>(
+      new LocalStore(std::move(*lock), path, std::move(opened), std::move(damage), options, clock));
 }
 
-LocalStore::LocalStore(UniqueFd lock, std::string path, Database database, std::string damage,
+LocalStore::LocalStore(UniqueFd lock, std::string path, OpenedStore opened, std::string damage,
                        const StoreOptions& options, Clock& clock)
-    : clock_(clock),
-      lock_(std::move(lock)),
+    : lock_(std::move(lock)),
+      epoch_(opened.epoch),
       damage_(std::move(damage)),
-      writer_(std::move(path), std::move(database), options, clock),
-      backend_(writer_.queue(), clock) {}
+      writer_(std::move(path), std::move(opened), options, clock),
+      backend_(writer_.queue()) {}
 
 void LocalStore::start() {
   if (!damage_.empty()) {
@@ -42,8 +55,14 @@ void LocalStore::start() {
   writer_.start();
 }
 
-double LocalStore::now() const {
-  return std::chrono::duration<double>(clock_.now().time_since_epoch()).count();
+void LocalStore::beginReplay(uint64_t firstCall) {
+  writer_.queue().setReplaying(true);
+  writer_.queue().runSoon([this, firstCall] { writer_.expectKnownRows(firstCall); });
+}
+
+void LocalStore::endReplay() {
+  (void)writer_.queue().append(ReplayEndRecord(), 0);
+  writer_.queue().setReplaying(false);
 }
 
 void LocalStore::sendEventLazy(std::string_view name, Function<Payload()> builder,
@@ -51,15 +70,15 @@ void LocalStore::sendEventLazy(std::string_view name, Function<Payload()> builde
   // The builder holds a message, most likely one that the relay holds too: counted by a typical
   // size.
   constexpr std::size_t kTypicalEventBytes = 128;
-  (void)writer_.queue().append({now(), AnalyticsRecord{name, message, std::move(builder)}},
+  (void)writer_.queue().append(AnalyticsRecord{name, message, std::move(builder)},
                                kTypicalEventBytes);
 }
 
 void LocalStore::logRegisteredEvent(int64_t clientIdentifier, std::string_view eventName,
                                     const Payload& record, const Payload*) {
   const std::size_t bytes = record.encoded().size();
-  (void)writer_.queue().append(
-      {now(), PowerRecord{clientIdentifier, std::string(eventName), record}}, bytes);
+  (void)writer_.queue().append(PowerRecord{clientIdentifier, std::string(eventName), record},
+                               bytes);
 }
 
 }  // namespace vx::lnx

@@ -1,7 +1,9 @@
 // The local store: one SQLite file, written by one thread, fed through one bounded queue.
 #pragma once
 
+#include <cstdint>
 #include <memory>
+#include <optional>
 #include <string>
 
 #include "base/Clock.h"
@@ -27,8 +29,21 @@ class LocalStore final : public AnalyticsEventService, public PowerEventLog {
   // Opens or creates <state>/telemetry.db and locks <state>/telemetry.lock. A failure when another
   // process has it or the folder cannot be used. The quick check runs on the writer's thread before
   // its first write, so start-up does not wait for it.
-  static Result<std::unique_ptr<LocalStore>> open(const std::string& stateDirectory,
-                                                  const StoreOptions& options, Clock& clock);
+  // `epochIfNew`: of a store that has none yet; random without one.
+  static Result<std::unique_ptr<LocalStore>> open(
+      const std::string& stateDirectory, const StoreOptions& options, Clock& clock,
+      const std::optional<JournalEpoch>& epochIfNew = std::nullopt);
+
+  // Within which (call, place) names a row. The same as long as this object lives.
+  const JournalEpoch& epoch() const { return epoch_; }
+  // The word for how a session ended, by the call whose work ended it; before start().
+  void setEndWord(EndWord word) { writer_.setEndWord(word); }
+
+  // What is appended until endReplay() comes from recorded calls from `firstCall` on: rows of
+  // theirs that are there already are not written again, and new ones bear the time of their call.
+  // Nothing else may be appended meanwhile.
+  void beginReplay(uint64_t firstCall);
+  void endReplay();
 
   // A row of the ledger; before start().
   void noteAtStart(LedgerNote note) { writer_.noteAtStart(std::move(note)); }
@@ -56,12 +71,11 @@ class LocalStore final : public AnalyticsEventService, public PowerEventLog {
   Counters counters() const { return writer_.counters(); }
 
  private:
-  LocalStore(UniqueFd lock, std::string path, Database database, std::string damage,
+  LocalStore(UniqueFd lock, std::string path, OpenedStore opened, std::string damage,
              const StoreOptions& options, Clock& clock);
-  double now() const;
 
-  Clock& clock_;
   const UniqueFd lock_;
+  const JournalEpoch epoch_;
   const std::string damage_;  // what was found and moved aside when the store was opened
   StoreWriter writer_;
   StoreBackend backend_;

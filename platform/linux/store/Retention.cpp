@@ -89,10 +89,15 @@ bool Retention::removeOldest(std::size_t table, std::optional<double> before, Co
   return rows > 0;
 }
 
-// Removes messages, and with them the events that share their text. These lie at the beginning of
-// their table: both tables name messages in the same order.
+// Removes messages, and with them the events that share their text. Those of the second schema lie
+// at the beginning of a table of their own: both tables name messages in the same order.
 bool Retention::removeOldestMessages(int64_t last, std::optional<double> before, Counts& removed) {
   if (execute(database_, "BEGIN IMMEDIATE") != SQLITE_OK) return false;
+  Statement events(database_,
+                   "SELECT count(event_name) FROM relay_messages WHERE id <= ? AND time < ?");
+  const int64_t within =
+      events.bind(last).bind(before.value_or(1e18)).row() ? events.integer(0) : 0;
+  events.reset();
   const int64_t rows = removeUpTo(kMessages, last, before);
   Statement sharers(database_,
                     "DELETE FROM analytics_entries AS e WHERE e.message <= ?1"
@@ -100,14 +105,14 @@ bool Retention::removeOldestMessages(int64_t last, std::optional<double> before,
                     " ORDER BY id LIMIT 1), 9e18)"
                     " AND NOT EXISTS (SELECT 1 FROM relay_messages m WHERE m.id = e.message)");
   int code = sharers.bind(last).run();
-  const int64_t events = sqlite3_changes64(database_);
+  const int64_t sharing = sqlite3_changes64(database_);
   if (code == SQLITE_OK) code = execute(database_, "COMMIT");
   if (code != SQLITE_OK) {
     execute(database_, "ROLLBACK");
     return false;
   }
   removed[kMessages] += rows;
-  removed[kEvents] += events;
+  removed[kEvents] += within + sharing;
   return rows > 0;
 }
 

@@ -1,5 +1,7 @@
 #include "platform/linux/store/RowWriter.h"
 
+#include <algorithm>
+#include <cmath>
 #include <exception>
 #include <optional>
 #include <utility>
@@ -13,6 +15,8 @@ namespace {
 
 constexpr std::size_t kKnownNames = 4096;
 constexpr std::size_t kKeptText = 256 << 10;  // a session's summary may be megabytes
+constexpr int64_t kRowsPerMark = 4096;
+constexpr int64_t kKeptMarks = 1024;
 
 template <class T>
 std::optional<T> infoValue(const VyrSessionInfo& info, std::string_view key) {
@@ -43,7 +47,7 @@ std::string textUnder(const Payload& payload, std::string_view key) {
 
 }  // namespace
 
-RowWriter::RowWriter(sqlite3* database, std::size_t mostText, Clock& clock)
+RowWriter::RowWriter(sqlite3* database, std::size_t mostText, EndWord endWord, Clock& clock)
     : database_(database),
       mostText_(mostText),
       clock_(clock),
@@ -53,7 +57,22 @@ RowWriter::RowWriter(sqlite3* database, std::size_t mostText, Clock& clock)
       insertPower_(database, kPowerRecords),
       insertLedger_(database, kStoreLedger),
       addName_(database, "INSERT OR IGNORE INTO event_names(name) VALUES(?)"),
-      findName_(database, "SELECT id FROM event_names WHERE name = ?") {}
+      findName_(database, "SELECT id FROM event_names WHERE name = ?"),
+      endSession_(database,
+                  "UPDATE relay_sessions SET ended_at = ?, ended_how = ? WHERE id = ?"
+                  " AND ended_at IS NULL"),
+      addMark_(database, "INSERT INTO store_marks(call, last_row) VALUES(?, ?)"),
+      removeMarks_(database,
+                   "DELETE FROM store_marks WHERE id <= (SELECT max(id) FROM store_marks) - ?"),
+      endWord_(endWord) {}
+
+Status RowWriter::loadKnownRows(uint64_t firstCall) {
+  thread_.assertIsCurrent();
+  Result<KnownRows> known = KnownRows::load(database_, firstCall);
+  if (!known.ok()) return known.status();
+  known_ = std::move(*known);
+  return {};
+}
 
 Result<RowWriter::Written> RowWriter::write(const StoreRecords& batch, std::size_t first,
                                             std::size_t last,
@@ -61,9 +80,13 @@ Result<RowWriter::Written> RowWriter::write(const StoreRecords& batch, std::size
   thread_.assertHere();
   written_ = {};
   leftOut_.clear();
+  const int64_t markedBefore = lastMarkedRow_;
   const int code = writeTransaction(batch, first, last, notes);
-  if (json_.capacity() > kKeptText) std::string().swap(json_);
+  for (std::string* text : {&json_, &eventJson_}) {
+    if (text->capacity() > kKeptText) std::string().swap(*text);
+  }
   if (code == SQLITE_OK) return written_;
+  lastMarkedRow_ = markedBefore;
   Status failure = Status::failure(sqlite3_errmsg(database_));
   nameRows_.clear();  // the names that were added are not there
   if (sqlite3_get_autocommit(database_) == 0) execute(database_, "ROLLBACK");
@@ -73,40 +96,84 @@ Result<RowWriter::Written> RowWriter::write(const StoreRecords& batch, std::size
 int RowWriter::writeTransaction(const StoreRecords& batch, std::size_t first, std::size_t last,
                                 const std::vector<LedgerNote>& notes) {
   int code = execute(database_, "BEGIN IMMEDIATE");
+  if (code == SQLITE_OK) code = prepare();
   for (std::size_t i = first; code == SQLITE_OK && i < last; ++i)
     code = writeRecord(batch, batch[i]);
   for (const std::vector<LedgerNote>* some : {&notes, &std::as_const(leftOut_)}) {
     for (std::size_t i = 0; code == SQLITE_OK && i < some->size(); ++i)
       code = writeLedger((*some)[i]);
   }
+  if (code == SQLITE_OK) code = writeMark();
   return code == SQLITE_OK ? execute(database_, "COMMIT") : code;
+}
+
+int RowWriter::prepare() {
+  if (prepared_) return SQLITE_OK;
+  Statement last(database_,
+                 "SELECT max(ifnull((SELECT max(id) FROM relay_messages), 0),"
+                 " ifnull((SELECT max(id) FROM analytics_entries), 0),"
+                 " ifnull((SELECT max(last_row) FROM store_marks), 0)),"
+                 " ifnull((SELECT max(last_row) FROM store_marks), 0),"
+                 " ifnull((SELECT max(call) FROM store_marks), 0)");
+  if (!last.row()) return sqlite3_extended_errcode(database_);
+  nextRow_ = last.integer(0) + 1;
+  lastMarkedRow_ = last.integer(1);
+  highestCall_ = static_cast<uint64_t>(last.integer(2));
+  for (const char* table : {"relay_messages", "analytics_entries"}) {
+    Statement highest(database_, std::string("SELECT ifnull(max(call), 0) FROM ") + table +
+                                     " WHERE id > " + std::to_string(lastMarkedRow_));
+    if (!highest.row()) return sqlite3_extended_errcode(database_);
+    highestCall_ = std::max(highestCall_, static_cast<uint64_t>(highest.integer(0)));
+  }
+  prepared_ = true;
+  return SQLITE_OK;
+}
+
+int RowWriter::writeMark() {
+  if (nextRow_ - 1 - lastMarkedRow_ < kRowsPerMark) return SQLITE_OK;
+  lastMarkedRow_ = nextRow_ - 1;
+  const int code = addMark_.bind(static_cast<int64_t>(highestCall_)).bind(lastMarkedRow_).run();
+  return code == SQLITE_OK ? removeMarks_.bind(kKeptMarks).run() : code;
+}
+
+KeyColumns RowWriter::keyOf(const StoreRecord& record) {
+  const RowKey key = record.cause.key();
+  if (key.call == 0) return {};
+  highestCall_ = std::max(highestCall_, key.call);
+  return {static_cast<int64_t>(key.call), int64_t{key.place}};
 }
 
 int RowWriter::writeRecord(const StoreRecords& batch, const StoreRecord& record) {
   if (const auto* message = std::get_if<RelayMessageRecord>(&record.what))
     return writeRelayMessage(batch, record, *message);
-  if (const auto* event = std::get_if<AnalyticsRecord>(&record.what)) {
-    if (record.sharing == StoreRecord::Sharing::Shares ||
-        record.sharing == StoreRecord::Sharing::Written)
-      return SQLITE_OK;  // has its place after a message
-    return writeEvent(record.time, *event, 0, nullptr);
+  if (std::holds_alternative<AnalyticsRecord>(record.what)) {
+    const bool shares = record.sharing == StoreRecord::Sharing::Shares ||
+                        record.sharing == StoreRecord::Sharing::Written;
+    return shares ? SQLITE_OK : writeEvent(record);
   }
   if (const auto* session = std::get_if<RelayOpenRecord>(&record.what))
-    return writeRelaySession(record.time, *session);
-  if (const auto* power = std::get_if<PowerRecord>(&record.what))
-    return writePower(record.time, *power);
+    return writeRelaySession(record, *session);
+  if (const auto* end = std::get_if<RelayEndRecord>(&record.what))
+    return writeRelayEnd(record, *end);
+  if (const auto* power = std::get_if<PowerRecord>(&record.what)) return writePower(record, *power);
   return SQLITE_OK;  // a place without a row
 }
 
-int RowWriter::writeRelaySession(double time, const RelayOpenRecord& record) {
-  const auto& [info, userInfo] = *record.information;
+int RowWriter::writeRelaySession(const StoreRecord& record, const RelayOpenRecord& session) {
+  if (known_) {
+    if (const auto row = known_->findSession(database_, record.cause.key())) {
+      session.row->id = *row;
+      return SQLITE_OK;
+    }
+  }
+  const auto& [info, userInfo] = *session.information;
   json_.clear();
   appendJson(json_, userInfo);
   const std::string clientName = textUnder(userInfo, kVyrReportingUserInfoClientName);
   const std::string serviceName = textUnder(userInfo, kVyrReportingUserInfoServiceName);
   ++written_.rows;
   const int code = insertRelaySession_.run(
-      {.time = time,
+      {.time = record.time,
        .sessionID = sessionIDOf(info),
        .clientType = infoValue<int32_t>(info, kVyrReportingSessionInfoClientType),
        .clientVersion = infoValue<float>(info, kVyrReportingSessionInfoClientVersion),
@@ -114,61 +181,100 @@ int RowWriter::writeRelaySession(double time, const RelayOpenRecord& record) {
        .serviceName = serviceName,
        .batchEvent = flag(info, kVyrReportingSessionInfoBatchEvent),
        .containsRealtimeEvents = flag(info, kVyrReportingSessionInfoContainsRealtimeEvents),
-       .userInfo = storable("relay_sessions")});
-  if (code == SQLITE_OK) record.row->id = sqlite3_last_insert_rowid(database_);
+       .userInfo = storable(json_, "relay_sessions"),
+       .key = keyOf(record)});
+  if (code == SQLITE_OK) session.row->id = sqlite3_last_insert_rowid(database_);
   return code;
+}
+
+int RowWriter::writeRelayEnd(const StoreRecord& record, const RelayEndRecord& end) {
+  const std::string_view how = endWord_ != nullptr && record.cause.ticket
+                                   ? endWord_(record.cause.ticket)
+                                   : std::string_view();
+  return endSession_.bind(record.time)
+      .bind(how.empty() ? std::nullopt : std::optional<std::string_view>(how))
+      .bind(end.row->id)
+      .run();
 }
 
 int RowWriter::writeRelayMessage(const StoreRecords& batch, const StoreRecord& record,
                                  const RelayMessageRecord& message) {
+  const StoreRecord* event = record.event == StoreRecord::kNone ? nullptr : &batch[record.event];
+  if (isKnown(record)) return event != nullptr ? writeEvent(*event) : SQLITE_OK;
   json_.clear();
   appendJson(json_, message.payload);
   ++written_.rows;
-  int code = insertRelayMessage_.run({.time = record.time,
-                                      .relaySession = message.row->id,
-                                      .category = message.category,
-                                      .type = message.type,
-                                      .payload = storable("relay_messages")});
-  const int64_t row = sqlite3_last_insert_rowid(database_);
-  for (uint32_t i = record.nextSharer; code == SQLITE_OK && i != StoreRecord::kNone;
-       i = batch[i].nextSharer) {
-    code =
-        writeEvent(batch[i].time, std::get<AnalyticsRecord>(batch[i].what), row, &message.payload);
+  RelayMessageRow row = {.id = nextRow_++,
+                         .time = record.time,
+                         .relaySession = message.row->id,
+                         .category = message.category,
+                         .type = message.type,
+                         .payload = storable(json_, "relay_messages"),
+                         .key = keyOf(record),
+                         .eventName = {},
+                         .eventPlace = {},
+                         .eventMicroseconds = {},
+                         .eventTail = {}};
+  if (event == nullptr || isKnown(*event)) return insertRelayMessage_.run(row);
+  const auto& built = std::get<AnalyticsRecord>(event->what);
+  const EventText text = buildEvent(built, &message.payload);
+  const bool shares = text == EventText::Tail && eventJson_.size() <= mostText_;
+  if (shares) {
+    int64_t name = 0;
+    if (const int code = nameRow(built.name, name); code != SQLITE_OK) return code;
+    ++written_.rows;
+    row.eventName = name;
+    row.eventPlace = keyOf(*event).place;
+    row.eventMicroseconds = std::llround((event->time - record.time) * 1e6);
+    row.eventTail = eventJson_;
   }
-  return code;
+  const int code = insertRelayMessage_.run(row);
+  if (code != SQLITE_OK || shares || text == EventText::None) return code;
+  return writeEventRow(*event, built.name);
 }
 
-int RowWriter::writePower(double time, const PowerRecord& record) {
+int RowWriter::writePower(const StoreRecord& record, const PowerRecord& power) {
+  if (isKnown(record)) return SQLITE_OK;
   json_.clear();
-  appendJson(json_, record.record);
+  appendJson(json_, power.record);
   ++written_.rows;
-  return insertPower_.run({.time = time,
-                           .clientIdentifier = record.clientIdentifier,
-                           .name = record.name,
-                           .record = storable("power_records")});
+  return insertPower_.run({.time = record.time,
+                           .clientIdentifier = power.clientIdentifier,
+                           .name = power.name,
+                           .record = storable(json_, "power_records"),
+                           .key = keyOf(record)});
 }
 
-int RowWriter::writeEvent(double time, const AnalyticsRecord& event, int64_t messageRow,
-                          const Payload* message) {
-  json_.clear();
-  bool shares = false;
+int RowWriter::writeEvent(const StoreRecord& record) {
+  const auto& event = std::get<AnalyticsRecord>(record.what);
+  if (isKnown(record) || buildEvent(event, nullptr) == EventText::None) return SQLITE_OK;
+  return writeEventRow(record, event.name);
+}
+
+RowWriter::EventText RowWriter::buildEvent(const AnalyticsRecord& event, const Payload* message) {
+  eventJson_.clear();
   try {
     const Payload built = event.builder();
-    shares = message != nullptr && appendJsonTail(json_, built, *message);
-    if (!shares) appendJson(json_, built);
+    if (message != nullptr && appendJsonTail(eventJson_, built, *message)) return EventText::Tail;
+    appendJson(eventJson_, built);
+    return EventText::Whole;
   } catch (const std::exception& failure) {
     VX_LOG(nullptr, Error, "the builder of event %s failed: %s", std::string(event.name).c_str(),
            failure.what());
     ++written_.failedBuilders;
-    return SQLITE_OK;
+    return EventText::None;
   }
-  ++written_.rows;
+}
+
+int RowWriter::writeEventRow(const StoreRecord& record, std::string_view eventName) {
   int64_t name = 0;
-  if (const int code = nameRow(event.name, name); code != SQLITE_OK) return code;
-  return insertEvent_.run({.time = time,
+  if (const int code = nameRow(eventName, name); code != SQLITE_OK) return code;
+  ++written_.rows;
+  return insertEvent_.run({.id = nextRow_++,
+                           .time = record.time,
                            .name = name,
-                           .message = shares ? std::optional<int64_t>(messageRow) : std::nullopt,
-                           .payload = storable("analytics_events")});
+                           .payload = storable(eventJson_, "analytics_events"),
+                           .key = keyOf(record)});
 }
 
 int RowWriter::writeLedger(const LedgerNote& note) {
@@ -181,15 +287,15 @@ int RowWriter::writeLedger(const LedgerNote& note) {
        .detail = note.detail});
 }
 
-const std::string& RowWriter::storable(const char* table) {
-  if (json_.size() <= mostText_) return json_;
-  const std::string bytes = std::to_string(json_.size());
+const std::string& RowWriter::storable(std::string& json, const char* table) {
+  if (json.size() <= mostText_) return json;
+  const std::string bytes = std::to_string(json.size());
   VX_LOG(nullptr, Error,
          "a payload of %s bytes is left out of %s; a row may hold %zu, a quarter of max_bytes",
          bytes.c_str(), table, mostText_);
   leftOut_.push_back({"left_out", table, 1, "a payload of " + bytes + " bytes"});
-  json_ = "{\"left_out_bytes\":" + bytes + "}";
-  return json_;
+  json = "{\"left_out_bytes\":" + bytes + "}";
+  return json;
 }
 
 int RowWriter::nameRow(std::string_view name, int64_t& row) {

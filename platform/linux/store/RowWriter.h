@@ -3,6 +3,7 @@
 
 #include <cstddef>
 #include <cstdint>
+#include <optional>
 #include <string>
 #include <string_view>
 #include <unordered_map>
@@ -12,10 +13,14 @@
 #include "base/Status.h"
 #include "base/ThreadChecker.h"
 #include "platform/linux/store/Database.h"
+#include "platform/linux/store/KnownRows.h"
 #include "platform/linux/store/StoreRecord.h"
 #include "platform/linux/store/StoreTables.h"
 
 namespace vx::lnx {
+
+// The word for how a session ended, of the call whose work ended it; empty: not known.
+using EndWord = std::string_view (*)(const JournalTicket& call);
 
 // Owned by the store's writer and confined to its thread. Refers to a database that outlives it.
 // Keeps at most kKnownNames event names; one row's text at a time, which `mostText` bounds.
@@ -27,29 +32,45 @@ class RowWriter {
   };
 
   // `mostText`: of one payload, in bytes; a larger one is left out and the ledger says so.
-  RowWriter(sqlite3* database, std::size_t mostText, Clock& clock);
+  RowWriter(sqlite3* database, std::size_t mostText, EndWord endWord, Clock& clock);
   RowWriter(const RowWriter&) = delete;
   RowWriter& operator=(const RowWriter&) = delete;
 
-  // Writes records [first, last) of a batch, the events that have their place after them, and the
-  // notes, in one transaction. On a failure none of them is there.
+  // Rows that are there already will not be written again, until they are forgotten.
+  Status loadKnownRows(uint64_t firstCall);
+  bool knowsRows() const { return known_.has_value(); }
+  void forgetKnownRows() { known_.reset(); }
+
+  // Writes records [first, last) of a batch, the events that share their text, and the notes, in
+  // one transaction. On a failure none of them is there.
   Result<Written> write(const StoreRecords& batch, std::size_t first, std::size_t last,
                         const std::vector<LedgerNote>& notes);
 
  private:
   int writeTransaction(const StoreRecords& batch, std::size_t first, std::size_t last,
                        const std::vector<LedgerNote>& notes);
+  // What there is to know of the database before the first row is written.
+  int prepare();
+  int writeMark();
   int writeRecord(const StoreRecords& batch, const StoreRecord& record);
-  int writeRelaySession(double time, const RelayOpenRecord& record);
+  int writeRelaySession(const StoreRecord& record, const RelayOpenRecord& session);
+  int writeRelayEnd(const StoreRecord& record, const RelayEndRecord& end);
   int writeRelayMessage(const StoreRecords& batch, const StoreRecord& record,
                         const RelayMessageRecord& message);
-  int writePower(double time, const PowerRecord& record);
-  // After `message` in row `messageRow`, whose text it shares; or by itself, when there is none.
-  int writeEvent(double time, const AnalyticsRecord& event, int64_t messageRow,
-                 const Payload* message);
+  int writePower(const StoreRecord& record, const PowerRecord& power);
+  int writeEvent(const StoreRecord& record);
+  // The row of an event whose text is in eventJson_.
+  int writeEventRow(const StoreRecord& record, std::string_view name);
+  enum class EventText : uint8_t { None, Whole, Tail };
+  // Builds the text of an event in eventJson_; of its tail only, when the rest of it is `message`.
+  EventText buildEvent(const AnalyticsRecord& event, const Payload* message);
   int writeLedger(const LedgerNote& note);
-  // json_ as it may be stored in a table: a text larger than mostText_ is left out and noted.
-  const std::string& storable(const char* table);
+  bool isKnown(const StoreRecord& record) const {
+    return known_ && known_->find(record.cause.key()).has_value();
+  }
+  KeyColumns keyOf(const StoreRecord& record);
+  // The text as it may be stored in a table: one larger than mostText_ is left out and noted.
+  const std::string& storable(std::string& json, const char* table);
   // The identifier of an event name. SQLITE_OK or an error.
   int nameRow(std::string_view name, int64_t& row);
 
@@ -64,10 +85,20 @@ class RowWriter {
   Insertion<LedgerRow> insertLedger_;
   Statement addName_;
   Statement findName_;
+  Statement endSession_;
+  Statement addMark_;
+  Statement removeMarks_;
+  const EndWord endWord_;
   std::unordered_map<std::string_view, int64_t> nameRows_;
   Written written_;                  // of the running transaction
   std::vector<LedgerNote> leftOut_;  // of the running transaction
   std::string json_;
+  std::string eventJson_;
+  std::optional<KnownRows> known_;
+  bool prepared_ = false;
+  int64_t nextRow_ = 1;       // of messages and events, which share their numbers
+  uint64_t highestCall_ = 0;  // of every row so far
+  int64_t lastMarkedRow_ = 0;
 };
 
 }  // namespace vx::lnx

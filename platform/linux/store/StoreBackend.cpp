@@ -1,6 +1,5 @@
 #include "platform/linux/store/StoreBackend.h"
 
-#include <chrono>
 #include <utility>
 
 namespace vx::lnx {
@@ -14,8 +13,7 @@ Error closed() { return {kRelayErrorDomain, kRelayErrorClosed, "the store is clo
 // One relay session of the store. Thread-safe: the row it stands for is the writer's.
 class StoreSession final : public RelayBackend::Session {
  public:
-  StoreSession(StoreQueue& queue, Clock& clock)
-      : queue_(queue), clock_(clock), row_(std::make_shared<RelayRow>()) {}
+  explicit StoreSession(StoreQueue& queue) : queue_(queue), row_(std::make_shared<RelayRow>()) {}
 
   std::optional<Error> open(const VyrSessionInfo& info, const Payload& userInfo) {
     VyrSessionInfo kept = info;
@@ -33,18 +31,18 @@ class StoreSession final : public RelayBackend::Session {
   }
 
   void flush(Function<void(std::optional<Error>)> handler) override {
+    // Flushed when it ends, and only then.
+    (void)queue_.append(RelayEndRecord{row_}, 0);
     if (!queue_.appendFlush(handler)) handler(closed());
   }
 
  private:
   std::optional<Error> append(StoreRecord::What what, std::size_t bytes) {
-    const double now = std::chrono::duration<double>(clock_.now().time_since_epoch()).count();
-    if (queue_.append({now, std::move(what)}, bytes)) return std::nullopt;
+    if (queue_.append(std::move(what), bytes)) return std::nullopt;
     return closed();
   }
 
   StoreQueue& queue_;
-  Clock& clock_;
   const std::shared_ptr<RelayRow> row_;
 };
 
@@ -52,7 +50,7 @@ class StoreSession final : public RelayBackend::Session {
 
 std::unique_ptr<RelayBackend::Session> StoreBackend::open(const VyrSessionInfo& info,
                                                           const Payload& userInfo) {
-  auto session = std::make_unique<StoreSession>(queue_, clock_);
+  auto session = std::make_unique<StoreSession>(queue_);
   (void)session->open(info, userInfo);  // told by whatever is sent afterwards
   return session;
 }
@@ -60,7 +58,7 @@ std::unique_ptr<RelayBackend::Session> StoreBackend::open(const VyrSessionInfo& 
 std::optional<Error> StoreBackend::sendOne(const VyrSessionInfo& info, const Payload& userInfo,
                                            uint16_t category, uint16_t type,
                                            const Payload& payload) {
-  StoreSession session(queue_, clock_);
+  StoreSession session(queue_);
   if (std::optional<Error> refused = session.open(info, userInfo)) return refused;
   return session.send(category, type, payload);
 }

@@ -14,7 +14,7 @@ namespace vx::lnx {
 // that bounds what it takes.
 class StoreBackend final : public RelayBackend {
  public:
-  StoreBackend(StoreQueue& queue, Clock& clock) : queue_(queue), clock_(clock) {}
+  explicit StoreBackend(StoreQueue& queue) : queue_(queue) {}
 
   std::string_view name() const override { return kStoreBackendName; }
   std::unique_ptr<Session> open(const VyrSessionInfo& info, const Payload& userInfo) override;
@@ -23,7 +23,6 @@ class StoreBackend final : public RelayBackend {
 
  private:
   StoreQueue& queue_;
-  Clock& clock_;
 };
 
 }  // namespace vx::lnx

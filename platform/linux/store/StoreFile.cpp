@@ -5,6 +5,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstdio>
 #include <ctime>
@@ -55,18 +56,18 @@ Result<UniqueFd> lockStore(const std::string& directory) {
   return lock;
 }
 
-OpenedStore openStoreDatabase(const std::string& path) {
+OpenedStore openStoreDatabase(const std::string& path, const JournalEpoch& epochIfNew) {
   configureOnce();
   sqlite3* database = nullptr;
   int code = sqlite3_open_v2(
       path.c_str(), &database,
       SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE | SQLITE_OPEN_NOMUTEX | SQLITE_OPEN_EXRESCODE,
       nullptr);
-  OpenedStore opened{Database(database), Status(), StoreFault::None};
+  OpenedStore opened{Database(database), Status(), StoreFault::None, {}};
   auto fail = [&](int failure) {
     const char* why = database != nullptr ? sqlite3_errmsg(database) : sqlite3_errstr(failure);
     const StoreFault fault = isDamage(failure) ? StoreFault::Damaged : StoreFault::Unusable;
-    return OpenedStore{nullptr, Status::failure("cannot use " + path + ": " + why), fault};
+    return OpenedStore{nullptr, Status::failure("cannot use " + path + ": " + why), fault, {}};
   };
   if (code != SQLITE_OK) return fail(code);
   sqlite3_busy_timeout(database, 1000);
@@ -82,10 +83,15 @@ OpenedStore openStoreDatabase(const std::string& path) {
     return {nullptr,
             Status::failure(path + " was written by a newer version of the service (schema " +
                             std::to_string(version) + "); move it away or install that version"),
-            StoreFault::Unusable};
+            StoreFault::Unusable,
+            {}};
   }
-  code = bringSchemaUpToDate(database, version);
+  code = bringSchemaUpToDate(database, version, epochIfNew);
   if (code != SQLITE_OK) return fail(code);
+  Statement epochQuery(database, "SELECT epoch FROM store_info");
+  if (!epochQuery.row()) return fail(sqlite3_extended_errcode(database));
+  const std::span<const uint8_t> epoch = epochQuery.blob(0);
+  std::copy_n(epoch.begin(), std::min(epoch.size(), opened.epoch.size()), opened.epoch.begin());
   return opened;
 }
 

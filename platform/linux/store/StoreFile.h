@@ -6,6 +6,7 @@
 
 #include "base/Status.h"
 #include "base/UniqueFd.h"
+#include "platform/linux/journal/JournalFormat.h"
 #include "platform/linux/store/Database.h"
 
 namespace vx::lnx {
@@ -24,10 +25,12 @@ struct OpenedStore {
   Database database;  // null unless the status is ok
   Status status;
   StoreFault fault = StoreFault::None;
+  JournalEpoch epoch{};
 };
 
-// Opens or creates the file, sets its modes and brings its schema up to date.
-OpenedStore openStoreDatabase(const std::string& path);
+// Opens or creates the file, sets its modes and brings its schema up to date. A store that has no
+// epoch yet gets this one.
+OpenedStore openStoreDatabase(const std::string& path, const JournalEpoch& epochIfNew);
 
 // Fails, with what was found, unless `PRAGMA quick_check` finds nothing.
 Status quickCheck(sqlite3* database);

@@ -30,14 +30,30 @@ bool StoreQueue::mustWake(bool urgent) {
   return wake;
 }
 
-bool StoreQueue::append(StoreRecord record, std::size_t bytes) {
+double StoreQueue::timeOf(const Cause& cause) const {
+  if (cause.ticket && replaying_.load(std::memory_order_relaxed)) return cause.ticket.time();
+  return std::chrono::duration<double>(clock_.now().time_since_epoch()).count();
+}
+
+void StoreQueue::abandonAll() {
+  MutexLock lock(mutex_);
+  for (std::size_t i = 0; i < pending_.records.size(); ++i)
+    pending_.records[i].cause.ticket.abandon();
+}
+
+bool StoreQueue::append(StoreRecord::What what, std::size_t bytes) {
   const std::size_t size = sizeof(StoreRecord) + bytes;
+  Cause cause = Cause::take();
+  const double time = timeOf(cause);
   bool wake = false;
   {
     MutexLock lock(mutex_);
-    if (closing_) return false;
+    if (closing_) {
+      cause.ticket.abandon();
+      return false;
+    }
     if (pending_.records.empty()) firstPending_ = clock_.monotonic();
-    pending_.records.push_back(std::move(record));
+    pending_.records.push_back({time, std::move(what), std::move(cause)});
     pending_.bytes += size;
     heldBytes_ += size;
     if (heldBytes_ > options_.queueBytes) congested_.store(true, std::memory_order_relaxed);

@@ -40,11 +40,15 @@ struct StoreBatch {
 class StoreQueue {
  public:
   StoreQueue(const StoreOptions& options, Clock& clock) : options_(options), clock_(clock) {}
+  ~StoreQueue() { abandonAll(); }
   StoreQueue(const StoreQueue&) = delete;
   StoreQueue& operator=(const StoreQueue&) = delete;
 
-  // `bytes`: what the record holds besides itself. False once closed.
-  bool append(StoreRecord record, std::size_t bytes);
+  // Of the calling thread's cause and the time of now. `bytes`: what the record holds besides
+  // itself. False once closed: its call is not done.
+  bool append(StoreRecord::What what, std::size_t bytes);
+  // From now on a row that has a recorded call bears the time of that call.
+  void setReplaying(bool replaying) { replaying_.store(replaying); }
   // False once closed; the handler is moved from only on success. It makes what waits due at once.
   bool appendFlush(FlushHandler& handler);
   // Work for the taking thread, before anything that waits to be written.
@@ -76,13 +80,17 @@ class StoreQueue {
   Retry waitBeforeRetry(Monotonic until);
 
  private:
+  void abandonAll();
   bool isDue(std::optional<Monotonic> heldSince) const REQUIRES(mutex_);
   std::optional<Monotonic> dueTime(std::optional<Monotonic> heldSince) const REQUIRES(mutex_);
   Turn takeLocked(StoreBatch& batch, std::optional<Monotonic> heldSince) REQUIRES(mutex_);
   bool mustWake(bool urgent) REQUIRES(mutex_);
 
+  double timeOf(const Cause& cause) const;
+
   const StoreOptions options_;
   Clock& clock_;
+  std::atomic<bool> replaying_{false};
   Mutex mutex_;
   CondVar wake_;
   StoreBatch pending_ GUARDED_BY(mutex_);

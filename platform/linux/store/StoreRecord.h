@@ -11,6 +11,7 @@
 #include "base/ChunkList.h"
 #include "base/Function.h"
 #include "platform/VyrReporting.h"
+#include "platform/linux/execution/CauseScope.h"
 #include "propertylist/Payload.h"
 
 namespace vx::lnx {
@@ -30,6 +31,12 @@ struct RelayMessageRecord {
   uint16_t category = 0;
   uint16_t type = 0;
 };
+// A relay session ends; makes no row of its own.
+struct RelayEndRecord {
+  std::shared_ptr<RelayRow> row;
+};
+// Whatever comes before was replayed; makes no row.
+struct ReplayEndRecord {};
 struct AnalyticsRecord {
   std::string_view name;  // of unlimited life
   Payload message;        // what the built dictionary is expected to begin with; may be empty
@@ -43,20 +50,29 @@ struct PowerRecord {
 
 struct StoreRecord {
   // std::monostate: the place of a record that has gone elsewhere; no row.
-  using What = std::variant<std::monostate, RelayOpenRecord, RelayMessageRecord, AnalyticsRecord,
-                            PowerRecord>;
-  // An event whose message is in the same batch as a relay message is written right after that one,
-  // and shares its text. A relay message names the first such event, each event the next one.
+  using What = std::variant<std::monostate, RelayOpenRecord, RelayMessageRecord, RelayEndRecord,
+                            ReplayEndRecord, AnalyticsRecord, PowerRecord>;
+  // An event whose message is in the same batch as a relay message is written with that one, and
+  // shares its text.
   enum class Sharing : uint8_t { No, Held, Shares, Written };
   static constexpr uint32_t kNone = UINT32_MAX;
 
-  StoreRecord(double when, What whatever) : time(when), what(std::move(whatever)) {}
+  // A place of another record, or something that happened.
+  bool makesNoRow() const {
+    return std::holds_alternative<std::monostate>(what) ||
+           std::holds_alternative<RelayEndRecord>(what) ||
+           std::holds_alternative<ReplayEndRecord>(what);
+  }
+  StoreRecord(double when, What whatever, Cause because = {})
+      : time(when), cause(std::move(because)), what(std::move(whatever)) {}
   double time;  // seconds since 1970
-  uint32_t nextSharer = kNone;
-  Sharing sharing = Sharing::No;
+  // The call whose row it is; done when the row is committed.
+  Cause cause;
+  uint32_t event = kNone;         // of a relay message: the place of the event that shares its text
+  Sharing sharing = Sharing::No;  // of an event
   What what;
 };
-static_assert(sizeof(StoreRecord) <= 128, "a record a message: two cache lines");
+static_assert(sizeof(StoreRecord) <= 144, "a record a message");
 
 using StoreRecords = ChunkList<StoreRecord, 256>;
 

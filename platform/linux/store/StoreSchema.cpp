@@ -17,12 +17,26 @@ CREATE VIEW session_messages AS
   FROM relay_messages m JOIN relay_sessions s ON s.id = m.relay_session;
 )sql";
 
-// An event says what a relay message says and a little more. Its entry names that message and keeps
-// what its text has after the message's (`,"k":1}`); without a message, it keeps the whole text.
 constexpr const char* kEventNames =
     "CREATE TABLE event_names(id INTEGER PRIMARY KEY, name TEXT NOT NULL UNIQUE);";
+
+// The epoch within which a row's (call, place) is its name; and every so many rows, the highest
+// call so far and the last id of messages and events (see KnownRows).
+constexpr const char* kBookkeeping = R"sql(
+CREATE TABLE store_info(id INTEGER PRIMARY KEY CHECK (id = 1), epoch BLOB NOT NULL);
+CREATE TABLE store_marks(id INTEGER PRIMARY KEY, call INTEGER NOT NULL, last_row INTEGER NOT NULL);
+)sql";
+
+// An event says what a relay message says and a little more: it lies in that message's row, which
+// keeps what its text has after the message's (`,"k":1}`). Otherwise it is an entry with its whole
+// text; one of the second schema may name a message.
 constexpr const char* kEventViews = R"sql(
 CREATE VIEW analytics_events AS
+  SELECT m.id, m.time + m.event_microseconds / 1e6 AS time,
+         (SELECT n.name FROM event_names n WHERE n.id = m.event_name) AS name,
+         substr(m.payload, 1, length(m.payload) - 1) || m.event_tail AS payload
+  FROM relay_messages m WHERE m.event_name IS NOT NULL
+  UNION ALL
   SELECT e.id, e.time, (SELECT n.name FROM event_names n WHERE n.id = e.name) AS name,
          CASE WHEN e.message IS NULL THEN e.payload
               ELSE (SELECT substr(m.payload, 1, length(m.payload) - 1) FROM relay_messages m WHERE m.id = e.message)
@@ -34,16 +48,49 @@ CREATE VIEW client_uptimes AS
   FROM analytics_events WHERE name = 'com.quorvel.sonik.vxreportingclientuptime';
 )sql";
 
+// What follows is fixed: it makes of an older file what its successor was, whatever the tables
+// above become.
+
 // Version 1 kept every event's name and text in a table of their own.
-constexpr const char* kEventsBefore = R"sql(
+constexpr const char* kFromVersion1 = R"sql(
 DROP VIEW client_uptimes;
 ALTER TABLE analytics_events RENAME TO events_before;
-)sql";
-constexpr const char* kMoveEvents = R"sql(
+CREATE TABLE event_names(id INTEGER PRIMARY KEY, name TEXT NOT NULL UNIQUE);
+CREATE TABLE analytics_entries(
+  id INTEGER PRIMARY KEY,
+  time REAL NOT NULL,
+  name INTEGER NOT NULL,
+  message INTEGER,
+  payload TEXT NOT NULL);
 INSERT INTO event_names(name) SELECT DISTINCT name FROM events_before;
 INSERT INTO analytics_entries(id, time, name, payload)
   SELECT b.id, b.time, n.id, b.payload FROM events_before b JOIN event_names n ON n.name = b.name ORDER BY b.id;
 DROP TABLE events_before;
+)sql";
+
+// Version 2 kept an entry of its own for each event, and could not tell where a row came from. An
+// entry that was left out after its message's text was no JSON.
+constexpr const char* kFromVersion2 = R"sql(
+DROP VIEW IF EXISTS client_uptimes;
+DROP VIEW IF EXISTS analytics_events;
+ALTER TABLE relay_sessions ADD COLUMN call INTEGER;
+ALTER TABLE relay_sessions ADD COLUMN place INTEGER;
+ALTER TABLE relay_sessions ADD COLUMN ended_at REAL;
+ALTER TABLE relay_sessions ADD COLUMN ended_how TEXT;
+ALTER TABLE relay_messages ADD COLUMN call INTEGER;
+ALTER TABLE relay_messages ADD COLUMN place INTEGER;
+ALTER TABLE relay_messages ADD COLUMN event_name INTEGER;
+ALTER TABLE relay_messages ADD COLUMN event_place INTEGER;
+ALTER TABLE relay_messages ADD COLUMN event_microseconds INTEGER;
+ALTER TABLE relay_messages ADD COLUMN event_tail TEXT;
+ALTER TABLE analytics_entries ADD COLUMN call INTEGER;
+ALTER TABLE analytics_entries ADD COLUMN place INTEGER;
+ALTER TABLE analytics_entries ADD COLUMN relay_session INTEGER;
+ALTER TABLE power_records ADD COLUMN call INTEGER;
+ALTER TABLE power_records ADD COLUMN place INTEGER;
+UPDATE analytics_entries SET message = NULL WHERE message IS NOT NULL AND substr(payload, 1, 1) = '{';
+CREATE TABLE store_info(id INTEGER PRIMARY KEY CHECK (id = 1), epoch BLOB NOT NULL);
+CREATE TABLE store_marks(id INTEGER PRIMARY KEY, call INTEGER NOT NULL, last_row INTEGER NOT NULL);
 )sql";
 
 using Script = std::vector<std::string>;
@@ -56,30 +103,38 @@ Script wholeSchema() {
           kMessageView,
           kEventNames,
           kAnalyticsEntries.createSql(),
+          kBookkeeping,
           kEventViews};
 }
 
-Script fromVersion1() {
-  return {kEventsBefore, kEventNames, kAnalyticsEntries.createSql(), kEventViews, kMoveEvents};
+Script scriptFrom(int64_t version) {
+  if (version <= 0) return wholeSchema();
+  Script script;
+  if (version == 1) script.emplace_back(kFromVersion1);
+  script.emplace_back(kFromVersion2);
+  script.emplace_back(kEventViews);
+  return script;
 }
 
-int executeInOneTransaction(sqlite3* database, const Script& script) {
-  int code = execute(database, "BEGIN IMMEDIATE");
-  for (const std::string& sql : script) {
-    if (code == SQLITE_OK) code = execute(database, sql.c_str());
-  }
-  if (code == SQLITE_OK) code = execute(database, "COMMIT");
-  if (code != SQLITE_OK) execute(database, "ROLLBACK");
-  return code;
+int beginEpoch(sqlite3* database, const JournalEpoch& epoch) {
+  Statement insert(database, "INSERT INTO store_info(id, epoch) VALUES(1, ?)");
+  return insert.bind(std::span<const uint8_t>(epoch)).run();
 }
 
 }  // namespace
 
-int bringSchemaUpToDate(sqlite3* database, int64_t version) {
+int bringSchemaUpToDate(sqlite3* database, int64_t version, const JournalEpoch& epochIfNew) {
   if (version == kStoreSchemaVersion) return SQLITE_OK;
-  Script script = version == 0 ? wholeSchema() : fromVersion1();
+  Script script = scriptFrom(version);
   script.push_back("PRAGMA user_version = " + std::to_string(kStoreSchemaVersion));
-  return executeInOneTransaction(database, script);
+  int code = execute(database, "BEGIN IMMEDIATE");
+  for (const std::string& sql : script) {
+    if (code == SQLITE_OK) code = execute(database, sql.c_str());
+  }
+  if (code == SQLITE_OK) code = beginEpoch(database, epochIfNew);
+  if (code == SQLITE_OK) code = execute(database, "COMMIT");
+  if (code != SQLITE_OK) execute(database, "ROLLBACK");
+  return code;
 }
 
 }  // namespace vx::lnx

@@ -5,12 +5,14 @@
 
 #include <cstdint>
 
+#include "platform/linux/journal/JournalFormat.h"
+
 namespace vx::lnx {
 
-inline constexpr int64_t kStoreSchemaVersion = 2;
+inline constexpr int64_t kStoreSchemaVersion = 3;
 
-// Brings a database of `version` (0: an empty one) up to kStoreSchemaVersion, in one transaction.
-// SQLITE_OK or SQLite's extended error code.
-int bringSchemaUpToDate(sqlite3* database, int64_t version);
+// Brings a database of `version` (0: an empty one) up to kStoreSchemaVersion, in one transaction. A
+// database that has no epoch gets this one. SQLITE_OK or SQLite's extended error code.
+int bringSchemaUpToDate(sqlite3* database, int64_t version, const JournalEpoch& epochIfNew);
 
 }  // namespace vx::lnx

@@ -19,19 +19,20 @@ struct Column {
   void (*bind)(Statement& insert, const Row& row);
 };
 
-// Immutable. Every table has an `id INTEGER PRIMARY KEY` before its columns. Identifiers are given
-// out in the order of arrival and never reused while the newest row is there, so "oldest first" is
-// the order of id.
+// Immutable. Every table has an `id INTEGER PRIMARY KEY`, before its columns or as the first of
+// them. Identifiers are given out in the order of arrival and never reused while the newest row is
+// there, so "oldest first" is the order of id.
 template <class Row>
 struct Table {
   const char* name;
   std::span<const Column<Row>> columns;
 
   std::string createSql() const {
-    std::string sql = std::string("CREATE TABLE ") + name + "(\n  id INTEGER PRIMARY KEY";
+    const bool givesId = std::string_view(columns.front().name) == "id";
+    std::string parts = givesId ? "" : "id INTEGER PRIMARY KEY";
     for (const Column<Row>& column : columns)
-      sql += std::string(",\n  ") + column.name + " " + column.type;
-    return sql + ");\n";
+      parts += (parts.empty() ? "" : ",\n  ") + std::string(column.name) + " " + column.type;
+    return std::string("CREATE TABLE ") + name + "(\n  " + parts + ");\n";
   }
   std::string insertSql() const {
     std::string names;
@@ -61,6 +62,12 @@ class Insertion {
   Statement statement_;
 };
 
+// Which call a row goes back to, as two columns: NULL where none was recorded.
+struct KeyColumns {
+  std::optional<int64_t> call;
+  std::optional<int64_t> place;
+};
+
 struct RelaySessionRow {
   double time = 0;
   int64_t sessionID = 0;
@@ -71,25 +78,35 @@ struct RelaySessionRow {
   std::optional<int64_t> batchEvent;
   std::optional<int64_t> containsRealtimeEvents;
   std::string_view userInfo;
+  KeyColumns key;
 };
 struct RelayMessageRow {
+  int64_t id = 0;
   double time = 0;
   int64_t relaySession = 0;
   uint16_t category = 0;
   uint16_t type = 0;
   std::string_view payload;
+  KeyColumns key;
+  // The event that says the same, if there is one.
+  std::optional<int64_t> eventName;
+  std::optional<int64_t> eventPlace;
+  std::optional<int64_t> eventMicroseconds;  // later than the message
+  std::optional<std::string_view> eventTail;
 };
 struct EventRow {
+  int64_t id = 0;
   double time = 0;
   int64_t name = 0;
-  std::optional<int64_t> message;  // whose text it shares
   std::string_view payload;
+  KeyColumns key;
 };
 struct PowerRow {
   double time = 0;
   int64_t clientIdentifier = 0;
   std::string_view name;
   std::string_view record;
+  KeyColumns key;
 };
 struct LedgerRow {
   double time = 0;

@@ -10,7 +10,6 @@
 
 #include "platform/Log.h"
 #include "platform/linux/execution/Threads.h"
-#include "platform/linux/store/StoreFile.h"
 
 namespace vx::lnx {
 
@@ -31,18 +30,19 @@ std::size_t mostTextOf(const StoreOptions& options) {
 
 }  // namespace
 
-StoreWriter::Open::Open(Database opened, const StoreOptions& options, Clock& clock)
+StoreWriter::Open::Open(Database opened, const StoreOptions& options, EndWord endWord, Clock& clock)
     : database(std::move(opened)),
-      rows(database.get(), mostTextOf(options), clock),
+      rows(database.get(), mostTextOf(options), endWord, clock),
       retention(database.get(), options, clock) {}
 
-StoreWriter::StoreWriter(std::string path, Database database, const StoreOptions& options,
+StoreWriter::StoreWriter(std::string path, OpenedStore opened, const StoreOptions& options,
                          Clock& clock)
     : path_(std::move(path)),
       options_(options),
       clock_(clock),
       queue_(options, clock),
-      unchecked_(std::move(database)) {}
+      epoch_(opened.epoch),
+      unchecked_(std::move(opened.database)) {}
 
 StoreWriter::~StoreWriter() {
   if (!thread_.joinable()) return;
@@ -98,18 +98,18 @@ void StoreWriter::runJobs() {
 void StoreWriter::checkDatabase() {
   const Status check = quickCheck(unchecked_.get());
   if (check.ok()) {
-    open_.emplace(std::move(unchecked_), options_, clock_);
+    open_.emplace(std::move(unchecked_), options_, endWord_, clock_);
     return;
   }
   unchecked_.reset();
   const Result<std::string> aside = moveAside(path_);
-  OpenedStore fresh = openStoreDatabase(path_);
+  OpenedStore fresh = openStoreDatabase(path_, epoch_);
   if (!fresh.status.ok()) {
     VX_LOG(nullptr, Error, "the store failed its check (%s) and cannot be begun afresh: %s",
            check.text().c_str(), fresh.status.text().c_str());
     return;
   }
-  open_.emplace(std::move(fresh.database), options_, clock_);
+  open_.emplace(std::move(fresh.database), options_, endWord_, clock_);
   const std::string where = aside.ok() ? *aside : "";
   VX_LOG(nullptr, Error,
          "the store failed its check (%s); it was moved to %s and a fresh one begun",
@@ -120,7 +120,7 @@ void StoreWriter::checkDatabase() {
 void StoreWriter::writeBatch(StoreBatch& batch) {
   pairing_.join(batch.records);
   pairing_.pair(batch.records);
-  if (!batch.urgent) {
+  if (!batch.urgent && !replayFrom_) {
     const double now = std::chrono::duration<double>(clock_.now().time_since_epoch()).count();
     pairing_.hold(batch.records, now - kHoldSeconds, clock_.monotonic());
   }
@@ -145,6 +145,9 @@ void StoreWriter::writeBatch(StoreBatch& batch) {
 Result<RowWriter::Written> StoreWriter::write(const StoreBatch& batch, std::size_t first,
                                               std::size_t last) {
   if (!open_) return Status::failure("the database cannot be opened");
+  if (replayFrom_ && !open_->rows.knowsRows()) {
+    if (Status read = open_->rows.loadKnownRows(*replayFrom_); !read.ok()) return read;
+  }
   Result<RowWriter::Written> written = open_->rows.write(batch.records, first, last, notes_);
   if (!written.ok()) return written;
   notes_.clear();
@@ -161,6 +164,11 @@ void StoreWriter::onCommitted(StoreBatch& batch, std::size_t first, std::size_t 
     VX_LOG(nullptr, Error, "the store can be written again; nothing was lost");
   }
   EventPairing::markWritten(batch.records, first, last);
+  for (std::size_t i = first; replayFrom_ && i < last; ++i) {
+    if (!std::holds_alternative<ReplayEndRecord>(batch.records[i].what)) continue;
+    replayFrom_.reset();
+    open_->rows.forgetKnownRows();
+  }
   const std::size_t left = batch.records.size() - first;
   release(batch, last - first == left ? batch.bytes : batch.bytes * (last - first) / left);
   const auto unanswered =
@@ -174,6 +182,7 @@ void StoreWriter::onCommitted(StoreBatch& batch, std::size_t first, std::size_t 
 void StoreWriter::onLost(StoreBatch& batch, std::size_t first, const Status& why) {
   const uint64_t lost = EventPairing::unwrittenRows(batch.records, first);
   rowsLost_ += lost;
+  EventPairing::abandon(batch.records, first);
   VX_LOG(nullptr, Error, "the store could not be written before the end: %llu rows are lost (%s)",
          static_cast<unsigned long long>(lost), why.text().c_str());
   release(batch, batch.bytes);
@@ -193,8 +202,8 @@ bool StoreWriter::waitBeforeRetry(const Status& failure) {
            path_.c_str(), failure.text().c_str());
   }
   if (!open_) {
-    OpenedStore again = openStoreDatabase(path_);
-    if (again.status.ok()) open_.emplace(std::move(again.database), options_, clock_);
+    OpenedStore again = openStoreDatabase(path_, epoch_);
+    if (again.status.ok()) open_.emplace(std::move(again.database), options_, endWord_, clock_);
   }
   backoff_ = std::clamp(backoff_ * 2, kFirstBackoff, kLastBackoff);
   const Monotonic until = clock_.monotonic() + backoff_;

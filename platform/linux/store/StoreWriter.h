@@ -16,6 +16,7 @@
 #include "platform/linux/store/EventPairing.h"
 #include "platform/linux/store/Retention.h"
 #include "platform/linux/store/RowWriter.h"
+#include "platform/linux/store/StoreFile.h"
 #include "platform/linux/store/StoreOptions.h"
 #include "platform/linux/store/StoreQueue.h"
 
@@ -32,7 +33,7 @@ struct StoreCounters {
 // writer's thread. Bounded by its queue.
 class StoreWriter {
  public:
-  StoreWriter(std::string path, Database database, const StoreOptions& options, Clock& clock);
+  StoreWriter(std::string path, OpenedStore opened, const StoreOptions& options, Clock& clock);
   ~StoreWriter();
   StoreWriter(const StoreWriter&) = delete;
   StoreWriter& operator=(const StoreWriter&) = delete;
@@ -41,7 +42,10 @@ class StoreWriter {
   // that a congested queue has drained.
   void noteAtStart(LedgerNote note) { notes_.push_back(std::move(note)); }
   void setDrainedHandler(Function<void()> handler) { drained_ = std::move(handler); }
+  void setEndWord(EndWord word) { endWord_ = word; }
   void start();
+  // On the writer's thread; see LocalStore::beginReplay.
+  void expectKnownRows(uint64_t firstCall) { replayFrom_ = firstCall; }
 
   StoreQueue& queue() { return queue_; }
   const StoreQueue& queue() const { return queue_; }
@@ -52,7 +56,7 @@ class StoreWriter {
  private:
   // What lives as long as one opened database.
   struct Open {
-    Open(Database opened, const StoreOptions& options, Clock& clock);
+    Open(Database opened, const StoreOptions& options, EndWord endWord, Clock& clock);
     Database database;
     RowWriter rows;
     Retention retention;
@@ -83,9 +87,12 @@ class StoreWriter {
   bool finished_ GUARDED_BY(mutex_) = false;
 
   // The writer's thread.
+  const JournalEpoch epoch_;
+  EndWord endWord_ = nullptr;
   Database unchecked_;        // until the thread has checked it
   std::optional<Open> open_;  // none: the file cannot be opened
   EventPairing pairing_;
+  std::optional<uint64_t> replayFrom_;  // until what is replayed is committed
   Function<void()> drained_;
   std::vector<LedgerNote> notes_;  // for the next transaction
   bool failing_ = false;

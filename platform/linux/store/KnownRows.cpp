@@ -1,0 +1,61 @@
+#include "platform/linux/store/KnownRows.h"
+
+#include "platform/linux/store/Database.h"
+
+namespace vx::lnx {
+
+namespace {
+
+// Rows up to the last mark before the call are of earlier calls: messages and events, which are
+// many, are read from there on.
+constexpr const char* kLastMark = "SELECT ifnull(max(last_row), 0) FROM store_marks WHERE call < ?";
+constexpr const char* kReads[] = {
+    "SELECT call, place, id FROM relay_messages WHERE id > ?2 AND call >= ?1",
+    "SELECT call, event_place, id FROM relay_messages"
+    " WHERE id > ?2 AND call >= ?1 AND event_place IS NOT NULL",
+    "SELECT call, place, id FROM analytics_entries WHERE id > ?2 AND call >= ?1",
+    "SELECT call, place, id FROM power_records WHERE call >= ?1 AND ?2 IS NOT NULL",
+    "SELECT call, place, id FROM relay_sessions WHERE call >= ?1 AND ?2 IS NOT NULL",
+};
+
+}  // namespace
+
+Result<KnownRows> KnownRows::load(sqlite3* database, uint64_t firstCall) {
+  KnownRows known;
+  known.firstCall_ = firstCall;
+  Statement mark(database, kLastMark);
+  if (!mark.bind(static_cast<int64_t>(firstCall)).row())
+    return Status::failure(sqlite3_errmsg(database));
+  const int64_t after = mark.integer(0);
+  for (const char* sql : kReads) {
+    if (known.read(database, sql, after) != SQLITE_DONE)
+      return Status::failure(sqlite3_errmsg(database));
+  }
+  return known;
+}
+
+int KnownRows::read(sqlite3* database, const char* sql, int64_t after) {
+  Statement rows(database, sql);
+  rows.bind(static_cast<int64_t>(firstCall_)).bind(after);
+  while (rows.row()) {
+    rows_.insert_or_assign(
+        RowKey{static_cast<uint64_t>(rows.integer(0)), static_cast<uint32_t>(rows.integer(1))},
+        rows.integer(2));
+  }
+  return rows.code();
+}
+
+std::optional<int64_t> KnownRows::find(const RowKey& key) const {
+  if (key.call == 0) return std::nullopt;
+  const auto found = rows_.find(key);
+  return found == rows_.end() ? std::nullopt : std::optional<int64_t>(found->second);
+}
+
+std::optional<int64_t> KnownRows::findSession(sqlite3* database, const RowKey& key) const {
+  if (key.call == 0 || key.call >= firstCall_) return find(key);
+  Statement query(database, "SELECT id FROM relay_sessions WHERE call = ? AND place = ?");
+  query.bind(static_cast<int64_t>(key.call)).bind(int64_t{key.place});
+  return query.row() ? std::optional<int64_t>(query.integer(0)) : std::nullopt;
+}
+
+}  // namespace vx::lnx

@@ -1,0 +1,38 @@
+// The rows that a replay of recorded calls would write a second time.
+#pragma once
+
+#include <sqlite3.h>
+
+#include <cstddef>
+#include <cstdint>
+#include <optional>
+#include <unordered_map>
+
+#include "base/Status.h"
+#include "platform/linux/execution/CauseScope.h"
+
+namespace vx::lnx {
+
+// Confined to the store's writer. Bounded by what was written since the first call of a journal was
+// accepted.
+class KnownRows {
+ public:
+  // The keys of the rows of `firstCall` and later ones. A failure when the database cannot be read.
+  static Result<KnownRows> load(sqlite3* database, uint64_t firstCall);
+  // The identifier of the row with this key. A relay session may be of any call.
+  std::optional<int64_t> find(const RowKey& key) const;
+  std::optional<int64_t> findSession(sqlite3* database, const RowKey& key) const;
+
+ private:
+  struct Hash {
+    std::size_t operator()(const RowKey& key) const {
+      return static_cast<std::size_t>((key.call << 32 ^ key.place) * 0x9E3779B97F4A7C15u >> 16);
+    }
+  };
+  int read(sqlite3* database, const char* sql, int64_t after);
+
+  uint64_t firstCall_ = 0;
+  std::unordered_map<RowKey, int64_t, Hash> rows_;
+};
+
+}  // namespace vx::lnx
