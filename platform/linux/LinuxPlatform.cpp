@@ -36,6 +36,7 @@
 #include "platform/linux/recovery/JournalOpening.h"
 #include "platform/linux/recovery/JournalRecorder.h"
 #include "platform/linux/recovery/JournaledInputs.h"
+#include "platform/linux/recovery/Records.h"
 #include "platform/linux/recovery/Recovery.h"
 #include "platform/linux/settings/PreferencesWatcher.h"
 #include "platform/linux/settings/TomlPreferences.h"
@@ -79,8 +80,8 @@ OrientationOptions withDefaults(OrientationOptions orientation, const Directorie
   return orientation;
 }
 
-// Of the store that the journal's calls go to.
-JournalEpoch storeEpoch() { return {}; }
+// More calls than a journal holds: what a store's newest rows may not show of those it has.
+constexpr uint64_t kMostCallsUnseen = 1 << 21;
 
 // Messages that sessions keep make the heap grow, and each of its pages is missing when it is first
 // touched: one message in sixteen would wait for the kernel to find one. So the heap grows in
@@ -130,14 +131,17 @@ class RunningPlatform final : public LinuxPlatform {
                      std::vector<PreferencesWatcher::Notification>{
                          {std::string(kPreferencesNotification), std::string(kPreferencesFile)}},
                      configuration_.preferences, clock_);
-    Result<std::unique_ptr<LocalStore>> opened =
-        LocalStore::open(directories.state, configuration_.store, clock_);
+    journalFolder_ = directories.runtime + "/journal";
+    // A store that was lost is begun anew and gets what the journal still has.
+    Result<std::unique_ptr<LocalStore>> opened = LocalStore::open(
+        directories.state, configuration_.store, clock_, epochOfJournal(journalFolder_));
     if (!opened.ok()) {
       problem = opened.status().text();
       return false;
     }
     store_ = std::move(*opened);
-    openJournal(directories.runtime, directories.state);
+    store_->setEndWord(endWordOf);
+    openJournal(directories);
     relay_.emplace(backends(), [this](Function<void()> job) { store_->runSoon(std::move(job)); });
     services_.emplace(Platform{
         .serviceListener = listener_,
@@ -178,7 +182,9 @@ class RunningPlatform final : public LinuxPlatform {
     recovery_.emplace(RecoveryMeans{*services_, executor_, *journal_, backendNames(),
                                     [this] { return store_->isCongested(); }},
                       std::move(left_));
+    store_->beginReplay(recovery_->firstUndone());
     const RecoveryOutcome outcome = recovery_->run(makeDelegate);
+    store_->endReplay();
     endReplay(journalFolder_);
     recoveredWaits_ = journal_->beginGeneration().ok();
     VX_LOG(nullptr, Default,
@@ -217,10 +223,12 @@ class RunningPlatform final : public LinuxPlatform {
 
  private:
   // Without one the service serves all the same.
-  void openJournal(const std::string& runtime, const std::string& state) {
-    journalFolder_ = runtime + "/journal";
+  void openJournal(const Directories& directories) {
     Result<OpenedJournal> opened =
-        vx::lnx::openJournal({.folder = journalFolder_, .epoch = storeEpoch()}, state + "/journal");
+        vx::lnx::openJournal({.folder = journalFolder_,
+                              .epoch = store_->epoch(),
+                              .first = {.call = store_->lastCall() + kMostCallsUnseen}},
+                             directories.state + "/journal");
     if (opened.ok()) {
       journal_ = std::move(opened->journal);
       left_ = std::move(opened->left);
@@ -238,7 +246,7 @@ class RunningPlatform final : public LinuxPlatform {
     }
     inputs_.emplace(journal_.get());
     struct statfs files {};
-    const std::string& folder = journal_ != nullptr ? journalFolder_ : runtime;
+    const std::string& folder = journal_ != nullptr ? journalFolder_ : directories.runtime;
     journalInMemory_ = statfs(folder.c_str(), &files) == 0 && files.f_type == TMPFS_MAGIC;
   }
 

@@ -73,6 +73,24 @@ Result<RecordedCall> readCall(std::span<const uint8_t> head,
   return call;
 }
 
+std::string_view endWordOf(const JournalTicket& call) {
+  switch (static_cast<RecordKind>(call.kind())) {
+    case RecordKind::StopCall:
+      return "stopped";
+    case RecordKind::DestroyCall:
+      return "destroyed";
+    case RecordKind::EndedInterrupted:
+    case RecordKind::EndedOrderly:
+      return "disconnected";
+    case RecordKind::EndedServiceStopped:
+      return "service_stopped";
+    case RecordKind::EndedCrashed:
+      return "crashed";
+    default:
+      return "";
+  }
+}
+
 std::vector<uint8_t> writeInput(uint32_t place, std::string_view what, const Payload& answer) {
   const std::span<const uint8_t> bytes = answer.encoded();
   std::vector<uint8_t> note(kWhat + what.size() + bytes.size());

@@ -26,6 +26,7 @@
 #include "base/Status.h"
 #include "platform/ClientConnection.h"
 #include "platform/linux/journal/JournalReader.h"
+#include "platform/linux/journal/JournalTicket.h"
 #include "platform/linux/journal/RecordKind.h"
 
 namespace vx::lnx {
@@ -60,6 +61,9 @@ struct RecordedInput {
 };
 std::vector<uint8_t> writeInput(uint32_t place, std::string_view what, const Payload& answer);
 std::optional<RecordedInput> readInput(std::span<const uint8_t> note);
+
+// How the session ended that the work of this call ended; empty when such a call ends none.
+std::string_view endWordOf(const JournalTicket& call);
 
 // Of a record that was read; 0 for what is of no connection.
 inline uint64_t connectionOf(const JournalContents::Record& record) {

@@ -18,7 +18,20 @@ constexpr const char* kReads[] = {
     "SELECT call, place, id FROM relay_sessions WHERE call >= ?1 AND ?2 IS NOT NULL",
 };
 
+// Rows of calls are written nearly in the calls' order.
+constexpr const char* kLastCall =
+    "SELECT ifnull(max(call), 0) FROM ("
+    "SELECT * FROM (SELECT call FROM relay_sessions ORDER BY id DESC LIMIT 1000) UNION ALL "
+    "SELECT * FROM (SELECT call FROM relay_messages ORDER BY id DESC LIMIT 1000) UNION ALL "
+    "SELECT * FROM (SELECT call FROM analytics_entries ORDER BY id DESC LIMIT 1000) UNION ALL "
+    "SELECT * FROM (SELECT call FROM power_records ORDER BY id DESC LIMIT 1000))";
+
 }  // namespace
+
+uint64_t KnownRows::lastCall(sqlite3* database) {
+  Statement last(database, kLastCall);
+  return last.row() ? static_cast<uint64_t>(last.integer(0)) : 0;
+}
 
 Result<KnownRows> KnownRows::load(sqlite3* database, uint64_t firstCall) {
   KnownRows known;

@@ -19,6 +19,8 @@ class KnownRows {
  public:
   // The keys of the rows of `firstCall` and later ones. A failure when the database cannot be read.
   static Result<KnownRows> load(sqlite3* database, uint64_t firstCall);
+  // The highest number of a call among the newest rows; 0 when there is none.
+  static uint64_t lastCall(sqlite3* database);
   // The identifier of the row with this key. A relay session may be of any call.
   std::optional<int64_t> find(const RowKey& key) const;
   std::optional<int64_t> findSession(sqlite3* database, const RowKey& key) const;

@@ -5,6 +5,7 @@
 #include <utility>
 
 #include "platform/Log.h"
+#include "platform/linux/store/KnownRows.h"
 #include "platform/linux/store/StoreFile.h"
 
 namespace vx::lnx {
@@ -43,6 +44,7 @@ LocalStore::LocalStore(UniqueFd lock, std::string path, OpenedStore opened, std:
                        const StoreOptions& options, Clock& clock)
     : lock_(std::move(lock)),
       epoch_(opened.epoch),
+      lastCall_(KnownRows::lastCall(opened.database.get())),
       damage_(std::move(damage)),
       writer_(std::move(path), std::move(opened), options, clock),
       backend_(writer_.queue()) {}

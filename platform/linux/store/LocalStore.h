@@ -36,6 +36,8 @@ class LocalStore final : public AnalyticsEventService, public PowerEventLog {
 
   // Within which (call, place) names a row. The same as long as this object lives.
   const JournalEpoch& epoch() const { return epoch_; }
+  // The highest number that a call has among the newest rows; 0 when there is none.
+  uint64_t lastCall() const { return lastCall_; }
   // The word for how a session ended, by the call whose work ended it; before start().
   void setEndWord(EndWord word) { writer_.setEndWord(word); }
 
@@ -76,6 +78,7 @@ class LocalStore final : public AnalyticsEventService, public PowerEventLog {
 
   const UniqueFd lock_;
   const JournalEpoch epoch_;
+  const uint64_t lastCall_;
   const std::string damage_;  // what was found and moved aside when the store was opened
   StoreWriter writer_;
   StoreBackend backend_;
