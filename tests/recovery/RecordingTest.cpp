@@ -1,0 +1,345 @@
+#include <gmock/gmock.h>
+#include <sys/un.h>
+
+#include <cstring>
+#include <filesystem>
+#include <fstream>
+#include <future>
+#include <map>
+
+#include "platform/linux/recovery/Records.h"
+#include "tests/ipc/TestInterface.h"
+#include "tests/journal/JournalFixture.h"
+#include "tests/recovery/RecordedService.h"
+#include "tests/wire/SocketEnd.h"
+#include "wire/Operations.h"
+
+namespace vx::lnx {
+namespace {
+
+using testing::Each;
+using testing::StartsWith;
+using wire::Operation;
+
+class RecordingTest : public JournalFixture {
+ protected:
+  RecordingTest() { open(); }
+  ~RecordingTest() override { stop(); }
+
+  void serve() {
+    service = std::make_unique<RecordedService>(journal.get());
+    service->fakes.services.processNames = {{getpid(), "recording"}};
+    recorder.emplace(*journal, service->fakes.clock);
+    recorder->setUnrecordedHandler([this](const Status&) { ++timesTold; });
+    service->listener.setRecorder(*recorder);
+    const Status opened = service->listener.open(root);
+    ASSERT_TRUE(opened.ok()) << opened.text();
+    std::promise<void> listening;
+    service->listener.setHooks({.congested = [] { return false; },
+                                .listening = [&] { listening.set_value(); },
+                                .stopping = [] {}});
+    service->listener.setDelegate(service->delegate);
+    thread_ = std::thread([this] { service->listener.resume(); });
+    listening.get_future().wait();
+  }
+  // Work that is not due is dropped.
+  void stop() {
+    clients.clear();
+    if (thread_.joinable()) {
+      service->loop.stop();
+      thread_.join();
+      service->runQueues();
+    }
+  }
+  std::size_t connect() {
+    UniqueFd socket(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    std::strncpy(address.sun_path, (root + "/service.socket").c_str(), sizeof address.sun_path - 1);
+    EXPECT_EQ(::connect(socket.get(), reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
+    clients.push_back(std::make_unique<SocketEnd>(std::move(socket)));
+    clients.back()->write(clientHello());
+    answer(clients.size() - 1);
+    return clients.size() - 1;
+  }
+  std::string answer(std::size_t client) {
+    for (;;) {
+      for (const std::string& said : clients[client]->texts())
+        if (!said.starts_with("2 2 ")) return said;
+      clients[client]->await();
+    }
+  }
+  template <class Write>
+  std::string call(std::size_t client, Operation operation, std::size_t count, const Write& write) {
+    clients[client]->write(callFrame(1, static_cast<int>(operation), count, write));
+    return answer(client);
+  }
+  std::string call(std::size_t client, Operation operation, int64_t id) {
+    return call(client, operation, 1, [&](CborWriter& w) { w.integer(id); });
+  }
+  void create(std::size_t client, int64_t id, uint16_t type = 7) {
+    call(client, Operation::CreateReportingSession, id);
+    call(client, Operation::SetServiceType, 2, [&](CborWriter& w) {
+      w.integer(type);
+      w.integer(id);
+    });
+  }
+  // To one session, or with 0 to all that are started.
+  void send(std::size_t client, int64_t number, int64_t id = 0) {
+    EXPECT_EQ(call(client, Operation::SendMessage, 4,
+                   [&](CborWriter& w) {
+                     w.encoded(dictionary(number, 50).encoded());
+                     w.integer(3);
+                     w.integer(4);
+                     if (id == 0) return w.null();
+                     w.array(1);
+                     w.integer(id);
+                   }),
+              "2 1 null");
+  }
+  // Is answered by the stop.
+  void start(std::size_t client, int64_t id) {
+    clients[client]->write(
+        callFrame(2, static_cast<int>(Operation::StartReportingSessionForID), id));
+    call(client, Operation::ReporterID, id);
+  }
+  // Until the service has let go of what a client held that has left.
+  void awaitReporters(std::size_t client, const std::string& reporters) {
+    while (call(client, Operation::GetAllReporters, 0, [](CborWriter&) {}) != "2 1 " + reporters) {
+    }
+  }
+  bool done(uint64_t number) {
+    for (const auto& record : read().records)
+      if (record.call == number) return record.done;
+    ADD_FAILURE() << "no call " << number;
+    return false;
+  }
+  // "5 @1 Call sendMessage {..} 3 4 null": number, connection, kind and what is in it.
+  static std::string textOf(const JournalContents::Record& record) {
+    static constexpr const char* kNames[] = {"",
+                                             "Accepted",
+                                             "Call",
+                                             "StopCall",
+                                             "DestroyCall",
+                                             "EndedInterrupted",
+                                             "EndedOrderly",
+                                             "EndedServiceStopped",
+                                             "EndedCrashed",
+                                             "PreferencesChanged"};
+    std::string text = std::to_string(record.call) + " @" + std::to_string(connectionOf(record)) +
+                       " " + kNames[record.kind];
+    if (const auto client = readAccepted(record.head))
+      if (record.kind == static_cast<uint8_t>(RecordKind::Accepted))
+        return text + (client->pid == getpid() && client->uid == getuid() ? " own" : " foreign");
+    if (record.kind == static_cast<uint8_t>(RecordKind::PreferencesChanged))
+      return text + " " + std::string(record.head.begin(), record.head.end());
+    if (record.head.empty()) return text;
+    const Frame frame = Frame::decode(record.head).value();
+    auto call = readCall(record.head, record.dictionary, vxReportingServiceInterface());
+    text += " " + std::string(call.value().operation->name);
+    for (std::size_t i = 3; i < frame.size(); ++i)
+      text += " " + (frame[i].kind() == ValueKind::Null ? "null" : frame[i].text());
+    if (record.dictionary) text += " " + record.dictionary->text();
+    return text;
+  }
+  std::vector<std::string> recorded() {
+    std::vector<std::string> texts;
+    for (const auto& record : read().records) texts.push_back(textOf(record));
+    return texts;
+  }
+
+  std::unique_ptr<RecordedService> service;
+  std::optional<JournalRecorder> recorder;
+  std::vector<std::unique_ptr<SocketEnd>> clients;
+  int timesTold = 0;
+
+ private:
+  std::thread thread_;
+};
+
+TEST_F(RecordingTest, WhatReachesTheServiceIsInTheJournalInItsOrder) {
+  serve();
+  const std::size_t a = connect();
+  const std::size_t b = connect();
+  create(a, 11, 7);
+  call(b, Operation::CreateReportingSession, 22);
+  call(a, Operation::ReporterID, 11);                                 // a question
+  call(a, Operation::CreateReportingSession, 0, [](CborWriter&) {});  // refused
+  call(a, Operation::SetConfiguration, 2, [](CborWriter& w) {
+    w.null();
+    w.integer(11);
+  });
+  send(a, 5, 11);
+  call(a, Operation::StopReportingSessionForID, 11);
+  call(a, Operation::DestroyReportingSession, 11);
+  clients[b]->close();
+  awaitReporters(a, "()");
+  const std::size_t c = connect();
+  clients[a]->write(goodbyeFrame());
+  while (!clients[a]->ended()) (void)clients[a]->texts();
+  (void)c;
+  {
+    const SocketEnd stays = std::move(*clients[c]);
+    stop();
+  }
+  EXPECT_THAT(
+      recorded(),
+      ElementsAre("1 @1 Accepted own", "2 @2 Accepted own", "3 @1 Call createReportingSession 11",
+                  "4 @1 Call setServiceType 7 11", "5 @2 Call createReportingSession 22",
+                  "6 @1 Call setConfiguration null 11",
+                  "7 @1 Call sendMessage {} 3 4 (11) {n=5,text=" + std::string(50, 't') + "}",
+                  "8 @1 StopCall stopReportingSessionForID 11",
+                  "9 @1 DestroyCall destroyReportingSession 11", "10 @2 EndedInterrupted",
+                  "11 @11 Accepted own", "12 @1 EndedOrderly", "13 @11 EndedServiceStopped"));
+  const auto contents = read();
+  for (const auto& record : contents.records)
+    EXPECT_DOUBLE_EQ(record.time, 365 * 50 * 86400.0) << record.call;
+  EXPECT_EQ(recorder->preferencesChanged("some.name").call(), 14u);
+  EXPECT_EQ(recorded().back(), "14 @0 PreferencesChanged some.name");
+}
+
+bool liesIn(const std::string& folder, const void* place) {
+  std::ifstream maps("/proc/self/maps");
+  for (std::string line; std::getline(maps, line);) {
+    uintptr_t begin = 0;
+    uintptr_t end = 0;
+    const auto at = reinterpret_cast<uintptr_t>(place);
+    if (line.find(folder) != std::string::npos &&
+        std::sscanf(line.c_str(), "%lx-%lx", &begin, &end) == 2 && at >= begin && at < end)
+      return true;
+  }
+  return false;
+}
+
+TEST_F(RecordingTest, MessagesTravelWhereTheyWereRecordedAndOnTheHeapWhenTheJournalIsFull) {
+  options.maxBytes = 4 * kSegmentBytes;
+  open();
+  serve();
+  const std::size_t a = connect();
+  const auto isInJournal = [&](std::size_t client) {
+    send(client, 1);
+    EXPECT_TRUE(service->executor.drain(Monotonic::max()));
+    const bool lies = liesIn(options.folder, service->rows.places("one-off {").at(0));
+    service->rows.commit();
+    return lies;
+  };
+  EXPECT_TRUE(isInJournal(a));
+  while (append(1, dictionary(0, 9000)).ok() || append(1, dictionary(0)).ok()) {
+  }
+  EXPECT_FALSE(isInJournal(a));
+  EXPECT_FALSE(isInJournal(a));
+  const std::size_t late = connect();
+  EXPECT_FALSE(isInJournal(late));
+  EXPECT_EQ(timesTold, 1);
+  ASSERT_TRUE(journal->beginGeneration().ok() && journal->endSnapshot().ok());
+  EXPECT_TRUE(isInJournal(a));
+  // Without its beginning a connection could not be replayed: it stays out, its end as well.
+  EXPECT_FALSE(isInJournal(late));
+  stop();
+  EXPECT_EQ(recorder->counters().unrecorded, 3u);
+  EXPECT_THAT(recorded(), ElementsAre(HasSubstr("sendMessage"), HasSubstr("@1 Ended")));
+}
+
+TEST_F(RecordingTest, ACallIsDoneWhenItsRowsAreAndNotBefore) {
+  serve();
+  const std::size_t a = connect();
+  create(a, 1);
+  start(a, 1);
+  send(a, 1, 1);    // call 5
+  create(a, 2, 4);  // 6, 7: alarms, whose standalone messages wait
+  service->fakes.services.random = 59;
+  send(a, 2, 2);  // 8
+  call(a, Operation::ReporterID, 1);
+  ASSERT_TRUE(service->executor.drain(Monotonic::max()));
+  EXPECT_TRUE(done(2));
+  EXPECT_FALSE(done(5));
+  EXPECT_FALSE(journal->allDone());
+  service->rows.commit();
+  EXPECT_TRUE(done(5));
+  EXPECT_FALSE(done(8));
+  stop();
+  service->rows.commit();
+  service.reset();  // drops the one that is not due
+  EXPECT_FALSE(done(8));
+  EXPECT_FALSE(journal->allDone());
+}
+
+// Runs recorded calls as a later process would.
+void runAgain(const std::vector<JournalContents::Record>& records, Journal& journal,
+              RecordedService& service) {
+  std::map<uint64_t, std::shared_ptr<fakes::FakeConnection>> connections;
+  for (const JournalContents::Record& record : records) {
+    const auto again =
+        journal.append({record.kind, record.time, record.connection, record.head, std::nullopt});
+    ASSERT_TRUE(again.ok() && again->call == record.call);
+    const Cause cause{again->ticket, {}};
+    const CauseScope scope(cause);
+    std::shared_ptr<fakes::FakeConnection>& connection = connections[connectionOf(record)];
+    if (record.kind == static_cast<uint8_t>(RecordKind::Accepted)) {
+      connection = std::make_shared<fakes::FakeConnection>(readAccepted(record.head)->pid);
+      service.delegate->listener(service.listener, connection);
+    } else if (record.head.empty()) {
+      if (record.kind == static_cast<uint8_t>(RecordKind::EndedInterrupted))
+        connection->interruption();
+      connection->invalidation();
+    } else {
+      RecordedCall call =
+          readCall(record.head, record.dictionary, vxReportingServiceInterface()).value();
+      call.operation->invoke(*connection->object, call.arguments, Reply());
+    }
+    service.runQueues();
+  }
+}
+
+TEST_F(RecordingTest, CallsThatAreRunAgainGiveTheirRowsTheSameNames) {
+  serve();
+  const std::size_t a = connect();
+  const std::size_t b = connect();
+  send(a, 1);  // nobody listens: a standalone
+  for (int64_t id : {1, 2, 3}) create(a, id);
+  for (int64_t id : {4, 5}) create(b, id);
+  create(b, 6, 4);  // alarms: a standalone is due at a time of its own
+  for (int64_t id : {1, 2, 3}) start(a, id);
+  for (int64_t id : {4, 5}) start(b, id);
+  send(a, 2);     // to all five
+  send(a, 3, 6);  // to one that is not started
+  send(b, 4, 1);  // to another client's
+  call(a, Operation::StopReportingSessionForID, 2);
+  call(a, Operation::ReporterID, 1);
+  clients[b]->close();
+  awaitReporters(a, "(1,2,3)");
+  call(a, Operation::DestroyReportingSession, 1);
+  stop();
+  const std::vector<std::string> rows = service->rows.texts();
+  const JournalContents first = read();
+  service.reset();
+
+  std::vector<std::string> names;
+  for (const std::string& row : rows) names.push_back(row.substr(0, row.find(' ')));
+  EXPECT_EQ(std::ranges::adjacent_find(names), names.end()) << "a name of two rows";
+  EXPECT_THAT(rows, SizeIs(34));
+
+  std::filesystem::remove_all(options.folder);
+  open();
+  RecordedService later(journal.get());
+  later.fakes.services.processNames = {{getpid(), "recording"}};
+  runAgain(first.records, *journal, later);
+  EXPECT_EQ(later.rows.texts(), rows);
+  const auto notes = [](const JournalContents& contents) {
+    std::vector<std::string> all;
+    for (const auto& record : contents.records)
+      for (const auto& note : record.notes) {
+        const RecordedInput input = readInput(note.bytes).value();
+        all.push_back(std::to_string(record.call) + ":" + std::to_string(input.place) + " " +
+                      std::string(input.what) + " " + input.answer.text());
+      }
+    return all;
+  };
+  EXPECT_THAT(notes(first),
+              ElementsAre(HasSubstr("{process name=recording}"),
+                          HasSubstr("{process name=recording}"), HasSubstr("{standalone due=")));
+  EXPECT_EQ(notes(read()), notes(first));
+}
+
+}  // namespace
+}  // namespace vx::lnx
