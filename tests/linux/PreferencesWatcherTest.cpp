@@ -48,11 +48,18 @@ class PreferencesWatcherTest : public FolderTest {
 
 TEST_F(PreferencesWatcherTest, SettlesBeforeItFires) {
   start(PreferencesWatcher::openInotify());
+  std::string posted;
+  watcher.setPoster([&](std::string_view name, const PreferencesWatcher::Post& post) {
+    const bool idle = !p.queues.nextDue();
+    post();
+    if (idle && p.queues.nextDue()) posted = name;
+  });
   EXPECT_FALSE(watcher.nextDue());
   edit();  // with its folder
   EXPECT_EQ(pass(99ms), 0);
   EXPECT_EQ(*watcher.nextDue() - p.clock.monotonic(), 1ms);
   EXPECT_EQ(pass(1ms), 1);
+  EXPECT_EQ(posted, "name");
   for (int i = 0; i < 30; ++i) {  // never left alone: told all the same, now and then
     edit();
     pass(90ms);

@@ -264,6 +264,38 @@ TEST_F(RecordingTest, ACallIsDoneWhenItsRowsAreAndNotBefore) {
   EXPECT_FALSE(journal->allDone());
 }
 
+TEST_F(RecordingTest, MemoryIsGivenBackForNoCallsSake) {
+  RecordedService own(journal.get());
+  {
+    const Cause cause{append(1, dictionary(1))->ticket, {}};
+    const CauseScope scope(cause);
+    own.threading.memoryWasFreed(64 << 20);  // in two seconds
+    own.executor.background().async([] {});
+    ASSERT_TRUE(own.executor.drain(Monotonic::max()));
+    EXPECT_FALSE(journal->allDone());
+  }
+  EXPECT_TRUE(journal->allDone());
+}
+
+// What a journal of another version, or by somebody else, may hold.
+TEST(Records, ThatCannotBeBelievedAreNoCallsAndNoInputs) {
+  const auto text = [](const Bytes& head) {
+    return readCall(head, std::nullopt, vxReportingServiceInterface()).status().text();
+  };
+  EXPECT_THAT(text({0x83, 1, 0}), HasSubstr("no frame"));
+  EXPECT_THAT(text({0x82, 1, 0}), HasSubstr("no operation"));
+  EXPECT_THAT(text({0x83, 1, 0, 0}), HasSubstr("no operation 0"));
+  EXPECT_THAT(text({0x83, 1, 0, 12}), HasSubstr("no operation 12"));
+  EXPECT_THAT(text({0x83, 1, 0, 1}), HasSubstr("takes 1 arguments"));
+  EXPECT_THAT(text({0x89, 1, 0, 1, 1, 1, 1, 1, 1, 1}), HasSubstr("no operation"));
+  EXPECT_EQ(text({0x84, 1, 0, 1, 5}), "");
+  EXPECT_FALSE(readAccepted(Bytes(7)) || readAccepted(Bytes(9)));
+  const Bytes note = writeInput(7, "what", PayloadBuilder().set("n", 5).build());
+  for (std::size_t n = 0; n < note.size(); ++n) {
+    EXPECT_FALSE(readInput(std::span(note).first(n))) << n;
+  }
+}
+
 // Runs recorded calls as a later process would.
 void runAgain(const std::vector<JournalContents::Record>& records, Journal& journal,
               RecordedService& service) {
