@@ -20,6 +20,7 @@ enum class RecordKind : uint8_t {
   ClientState = 10,  // parts of a snapshot
   SessionState = 11,
   MessageState = 12,
+  ServiceBegan = 13,  // what comes next was recorded by a process that knew nothing of what was
 };
 
 }  // namespace vx::lnx

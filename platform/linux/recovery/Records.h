@@ -5,6 +5,7 @@
 //   Call and the like   | a call's frame [1, 0, operation, argument...]     | the one among the
 //                       | with its dictionary as an empty one               | arguments, if any
 //   Ended...            | none                                              | none
+//   ServiceBegan        | none                                              | none
 //   PreferencesChanged  | the notification's name                           | none
 //
 // A connection is known by the call number of its Accepted record, whose own connection is 0; all

@@ -32,12 +32,14 @@ uint64_t Recovery::firstUndone() const {
 
 RecoveryOutcome Recovery::run(const MakeDelegate& makeDelegate) {
   installPlatform(&platform_.services());
-  delegate_ = makeDelegate();
+  makeDelegate_ = &makeDelegate;
+  beginService();
   for (const Record& record : contents_.records) {
     lastTime_ = std::max(lastTime_, record.time);
     runRecord(record);
   }
   endOpenConnections();
+  (void)append(RecordKind::ServiceBegan, 0);
   delegate_.reset();
   runInteractive();
   (void)means_.executor.drain(means_.live.clock.monotonic() + kBackgroundTime);
@@ -47,6 +49,14 @@ RecoveryOutcome Recovery::run(const MakeDelegate& makeDelegate) {
 
 // ---------------------------------------------------------------------------------------------------------------------
 // Records
+
+// A process that begins has no clients, and knows no preferences before they change.
+void Recovery::beginService() {
+  connections_.clear();
+  delegate_.reset();
+  runInteractive();
+  delegate_ = (*makeDelegate_)();
+}
 
 void Recovery::runRecord(const Record& record) {
   const Cause cause{means_.journal.resume(record.place), {}};
@@ -70,6 +80,9 @@ void Recovery::runRecord(const Record& record) {
       case RecordKind::PreferencesChanged:
         platform_.notify({reinterpret_cast<const char*>(record.head.data()), record.head.size()});
         break;
+      case RecordKind::ServiceBegan:
+        beginService();
+        return;
       default:
         ++outcome_.unreadable;
         return;
@@ -125,13 +138,8 @@ void Recovery::endOpenConnections() {
   while (!connections_.empty()) {
     const auto [number, connection] = *connections_.begin();
     connections_.erase(connections_.begin());
-    Result<JournalAppended> appended =
-        means_.journal.appendEnd({.kind = static_cast<uint8_t>(RecordKind::EndedCrashed),
-                                  .time = lastTime_,
-                                  .connection = number});
-    Cause cause;
-    if (appended.ok()) cause.ticket = std::move(appended->ticket);
     {
+      const Cause cause = append(RecordKind::EndedCrashed, number);
       const CauseScope scope(cause);
       connection->invalidate();
     }
@@ -139,6 +147,14 @@ void Recovery::endOpenConnections() {
     runInteractive();
     waitForStore();
   }
+}
+
+Cause Recovery::append(RecordKind kind, uint64_t connection) {
+  Result<JournalAppended> appended = means_.journal.appendEnd(
+      {.kind = static_cast<uint8_t>(kind), .time = lastTime_, .connection = connection});
+  Cause cause;
+  if (appended.ok()) cause.ticket = std::move(appended->ticket);
+  return cause;
 }
 
 void Recovery::runInteractive() {

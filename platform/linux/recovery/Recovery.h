@@ -10,9 +10,11 @@
 
 #include "base/Function.h"
 #include "platform/ServiceListener.h"
+#include "platform/linux/execution/CauseScope.h"
 #include "platform/linux/execution/Executor.h"
 #include "platform/linux/journal/Journal.h"
 #include "platform/linux/journal/JournalReader.h"
+#include "platform/linux/journal/RecordKind.h"
 #include "platform/linux/recovery/RecoveredConnection.h"
 #include "platform/linux/recovery/ReplayInputs.h"
 #include "platform/linux/recovery/ReplayPlatform.h"
@@ -54,21 +56,24 @@ class Recovery {
 
   // The number of the first call that has rows to be written.
   uint64_t firstUndone() const;
-  // Makes a delegate of its own, on a platform that is installed until it returns.
+  // Makes delegates of its own, on a platform that is installed until it returns.
   RecoveryOutcome run(const MakeDelegate& makeDelegate);
 
  private:
   using Record = JournalContents::Record;
+  void beginService();
   void runRecord(const Record& record);
   void accept(const Record& record);
   void call(const Record& record);
   void end(const Record& record);
   void endOpenConnections();
+  Cause append(RecordKind kind, uint64_t connection);
   void runInteractive();
   void waitForStore();
 
   RecoveryMeans means_;
   const JournalContents contents_;
+  const MakeDelegate* makeDelegate_ = nullptr;
   ReplayInputs inputs_{contents_};
   ReplayPlatform platform_;
   std::shared_ptr<ServiceListenerDelegate> delegate_;
