@@ -309,6 +309,7 @@ class RunningPlatform final : public LinuxPlatform {
     loop_.addPassEndHook([this] { heapPages_.askForNew(); });
     loop_.addPassEndHook([this] { cutJournal(); });
     if (recorder_) {
+      loop_.addPassEndHook([this] { recorder_->endPass(); });
       watcher_->setPoster([this](std::string_view name, const PreferencesWatcher::Post& post) {
         const Cause cause{recorder_->preferencesChanged(name), {}};
         const CauseScope scope(cause);

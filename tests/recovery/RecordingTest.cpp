@@ -196,6 +196,10 @@ TEST_F(RecordingTest, WhatReachesTheServiceIsInTheJournalInItsOrder) {
     EXPECT_DOUBLE_EQ(record.time, 365 * 50 * 86400.0) << record.call;
   EXPECT_EQ(recorder->preferencesChanged("some.name").call(), 14u);
   EXPECT_EQ(recorded().back(), "14 @0 PreferencesChanged some.name");
+  service->fakes.clock.advance(std::chrono::seconds(1));
+  EXPECT_DOUBLE_EQ(recorder->preferencesChanged("").time(), 365 * 50 * 86400.0);
+  recorder->endPass();  // the time is asked for once a pass
+  EXPECT_DOUBLE_EQ(recorder->preferencesChanged("").time(), 365 * 50 * 86400.0 + 1);
 }
 
 bool liesIn(const std::string& folder, const void* place) {

@@ -70,9 +70,9 @@ JournalTicket JournalRecorder::preferencesChanged(std::string_view notification)
 JournalAppended JournalRecorder::append(RecordKind kind, uint64_t connection,
                                         std::span<const uint8_t> head,
                                         const std::optional<Payload::Validated>& dictionary) {
-  const double now = std::chrono::duration<double>(clock_.now().time_since_epoch()).count();
+  if (!time_) time_ = std::chrono::duration<double>(clock_.now().time_since_epoch()).count();
   Result<JournalAppended> appended =
-      journal_.append({static_cast<uint8_t>(kind), now, connection, head, dictionary});
+      journal_.append({static_cast<uint8_t>(kind), *time_, connection, head, dictionary});
   if (!appended.ok()) [[unlikely]] {
     countUnrecorded(appended.status());
     return {};

@@ -2,6 +2,7 @@
 #pragma once
 
 #include <cstdint>
+#include <optional>
 #include <string_view>
 #include <vector>
 
@@ -33,6 +34,9 @@ class JournalRecorder final : public CallRecorder {
   Called called(uint64_t connection, const Frame& call,
                 std::optional<std::size_t> dictionary) override;
   JournalTicket ended(uint64_t connection, End how) override;
+  // Calls of one pass of the event loop bear one time: to ask for it costs as much as to copy a
+  // message.
+  void endPass() { time_.reset(); }
   // Before the notification is queued.
   JournalTicket preferencesChanged(std::string_view notification);
 
@@ -47,7 +51,8 @@ class JournalRecorder final : public CallRecorder {
   Clock& clock_;
   Function<void(const Status&)> unrecorded_;
   Counters counters_;
-  std::vector<uint8_t> head_;  // of the call that is being recorded
+  std::optional<double> time_;  // of this pass
+  std::vector<uint8_t> head_;   // of the call that is being recorded
 };
 
 }  // namespace vx::lnx

@@ -39,18 +39,22 @@ std::optional<RecordedClient> readAccepted(std::span<const uint8_t> head) {
 
 void writeCall(const Frame& call, std::optional<std::size_t> dictionary,
                std::vector<uint8_t>& head) {
-  head.clear();
-  head.push_back(static_cast<uint8_t>(kArrayHead | call.size()));
-  head.push_back(static_cast<uint8_t>(wire::FrameKind::Call));
-  head.push_back(kNoNumber);
-  for (std::size_t i = wire::kCallHead - 1; i < call.size(); ++i) {
-    if (i == dictionary) {
-      head.push_back(kEmptyDictionary);
-      continue;
-    }
-    const std::span<const uint8_t> element = call[i].encoded();
-    head.insert(head.end(), element.begin(), element.end());
-  }
+  // The elements lie one behind the other: two pieces, with the dictionary between them.
+  const uint8_t* const begin = call[wire::kCallHead - 1].encoded().data();
+  const std::span<const uint8_t> last = call[call.size() - 1].encoded();
+  const uint8_t* const end = last.data() + last.size();
+  const std::span<const uint8_t> left =
+      dictionary ? call[*dictionary].encoded() : std::span(end, end);
+  const auto before = static_cast<std::size_t>(left.data() - begin);
+  const auto after = static_cast<std::size_t>(end - (left.data() + left.size()));
+  head.resize(wire::kCallHead + before + (dictionary ? 1 : 0) + after);
+  uint8_t* at = head.data();
+  *at++ = static_cast<uint8_t>(kArrayHead | call.size());
+  *at++ = static_cast<uint8_t>(wire::FrameKind::Call);
+  *at++ = kNoNumber;
+  at = std::copy_n(begin, before, at);
+  if (dictionary) *at++ = kEmptyDictionary;
+  std::copy_n(end - after, after, at);
 }
 
 Result<RecordedCall> readCall(std::span<const uint8_t> head,
