@@ -31,8 +31,9 @@ class RecordedClock final : public Clock {
   Date now() override {
     const JournalTicket* const call = currentCall();
     if (call == nullptr) return live_.now();
-    return Date(
-        std::chrono::duration_cast<Date::duration>(std::chrono::duration<double>(call->time())));
+    // To the microsecond: that much of a second such a number has.
+    return Date(std::chrono::round<std::chrono::microseconds>(
+        std::chrono::duration<double>(call->time())));
   }
   Monotonic monotonic() override { return live_.monotonic(); }
   std::string formatLocal(Date date, const char* format) override {

@@ -1,0 +1,323 @@
+// What a process had accepted when it was killed, finished by the next one.
+#include <gmock/gmock.h>
+
+#include <filesystem>
+#include <map>
+
+#include "Statistics/VXReportingProcessState.h"
+#include "platform/linux/ipc/ArgumentReading.h"
+#include "platform/linux/recovery/JournalOpening.h"
+#include "platform/linux/recovery/Records.h"
+#include "platform/linux/recovery/Recovery.h"
+#include "tests/ipc/TestInterface.h"
+#include "tests/journal/JournalFixture.h"
+#include "tests/recovery/RecordedService.h"
+#include "wire/Operations.h"
+#include "wire/Protocol.h"
+
+namespace vx::lnx {
+namespace {
+
+using wire::Operation;
+
+class RecoveryTest : public JournalFixture {
+ protected:
+  ~RecoveryTest() override { endLife(); }
+
+  void beginLife() {
+    auto opened = openJournal(options, root + "/moved");
+    ASSERT_TRUE(opened.ok()) << opened.status().text();
+    journal = std::move(opened->journal);
+    left = std::move(opened->left);
+    poisoned = opened->poisoned;
+    processState.emplace();
+    service = std::make_unique<RecordedService>(journal.get());
+    service->fakes.services.processNames = {{200, "player"}, {201, "phone"}};
+    service->fakes.services.internalBuild = true;
+    service->fakes.services.random = 30;
+    service->fakes.clock.wall = wall;
+    service->fakes.clock.steady = service->steady.monotonic();
+    recorder.emplace(*journal, service->fakes.clock);
+  }
+  void endLife() {
+    recovery.reset();
+    connections.clear();
+    if (service != nullptr) {  // whose handlers hold sessions
+      service->fakes.services.deviceHandlers.clear();
+      service->fakes.services.interfaceHandlers.clear();
+    }
+    service.reset();
+    processState.reset();
+    journal.reset();
+  }
+  // Leaves the files as they are at this moment.
+  void kill() {
+    const std::string kept = root + "/kept";
+    std::filesystem::rename(options.folder, kept);
+    std::filesystem::copy(kept, options.folder);
+    for (const auto& file : std::filesystem::directory_iterator(options.folder))
+      std::filesystem::permissions(file, std::filesystem::perms(0600));
+    std::filesystem::permissions(options.folder, std::filesystem::perms(0700));
+    endLife();
+    std::filesystem::remove_all(kept);
+  }
+  RecoveryOutcome recover(std::chrono::seconds later = {}) {
+    wall += later;
+    beginLife();
+    service->fakes.services.processNames.clear();  // they are dead
+    recovery.emplace(
+        RecoveryMeans{
+            service->platform, service->executor, *journal, {"test"}, [] { return false; }},
+        std::move(left));
+    return recovery->run([] { return VXReportingServiceDelegate::create(); });
+  }
+
+  // --- what clients do ---
+  void tick() {
+    service->fakes.clock.wall = wall += std::chrono::milliseconds(10);
+    recorder->endPass();
+  }
+  void connect(int client, int pid) {
+    tick();
+    const CallRecorder::Accepted accepted = recorder->accepted(pid, 1000);
+    const Cause cause{accepted.ticket, {}};
+    const CauseScope scope(cause);
+    connections[client] = {accepted.connection, std::make_shared<fakes::FakeConnection>(pid)};
+    service->delegate->listener(service->listener, connections[client].second);
+    service->runQueues();
+  }
+  template <class Write>
+  void call(int client, Operation number, std::size_t count, const Write& write) {
+    tick();
+    const Bytes bytes = callFrame(1, static_cast<int>(number), count, write);
+    const Frame frame = Frame::decode(std::span(bytes).subspan(wire::kLengthBytes)).value();
+    const OperationDescription& operation =
+        vxReportingServiceInterface().operations[static_cast<std::size_t>(number) - 1];
+    CallArguments arguments;
+    ASSERT_TRUE(readArguments(operation, frame, arguments).ok());
+    const auto element = dictionaryElement(operation, frame);
+    auto& [connection, of] = connections[client];
+    CallRecorder::Called called = recorder->called(connection, frame, element);
+    if (element) arguments.set(*element - wire::kCallHead, std::move(called.dictionary));
+    const Cause cause{std::move(called.ticket), {}};
+    const CauseScope scope(cause);
+    operation.invoke(*of->object, arguments, Reply());
+    service->runQueues();
+  }
+  void call(int client, Operation number, int64_t id) {
+    call(client, number, 1, [&](CborWriter& w) { w.integer(id); });
+  }
+  void create(int client, int64_t id, uint16_t type) {
+    call(client, Operation::CreateReportingSession, id);
+    call(client, Operation::SetServiceType, 2, [&](CborWriter& w) {
+      w.integer(type);
+      w.integer(id);
+    });
+  }
+  void configure(int client, int64_t id, const Payload& with) {
+    call(client, Operation::SetConfiguration, 2, [&](CborWriter& w) {
+      w.encoded(with.encoded());
+      w.integer(id);
+    });
+  }
+  void start(int client, int64_t id) { call(client, Operation::StartReportingSessionForID, id); }
+  void send(int client, int64_t number, std::vector<int64_t> ids = {}) {
+    call(client, Operation::SendMessage, 4, [&](CborWriter& w) {
+      w.encoded(dictionary(number).encoded());
+      w.integer(5);
+      w.integer(1);
+      if (ids.empty()) return w.null();
+      w.array(ids.size());
+      for (const int64_t id : ids) w.integer(id);
+    });
+  }
+  void prefer(const char* name, const char* disabled) {
+    tick();
+    service->fakes.services.preferences = {{"device_name", name}, {"disable_reporting", disabled}};
+    const Cause cause{recorder->preferencesChanged("com.quorvel.sonik.reporting"), {}};
+    const CauseScope scope(cause);
+    service->fakes.services.notifyQueue->async([handler = service->fakes.services.notifyHandler] {
+      (*handler)(fakes::FakeServices::kToken);
+    });
+    service->runQueues();
+  }
+  void end(int client, CallRecorder::End how) {
+    const Cause cause{recorder->ended(connections[client].first, how), {}};
+    const CauseScope scope(cause);
+    if (how == CallRecorder::End::Interrupted) connections[client].second->interruption();
+    connections[client].second->invalidation();
+    service->runQueues();
+    connections.erase(client);
+  }
+
+  std::vector<std::string> written() { return service->rows.texts(); }
+
+  Date wall{std::chrono::hours(24 * 365 * 50)};
+  JournalContents left;
+  std::string poisoned;
+  std::optional<VXReportingProcessState> processState;
+  std::unique_ptr<RecordedService> service;
+  std::optional<JournalRecorder> recorder;
+  std::optional<Recovery> recovery;
+  std::map<int, std::pair<uint64_t, std::shared_ptr<fakes::FakeConnection>>> connections;
+};
+
+// What a store has that writes no key twice; without the keys, which differ for ends.
+std::vector<std::string> together(std::vector<std::string> some,
+                                  const std::vector<std::string>& more) {
+  some.insert(some.end(), more.begin(), more.end());
+  std::ranges::sort(some);
+  some.erase(std::ranges::unique(some).begin(), some.end());
+  for (std::string& row : some) row.erase(0, row.find(' '));
+  std::ranges::sort(some);
+  return some;
+}
+
+// Wherever a process is killed, and the next one as well: together they write what one would have
+// that had lost its clients at that moment.
+TEST_F(RecoveryTest, AKilledProcessLosesNothingAndWritesNothingTwice) {
+  const std::vector<Function<void()>> script = [this] {
+    std::vector<Function<void()>> steps;
+    steps.emplace_back([this] { connect(1, 200); });
+    steps.emplace_back([this] { send(1, 1); });  // nobody listens: a standalone
+    steps.emplace_back([this] { create(1, 11, 7); });
+    steps.emplace_back([this] {
+      configure(1, 11, PayloadBuilder().set("HostApplicationDisplayID", "app").build());
+    });
+    steps.emplace_back([this] { start(1, 11); });
+    steps.emplace_back([this] { connect(2, 201); });
+    steps.emplace_back([this] { prefer("first", "false"); });
+    steps.emplace_back([this] { create(2, 22, 3); });  // never started: needs no end
+    steps.emplace_back([this] { send(1, 2); });
+    steps.emplace_back([this] { send(2, 3, {11, 22}); });  // also to another client's
+    steps.emplace_back([this] { create(2, 33, 3), start(2, 33); });
+    steps.emplace_back([this] { send(2, 4); });
+    steps.emplace_back([this] { prefer("second", "true"); });
+    steps.emplace_back([this] { send(2, 5); });  // refused
+    steps.emplace_back([this] { prefer("third", "false"); });
+    steps.emplace_back([this] { call(2, Operation::StopReportingSessionForID, 33); });
+    steps.emplace_back([this] { start(2, 33), send(2, 6); });
+    steps.emplace_back([this] { create(2, 33, 3); });  // replaced without a stop: stays unended
+    steps.emplace_back([this] { call(1, Operation::DestroyReportingSession, 11); });
+    steps.emplace_back([this] { start(2, 33), send(1, 7); });
+    steps.emplace_back([this] { end(2, CallRecorder::End::Interrupted); });
+    return steps;
+  }();
+  const Date begin = wall;
+  for (std::size_t steps = 1; steps <= script.size(); ++steps) {
+    for (const int deaths : {1, 2}) {
+      SCOPED_TRACE(std::to_string(deaths) + " deaths after " + std::to_string(steps) + " steps");
+      std::filesystem::remove_all(options.folder);
+      wall = begin;
+      beginLife();
+      for (std::size_t i = 0; i < steps; ++i) script[i]();
+      while (!connections.empty()) end(connections.begin()->first, CallRecorder::End::Orderly);
+      const std::vector<std::string> whole = together(written(), {});
+      const auto files = service->fakes.services.files;
+      endLife();
+
+      std::filesystem::remove_all(options.folder);
+      wall = begin;
+      beginLife();
+      for (std::size_t i = 0; i < steps / 2; ++i) script[i]();
+      std::vector<std::string> rows = written();
+      service->rows.commit();
+      auto filesNow = service->fakes.services.files;
+      for (std::size_t i = steps / 2; i < steps; ++i) script[i]();
+      const std::size_t open = connections.size();
+      for (const auto& [name, text] : service->fakes.services.files) filesNow[name] = text;
+      kill();
+      if (deaths == 2) {
+        EXPECT_EQ(recover(std::chrono::hours(1)).ended, open);
+        kill();
+      }
+      const RecoveryOutcome outcome = recover(std::chrono::hours(1));
+      EXPECT_EQ(outcome.ended, deaths == 2 ? 0 : open);
+      EXPECT_EQ(outcome.unreadable, 0u);
+      EXPECT_EQ(together(rows, written()), whole);
+      for (const auto& [name, text] : service->fakes.services.files) filesNow[name] = text;
+      EXPECT_EQ(filesNow, files);
+      endLife();
+    }
+  }
+}
+
+// Two lives in one journal: the second knows neither the clients nor the preferences of the first.
+TEST_F(RecoveryTest, WhatALaterProcessAcceptedIsRunAgainAsItFoundThings) {
+  beginLife();
+  connect(1, 200);
+  create(1, 11, 3);
+  start(1, 11);
+  prefer("first", "true");
+  kill();
+  recover();
+  service->fakes.services.processNames = {{201, "phone"}};
+  connect(2, 201);
+  create(2, 11, 3);
+  start(2, 11);
+  service->rows.commit();
+  send(2, 7);
+  const std::vector<std::string> unwritten = written();
+  EXPECT_THAT(unwritten, SizeIs(2));
+  EXPECT_TRUE(connections[2].first > 1000) << "beyond all numbers of the first";
+  kill();
+  EXPECT_EQ(recover().undone, 1u);
+  for (const std::string& row : unwritten) EXPECT_THAT(written(), ::testing::Contains(row));
+  EXPECT_THAT(written(), SizeIs(7)) << "two sessions, a summary, a flush and an uptime";
+}
+
+TEST_F(RecoveryTest, AStandaloneWaitsForTheRestOfItsDelay) {
+  for (const auto& [later, sent] : {std::pair{10, 0}, {40, 2}}) {
+    std::filesystem::remove_all(options.folder);
+    beginLife();
+    connect(1, 200);
+    create(1, 11, 4);
+    send(1, 1, {11});
+    service->rows.commit();
+    kill();
+    recover(std::chrono::seconds(later));
+    EXPECT_EQ(service->rows.places("one-off").size(), static_cast<std::size_t>(sent)) << later;
+    service->rows.commit();
+    EXPECT_EQ(journal->allDone(), sent != 0) << later;
+    endLife();
+  }
+}
+
+TEST_F(RecoveryTest, AJournalWhoseReplaysDieIsMovedAsideAndTheServiceServes) {
+  beginLife();
+  connect(1, 200);
+  const uint64_t first = connections[1].first;
+  for (int deaths = 0; deaths < 2; ++deaths) {
+    kill();
+    beginLife();
+    EXPECT_THAT(left.records, SizeIs(1));
+    EXPECT_EQ(poisoned, "");
+  }
+  kill();
+  beginLife();
+  EXPECT_EQ(poisoned, options.folder + ".aside-1");
+  EXPECT_THAT(left.records, IsEmpty());
+  EXPECT_TRUE(std::filesystem::exists(poisoned));
+  connect(1, 200);
+  EXPECT_GT(connections[1].first, first + 1);
+  // One that ends counts as none.
+  for (int replays = 0; replays < 4; ++replays) {
+    kill();
+    beginLife();
+    EXPECT_EQ(poisoned, "");
+    endReplay(options.folder);
+  }
+}
+
+TEST_F(RecoveryTest, WhatWasMovedElsewhereIsTakenBack) {
+  beginLife();
+  connect(1, 200);
+  kill();
+  EXPECT_EQ(epochOfJournal(options.folder), kEpoch);
+  ASSERT_TRUE(JournalFolder::moveTo(options.folder, root + "/moved").ok());
+  EXPECT_EQ(epochOfJournal(options.folder), std::nullopt);
+  EXPECT_EQ(recover().ended, 1u);
+}
+
+}  // namespace
+}  // namespace vx::lnx
