@@ -235,6 +235,12 @@ TEST_F(RecoveryTest, AKilledProcessLosesNothingAndWritesNothingTwice) {
       EXPECT_EQ(outcome.ended, deaths == 2 ? 0 : open);
       EXPECT_EQ(outcome.unreadable, 0u);
       EXPECT_EQ(together(rows, written()), whole);
+      for (const std::string& row : written())  // a session's row is asked for, for its number
+      {
+        if (std::ranges::count(rows, row) > 0) {
+          EXPECT_THAT(row, HasSubstr(" session "));
+        }
+      }
       for (const auto& [name, text] : service->fakes.services.files) filesNow[name] = text;
       EXPECT_EQ(filesNow, files);
       endLife();
