@@ -15,8 +15,19 @@
 #include "platform/linux/recovery/JournalRecorder.h"
 #include "platform/linux/recovery/JournaledInputs.h"
 #include "tests/fakes/FakePlatform.h"
+#include "tests/wire/SocketEnd.h"
+#include "wire/FrameWriter.h"
 
 namespace vx::lnx {
+
+template <class Write>
+Bytes callFrame(uint64_t number, wire::Operation operation, std::size_t count, const Write& write) {
+  Bytes out;
+  wire::FrameWriter call = wire::FrameWriter::call(out, number, operation, count);
+  write(call.items());
+  call.end();
+  return out;
+}
 
 // What would be rows, with the causes that the store would keep until they are committed.
 class Rows final : public VyrReporting, public AnalyticsEventService, public PowerEventLog {
@@ -142,7 +153,6 @@ class RecordedService {
     void emit(uint32_t, uint64_t, uint64_t, uint64_t, uint64_t) override {}
   } quiet_;
   fakes::FakeServices& small_ = fakes.services;
-  fakes::NoChannels channels_;
 
  public:
   Platform platform{.serviceListener = listener,
@@ -157,7 +167,7 @@ class RecordedService {
                     .vyrReporting = rows,
                     .analytics = rows,
                     .powerLog = rows,
-                    .channelReports = channels_,
+                    .channelReports = fakes::FakePlatform::noChannels(),
                     .deviceProperties = small_,
                     .orientation = small_,
                     .log = quiet_,

@@ -8,7 +8,7 @@
 #include <map>
 
 #include "platform/linux/recovery/Records.h"
-#include "tests/ipc/TestInterface.h"
+#include "tests/ipc/IpcTest.h"
 #include "tests/journal/JournalFixture.h"
 #include "tests/recovery/RecordedService.h"
 #include "tests/wire/SocketEnd.h"
@@ -57,7 +57,7 @@ class RecordingTest : public JournalFixture {
     std::strncpy(address.sun_path, (root + "/service.socket").c_str(), sizeof address.sun_path - 1);
     EXPECT_EQ(::connect(socket.get(), reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
     clients.push_back(std::make_unique<SocketEnd>(std::move(socket)));
-    clients.back()->write(clientHello());
+    clients.back()->write(frame(0, 1));
     answer(clients.size() - 1);
     return clients.size() - 1;
   }
@@ -70,7 +70,7 @@ class RecordingTest : public JournalFixture {
   }
   template <class Write>
   std::string call(std::size_t client, Operation operation, std::size_t count, const Write& write) {
-    clients[client]->write(callFrame(1, static_cast<int>(operation), count, write));
+    clients[client]->write(callFrame(1, operation, count, write));
     return answer(client);
   }
   std::string call(std::size_t client, Operation operation, int64_t id) {
@@ -98,8 +98,7 @@ class RecordingTest : public JournalFixture {
   }
   // Is answered by the stop.
   void start(std::size_t client, int64_t id) {
-    clients[client]->write(
-        callFrame(2, static_cast<int>(Operation::StartReportingSessionForID), id));
+    clients[client]->write(frame(1, 2, Operation::StartReportingSessionForID, id));
     call(client, Operation::ReporterID, id);
   }
   // Until the service has let go of what a client held that has left.
@@ -174,7 +173,7 @@ TEST_F(RecordingTest, WhatReachesTheServiceIsInTheJournalInItsOrder) {
   clients[b]->close();
   awaitReporters(a, "()");
   const std::size_t c = connect();
-  clients[a]->write(goodbyeFrame());
+  clients[a]->write(frame(4));
   while (!clients[a]->ended()) (void)clients[a]->texts();
   (void)c;
   {

@@ -9,7 +9,7 @@
 #include "platform/linux/recovery/JournalOpening.h"
 #include "platform/linux/recovery/Records.h"
 #include "platform/linux/recovery/Recovery.h"
-#include "tests/ipc/TestInterface.h"
+#include "tests/ipc/IpcTest.h"
 #include "tests/journal/JournalFixture.h"
 #include "tests/recovery/RecordedService.h"
 #include "wire/Operations.h"
@@ -89,7 +89,7 @@ class RecoveryTest : public JournalFixture {
   template <class Write>
   void call(int client, Operation number, std::size_t count, const Write& write) {
     tick();
-    const Bytes bytes = callFrame(1, static_cast<int>(number), count, write);
+    const Bytes bytes = callFrame(1, number, count, write);
     const Frame frame = Frame::decode(std::span(bytes).subspan(wire::kLengthBytes)).value();
     const OperationDescription& operation =
         vxReportingServiceInterface().operations[static_cast<std::size_t>(number) - 1];

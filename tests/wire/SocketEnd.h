@@ -1,8 +1,9 @@
 // One end of a socket, worked by a test: writes bytes, and shows the frames that have come.
-// Confined to the test's thread; never blocks.
+// Confined to the test's thread; never blocks unless said.
 #pragma once
 
 #include <gtest/gtest.h>
+#include <poll.h>
 #include <sys/socket.h>
 
 #include <cstdint>
@@ -90,6 +91,11 @@ class SocketEnd {
       while (reader_.next(body) == wire::FrameReader::Next::Frame) all.push_back(textOf(body));
     } while (readSome(SIZE_MAX) > 0);
     return all;
+  }
+  // Waits for bytes, or the end.
+  void await() {
+    pollfd ready{socket_.get(), POLLIN, 0};
+    ASSERT_EQ(poll(&ready, 1, 20000), 1) << "nothing came";
   }
   bool holdsHalfAFrame() const { return reader_.unread() != 0; }
   bool ended() const { return ended_; }  // seen by a read
