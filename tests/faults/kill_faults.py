@@ -1,0 +1,89 @@
+"""kill -9 at random moments, during recovery too: what was answered is there exactly once, and every session is ended."""
+import threading
+import time
+
+from harness import CREATE, SEND, SET_TYPE, START, STOP, Client
+from service import spread
+from store_check import Check, stopped
+from traffic import Session, Start, scene
+
+ROUNDS_IN_A_CHAIN = 10
+MARKER = 1 << 40   # an identifier
+LONGEST_START = 5  # seconds: no session's set-up is waited for again
+
+
+def loaded_until_killed(r, service, traffic):
+    killer = threading.Timer(10 ** r.uniform(-2.2, -0.3), service.process.kill)
+    killer.start()
+    try:
+        traffic.connect(r.randrange(2, 5))
+        while service.process.poll() is None:
+            traffic.step()
+    except OSError:
+        pass  # the moment has come
+    killer.join()
+    service.process.wait()
+    traffic.process_ended("crashed")
+
+
+def end_marker_session(service, traffic):
+    """When its end is stored, so is what was recovered before it, but for what is delayed."""
+    traffic.connections += 1
+    traffic.apps[None] = Session(MARKER, 12, "")
+    traffic.apps[None].starts.append(Start(traffic.apps[None], 0, 0, 0))
+    c = Client(service.socket_path)
+    c.call(CREATE, MARKER)
+    c.call(SET_TYPE, 12, MARKER)
+    c.post(START, MARKER)
+    c.call(SEND, {"marker": 1}, 1, 0, [MARKER])
+    c.call(STOP, MARKER)
+    c.close()
+
+
+def settled(traffic, aside=(), seconds=1):
+    """A check while the daemon runs, when nothing lacks or nothing has come for some seconds."""
+    check, since = Check(traffic, patient=True, aside=aside), time.monotonic()
+    while check.lacks() and time.monotonic() < since + seconds:
+        time.sleep(0.2)
+        before, check = check, Check(traffic, patient=True, aside=aside)
+        since = time.monotonic() if check.lacks() != before.lacks() else since
+    return check
+
+
+def chain(argument):
+    """Rounds in the same folders."""
+    seed, rounds, waits = argument
+    with scene(seed) as (r, service, traffic):
+        # With slow syncs the store's thread lags: sessions stay in set-up, rows in the queue.
+        shim = {"sync_ms": "5,80"} if r.random() < 0.5 else {}
+        twice_killed = set()
+        service.start(**shim)
+        for n in range(rounds):
+            loaded_until_killed(r, service, traffic)
+            deaths = r.choice((0, 0, 0, 0, 0, 0, 1, 1, 1, 2))  # of those that recover
+            twice_killed |= {n} if deaths > 1 else set()
+            for _ in range(deaths):
+                service.launch(**shim)
+                time.sleep(10 ** r.uniform(-3, -1))
+                service.kill()
+            service.start(**shim)
+        end_marker_session(service, traffic)
+        # A journal whose recovery died twice is moved aside, and the ledger says so.
+        moved = sum("moved_aside" in text and "journal" in text for text, _ in service.ledger())
+        aside = twice_killed if moved else set()
+        if waits:
+            time.sleep(max(0, max((m.due for m in traffic.messages.values()), default=0) - time.monotonic()))
+        live = settled(traffic, aside)
+        check = stopped(traffic, argument, aside)
+        check.found("not_before_stop", [*live.findings.values()], live.lacks() - check.lacks())
+        check.found("needlessly_aside", f"{moved} journals", moved - len(twice_killed))
+        check.found("slow_start", f"{service.slowest_start:.1f} s", service.slowest_start > LONGEST_START)
+        check.figures.update(slowest_start_s=service.slowest_start, rounds=rounds - 1)  # one is added for each chain
+        return check
+
+
+def run(options):
+    rounds = options.rounds or (50 if options.small else 500)
+    chains = [(options.seed * 1000 + i, min(ROUNDS_IN_A_CHAIN, rounds - i * ROUNDS_IN_A_CHAIN), i == 0 and not options.small)
+              for i in range((rounds + ROUNDS_IN_A_CHAIN - 1) // ROUNDS_IN_A_CHAIN)]
+    return spread(chain, chains, options)

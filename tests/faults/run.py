@@ -1,0 +1,64 @@
+#!/usr/bin/env python3
+"""Runs the fault programs against a built daemon: ./check --faults, or
+   tests/faults/run.py --build build/dev [--small] [--only kill,io] [--rounds N] [--seed S] [--jobs N]
+Each prints one line of figures; the last line says how many passed."""
+import argparse
+import importlib
+import os
+import random
+import shutil
+import sys
+import tempfile
+import time
+
+SCRATCH_BYTES = 2 << 30
+PROGRAMS = ("kill", "term")
+
+
+def main():
+    parser = argparse.ArgumentParser(description=__doc__, formatter_class=argparse.RawDescriptionHelpFormatter)
+    parser.add_argument("--build", default="build/dev")
+    parser.add_argument("--small", action="store_true", help="a minute or two instead of twenty")
+    parser.add_argument("--only", default=",".join(PROGRAMS), help="programs, with commas between")
+    parser.add_argument("--rounds", type=int, help="rounds, points or images of each program")
+    parser.add_argument("--seed", type=int, default=random.randrange(1 << 30))
+    parser.add_argument("--jobs", type=int, default=2 * (os.cpu_count() or 1))
+    parser.add_argument("--findings", type=int, default=2, help="how many findings of each kind are printed")
+    options = parser.parse_args()
+    unknown = set(options.only.split(",")) - set(PROGRAMS)
+    if unknown:
+        parser.error(f"no such program: {', '.join(sorted(unknown))}; there are {', '.join(PROGRAMS)}")
+
+    build = os.path.abspath(options.build)
+    os.environ["VXREPORTINGD"] = build + "/Statistics/vxreportingd"
+    os.environ["VX_IO_SHIM"] = build + "/tests/faults/libvx_io_shim.so"
+    roomy = os.path.isdir("/dev/shm") and shutil.disk_usage("/dev/shm").free > SCRATCH_BYTES
+    scratch = tempfile.mkdtemp(prefix="vxfaults", dir="/dev/shm" if roomy else None)
+    os.environ["VX_FAULTS_FOLDER"] = scratch
+    print(f"seed {options.seed}, {options.jobs} at once, in {scratch}", flush=True)
+    here = os.path.dirname(os.path.abspath(__file__))
+    sys.path[:0] = [here, here + "/../e2e"]
+    sys.dont_write_bytecode = True
+    passed = failed = 0
+    try:
+        for name in options.only.split(","):
+            began = time.monotonic()
+            outcome = importlib.import_module(name + "_faults").run(options)
+            if outcome.skipped:
+                print(f"{name}: skipped, {outcome.skipped}", flush=True)
+                continue
+            for figure, texts in outcome.findings.items():
+                for text in texts[:options.findings]:
+                    print(f"  {name}: {figure}: {text}")
+            figures = " ".join(f"{k}={v:.2f}" if isinstance(v, float) else f"{k}={v:d}" for k, v in outcome.figures.items())
+            word = "passed" if outcome.ok() else "FAILED"
+            print(f"{name}: {word} {figures} ({time.monotonic() - began:.0f} s)", flush=True)
+            passed, failed = passed + outcome.ok(), failed + (not outcome.ok())
+    finally:
+        shutil.rmtree(scratch, ignore_errors=True)
+    print(f"{passed} passed, {failed} failed")
+    return 1 if failed else 0
+
+
+if __name__ == "__main__":
+    sys.exit(main())
