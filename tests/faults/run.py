@@ -12,7 +12,7 @@ import tempfile
 import time
 
 SCRATCH_BYTES = 2 << 30
-PROGRAMS = ("kill", "term", "io", "disk")
+PROGRAMS = ("kill", "term", "io", "power", "disk")
 
 
 def main():
