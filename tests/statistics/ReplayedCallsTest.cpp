@@ -13,7 +13,7 @@ TEST_F(ReplayedCallsTest, CallsThatAreRunAgainFindWhatTheyFoundTheFirstTime) {
     auto& client = connect();
     create(client, 1);
     notify();
-    VXReportingSession::sendSingleMessage(message(), 1, 1, 4, std::nullopt, nullptr);
+    VXReportingSession::sendSingleMessage(message, 1, 1, 4, std::nullopt, nullptr);
     return client.clientProcessName().value_or("none") + " " +
            session(client, 1)->userInfo()->snapshot().text();
   };
@@ -32,8 +32,9 @@ TEST_F(ReplayedCallsTest, CallsThatAreRunAgainFindWhatTheyFoundTheFirstTime) {
   EXPECT_EQ(p.vyr.oneOffs.size(), 2u);  // the second waited for what was left
   drivers.onSample = [] { ADD_FAILURE() << "the drivers were asked"; };
   p.inputs.answers["driver statistics"] = PayloadBuilder().set("AE2", 3).build();
-  EXPECT_THAT(during([&] { stop(*clients[0], 1); }, {"fetching"}),
-              ElementsAre("log vxrs default fetching driver logs {AE2=3}"));
+  (void)gained();
+  stop(*clients[0], 1);
+  EXPECT_THAT(gained({"fetching"}), ElementsAre("log vxrs default fetching driver logs {AE2=3}"));
 
   p.inputs.answers.clear();  // what was not found then
   EXPECT_EQ(liveThrough(), "none {}");

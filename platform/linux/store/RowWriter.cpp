@@ -67,7 +67,7 @@ RowWriter::RowWriter(sqlite3* database, std::size_t mostText, EndWord endWord, C
       endWord_(endWord) {}
 
 Status RowWriter::loadKnownRows(uint64_t firstCall) {
-  thread_.assertIsCurrent();
+  thread_.assertHere();
   Result<KnownRows> known = KnownRows::load(database_, firstCall);
   if (!known.ok()) return known.status();
   known_ = std::move(*known);
