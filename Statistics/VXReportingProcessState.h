@@ -1,9 +1,11 @@
-// What is asked or registered once per process, however many sessions there are.
+// What there is once per process, however many sessions there are.
 #pragma once
 
 #include <atomic>
+#include <memory>
 #include <optional>
 
+#include "Statistics/Service/VXReportingDelayedMessages.h"
 #include "base/Mutex.h"
 #include "platform/ScopedLog.h"
 
@@ -20,6 +22,7 @@ class VXReportingProcessState {
   VXReportingProcessState& operator=(const VXReportingProcessState&) = delete;
   static VXReportingProcessState& current();
 
+  VXReportingDelayedMessages& delayedMessages() { return *delayedMessages_; }
   // Asks the device the first time.
   bool isInternalBuild();
   // Registers the "vxrr" scope the first time.
@@ -30,6 +33,8 @@ class VXReportingProcessState {
 
  private:
   VXReportingProcessState* const replaced_;
+  const std::shared_ptr<VXReportingDelayedMessages> delayedMessages_ =
+      std::make_shared<VXReportingDelayedMessages>();
   Mutex mutex_;
   std::optional<bool> internalBuild_ GUARDED_BY(mutex_);
   bool sessionScopeRegistered_ GUARDED_BY(mutex_) = false;

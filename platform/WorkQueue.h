@@ -34,9 +34,24 @@ class CAPABILITY("queue") WorkQueue {
   void assertIsCurrent() const ASSERT_CAPABILITY(this) { VX_DCHECK(isCurrent()); }
 };
 
+// The recorded call that a piece of work goes back to, for work that waits elsewhere than on a
+// queue. Let go of before run(), the work is found undone after a crash.
+class WorkCause {
+ public:
+  virtual ~WorkCause() = default;
+  // Runs the work before it returns, as the call's own. Once.
+  virtual void run(const Work& work) { work(); }
+};
+
 class WorkQueues {
  public:
   virtual ~WorkQueues() = default;
+  // What the caller's work goes back to, as asyncAfter would take it along. Null where a call is
+  // run again after a crash whose work was done before it.
+  virtual std::unique_ptr<WorkCause> takeCause() { return std::make_unique<WorkCause>(); }
+  // Runs `work` before it returns, as work for the service's own sake: what it queues goes back to
+  // no call.
+  virtual void withoutCause(const Work& work) { work(); }
   // A new serial queue; `label` must outlive it (a literal). Cheap: thousands may exist. Work
   // queued on it keeps it alive until it has run.
   virtual std::shared_ptr<WorkQueue> makeSerial(std::string_view label,

@@ -76,6 +76,10 @@ class VXReportingSession : public std::enable_shared_from_this<VXReportingSessio
   static void sendSingleMessage(const Payload& message, MessageCategory category, MessageType type,
                                 ServiceType serviceType, const std::optional<Payload>& userInfo,
                                 MessageReply reply);
+  // What is left of that when the delay is over. On any thread.
+  static void sendSingleMessageNow(const Payload& message, MessageCategory category,
+                                   MessageType type, ServiceType serviceType,
+                                   const MessageReply& reply);
 
   bool shouldReportOrientation() const;
   // Issues the next identifier of the kind: "Session_Setup_Start_1", "..._2". Numbering goes on
@@ -142,9 +146,6 @@ class VXReportingSession : public std::enable_shared_from_this<VXReportingSessio
   void relayMessage(const Payload& normalised, const Payload& message, MessageCategory category,
                     MessageType type, bool startedThen);
   void flushRelay();
-  static void sendSingleMessageNow(const Payload& message, MessageCategory category,
-                                   MessageType type, ServiceType serviceType,
-                                   const MessageReply& reply);
   void setVyrReportingSession(std::shared_ptr<VyrReportingSession> session);
   void setVyrReportingAgentToken(std::shared_ptr<const VyrSecureHierarchyToken> token);
 

@@ -4,6 +4,7 @@
 #include <cstdlib>
 
 #include "Statistics/Service/VXReportingSession.h"
+#include "Statistics/VXReportingProcessState.h"
 #include "platform/Log.h"
 
 namespace vx {
@@ -20,11 +21,10 @@ constexpr uint32_t kAlarmDelaySeconds = 60;  // exclusive
 
 float clientVersion() { return std::strtof(kClientVersion, nullptr); }
 
-// How long a standalone message of that service type waits. When it is due is decided once,
+// When a standalone message of that service type goes out; none for at once. Decided once,
 // whatever happens to the process meanwhile.
-std::chrono::nanoseconds standaloneDelay(ServiceType serviceType) {
+std::optional<Date> standaloneDue(ServiceType serviceType, Date now) {
   static constexpr std::string_view kDue = "standalone due";
-  const Date now = platform().clock.now();
   const std::optional<Payload> answer =
       platform().inputs.once(kDue, [&]() -> std::optional<Payload> {
         if (serviceType != kServiceTypeAlarms) return std::nullopt;
@@ -34,11 +34,9 @@ std::chrono::nanoseconds standaloneDelay(ServiceType serviceType) {
         return PayloadBuilder().set(kDue, PayloadDate{due.count()}).build();
       });
   const std::optional<Value> due = answer ? answer->find(kDue) : std::nullopt;
-  if (!due) return {};
-  const std::chrono::duration<double> since1970(due->asDouble());
-  const auto delay =
-      std::chrono::duration_cast<std::chrono::nanoseconds>(since1970) - now.time_since_epoch();
-  return std::max(delay, std::chrono::nanoseconds(0));
+  if (!due) return std::nullopt;
+  return Date(std::chrono::round<std::chrono::microseconds>(
+      std::chrono::duration<double>(due->asDouble())));
 }
 
 uint16_t relayCategory(MessageCategory category) {
@@ -174,12 +172,19 @@ void VXReportingSession::flushRelay() {
 void VXReportingSession::sendSingleMessage(const Payload& message, MessageCategory category,
                                            MessageType type, ServiceType serviceType,
                                            const std::optional<Payload>&, MessageReply reply) {
-  const std::chrono::nanoseconds delay = standaloneDelay(serviceType);
+  const Date now = platform().clock.now();
+  const std::optional<Date> due = standaloneDue(serviceType, now);
+  const std::chrono::nanoseconds delay =
+      due ? std::max<std::chrono::nanoseconds>(*due - now, {}) : std::chrono::nanoseconds(0);
   VX_VERBOSE(sessionLogScope(), "sending single message after delta %lli for service %i",
              static_cast<long long>(std::chrono::round<std::chrono::seconds>(delay).count()),
              int{serviceType});
-  platform().workQueues.background().asyncAfter(
-      delay, [message, reply = std::move(reply), category, serviceType, type] {
+  if (delay.count() > 0) {
+    return VXReportingProcessState::current().delayedMessages().add(
+        {message, category, type, serviceType, *due, std::move(reply)});
+  }
+  platform().workQueues.background().async(
+      [message, reply = std::move(reply), category, serviceType, type] {
         sendSingleMessageNow(message, category, type, serviceType, reply);
       });
 }

@@ -169,6 +169,41 @@ TEST_F(SessionTest, SinglesAreTakenAsTheyAreAndThoseOfAlarmsSpreadOverAMinute) {
                 {"clientType", int32_t{19}}, {"clientVersion", 2.0f}, {"sessionID", int32_t{-1}}}));
 }
 
+TEST_F(SessionTest, DelayedSinglesGoOutInTheirOrderWhenSomebodyIsInAHurryAndOnce) {
+  const auto single = [&](int64_t number, uint32_t delay) {
+    p.services.random = delay;
+    VXReportingSession::sendSingleMessage(dictionary("n", number), 1, 1, 4, std::nullopt, nullptr);
+  };
+  const auto sent = [&] {
+    std::string numbers;
+    for (const auto& one : p.vyr.oneOffs) numbers += one.payload.find("n")->text() + " ";
+    return numbers;
+  };
+  VXReportingDelayedMessages& delayed = VXReportingProcessState::current().delayedMessages();
+  single(1, 30);
+  single(2, 10);
+  single(3, 30);
+  p.queues.advance(10s);
+  EXPECT_EQ(sent(), "2 ");
+  single(4, 5);
+  delayed.sendAllNow();
+  EXPECT_EQ(sent(), "2 4 1 3 ");
+  p.queues.advance(60s);
+  EXPECT_EQ(p.vyr.oneOffs.size(), 4u);
+  // Those that are too many do not wait.
+  p.vyr.oneOffs.clear();
+  for (std::size_t i = 0; i < VXReportingDelayedMessages::kMostMessages; ++i) single(0, 20);
+  run();
+  EXPECT_EQ(sent(), "");
+  p.queues.advance(1s);
+  single(1, 59);
+  run();
+  EXPECT_EQ(p.vyr.oneOffs.size(), VXReportingDelayedMessages::kMostMessages);
+  EXPECT_EQ(delayed.size(), 1u);
+  p.queues.advance(59s);
+  EXPECT_EQ(p.vyr.oneOffs.back().payload.find("n")->asInt64(), 1);
+}
+
 class OrientationTest : public SessionTest {
  protected:
   OrientationTest() { p.services.internalBuild = true; }

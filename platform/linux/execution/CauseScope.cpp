@@ -40,4 +40,12 @@ Cause Cause::take() {
            std::min<uint8_t>(static_cast<uint8_t>(scope->depth_ + 1), kDeepest)}};
 }
 
+void HeldCause::run(const Work& work) {
+  {
+    const CauseScope scope(cause_);
+    work();
+  }
+  cause_.ticket = {};
+}
+
 }  // namespace vx::lnx

@@ -4,6 +4,7 @@
 #include <cstdint>
 #include <utility>
 
+#include "platform/WorkQueue.h"
 #include "platform/linux/journal/JournalTicket.h"
 
 namespace vx::lnx {
@@ -58,6 +59,20 @@ class CauseScope {
   const uint8_t depth_;
   uint32_t taken_ = 0;
   CauseScope* const outer_;
+};
+
+// A cause outside of the queues. Each by one thread at a time.
+class HeldCause final : public WorkCause {
+ public:
+  explicit HeldCause(Cause cause) : cause_(std::move(cause)) {}
+  ~HeldCause() override { cause_.ticket.abandon(); }
+  void run(const Work& work) override;
+  const Cause& cause() const { return cause_; }
+  // The work has been recorded anew: it waits for that record from here on.
+  void moveTo(JournalTicket ticket) { cause_.ticket = std::move(ticket); }
+
+ private:
+  Cause cause_;
 };
 
 // While one lives, the calling thread works because of no call: what is queued for the service's

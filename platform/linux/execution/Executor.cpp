@@ -26,6 +26,15 @@ std::shared_ptr<WorkQueue> Executor::makeSerial(std::string_view label, QualityO
   return std::make_shared<SerialQueue>(lane(quality), label);
 }
 
+std::unique_ptr<WorkCause> Executor::takeCause() {
+  return std::make_unique<HeldCause>(Cause::take());
+}
+
+void Executor::withoutCause(const Work& work) {
+  const NoCause own;
+  work();
+}
+
 void Executor::setInteractiveWaker(Function<void()> wake) {
   interactive_->setWaker(std::move(wake));
 }

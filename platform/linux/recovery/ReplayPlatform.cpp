@@ -32,8 +32,8 @@ class RecordedClock final : public Clock {
     const JournalTicket* const call = currentCall();
     if (call == nullptr) return live_.now();
     // To the microsecond: that much of a second such a number has.
-    return Date(std::chrono::round<std::chrono::microseconds>(
-        std::chrono::duration<double>(call->time())));
+    return Date(
+        std::chrono::round<std::chrono::microseconds>(std::chrono::duration<double>(call->time())));
   }
   Monotonic monotonic() override { return live_.monotonic(); }
   std::string formatLocal(Date date, const char* format) override {
@@ -110,6 +110,10 @@ class ReplayQueues final : public WorkQueues {
     return live_.makeSerial(label, QualityOfService::UserInteractive);
   }
   WorkQueue& background() override { return background_; }
+  std::unique_ptr<WorkCause> takeCause() override {
+    return isWritten() ? nullptr : live_.takeCause();
+  }
+  void withoutCause(const Work& work) override { live_.withoutCause(work); }
   void beginBlocking() override { live_.beginBlocking(); }
   void endBlocking() override { live_.endBlocking(); }
 

@@ -1,0 +1,128 @@
+#include "Statistics/Service/VXReportingDelayedMessages.h"
+
+#include <algorithm>
+#include <limits>
+
+#include "Statistics/Service/VXReportingSession.h"
+#include "platform/Platform.h"
+
+namespace vx {
+
+namespace {
+
+constexpr std::chrono::seconds kLongest{60};  // whatever the wall clock does
+constexpr std::string_view kCategory = "category";
+constexpr std::string_view kType = "type";
+constexpr std::string_view kServiceType = "service type";
+constexpr std::string_view kDue = "due";
+
+double since1970(Date date) {
+  return std::chrono::duration<double>(date.time_since_epoch()).count();
+}
+
+// None further off than any clock shows: a number of seconds may be anything.
+Date dateOf(double seconds) {
+  constexpr double kMost = 6e9;
+  return Date(std::chrono::round<std::chrono::microseconds>(
+      std::chrono::duration<double>(std::clamp(seconds, 0.0, kMost))));
+}
+
+template <class Number>
+bool readNumber(const Payload& from, std::string_view key, Number& number) {
+  const std::optional<Value> value = from.find(key);
+  if (!value || value->kind() != ValueKind::Integer) return false;
+  const int64_t wide = value->asInt64();
+  if (wide < 0 || wide > std::numeric_limits<Number>::max()) return false;
+  number = static_cast<Number>(wide);
+  return true;
+}
+
+}  // namespace
+
+void VXReportingDelayedMessages::add(VXReportingDelayedMessage message) {
+  std::unique_ptr<WorkCause> cause = platform().workQueues.takeCause();
+  if (cause == nullptr) return;  // it went out before
+  message.message = PayloadBuilder(message.message).build();
+  add(std::move(message), std::move(cause));
+}
+
+void VXReportingDelayedMessages::add(VXReportingDelayedMessage message,
+                                     std::unique_ptr<WorkCause> cause) {
+  // The time of the service, which is not that of the call when it is run again.
+  platform().workQueues.withoutCause([&] {
+    Clock& clock = platform().clock;
+    const Monotonic now = clock.monotonic();
+    const Monotonic due =
+        now + std::clamp<std::chrono::nanoseconds>(message.due - clock.now(), {}, kLongest);
+    Monotonic overdue = Monotonic::min();
+    {
+      MutexLock lock(mutex_);
+      bytes_ += message.message.encoded().size();
+      waiting_.emplace(Key{due, next_++}, Waiting{std::move(message), std::move(cause)});
+      if (isTooMuch()) overdue = waiting_.begin()->first.first;
+    }
+    wakeAfter(due - now, due);
+    if (overdue > now) wakeAfter({}, overdue);
+  });
+}
+
+// Wake-ups are not taken back: one that finds nothing due has cost next to nothing.
+void VXReportingDelayedMessages::wakeAfter(std::chrono::nanoseconds delay, Monotonic until) {
+  platform().workQueues.background().asyncAfter(delay, [weak = weak_from_this(), until] {
+    if (const auto self = weak.lock()) self->sendDue(until);
+  });
+}
+
+void VXReportingDelayedMessages::sendAllNow() { sendDue(Monotonic::max()); }
+
+void VXReportingDelayedMessages::sendDue(Monotonic until) {
+  for (;;) {
+    Waiting next;
+    {
+      MutexLock lock(mutex_);
+      if (waiting_.empty() || waiting_.begin()->first.first > until) return;
+      next = std::move(waiting_.begin()->second);
+      waiting_.erase(waiting_.begin());
+      bytes_ -= next.message.message.encoded().size();
+    }
+    const VXReportingDelayedMessage& message = next.message;
+    next.cause->run([&message] {
+      VXReportingSession::sendSingleMessageNow(message.message, message.category, message.type,
+                                               message.serviceType, message.reply);
+    });
+  }
+}
+
+void VXReportingDelayedMessages::forEach(
+    const Function<void(const VXReportingDelayedMessage&, WorkCause&)>& visit) const {
+  MutexLock lock(mutex_);
+  for (const auto& [key, waiting] : waiting_) visit(waiting.message, *waiting.cause);
+}
+
+std::size_t VXReportingDelayedMessages::size() const {
+  MutexLock lock(mutex_);
+  return waiting_.size();
+}
+
+Payload VXReportingDelayedMessages::facts(const VXReportingDelayedMessage& message) {
+  return PayloadBuilder()
+      .set(kCategory, message.category)
+      .set(kType, message.type)
+      .set(kServiceType, message.serviceType)
+      .set(kDue, PayloadDate{since1970(message.due)})
+      .build();
+}
+
+std::optional<VXReportingDelayedMessage> VXReportingDelayedMessages::fromFacts(const Payload& facts,
+                                                                               Payload message) {
+  const std::optional<Value> due = facts.find(kDue);
+  VXReportingDelayedMessage read;
+  if (!due || due->kind() != ValueKind::Date || !readNumber(facts, kCategory, read.category) ||
+      !readNumber(facts, kType, read.type) || !readNumber(facts, kServiceType, read.serviceType))
+    return std::nullopt;
+  read.message = std::move(message);
+  read.due = dateOf(due->asDouble());
+  return read;
+}
+
+}  // namespace vx
