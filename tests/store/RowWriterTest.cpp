@@ -1,3 +1,4 @@
+#include <limits>
 #include <stdexcept>
 
 #include "platform/linux/store/EventPairing.h"
@@ -7,6 +8,7 @@
 namespace vx::lnx {
 namespace {
 
+// With the pairing before it, as the store's writer has it.
 class RowWriterTest : public StoreTest {
  protected:
   static constexpr std::size_t kMostText = 100;
@@ -14,9 +16,12 @@ class RowWriterTest : public StoreTest {
   void add(StoreRecord::What what, double time = 1.5) { batch.push_back({time, std::move(what)}); }
   // Writes what was added and begins the next batch.
   Status write(const std::vector<LedgerNote>& notes = {}) {
-    EventPairing().pair(batch);
+    pairing.join(batch);
+    pairing.pair(batch);
+    pairing.hold(batch, holdFrom, p.clock.monotonic());
     const Result<RowWriter::Written> result = writer.write(batch, 0, batch.size(), notes);
     if (!result.ok()) return result.status();
+    EXPECT_EQ(EventPairing::unwrittenRows(batch, 0), result->rows + result->failedBuilders);
     written = *result;
     batch.clear();
     return {};
@@ -28,6 +33,8 @@ class RowWriterTest : public StoreTest {
   }
 
   Database database = openStoreDatabase(":memory:").database;
+  EventPairing pairing;
+  double holdFrom = std::numeric_limits<double>::max();
   RowWriter writer{database.get(), kMostText, p.clock};
   StoreRecords batch;
   RowWriter::Written written;
@@ -40,32 +47,31 @@ TEST_F(RowWriterTest, EveryColumnIsWhatWasGivenAndOfItsKind) {
   add(RelayMessageRecord{row, PayloadBuilder().set("x", 0.5).set("t", true).build(), 65535, 65534},
       2.5);
   add(event("name", numbered(1)), 3);
+  add(AnalyticsRecord{"bad", Payload(), []() -> Payload { throw std::runtime_error("no"); }});
   add(PowerRecord{28, "Lumo_Haptics", numbered(2)}, 4);
   EXPECT_TRUE(write({{"what", "", 0, "why"}, {"what", "t", 3, "why"}}).ok());
   EXPECT_EQ(written.rows, 5u);
-  EXPECT_THAT(query("SELECT * FROM relay_sessions"),
-              ElementsAre("1|1.5|-1|null|null|||null|null|{}",
-                          "2|2.0|1099511627776|19|2.5|c|s|1|0|{\"clientName\":\"c\","
-                          "\"serviceName\":\"s\"}"));
-  EXPECT_THAT(query("SELECT * FROM relay_messages"),
-              ElementsAre("1|2.5|2|65535|65534|{\"x\":0.5,\"t\":true}"));
-  EXPECT_THAT(query("SELECT * FROM analytics_events"), ElementsAre("1|3.0|name|{\"i\":1}"));
-  EXPECT_THAT(query("SELECT * FROM power_records"), ElementsAre("1|4.0|28|Lumo_Haptics|{\"i\":2}"));
-  EXPECT_THAT(query("SELECT id, time = 1576800000, event, table_name, rows, detail "
-                    "FROM store_ledger"),
-              ElementsAre("1|1|what|null|0|why", "2|1|what|t|3|why"));
-  EXPECT_THAT(query("SELECT typeof(client_version), typeof(batch_event), typeof(service_name), "
-                    "typeof(user_info) FROM relay_sessions WHERE id = 2"),
-              ElementsAre("real|integer|text|text"));
-  EXPECT_THAT(query("SELECT typeof(category), typeof(type), typeof(payload) FROM relay_messages"),
-              ElementsAre("integer|integer|text"));
+  EXPECT_EQ(written.failedBuilders, 1u);
+  EXPECT_THAT(
+      query("SELECT * FROM relay_sessions; SELECT * FROM relay_messages;"
+            "SELECT * FROM analytics_events; SELECT * FROM power_records;"
+            "SELECT id, time = 1576800000, event, table_name, rows, detail FROM store_ledger;"
+            "SELECT typeof(client_version), typeof(batch_event), typeof(service_name),"
+            " typeof(user_info) FROM relay_sessions WHERE id = 2;"
+            "SELECT typeof(category), typeof(type), typeof(payload) FROM relay_messages"),
+      ElementsAre("1|1.5|-1|null|null|||null|null|{}",
+                  "2|2.0|1099511627776|19|2.5|c|s|1|0|{\"clientName\":\"c\",\"serviceName\":\"s\"}",
+                  "1|2.5|2|65535|65534|{\"x\":0.5,\"t\":true}", "1|3.0|name|{\"i\":1}",
+                  "1|4.0|28|Lumo_Haptics|{\"i\":2}", "1|1|what|null|0|why", "2|1|what|t|3|why",
+                  "real|integer|text|text", "integer|integer|text"));
 }
 
-TEST_F(RowWriterTest, EventsShareTheTextOfTheirMessages) {
+TEST_F(RowWriterTest, EventsShareTheTextOfTheirMessagesInTheirOrder) {
   const Payload own = PayloadBuilder().set("app", "client's").set("i", 5).build();
-  const Payload messages[] = {numbered(1), numbered(2), numbered(3), Payload(), own};
+  const Payload messages[] = {numbered(1), numbered(1), numbered(3), Payload(), own};  // 1 twice
   add(event("before", tagged(messages[0]), messages[0]));
   for (const Payload& each : messages) add(message(each));
+  add(message(messages[1]));  // to a second session
   add(event("after", tagged(messages[1]), messages[1]));
   add(event("again", tagged(messages[1]), messages[1]));
   add(event("same", messages[2], messages[2]));
@@ -73,15 +79,50 @@ TEST_F(RowWriterTest, EventsShareTheTextOfTheirMessages) {
   add(event("replaced", tagged(own), own));
   add(event("alone", tagged(numbered(6)), numbered(6)));
   EXPECT_TRUE(write().ok());
-  EXPECT_EQ(written.rows, 12u);
+  EXPECT_EQ(written.rows, 13u);
   EXPECT_THAT(
-      query("SELECT name, payload FROM analytics_events ORDER BY name"),
-      ElementsAre("after|{\"i\":2,\"app\":\"x\\\"y\"}", "again|{\"i\":2,\"app\":\"x\\\"y\"}",
-                  "alone|{\"i\":6,\"app\":\"x\\\"y\"}", "before|{\"i\":1,\"app\":\"x\\\"y\"}",
-                  "empty|{\"app\":\"x\\\"y\"}", "replaced|{\"app\":\"x\\\"y\",\"i\":5}",
-                  "same|{\"i\":3}"));
-  EXPECT_THAT(query("SELECT message FROM analytics_entries WHERE message IS NOT NULL ORDER BY id"),
-              ElementsAre("1", "2", "2", "3"));
+      query("SELECT e.name, n.message, e.payload FROM analytics_events e"
+            " JOIN analytics_entries n USING (id) ORDER BY id"),
+      ElementsAre("before|1|{\"i\":1,\"app\":\"x\\\"y\"}", "after|2|{\"i\":1,\"app\":\"x\\\"y\"}",
+                  "again|2|{\"i\":1,\"app\":\"x\\\"y\"}", "same|3|{\"i\":3}",
+                  "replaced|null|{\"app\":\"x\\\"y\",\"i\":5}", "empty|null|{\"app\":\"x\\\"y\"}",
+                  "alone|null|{\"i\":6,\"app\":\"x\\\"y\"}"));
+  std::vector<Payload> many;
+  for (int i = 0; i < 700; ++i) many.push_back(numbered(i));
+  for (const Payload& each : many) add(message(each));
+  for (const Payload& each : many) add(event("many", each, each));
+  EXPECT_TRUE(write().ok());
+  EXPECT_THAT(query("SELECT count(*) FROM analytics_entries WHERE message > 6"),
+              ElementsAre("700"));
+}
+
+TEST_F(RowWriterTest, YoungEventWaitsOneBatchForItsMessage) {
+  const Payload late = numbered(1);
+  const Payload never = numbered(2);
+  holdFrom = 10;
+  add(event("old", late, late), 9.9);
+  add(event("late", late, late), 10);
+  add(event("never", never, never), 11);
+  add(event("nobody's", numbered(3)), 11);
+  EXPECT_TRUE(write().ok());
+  EXPECT_EQ(written.rows, 2u);
+  EXPECT_EQ(pairing.heldSince(), p.clock.monotonic());
+  add(message(late));
+  EXPECT_TRUE(write().ok());
+  EXPECT_EQ(pairing.heldSince(), std::nullopt);  // not twice
+  EXPECT_THAT(query("SELECT message FROM analytics_entries ORDER BY id"),
+              ElementsAre("null", "null", "1", "null"));
+}
+
+TEST_F(RowWriterTest, WhatIsWrittenIsNeitherLostNorKept) {
+  const Payload a = numbered(1);
+  for (const Payload& each : {a, numbered(2)}) add(message(each));
+  add(event("e", a, a));
+  pairing.pair(batch);
+  EventPairing::markWritten(batch, 0, 1);
+  EXPECT_EQ(EventPairing::unwrittenRows(batch, 1), 1u);
+  EXPECT_EQ(std::get<RelayMessageRecord>(batch[0].what).payload.identity(), nullptr);
+  EXPECT_NE(std::get<RelayMessageRecord>(batch[1].what).payload.identity(), nullptr);
 }
 
 TEST_F(RowWriterTest, EventNamesAreKeptOnce) {
@@ -131,14 +172,6 @@ TEST_F(RowWriterTest, PayloadTooLargeIsLeftOutWithALedgerRow) {
               ElementsAre("left_out|relay_messages|1|a payload of 101 bytes",
                           "left_out|analytics_events|1|a payload of 101 bytes",
                           "left_out|power_records|1|a payload of 101 bytes"));
-}
-
-TEST_F(RowWriterTest, EventWhoseBuilderFailsIsLeftOut) {
-  add(AnalyticsRecord{"bad", Payload(), []() -> Payload { throw std::runtime_error("no"); }});
-  add(power(1));
-  EXPECT_TRUE(write().ok());
-  EXPECT_EQ(written.rows, 1u);
-  EXPECT_EQ(written.failedBuilders, 1u);
 }
 
 }  // namespace
