@@ -9,7 +9,6 @@ constexpr double kDay = 86400;
 
 class RetentionTest : public StoreTest {
  protected:
-  RetentionTest() { options.maxAgeDays = 0; }
   Rows query(const std::string& sql) { return StoreTest::query(database.get(), sql); }
   // `count` rows, a second apart.
   void addPower(int count, double time, std::size_t bytes = 10) {
@@ -23,73 +22,67 @@ class RetentionTest : public StoreTest {
   void addSession(int count, double time, std::size_t bytes = 10) {
     const std::string at = std::to_string(time);
     query("INSERT INTO relay_sessions(time, session_id, user_info) VALUES(" + at + ", 1, '{}')");
-    const std::string session = query("SELECT max(id) FROM relay_sessions").at(0);
     for (int i = 0; i < count; ++i) {
-      query("INSERT INTO relay_messages(time, relay_session, category, type, payload) VALUES(" +
-            at + ", " + session + ", 1, 1, printf('%*c', " + std::to_string(bytes) + ", 'x'));" +
+      query("INSERT INTO relay_messages(time, relay_session, category, type, payload) SELECT " +
+            at + ", max(id), 1, 1, printf('%*c', " + std::to_string(bytes) +
+            ", 'x') FROM relay_sessions;" +
             "INSERT INTO analytics_entries(time, name, message, payload) VALUES(" + at +
             ", 1, last_insert_rowid(), '}')");
     }
   }
-  Rows apply() {
+  static Rows apply(Retention& retention) {
     Rows notes;
-    for (const LedgerNote& note : retention().apply())
+    for (const LedgerNote& note : retention.apply())
       notes.push_back(note.event + " " + note.table + " " + std::to_string(note.rows));
     return notes;
   }
-  Retention& retention() {
-    if (!made) made.emplace(database.get(), options, p.clock);
-    return *made;
-  }
   Database database = openStoreDatabase(":memory:").database;
-  StoreOptions options;
-  std::optional<Retention> made;
 };
 
 TEST_F(RetentionTest, RowsOlderThanTheDaysGoEveryTenMinutesAndTheirSharersWithThem) {
-  options.maxAgeDays = 2;
+  Retention retention(database.get(), {.maxAgeDays = 2, .commit = {}}, p.clock);
   addPower(1, kNow - 2 * kDay - 1);
   addPower(1, kNow - 2 * kDay);
   addSession(2, kNow - 3 * kDay);
   addSession(1, kNow - kDay);
-  EXPECT_THAT(apply(),
+  EXPECT_THAT(apply(retention),
               ElementsAre("removed_for_age relay_messages 2", "removed_for_age analytics_events 2",
                           "removed_for_age power_records 1", "removed_for_age relay_sessions 1"));
   EXPECT_THAT(query("SELECT id FROM analytics_entries; SELECT id FROM power_records"),
               ElementsAre("3", "2"));
   p.clock.advance(10min - 1s);
-  EXPECT_THAT(apply(), IsEmpty());
+  EXPECT_THAT(apply(retention), IsEmpty());
   p.clock.advance(1s);
-  EXPECT_THAT(apply(), ElementsAre("removed_for_age power_records 1"));
-  options.maxAgeDays = 0;  // no limit
-  made.reset();
+  EXPECT_THAT(apply(retention), ElementsAre("removed_for_age power_records 1"));
+  Retention unlimited(database.get(), {.maxAgeDays = 0, .commit = {}}, p.clock);
   addPower(2, 0);
-  EXPECT_THAT(apply(), IsEmpty());
+  EXPECT_THAT(apply(unlimited), IsEmpty());
 }
 
 TEST_F(RetentionTest, PassesComeEverySoManyBatchesAndRemoveAtMostSoManyRows) {
-  options.maxAgeDays = 1;
+  Retention retention(database.get(), {.maxAgeDays = 1, .commit = {}}, p.clock);
   addPower(33000, 0);
   for (std::size_t i = 1; i < Retention::kBatchesPerPass; ++i)
-    ASSERT_THAT(retention().onBatchWritten().size(), 0u);
-  EXPECT_EQ(retention().onBatchWritten().at(0).rows, 32000);
+    ASSERT_THAT(retention.onBatchWritten().size(), 0u);
+  EXPECT_EQ(retention.onBatchWritten().at(0).rows, 32000);
   p.clock.advance(10min);
-  EXPECT_THAT(apply(), ElementsAre("removed_for_age power_records 1000"));
+  EXPECT_THAT(apply(retention), ElementsAre("removed_for_age power_records 1000"));
 }
 
 TEST_F(RetentionTest, OldestGoFirstUntilTheSizeFits) {
-  options.maxBytes = 1 << 20;
+  Retention retention(database.get(), {.maxBytes = 1 << 20, .maxAgeDays = 0, .commit = {}},
+                      p.clock);
   addPower(3000, kNow, 200);
   addSession(1200, kNow - 1, 1000);  // older, written later
   addSession(500, kNow + kDay);
-  EXPECT_THAT(apply(), ElementsAre("removed_for_size relay_messages 1000",
-                                   "removed_for_size analytics_events 1000"));
+  EXPECT_THAT(apply(retention), ElementsAre("removed_for_size relay_messages 1000",
+                                            "removed_for_size analytics_events 1000"));
   EXPECT_THAT(query("SELECT count(*) FROM power_records; SELECT min(id) FROM relay_messages;"
                     "SELECT count(*) FROM relay_sessions;"
                     "SELECT count(*) FROM analytics_events WHERE payload IS NULL"),
               ElementsAre("3000", "1001", "2", "0"));
   addPower(3000, kNow, 200);
-  const Rows more = apply();
+  const Rows more = apply(retention);
   ASSERT_EQ(more.size(), 4u);
   EXPECT_EQ(more[0], "removed_for_size relay_messages 500");
   EXPECT_EQ(more[3], "removed_for_size relay_sessions 1");

@@ -7,31 +7,24 @@ namespace {
 class StoreQueueTest : public StoreTest {
  protected:
   static constexpr std::size_t kRecord = sizeof(StoreRecord);
-  StoreQueueTest() {
-    options.commit = {.rows = 3, .bytes = 1000000, .interval = 200ms};
-    options.queueBytes = 20 * kRecord;
-    p.clock.steady = Monotonic(1s);  // past for the machine: nothing really waits
-  }
-  bool append(std::size_t bytes = 0) { return queue().append({1.0, power(1)}, bytes); }
+  StoreQueueTest() { p.clock.steady = Monotonic(1s); }  // past for the machine: nothing waits
+  bool append(std::size_t bytes = 0) { return queue.append({1.0, power(1)}, bytes); }
   // What the writer's next turn is; of a batch, how many records it has.
   std::string take() {
-    const StoreQueue::Turn turn = queue().tryTake(batch, heldSince);
+    const StoreQueue::Turn turn = queue.tryTake(batch, heldSince);
     if (turn == StoreQueue::Turn::Batch)
       return std::to_string(batch.records.size()) + (batch.urgent ? " urgent" : "");
     return turn == StoreQueue::Turn::Jobs ? "jobs" : turn == StoreQueue::Turn::End ? "end" : "";
   }
   bool flush() {
     FlushHandler handler = [](const std::optional<Error>&) {};
-    const bool taken = queue().appendFlush(handler);
+    const bool taken = queue.appendFlush(handler);
     EXPECT_EQ(static_cast<bool>(handler), !taken);
     return taken;
   }
-  StoreQueue& queue() {
-    if (!made) made.emplace(options, p.clock);
-    return *made;
-  }
-  StoreOptions options;
-  std::optional<StoreQueue> made;
+  StoreQueue queue{
+      {.queueBytes = 20 * kRecord, .commit = {.rows = 3, .bytes = 1000000, .interval = 200ms}},
+      p.clock};
   std::optional<Monotonic> heldSince;
   StoreBatch batch;
 };
@@ -79,7 +72,7 @@ TEST_F(StoreQueueTest, HeldEventsAreDueWhenTheyWouldBeInTheQueue) {
   p.clock.advance(1ms);
   EXPECT_EQ(take(), "1");
   append();
-  queue().close({});
+  queue.close({});
   EXPECT_FALSE(append());
   EXPECT_FALSE(flush());
   EXPECT_EQ(take(), "1 urgent");
@@ -90,15 +83,15 @@ TEST_F(StoreQueueTest, HeldEventsAreDueWhenTheyWouldBeInTheQueue) {
 
 TEST_F(StoreQueueTest, CongestedAboveTheBoundUntilHalfIsReleased) {
   append(19 * kRecord);
-  EXPECT_FALSE(queue().isCongested());
+  EXPECT_FALSE(queue.isCongested());
   take();
   append(0);
-  EXPECT_TRUE(queue().isCongested());
-  EXPECT_FALSE(queue().release(11 * kRecord - 1));
-  EXPECT_TRUE(queue().isCongested());
-  EXPECT_TRUE(queue().release(1));
-  EXPECT_FALSE(queue().isCongested());
-  EXPECT_FALSE(queue().release(kRecord));
+  EXPECT_TRUE(queue.isCongested());
+  EXPECT_FALSE(queue.release(11 * kRecord - 1));
+  EXPECT_TRUE(queue.isCongested());
+  EXPECT_TRUE(queue.release(1));
+  EXPECT_FALSE(queue.isCongested());
+  EXPECT_FALSE(queue.release(kRecord));
 }
 
 TEST_F(StoreQueueTest, JobsComeFirstAndRetriesEndWithTheDeadlineOfTheClose) {
@@ -106,18 +99,18 @@ TEST_F(StoreQueueTest, JobsComeFirstAndRetriesEndWithTheDeadlineOfTheClose) {
   append();
   flush();
   int ran = 0;
-  queue().runSoon([&] { ++ran; });
-  EXPECT_EQ(queue().waitBeforeRetry(now + 1h), StoreQueue::Retry::JobsFirst);
+  queue.runSoon([&] { ++ran; });
+  EXPECT_EQ(queue.waitBeforeRetry(now + 1h), StoreQueue::Retry::JobsFirst);
   EXPECT_EQ(take(), "jobs");
-  for (const auto& job : queue().takeJobs()) job();
+  for (const auto& job : queue.takeJobs()) job();
   EXPECT_EQ(ran, 1);
   EXPECT_EQ(take(), "1 urgent");
-  EXPECT_EQ(queue().waitBeforeRetry(now), StoreQueue::Retry::Now);
-  queue().close(now + 1s);
-  queue().close(now + 2s);  // the first one counts
-  EXPECT_EQ(queue().waitBeforeRetry(now + 1h), StoreQueue::Retry::Now);
+  EXPECT_EQ(queue.waitBeforeRetry(now), StoreQueue::Retry::Now);
+  queue.close(now + 1s);
+  queue.close(now + 2s);  // the first one counts
+  EXPECT_EQ(queue.waitBeforeRetry(now + 1h), StoreQueue::Retry::Now);
   p.clock.advance(1s);
-  EXPECT_EQ(queue().waitBeforeRetry(now + 1h), StoreQueue::Retry::NoMore);
+  EXPECT_EQ(queue.waitBeforeRetry(now + 1h), StoreQueue::Retry::NoMore);
 }
 
 }  // namespace

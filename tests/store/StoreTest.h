@@ -10,6 +10,7 @@
 #include "platform/linux/store/StoreFile.h"
 #include "platform/linux/store/StoreRecord.h"
 #include "tests/linux/FolderTest.h"
+#include "tests/propertylist/Dictionary.h"
 
 namespace vx::lnx {
 
@@ -40,7 +41,7 @@ class StoreTest : public FolderTest {
     return query(opened, sql);
   }
 
-  static Payload numbered(int i) { return PayloadBuilder().set("i", i).build(); }
+  static Payload numbered(int i) { return dictionary("i", i); }
   // The payload with one entry more, as its event has it.
   static Payload tagged(const Payload& payload) {
     return PayloadBuilder(payload).set("app", "x\"y").build();
@@ -53,10 +54,7 @@ class StoreTest : public FolderTest {
             {kVyrReportingSessionInfoContainsRealtimeEvents, false}};
   }
   static Payload userInfo() {
-    return PayloadBuilder()
-        .set(kVyrReportingUserInfoClientName, "c")
-        .set(kVyrReportingUserInfoServiceName, "s")
-        .build();
+    return dictionary(kVyrReportingUserInfoClientName, "c", kVyrReportingUserInfoServiceName, "s");
   }
   static RelayOpenRecord opening(std::shared_ptr<RelayRow> of, VyrSessionInfo info,
                                  Payload user = userInfo()) {
