@@ -271,6 +271,10 @@ class RunningPlatform final : public LinuxPlatform {
       VX_LOG(nullptr, Info, "the runtime folder is not a tmpfs: each call costs writes to a disk");
   }
 
+  void watch(int fd, EventLoop::Source& source) {
+    const Status added = loop_.add(fd, EPOLLIN, source);
+    if (!added.ok()) VX_LOG(nullptr, Error, "%s", added.text().c_str());
+  }
   // Those that the configuration names, in its order.
   std::vector<RelayBackend*> backends() {
     std::vector<RelayBackend*> named;
@@ -304,7 +308,7 @@ class RunningPlatform final : public LinuxPlatform {
     for (const int number : {SIGTERM, SIGINT, SIGUSR1}) sigaddset(&signals, number);
     pthread_sigmask(SIG_BLOCK, &signals, nullptr);
     signalFd_.reset(signalfd(-1, &signals, SFD_CLOEXEC | SFD_NONBLOCK));
-    (void)loop_.add(signalFd_.get(), EPOLLIN, signalSource_);
+    watch(signalFd_.get(), signalSource_);
 
     loop_.addPassEndHook([this] { heapPages_.askForNew(); });
     loop_.addPassEndHook([this] { cutJournal(); });
@@ -317,7 +321,7 @@ class RunningPlatform final : public LinuxPlatform {
       });
     }
     watcher_->setBeforeFire([this](std::string_view) { log_.refreshVerbose(); });
-    if (watcher_->fd() >= 0) (void)loop_.add(watcher_->fd(), EPOLLIN, watcherSource_);
+    if (watcher_->fd() >= 0) watch(watcher_->fd(), watcherSource_);
     loop_.addDeadline([this] { return watcher_->nextDue(); }, [this] { watcher_->onDue(); });
 
     uint64_t microseconds = 0;

@@ -26,7 +26,6 @@ class FakeLog final : public ScopedLog {
                                 uint32_t level) override {
     note(registrations, name, " ", code, " ", domain, " ", verboseKey, " ", level,
          enabled ? "" : " off");
-    if (refuseScopes) return nullptr;
     scopes_.emplace_back().name = name;
     return &scopes_.back();
   }
@@ -45,7 +44,6 @@ class FakeLog final : public ScopedLog {
   std::vector<std::string> functions;  // of each line
   std::vector<std::string> registrations;
   bool verbose = false;
-  bool refuseScopes = false;
 
  private:
   struct Scope final : LogScope {
@@ -59,11 +57,8 @@ class FakeVyrReporting final : public VyrReporting {
  public:
   struct Sent {
     uint16_t category;
-    uint16_t type;
     Payload payload;
-  };
-  struct OneOff : Sent {
-    VyrSessionInfo info;
+    VyrSessionInfo info;  // of one-offs
     Payload userInfo;
   };
   class Session final : public VyrReportingSession {
@@ -82,7 +77,7 @@ class FakeVyrReporting final : public VyrReporting {
     bool sendMessageWithCategory(uint16_t category, uint16_t type, const Payload& payload,
                                  std::optional<Error>& error) override {
       if (!owner_.takes("relay ", category, type, error)) return false;
-      owner_.sent.push_back({category, type, payload});
+      owner_.sent.push_back({category, payload, {}, {}});
       return true;
     }
     void flushMessagesWithCompletion(Function<void(std::optional<Error>)> handler) override {
@@ -114,7 +109,7 @@ class FakeVyrReporting final : public VyrReporting {
                                      uint16_t category, uint16_t type, const Payload& payload,
                                      std::optional<Error>& error) override {
     if (!takes("one-off ", category, type, error)) return false;
-    oneOffs.push_back({{category, type, payload}, info, userInfo});
+    oneOffs.push_back({category, payload, info, userInfo});
     return true;
   }
 
@@ -124,7 +119,7 @@ class FakeVyrReporting final : public VyrReporting {
   std::optional<Error> flushError;
   std::vector<std::shared_ptr<Session>> sessions;
   std::vector<Sent> sent;
-  std::vector<OneOff> oneOffs;
+  std::vector<Sent> oneOffs;
   int tokens = 0;
 
  private:
@@ -156,14 +151,12 @@ class FakeServices final : public AnalyticsEventService,
     note(journal_, "event ", name);
     events.push_back({std::string(name), share(std::move(builder))});
   }
-  void logRegisteredEvent(int64_t client, Name name, const Payload& record,
-                          const Payload*) override {
+  void logRegisteredEvent(int64_t, Name name, const Payload& record, const Payload*) override {
     note(journal_, "power ", name);
-    powers.push_back({client, std::string(name), record});
+    powers.push_back({std::string(name), record});
   }
   void emit(uint32_t code, uint64_t, uint64_t, uint64_t, uint64_t) override {
     note(journal_, std::hex, std::uppercase, std::setfill('0'), "trace 0x", std::setw(8), code);
-    traces.push_back(code);
   }
   int32_t ownProcessIdentifier() override { return 1000; }
   std::string ownProcessName() override { return "vxreportingd"; }
@@ -173,22 +166,17 @@ class FakeServices final : public AnalyticsEventService,
   }
   void exit(int status) override { note(journal_, "exit ", status); }
   uint32_t below(uint32_t bound) override { return randomBound = bound, random; }
-  bool boolean(Name name) override {
-    ++internalBuildQuestions;
-    return name == "InternalBuild" && internalBuild;
-  }
+  bool boolean(Name name) override { return name == "InternalBuild" && internalBuild; }
   int32_t integer(Name name, int32_t defaultValue) override {
     return name == "DeviceClassNumber" ? deviceClass : defaultValue;
   }
   std::unique_ptr<PreferencesDomain> open(Name) override {
-    ++preferenceReads;
     return std::make_unique<Domain>(preferences);
   }
-  uint32_t registerHandler(Name name, int& token, std::shared_ptr<WorkQueue> queue,
+  uint32_t registerHandler(Name name, int& token, std::shared_ptr<WorkQueue>,
                            Function<void(int)> handler) override {
     note(journal_, "notify ", name);
     token = kToken;
-    notifyQueue = std::move(queue);
     notifyHandler = share(std::move(handler));
     return notifyStatus;
   }
@@ -216,10 +204,8 @@ class FakeServices final : public AnalyticsEventService,
   }
   std::unique_ptr<AtomicFile> createAtomically(const std::string& directory,
                                                const std::string& name,
-                                               std::optional<Error>& error) override {
-    if (!fileError) return std::make_unique<File>(*this, directory + "/" + name);
-    error = fileError;
-    return nullptr;
+                                               std::optional<Error>&) override {
+    return std::make_unique<File>(*this, directory + "/" + name);
   }
 
   struct Event {
@@ -227,31 +213,25 @@ class FakeServices final : public AnalyticsEventService,
     std::shared_ptr<Function<Payload()>> builder;
   };
   struct Power {
-    int64_t client;
     std::string name;
     Payload record;
   };
   using Texts = std::map<std::string, std::string, std::less<>>;
   std::vector<Event> events;
   std::vector<Power> powers;
-  std::vector<uint32_t> traces;
   std::map<int32_t, std::string> processNames;
   uint32_t random = 0;
   uint32_t randomBound = 0;
   bool internalBuild = false;
-  int internalBuildQuestions = 0;
   int32_t deviceClass = 0;
   Texts preferences;  // "true" and "false" read as booleans too
-  int preferenceReads = 0;
   uint32_t notifyStatus = 0;
-  std::shared_ptr<WorkQueue> notifyQueue;
   std::shared_ptr<Function<void(int)>> notifyHandler;
   static constexpr int kToken = 77;
   std::map<std::string, std::shared_ptr<Handler>> deviceHandlers;
   std::map<std::string, std::shared_ptr<Handler>> interfaceHandlers;
   Texts files;
   std::optional<Error> directoryError;
-  std::optional<Error> fileError;
   std::optional<Error> writeError;  // of the next piece written, and of no other
 
  private:

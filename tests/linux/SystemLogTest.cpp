@@ -51,15 +51,12 @@ class SystemLogTest : public ::testing::Test {
   int ends_[2] = {-1, -1};
 };
 
-TEST_F(SystemLogTest, ClientsTextCannotForgeALineAndIsCutBetweenCharacters) {
+TEST_F(SystemLogTest, ClientsCannotForgeALineAndAReaderThatStoppedCostsLinesAndNoTime) {
   log.write(nullptr, LogLevel::Default, site, "a\n<0>b\x1B[m\tc\xC3\xA9", 0);
   EXPECT_EQ(drain(), "<5>default: a\\n<0>b\\x1B[m\\tc\xC3\xA9\n");
   const std::string kept((16 << 10) - 1, 'x');
   log.write(nullptr, LogLevel::Error, site, kept + "\xC3\xA9" + "tail", 0);
   EXPECT_EQ(drain(), "<3>default: " + kept + "\xE2\x80\xA6\n");
-}
-
-TEST_F(SystemLogTest, AReaderThatStoppedCostsLinesAndNoTime) {
   const std::string text(12288 - 13, 'x');  // a line of whole pages
   for (int i = 0; i < 3; ++i) log.write(nullptr, LogLevel::Info, site, text, 0);
   EXPECT_EQ(log.droppedLines(), 1u);
@@ -72,7 +69,7 @@ TEST_F(SystemLogTest, AReaderThatStoppedCostsLinesAndNoTime) {
   EXPECT_EQ(log.droppedLines(), 2u);
 }
 
-TEST_F(SystemLogTest, LinesOfOneStatementAreLimitedAndCounted) {
+TEST_F(SystemLogTest, LinesOfOneStatementAreLimitedCountedAndAllowedAgainAsSlowlyAsConfigured) {
   limit(3, 0.001);
   EXPECT_EQ(wanted(site, 10), 3);
   const LogSite other{"F.cpp", 8, "f", 0};
@@ -80,10 +77,7 @@ TEST_F(SystemLogTest, LinesOfOneStatementAreLimitedAndCounted) {
   EXPECT_FALSE(log.wantsLine(nullptr, LogLevel::Info, other));
   log.write(nullptr, LogLevel::Error, site, "F.cpp:7:f: text", 10);
   EXPECT_EQ(drain(), "<3>default: F.cpp:7:f: text (7 lines like this were left out)\n");
-}
-
-// The bucket of a statement that wrote its last line some time ago.
-TEST_F(SystemLogTest, AnAllowanceComesBackAsSlowlyAsConfigured) {
+  // The bucket of a statement that wrote its last line some time ago.
   const auto wantedAfter = [&](std::chrono::seconds ago) {
     timespec now{};
     clock_gettime(CLOCK_MONOTONIC, &now);
@@ -96,7 +90,7 @@ TEST_F(SystemLogTest, AnAllowanceComesBackAsSlowlyAsConfigured) {
   EXPECT_EQ(wantedAfter(-20s), 0);  // another thread's clock was ahead
   EXPECT_EQ(wantedAfter(10h), 6);   // no more than the burst
   limit(1 << 16, 0.01);             // one more than there are bits for
-  EXPECT_EQ(wanted(site, 20), 20);
+  EXPECT_EQ(wanted({"F.cpp", 9, "f", 0}, 20), 20);
 }
 
 TEST_F(SystemLogTest, ScopesAreAsVerboseAsTheirKeys) {

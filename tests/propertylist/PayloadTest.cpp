@@ -163,14 +163,15 @@ TEST(Frame, ElementsAreWhereTheyWere) {
   }
 }
 
-TEST(PayloadBuilder, MakesAValidPayloadOfAnything) {
+TEST(PayloadBuilder, MakesAValidPayloadOfAnythingAndJoinsTextsFromPieces) {
   Bytes frame = fromHex("82f601");
   const Value null = (*Frame::decode(frame))[0];
-  const Payload p = dictionary(
-      "bad\xFFkey", "half\xE2\x82", "bad\xFEkey", 1,  // the same key, once it is text
-      "null", null, "list", ArrayBuilder().add("\xC0").add(null), "three", "a\xC3(b\xED\xA0\x80",
-      "long", std::string(70000, 'x'), "256", std::string(256, 'y'), "days",
-      PayloadDate{1795232760}, "never", PayloadDate{std::nan("")});
+  const std::string large(70000, 'x');
+  const Payload p =
+      dictionary("bad\xFFkey", "half\xE2\x82", "bad\xFEkey", 1,  // the same key, once it is text
+                 "null", null, "list", ArrayBuilder().add("\xC0").add(null), "three",
+                 "a\xC3(b\xED\xA0\x80", "long", large, "256", std::string(256, 'y'), "days",
+                 PayloadDate{1795232760}, "never", PayloadDate{std::nan("")});
   ASSERT_TRUE(Payload::decode(p.encoded()).has_value());
   EXPECT_EQ(p.size(), 7u);
   EXPECT_EQ(p.find("never")->text(), "1970-01-01T00:00:00Z");
@@ -178,6 +179,12 @@ TEST(PayloadBuilder, MakesAValidPayloadOfAnything) {
   EXPECT_EQ(p.find("days")->encoded().size(), 6u) << "whole seconds are an integer";
   EXPECT_EQ(p.find("bad\uFFFDkey")->asInt64(), 1);
   EXPECT_EQ(p.find("list")->text(), "(\uFFFD)");
+  const PayloadBuilder::JoinedText texts[] = {
+      {"a b", {"1", ",", "\xC3", "\xBC"}}, {"none", {}}, {"large", {large, ",", large}}};
+  const Payload joined = PayloadBuilder::joined(texts);
+  EXPECT_EQ(joined, dictionary("a b", "1,\u00FC", "none", "", "large", large + "," + large));
+  EXPECT_TRUE(joined.hasSpaceInKeys());
+  EXPECT_TRUE(PayloadBuilder::joined({}).empty());
 }
 
 // Whatever way a number's text is found, it is the one that reads back and that is the shortest.
@@ -215,16 +222,6 @@ TEST(Payload, OneEntryMoreIsWhatTheBuilderMakes) {
       EXPECT_EQ(copy.hasSpaceInKeys(), key[1] == ' ');
     }
   }
-}
-
-TEST(PayloadBuilder, JoinsTextsFromPieces) {
-  const std::string large(70000, 'x');
-  const PayloadBuilder::JoinedText texts[] = {
-      {"a b", {"1", ",", "\xC3", "\xBC"}}, {"none", {}}, {"large", {large, ",", large}}};
-  const Payload joined = PayloadBuilder::joined(texts);
-  EXPECT_EQ(joined, dictionary("a b", "1,\u00FC", "none", "", "large", large + "," + large));
-  EXPECT_TRUE(joined.hasSpaceInKeys());
-  EXPECT_TRUE(PayloadBuilder::joined({}).empty());
 }
 
 TEST(Payload, KnowsWhetherANumberMayNotBeFinite) {

@@ -61,5 +61,38 @@ TEST_F(DriverTest, FailuresOfOneDriverLeaveTheOthersAlone) {
   EXPECT_THAT(p.log.lines, Contains("vxrd error ChannelReportCreateSamplesDelta error 22"));
 }
 
+TEST_F(ServiceTest, StartTakesItsSnapshotAfterStartingAndHoldsTheReply) {
+  drivers.write("Speaker/x", "1");
+  service = VXReportingServiceDelegate::create();
+  auto& client = connect();
+  create(client, 1);
+  bool startedThen = false;
+  drivers.onSample = [&] {
+    p.journal.push_back("sample");
+    startedThen = session(client, 1)->started();
+  };
+  start(client, 1);
+  EXPECT_THAT(gained({"trace", "sample", "reply"}),
+              ElementsAre("trace 0x21042818", "trace 0x2104282C", "sample"));
+  EXPECT_TRUE(startedThen);
+  start(client, 1);
+  EXPECT_THAT(gained({"sample", "reply"}), ElementsAre("reply start true"));
+  drivers.write("Speaker/x", "4");
+  stop(client, 1);
+  EXPECT_THAT(gained({"0x2104281C", "0x21042838", "event com", "fetching", "0x21042830", "reply",
+                      "default stopping"}),
+              ElementsAre("trace 0x2104281C", "trace 0x21042838",
+                          "event com.quorvel.sonik.ChannelReporting.Generic",
+                          "log vxrs default fetching driver logs {Speaker_x=3}", "trace 0x21042830",
+                          "trace 0x21042838", "reply start true", "log vxrs default stopping 1",
+                          "reply stop true"));
+  EXPECT_EQ(session(client, 1)->driverSnapShot(), nullptr);
+  start(client, 1);
+  onQueue([&] { session(client, 1)->stop(); });
+  start(client, 1);
+  EXPECT_THAT(gained({"reply"}), ElementsAre("reply start true")) << "held over another's stop";
+  EXPECT_TRUE(session(client, 1)->hasTransactionCompleteBlock());
+}
+
 }  // namespace
 }  // namespace vx

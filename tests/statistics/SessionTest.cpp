@@ -1,3 +1,5 @@
+#include "Statistics/VXReportingTallyhubBridge.h"
+#include "Statistics/VXReportingWattmarkUtility.h"
 #include "tests/statistics/ServiceFixture.h"
 
 namespace vx {
@@ -75,7 +77,7 @@ TEST_F(SessionTest, ARestartIsAWholeLifeAgain) {
   EXPECT_EQ(s->messageIdForCategory(0xFFFFFFFF, 0xFFFF), "Undefined_Unknown_3");
 }
 
-TEST_F(SessionTest, RelaySessionCarriesWhatTheSetUpTook) {
+TEST_F(SessionTest, RelaySessionCarriesWhatTheSetUpTookAndTestSessionsHaveNone) {
   for (const auto& [type, name] : {std::pair(ServiceType{7}, "longformaudio"), {12, "apiusage"}}) {
     const auto s = make(type);
     s->start();
@@ -98,16 +100,14 @@ TEST_F(SessionTest, RelaySessionCarriesWhatTheSetUpTook) {
     EXPECT_EQ(s->vyrReportingSession(), p.vyr.sessions.back());
   }
   EXPECT_EQ(p.queues.blockingScopes, 2);
-}
-
-TEST_F(SessionTest, TestSessionsNeverTouchTheRelay) {
-  const auto s = make(11);
-  s->start();
-  s->sendMessage(message, 3, 1, nullptr);
-  s->stop();
+  mark();
+  const auto test = startedSession(11);
+  test->sendMessage(message, 3, 1, nullptr);
+  test->stop();
   run();
-  EXPECT_EQ(p.vyr.sessions.size() + static_cast<unsigned>(p.vyr.tokens), 0u);
-  s->sendMessage(message, 3, 1, nullptr);  // not started: alone, like any other
+  EXPECT_THAT(gained({"relay"}), IsEmpty());
+  EXPECT_EQ(p.vyr.tokens, 2);
+  test->sendMessage(message, 3, 1, nullptr);  // not started: alone, like any other
   run();
   EXPECT_EQ(p.vyr.oneOffs.size(), 1u);
 }
@@ -204,12 +204,42 @@ TEST_F(SessionTest, DelayedSinglesGoOutInTheirOrderWhenSomebodyIsInAHurryAndOnce
   EXPECT_EQ(p.vyr.oneOffs.back().payload.find("n")->asInt64(), 1);
 }
 
+TEST_F(SessionTest, PowerRecords) {
+  const auto s = make();
+  s->setConfiguration(dictionary("HostApplicationDisplayID", 7));
+  const struct {
+    Payload sent;
+    const char* record;
+    MessageType type = 6;
+  } cases[] = {{dictionary("EngineOnTime", 0, "Haptic_Active_Hardware_Time_Seconds", 1),
+                "Lumo_Haptics {EngineOnDuration=0,ApplicationName=7}"},
+               {dictionary("Active_Clients", "x", "vxreporting_timestamp", 1,
+                           "Haptic_Active_Hardware_Time_Seconds", 1.5),
+                "LeakedHapticsSessionInfo "
+                "{Haptic_Active_Hardware_Time_Seconds=1.5,Active_Clients=x}"},
+               {dictionary("EngineOnTime", 2), "", 5},
+               {message, ""}};
+  for (const auto& [sent, expected, type] : cases) {
+    p.services.powers.clear();
+    VXReportingWattmarkUtility::handleEvent(&sent, 1, type, s.get());
+    std::string records;
+    for (const auto& power : p.services.powers) records += power.name + " " + power.record.text();
+    EXPECT_EQ(records, expected);
+  }
+  EXPECT_EQ(p.log.lines.back(), "system error failed to get VXReporting timestamp for wattmark");
+  VXReportingWattmarkUtility::handleEvent(nullptr, 1, 6, nullptr);
+  VXReportingTallyhubBridge::handleEvent(nullptr, 0x10000009, 0xFFFF, nullptr);
+  EXPECT_EQ((*p.services.events.back().builder)().text(), "{HostApplicationDisplayID=Unknown}");
+}
+
 class OrientationTest : public SessionTest {
  protected:
   OrientationTest() { p.services.internalBuild = true; }
 };
 
-TEST_F(OrientationTest, HandlersComeAndGoInOrder) {
+TEST_F(OrientationTest, HandlersComeAndGoInOrderWhereAllThreeConditionsHold) {
+  for (const ServiceType type : {ServiceType{2}, ServiceType{8}})
+    EXPECT_EQ(make(type)->shouldReportOrientation(), type == 2);
   const auto s = make(7);
   s->start();
   EXPECT_THAT(gained({"register"}), ElementsAre("register device VXReportingService 42",
@@ -227,13 +257,8 @@ TEST_F(OrientationTest, HandlersComeAndGoInOrder) {
   EXPECT_EQ(gained({"register"}).size(), 2u);
   p.services.deviceHandlers.clear();
   p.services.interfaceHandlers.clear();
-}
-
-TEST_F(OrientationTest, OnlyWhereAllThreeConditionsHold) {
-  for (const ServiceType type : {ServiceType{7}, ServiceType{2}, ServiceType{8}})
-    EXPECT_EQ(make(type)->shouldReportOrientation(), type != 8);
   p.services.deviceClass = 6;
-  EXPECT_FALSE(make(7)->shouldReportOrientation());
+  EXPECT_FALSE(s->shouldReportOrientation());
 }
 
 TEST_F(OrientationTest, ChangesAreStampedToTheMillisecondInTheFlatAggregateOnly) {

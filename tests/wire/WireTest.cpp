@@ -43,24 +43,14 @@ std::vector<Bytes> readAll(std::span<const uint8_t> stream, std::size_t cut, int
 }
 
 TEST(FrameReader, FramesComeWholeWhereverTheStreamIsCut) {
-  const Bytes large(200000, 7);
-  std::vector<Bytes> many;
-  for (uint8_t i = 0; i < 250; ++i) many.emplace_back(2000, i);
-  const struct {
-    std::vector<Bytes> bodies;
-    std::size_t cuts;
-  } cases[] = {{{Bytes(3, 1), {}, Bytes(300, 2), {3}}, 320},
-               {{Bytes(5, 1), large, Bytes(6, 2), large}, 1},
-               {many, 1}};
-  for (const auto& c : cases) {
-    Bytes stream;
-    for (const Bytes& body : c.bodies) stream = stream + framed(body);
-    for (std::size_t cut = 0; cut < c.cuts; ++cut)
-      for (const int most : {1, 3, 1000})
-        for (const bool shared : {false, true})
-          EXPECT_TRUE(readAll(stream, cut, most, shared) == c.bodies)
-              << cut << " " << most << " " << shared;
-  }
+  std::vector<Bytes> bodies{Bytes(3, 1), {}, Bytes(300, 2), {3}, Bytes(200000, 7), Bytes(6, 2)};
+  for (uint8_t i = 0; i < 250; ++i) bodies.emplace_back(500, i);
+  Bytes stream;
+  for (const Bytes& body : bodies) stream = stream + framed(body);
+  for (std::size_t cut = 0; cut < 320; cut += cut < 20 ? 1 : 3)
+    for (const int most : {1, 3, 1000})
+      for (const bool shared : {false, true})
+        EXPECT_TRUE(readAll(stream, cut, most, shared) == bodies) << cut << most << shared;
 }
 
 TEST(FrameReader, ALengthAboveTheLimitIsRefusedBeforeTheBodyComes) {

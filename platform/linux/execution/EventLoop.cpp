@@ -20,12 +20,13 @@ EventLoop::EventLoop(Executor& executor, Clock& clock)
   executor_.setInteractiveWaker([this] { wake(); });
 }
 
-bool EventLoop::add(int fd, uint32_t events, Source& source) {
+Status EventLoop::add(int fd, uint32_t events, Source& source) {
   executor_.assertInteractiveThread();
   epoll_event event{};
   event.events = events;
   event.data.ptr = &source;
-  return epoll_ctl(epollFd_.get(), EPOLL_CTL_ADD, fd, &event) == 0;
+  if (epoll_ctl(epollFd_.get(), EPOLL_CTL_ADD, fd, &event) == 0) return {};
+  return Status::lastError("cannot wait for a descriptor");
 }
 
 void EventLoop::modify(int fd, uint32_t events, Source& source) {

@@ -17,6 +17,7 @@
 
 #include "base/Clock.h"
 #include "base/Function.h"
+#include "base/Status.h"
 #include "base/UniqueFd.h"
 #include "platform/linux/execution/Executor.h"
 
@@ -37,9 +38,8 @@ class EventLoop {
   EventLoop(const EventLoop&) = delete;
   EventLoop& operator=(const EventLoop&) = delete;
 
-  // Level-triggered. `source` must stay valid until remove(). False with errno set when the kernel
-  // refuses.
-  [[nodiscard]] bool add(int fd, uint32_t events, Source& source);
+  // Level-triggered. `source` must stay valid until remove(). Fails when the kernel refuses.
+  Status add(int fd, uint32_t events, Source& source);
   void modify(int fd, uint32_t events, Source& source);
   // No call of `source` follows, not even for events of the running pass.
   void remove(int fd, Source& source);

@@ -4,6 +4,7 @@
 
 #include <cerrno>
 
+#include "platform/Log.h"
 #include "platform/linux/ipc/ArgumentReading.h"
 
 namespace vx::lnx {
@@ -50,7 +51,8 @@ void SocketConnection::resume() {
   if (state_ != State::Accepted) return;
   state_ = State::Open;
   interest_ = EPOLLIN;
-  if (!host_.loop().add(socket_.get(), interest_, *this)) {
+  if (const Status added = host_.loop().add(socket_.get(), interest_, *this); !added.ok()) {
+    VX_LOG(nullptr, Error, "a client is turned away: %s", added.text().c_str());
     interest_ = 0;
     async([self = shared_from_this()] { self->finishReading(End::Interrupted); });
   }

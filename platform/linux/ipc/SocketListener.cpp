@@ -234,7 +234,9 @@ void SocketListener::stopListening() {
 
 void SocketListener::resume() {
   executor_.adoptInteractiveThread();
-  listening_ = loop_.add(socket_.get(), EPOLLIN, *this);
+  const Status added = loop_.add(socket_.get(), EPOLLIN, *this);
+  listening_ = added.ok();
+  if (!listening_) VX_LOG(nullptr, Error, "no client can connect: %s", added.text().c_str());
   if (hooks_.listening) hooks_.listening();
   loop_.run();
 

@@ -2,11 +2,14 @@
 
 #include <atomic>
 #include <chrono>
+#include <latch>
+#include <stdexcept>
 #include <thread>
 #include <vector>
 
 #include "platform/linux/execution/Executor.h"
-#include "tests/linux/Latch.h"
+#include "platform/linux/execution/SystemThreading.h"
+#include "tests/fakes/FakePlatform.h"
 
 namespace vx::lnx {
 namespace {
@@ -63,12 +66,12 @@ TEST_F(ExecutorTest, DelayedWorkJoinsInOrderOfItsTimeAndKeepsItsQueue) {
   queue->async([&] { ran.push_back(0); });
   EXPECT_FALSE(queue->isCurrent());
   queue.reset();
-  Latch done;
+  std::latch done(1);
   executor.background().asyncAfter(31ms, [&] {
     EXPECT_TRUE(executor.background().isCurrent());
-    done.open();
+    done.count_down();
   });
-  EXPECT_TRUE(done.wait());
+  done.wait();
   EXPECT_TRUE(executor.drain(soon()));
   EXPECT_EQ(ran, (std::vector<int>{0, 1, 2, 3}));
 }
@@ -95,48 +98,40 @@ TEST_F(ExecutorTest, ManyQueuesKeepTheirOrderAcrossThreads) {
   }
 }
 
-TEST_F(ExecutorTest, BlockedQueuesDelayNobody) {
-  Latch release;
+TEST_F(ExecutorTest, BlockedQueuesDelayNobodyAndLowWaterIsToldWhenTheyGoOn) {
+  std::atomic<int> told{0};
+  executor.setUtilityLowWater(100, [&] { ++told; });
+  std::latch release(1);
   std::atomic<int> done{0};
   std::vector<Queue> queues(200);
   for (Queue& queue : queues) {
     queue = utility();
     queue->async([&] {
       Blocking blocking(executor);
-      if (release.wait()) ++done;
+      release.wait();
+      ++done;
     });
   }
-  Latch served;
+  std::latch served(1);
   const Queue other = utility();
-  other->async([&] { served.open(); });
-  EXPECT_TRUE(served.wait());
-  EXPECT_EQ(done, 0);
-  release.open();
+  other->async([&] { served.count_down(); });
+  served.wait();
+  EXPECT_GE(executor.utilityBacklog(), 200u);
+  EXPECT_EQ(done + told, 0);
+  release.count_down();
   EXPECT_TRUE(executor.drain(soon()));
   EXPECT_EQ(done, 200);
-}
-
-TEST_F(ExecutorTest, LowWaterIsToldWhenABacklogFalls) {
-  std::atomic<int> told{0};
-  executor.setUtilityLowWater(10, [&] { ++told; });
-  const Queue queue = utility();
-  Latch go;
-  queue->async([&] { go.wait(); });
-  for (int i = 0; i < 100; ++i) queue->async([] {});
-  EXPECT_GE(executor.utilityBacklog(), 100u);
-  EXPECT_EQ(told, 0);
-  go.open();
-  EXPECT_TRUE(executor.drain(soon()));
   EXPECT_EQ(told, 1);
 }
 
 TEST_F(ExecutorTest, UndueWorkIsDroppedAtTheEndAndLateWorkAtOnce) {
-  const auto witness = std::make_shared<int>(0);
-  executor.background().asyncAfter(1h, [witness] { ++*witness; });
+  const auto witness = std::make_shared<int>();
+  const auto work = [witness] { FAIL(); };
+  executor.background().asyncAfter(1h, work);
   executor.stop(soon());
-  executor.background().async([witness] { ++*witness; });
-  executor.background().asyncAfter(1h, [witness] { ++*witness; });
-  EXPECT_EQ(witness.use_count(), 1);
+  executor.background().async(work);
+  executor.background().asyncAfter(1h, work);
+  EXPECT_EQ(witness.use_count(), 2);
 }
 
 TEST_F(ExecutorTest, OneBusyQueueLetsTheOthersHaveTheirTurn) {
@@ -160,6 +155,52 @@ TEST_F(ExecutorTest, OneBusyQueueLetsTheOthersHaveTheirTurn) {
   EXPECT_FALSE(executor.runInteractive(2000));
   EXPECT_EQ(ran.size(), 1001u);
   EXPECT_TRUE(std::is_sorted(ran.begin(), ran.end()));
+}
+
+TEST(RunLoopTest, TimersFireInOrderOfTimeAndMoveAndGoFromOtherThreads) {
+  fakes::FakePlatform p;
+  SystemThreading threading(p.queues.background());
+  SystemClock clock;
+  const auto loop = threading.makeRunLoop();
+  std::vector<int> fired;
+  std::latch running(1);
+  const auto far = threading.makeTimer(1h, [&] { fired.push_back(3); });
+  const auto gone = threading.makeTimer(1h, [] { FAIL(); });
+  const auto second = threading.makeTimer(2ms, [&] {
+    fired.push_back(2);
+    running.count_down();
+    throw std::runtime_error("leaves the loop");
+  });
+  const auto first = threading.makeTimer(1ms, [&] { fired.push_back(1); });
+  for (const auto& timer : {far, gone, second, first}) loop->attach(timer);
+  std::thread other([&] {
+    running.wait();
+    gone->invalidate();
+    far->setFireTime(clock.monotonic());
+  });
+  EXPECT_THROW(loop->runUntilEmpty(), std::runtime_error);
+  loop->runUntilEmpty();
+  other.join();
+  EXPECT_EQ(fired, (std::vector<int>{1, 2, 3}));
+}
+
+TEST(FreedMemory, GoesBackInOneStepTwoSecondsAfterAMegabyteWasFreed) {
+  fakes::FakePlatform p;
+  int trims = 0;
+  SystemThreading threading(p.queues.background(), [&] { ++trims; });
+  threading.memoryWasFreed((1 << 20) - 1);
+  EXPECT_FALSE(p.queues.nextDue());
+  for (int i = 0; i < 100; ++i) threading.memoryWasFreed(1 << 20);
+  p.queues.advance(1999ms);
+  EXPECT_EQ(trims, 0);
+  p.queues.advance(1ms);
+  EXPECT_EQ(trims, 1);
+  p.queues.advance(2s);  // for those that came while one was pending
+  EXPECT_EQ(trims, 2);
+  threading.memoryWasFreed(1 << 20);
+  p.queues.advance(2s);
+  EXPECT_EQ(trims, 3);
+  EXPECT_FALSE(p.queues.nextDue());
 }
 
 }  // namespace
