@@ -103,6 +103,10 @@ std::string messageKindName(MessageKind kind, char separator) {
   return name;
 }
 
+std::string messageIdentifier(MessageKind kind, uint64_t count) {
+  return messageKindName(kind, '_') + "_" + std::to_string(count);
+}
+
 void HostApplicationDisplayID::storeUnder(std::string_view key, PayloadBuilder& builder) const {
   if (value_)
     builder.set(key, *value_);

@@ -50,6 +50,8 @@ inline constexpr std::size_t kMessageKinds =
 MessageKind messageKind(MessageCategory category, MessageType type);
 // "<category name><separator><type name>".
 std::string messageKindName(MessageKind kind, char separator);
+// "Session_Setup_Start_1" for the first one.
+std::string messageIdentifier(MessageKind kind, uint64_t count);
 
 // The value under "HostApplicationDisplayID" as it stands, of whatever kind, or the string
 // "Unknown".

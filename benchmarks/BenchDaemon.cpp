@@ -128,6 +128,16 @@ uint64_t BenchDaemon::anonymousBytes() const {
   return statusField("/proc/" + std::to_string(pid_) + "/status", "RssAnon") << 10;
 }
 
+uint64_t BenchDaemon::aggregateBytes() const {
+  uint64_t bytes = 0;
+  std::error_code error;
+  const fs::path folder = fs::path(socketPath_).parent_path() / "journal";
+  for (fs::directory_iterator at(folder, error), end; !error && at != end; at.increment(error)) {
+    if (at->path().filename().string().starts_with("aggregate-")) bytes += at->file_size();
+  }
+  return bytes;
+}
+
 uint64_t BenchDaemon::residentBytes() const {
   return statusField("/proc/" + std::to_string(pid_) + "/status", "VmRSS") << 10;
 }

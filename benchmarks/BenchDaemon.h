@@ -29,6 +29,7 @@ class BenchDaemon {
 
   double cpuSeconds() const;           // all threads, since its start
   uint64_t anonymousBytes() const;     // RssAnon
+  uint64_t aggregateBytes() const;     // what sessions received: shared memory
   uint64_t residentBytes() const;      // VmRSS
   uint64_t voluntarySwitches() const;  // all threads
   // Until it has used no more than a few hundred microseconds of CPU for a while.

@@ -3,6 +3,7 @@
 #pragma once
 
 #include "base/Clock.h"
+#include "platform/AggregateMemory.h"
 #include "platform/ChannelReportService.h"
 #include "platform/DevicePropertyQuery.h"
 #include "platform/DiagnosticFiles.h"
@@ -40,6 +41,7 @@ struct Platform {
   TracePoint& trace;
   DiagnosticFiles& diagnosticFiles;
   RecordedInputs& inputs;
+  AggregateMemory& aggregates;
 };
 
 // The installed one. Asking before installPlatform is a programming error.

@@ -343,6 +343,20 @@ void appendPrettyJson(std::string& out, const Value& value, int indent) {
       .item(value.encoded().data());
 }
 
+void appendPrettyEntries(std::string& out, std::span<const std::string> openings,
+                         std::span<const Value> values, int indent) {
+  std::size_t expected = 64;
+  for (const std::string& opening : openings) expected += opening.size() + 8;
+  for (const Value& value : values) expected += 3 * value.encoded().size();
+  Sink sink(out, expected);
+  Emitter emitter(sink, NonFinite::Refuse, Emitter::Layout::Pretty,
+                  static_cast<std::size_t>(std::max(indent, 0)));
+  for (std::size_t i = 0; i < values.size(); ++i) {
+    sink.put(openings[i]);
+    emitter.item(values[i].encoded().data());
+  }
+}
+
 std::optional<Error> checkJson(const Payload& payload) {
   if (!payload.mayHoldNonFinite()) return std::nullopt;
   FiniteCheck check;

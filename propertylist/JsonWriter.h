@@ -5,6 +5,7 @@
 
 #include <cstddef>
 #include <optional>
+#include <span>
 #include <string>
 #include <string_view>
 
@@ -36,6 +37,10 @@ void appendJsonText(std::string& out, std::string_view part);
 // indented, the others by `indent` levels at least.
 void appendPrettyJson(std::string& out, const Payload& payload, int indent);
 void appendPrettyJson(std::string& out, const Value& value, int indent);
+// The entries of a pretty dictionary without its braces, each value after its opening: what stands
+// before it, which begins with the line break and ends with `"key": `. `indent`: of the entries.
+void appendPrettyEntries(std::string& out, std::span<const std::string> openings,
+                         std::span<const Value> values, int indent);
 // The error that a strict JSON serialisation would report: a non-finite number, named by its key
 // path. None when fine.
 std::optional<Error> checkJson(const Payload& payload);

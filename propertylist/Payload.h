@@ -65,6 +65,13 @@ class Value {
 
   // The value's own CBOR bytes.
   std::span<const uint8_t> encoded() const { return {begin_, end_}; }
+  // The one item of bytes that have been validated: what encoded() gave, kept elsewhere.
+  static Value ofValidated(std::span<const uint8_t> item) {
+    return {item.data(), item.data() + item.size()};
+  }
+  // The item that bytes from outside begin with, if it is one that a Payload may hold. What follows
+  // it is not looked at.
+  static std::optional<Value> validate(std::span<const uint8_t> bytes);
 
   // Text of a value: decimal integers, shortest round-trip floating numbers (3 and 3.0 are both
   // "3"; "nan", "inf", "-inf" for those), booleans as 1 and 0, strings as themselves, dates as

@@ -66,9 +66,15 @@ class Validator {
  public:
   // Of a payload, or of a frame, whose elements are noted as they pass.
   explicit Validator(std::span<const uint8_t> bytes, Frame::Element* elements = nullptr)
-      : begin_(bytes.data()), at_(begin_), end_(begin_ + bytes.size()), elements_(elements) {}
+      : begin_(bytes.data()),
+        at_(begin_),
+        end_(begin_ + bytes.size()),
+        elements_(elements),
+        deepest_(elements != nullptr ? Payload::kMaxNesting : Payload::kMaxNesting - 1) {}
 
   bool run();
+  // Of one value, of a payload, with which the bytes begin: where it ends. Null when it is none.
+  const uint8_t* runValue();
   uint64_t rootCount() const { return rootCount_; }
   bool spaceInKeys() const { return space_ != 0; }
   bool nonFinite() const { return nonFinite_; }
@@ -85,10 +91,6 @@ class Validator {
     bool dictionary;
   };
 
-  // A frame's array does not count, so that every valid payload fits into a frame.
-  int deepest() const {
-    return elements_ != nullptr ? Payload::kMaxNesting : Payload::kMaxNesting - 1;
-  }
   std::size_t bytesLeft() const { return static_cast<std::size_t>(end_ - at_); }
   bool fail(const uint8_t* at, std::string text) {
     error_ = {std::move(text), static_cast<std::size_t>(at - begin_)};
@@ -97,6 +99,7 @@ class Validator {
   bool failDuplicate(const OpenKey& key);
   bool failSimple(const cbor::Head& head, const uint8_t* at);
 
+  bool runLevels();
   void endElement(uint64_t next);
   bool readHead(cbor::Head& head);
   bool open(const cbor::Head& head, const uint8_t* at);
@@ -110,7 +113,9 @@ class Validator {
   const uint8_t* at_;
   const uint8_t* end_;
   Frame::Element* elements_;  // kMaxElements of them; null for a payload
-  int depth_ = -1;            // index of the open level
+  // A frame's array does not count, so that every valid payload fits into a frame.
+  int deepest_;     // index of a level
+  int depth_ = -1;  // index of the open level
   uint64_t rootCount_ = 0;
   uint64_t space_ = 0;
   bool nonFinite_ = false;
@@ -127,7 +132,18 @@ bool Validator::run() {
   if (elements_ == nullptr && head.major() != cbor::kMap) return fail(begin_, "not a dictionary");
   if (elements_ != nullptr && head.major() != cbor::kArray) return fail(begin_, "not an array");
   rootCount_ = head.argument;
-  if (!open(head, begin_)) return false;
+  if (!open(head, begin_) || !runLevels()) return false;
+  if (elements_ != nullptr) endElement(rootCount_);
+  return at_ == end_ || fail(at_, "bytes after the end");
+}
+
+const uint8_t* Validator::runValue() {
+  --deepest_;
+  return readValue() && runLevels() ? at_ : nullptr;
+}
+
+// What is open, to its end.
+bool Validator::runLevels() {
   while (depth_ >= 0) {
     Level& level = levels_[static_cast<std::size_t>(depth_)];
     if (level.left == 0) {
@@ -140,8 +156,7 @@ bool Validator::run() {
     if (level.dictionary && !readKey(level)) return false;
     if (!readValue()) return false;
   }
-  if (elements_ != nullptr) endElement(rootCount_);
-  return at_ == end_ || fail(at_, "bytes after the end");
+  return true;
 }
 
 // The frame's element before number `next` ends here, and that one begins.
@@ -183,7 +198,7 @@ inline bool Validator::open(const cbor::Head& head, const uint8_t* at) {
   const bool dictionary = head.major() == cbor::kMap;
   if (head.argument > bytesLeft() / (dictionary ? 2 : 1))
     return fail(at, "count larger than the bytes left");
-  if (depth_ == deepest())
+  if (depth_ == deepest_)
     return fail(at, "nesting deeper than " + std::to_string(Payload::kMaxNesting));
   ++depth_;
   levels_[static_cast<std::size_t>(depth_)] = {head.argument, head.argument, keys_.size(),
@@ -320,6 +335,12 @@ std::optional<Frame> Frame::decode(std::span<const uint8_t> bytes, DecodeError* 
   }
   frame->size_ = validator.rootCount();
   return frame;
+}
+
+std::optional<Value> Value::validate(std::span<const uint8_t> bytes) {
+  const uint8_t* const end = Validator(bytes).runValue();
+  if (end == nullptr) return std::nullopt;
+  return Value(bytes.data(), end);
 }
 
 Payload::Validated Frame::validated(std::size_t i) const {

@@ -3,85 +3,84 @@
 
 #include <cstddef>
 #include <cstdint>
-#include <span>
+#include <memory>
+#include <optional>
 #include <utility>
 #include <vector>
 
-#include "Statistics/VXReportingUtility.h"
-#include "base/ChunkList.h"
+#include "Statistics/Service/VXReportingRowReader.h"
+#include "Statistics/Service/VXReportingRows.h"
 #include "base/Mutex.h"
+#include "base/Status.h"
 
 namespace vx {
 
-// One message under its identifier, as (kind, count): the text is written out when somebody reads
-// it.
-struct VXReportingNestedEntry {
-  Payload payload;
-  uint64_t count : 48 = 0;  // a thousand messages a second for some 9000 years
-  uint64_t kind : 16 = 0;
-};
-
-// An append-only array with its own lock, which may be absent. Grows by chunks: a session may hold
-// millions of messages, and an array that doubles would need half as much memory again just to
-// grow. An empty one allocates nothing. Thread-safe; bounded by what the clients send while the
-// session is started.
-template <class Entry>
+// The two aggregates of a session, which may be absent, as views of the same rows: the flat one is
+// all of them, the nested one what was put before the messages, and the messages under their
+// identifiers. Thread-safe, with one lock. Bounded by what the clients send while the session is
+// started; an empty one has no rows.
 class VXReportingAggregate {
  public:
-  bool isPresent() const {
-    MutexLock lock(mutex_);
-    return present_;
-  }
-  std::size_t size() const {
-    MutexLock lock(mutex_);
-    return entries_.size() + front_.size();
-  }
-  // A new, empty array takes the place of the old one.
-  void renew() { (void)exchange(true); }
-  // What was there, for whoever has the time to destroy millions of entries.
-  using Contents = ChunkList<Entry, 4096, 16, 4>;
-  [[nodiscard]] Contents removeAll() { return exchange(false); }
+  bool isPresent() const;
+  std::size_t flatSize() const;
+  std::size_t nestedSize() const;
+  // A new, empty one takes the place of the old one.
+  void renew();
+  // From here on it is absent. What was there, for whoever has the time to let go of it.
+  using Contents = std::unique_ptr<VXReportingRows>;
+  [[nodiscard]] Contents removeAll();
 
-  // Dropped without a word when the array is absent.
-  void append(Entry entry) {
-    MutexLock lock(mutex_);
-    if (!present_) return;
-    entries_.push_back(std::move(entry));
-  }
-  // Puts `header` before everything that is there.
-  void insertAtFront(Payload header) {
-    MutexLock lock(mutex_);
-    front_.insert(front_.begin(), std::move(header));
-  }
+  // All of them are dropped without a word where the aggregate is absent. None keeps the payload
+  // alive, but appendReference: for one that is too large for a copy and is let go of soon.
+  void appendMessage(MessageKind kind, uint64_t count, const Payload& payload);
+  void appendReference(MessageKind kind, uint64_t count, const Payload& payload);
+  void appendToFlat(const Payload& payload);
+  // Puts `header` before everything in the nested one.
+  void insertHeader(Payload header);
 
-  // Visits, with the lock held, the headers and then every entry in order.
-  template <class OnHeader, class OnEntry>
-  void forEach(const OnHeader& onHeader, const OnEntry& onEntry) const {
+  // Visits, with the lock held, every row in order: onRow(const VXReportingRow&).
+  template <class OnRow>
+  void forEach(const OnRow& onRow) const {
+    forEach([](const Payload&) {}, onRow);
+  }
+  // The headers first.
+  template <class OnHeader, class OnRow>
+  void forEach(const OnHeader& onHeader, const OnRow& onRow) const {
     MutexLock lock(mutex_);
-    for (const Payload& header : front_) onHeader(header);
-    entries_.forEachChunk([&](std::span<const Entry> chunk) {
-      for (const Entry& entry : chunk) onEntry(entry);
-    });
+    for (const Payload& header : headers_) onHeader(header);
+    if (rows_ == nullptr) return;
+    VXReportingRowReader reader(*rows_);
+    while (const VXReportingRow* row = reader.next()) onRow(*row);
   }
-  template <class OnEntry>
-  void forEach(const OnEntry& onEntry) const {
-    forEach([](const Payload&) {}, onEntry);
+  template <class OnHeader>
+  void forEachHeader(const OnHeader& onHeader) const {
+    MutexLock lock(mutex_);
+    for (const Payload& header : headers_) onHeader(header);
   }
+  // A number in a row may not be finite.
+  bool mayHoldNonFinite() const;
+
+  // What a snapshot of the service holds of it; the rows lie in AggregateMemory and survive the
+  // process by themselves. What is appended later, and headers, are no part of it.
+  struct State {
+    bool present = true;
+    uint64_t aggregate = 0;  // 0: without rows
+    uint64_t bytes = 0;
+  };
+  State state() const;
+  // The aggregate as it was, for a process that came after. An error where that is not there any
+  // more, and then a new, empty one. Each state can be restored once.
+  Status restore(const State& state);
+  // Bytes that a state of this moment would miss, since they lie where they do not survive.
+  uint64_t unrecordedBytes() const;
 
  private:
-  Contents exchange(bool present) {
-    Contents old;
-    std::vector<Payload> oldFront;  // both are destroyed after the lock is released
-    MutexLock lock(mutex_);
-    old.swap(entries_);
-    oldFront.swap(front_);
-    present_ = present;
-    return old;
-  }
+  Contents exchange(Contents rows, bool present);
+  VXReportingRows& rows() REQUIRES(mutex_);
 
   mutable Mutex mutex_;
-  Contents entries_ GUARDED_BY(mutex_);
-  std::vector<Payload> front_ GUARDED_BY(mutex_);
+  Contents rows_ GUARDED_BY(mutex_);  // none yet
+  std::vector<Payload> headers_ GUARDED_BY(mutex_);
   bool present_ GUARDED_BY(mutex_) = true;
 };
 

@@ -20,7 +20,6 @@ constexpr uint32_t kTraceStarted = 0x2104282C;
 constexpr uint32_t kTraceStopped = 0x21042830;
 constexpr uint32_t kTraceGone = 0x21042834;
 constexpr uint32_t kTraceMessage = 0x21042838;
-constexpr std::size_t kApproximateMessageBytes = 256;  // of a small one, with its entries
 constexpr int32_t kDeviceClassWithoutOrientation = 6;
 constexpr const char* kReportingSubdirectory = "/Audio/Reporting";
 constexpr const char* kDateFormat = "%Y%m%d-%H%M%S%z";
@@ -102,8 +101,7 @@ void VXReportingSession::start() {
     return;
   }
   started_ = true;
-  aggregatedPayloadData_.renew();
-  nestedAggregatedPayloadData_.renew();
+  received_.renew();
   platform().trace.emit(kTraceStarted, 0, 0, 0, 0);
   if (shouldReportOrientation()) registerOrientationHandlers();
   // The set-up holds the user information itself, not a copy: what is merged before it runs is seen
@@ -123,16 +121,17 @@ void VXReportingSession::stop() {
   if (const std::optional<Payload> summary = createSummaryEventForSession()) {
     VX_LOG(sessionLogScope(), Default, "sending summary event for reporter %lli",
            static_cast<long long>(reporterID_));
-    sendMessage(*summary, kCategoryUndefined, kMessageTypeUnknown, Sync::Yes, nullptr);
+    // As large as all that was received, and about to be dropped with it: not worth a copy.
+    deliver(*summary, kCategoryUndefined, kMessageTypeUnknown, Keep::Reference, nullptr);
   }
   writeSummaryJson();
   vyrReportingQueue_->async([self = shared_from_this()] { self->flushRelay(); });
-  // Destroying millions of messages takes its time: not on the queue that serves everybody.
-  vyrReportingQueue_->async([flat = aggregatedPayloadData_.removeAll(),
-                             nested = nestedAggregatedPayloadData_.removeAll()]() mutable {
-    const std::size_t bytes = flat.size() * kApproximateMessageBytes;
-    flat = {};
-    nested = {};
+  // Letting go of what millions of messages left takes its time: not on the queue that serves
+  // everybody.
+  vyrReportingQueue_->async([contents = received_.removeAll()]() mutable {
+    if (contents == nullptr) return;
+    const std::size_t bytes = contents->memoryBytes();
+    contents.reset();
     platform().threading.memoryWasFreed(bytes);
   });
   started_ = false;
@@ -152,13 +151,9 @@ VXReportingSession::KindCount VXReportingSession::nextIdentifier(MessageCategory
   return {kind, 1};
 }
 
-std::string VXReportingSession::identifierText(MessageKind kind, uint64_t count) {
-  return messageKindName(kind, '_') + "_" + std::to_string(count);
-}
-
 std::string VXReportingSession::messageIdForCategory(MessageCategory category, MessageType type) {
   const KindCount issued = nextIdentifier(category, type);
-  return identifierText(issued.kind, issued.count);
+  return messageIdentifier(issued.kind, issued.count);
 }
 
 Payload VXReportingSession::normalizePayloadKeys(const Payload& payload) {
@@ -175,14 +170,23 @@ Payload VXReportingSession::normalizePayloadKeys(const Payload& payload) {
 
 void VXReportingSession::sendMessage(const Payload& message, MessageCategory category,
                                      MessageType type, Sync, MessageReply reply) {
+  deliver(message, category, type, Keep::Copy, std::move(reply));
+}
+
+void VXReportingSession::deliver(const Payload& message, MessageCategory category, MessageType type,
+                                 Keep keep, MessageReply reply) {
+  static constexpr const char* kFunction = "sendMessage";
   serviceQueue()->assertIsCurrent();
-  VX_VERBOSE(sessionLogScope(), "sending message for session owned by %lli",
-             static_cast<long long>(reporterID_));
+  if (platform().log.isLogEnabled(5, sessionLogScope())) {
+    VX_LOG_AS(kFunction, sessionLogScope(), Debug, "sending message for session owned by %lli",
+              static_cast<long long>(reporterID_));
+  }
   Payload normalised = normalizePayloadKeys(message);
   const KindCount identifier = nextIdentifier(category, type);
-  aggregatedPayloadData_.append(normalised);
-  nestedAggregatedPayloadData_.append(
-      {normalised, identifier.count & ((uint64_t{1} << 48) - 1), identifier.kind});
+  if (keep == Keep::Copy)
+    received_.appendMessage(identifier.kind, identifier.count, normalised);
+  else
+    received_.appendReference(identifier.kind, identifier.count, normalised);
   platform().trace.emit(kTraceMessage, 0, 0, 0, 0);
   // What the client sent goes along only where it is another object: a count less to keep.
   std::optional<Payload> asSent;
@@ -249,7 +253,7 @@ void VXReportingSession::orientationChanged(const char* mode, std::string_view k
         PayloadBuilder().set("t", time).build().find("t")->text().c_str(),
         orientationCallbackID().value_or("(null)").c_str());
   }
-  aggregatedPayloadData_.append(
+  received_.appendToFlat(
       PayloadBuilder().set(key, name).set(std::string(key) + "_time", time).build());
 }
 
@@ -258,9 +262,9 @@ void VXReportingSession::orientationChanged(const char* mode, std::string_view k
 
 std::optional<Payload> VXReportingSession::createSummaryEventForSession() const {
   serviceQueue()->assertIsCurrent();
-  if (aggregatedPayloadData_.size() == 0) return std::nullopt;
+  if (received_.flatSize() == 0) return std::nullopt;
   VXReportingSummaryEvent event(serviceType());
-  aggregatedPayloadData_.forEach([&](const Payload& payload) { event.add(payload); });
+  received_.forEach([&](const VXReportingRow& row) { event.add(row); });
   try {
     return event.build();
   } catch (const std::length_error& tooLarge) {
@@ -270,19 +274,29 @@ std::optional<Payload> VXReportingSession::createSummaryEventForSession() const 
   }
 }
 
+// The first number of the nested aggregate that JSON has no form for.
+std::optional<Error> VXReportingSession::checkNested() const {
+  std::optional<Error> found;
+  const auto check = [&](const Payload& payload) {
+    if (!found) found = checkJson(payload);
+  };
+  if (!received_.mayHoldNonFinite()) {
+    received_.forEachHeader(check);
+    return found;
+  }
+  received_.forEach(check, [&](const VXReportingRow& row) {
+    if (!found && row.kind) check(row.payload());
+  });
+  return found;
+}
+
 void VXReportingSession::writeSummaryJson() {
   serviceQueue()->assertIsCurrent();
   if (!VXReportingIsInternalBuild()) return;
-  if (!nestedAggregatedPayloadData_.isPresent() || nestedAggregatedPayloadData_.size() == 0) return;
+  if (!received_.isPresent() || received_.nestedSize() == 0) return;
   const Payload information = userInfo_->snapshot();
-  nestedAggregatedPayloadData_.insertAtFront(information);
-
-  std::optional<Error> unserialisable;
-  auto check = [&](const Payload& payload) {
-    if (!unserialisable) unserialisable = checkJson(payload);
-  };
-  nestedAggregatedPayloadData_.forEach(
-      check, [&](const VXReportingNestedEntry& entry) { check(entry.payload); });
+  received_.insertHeader(information);
+  const std::optional<Error> unserialisable = checkNested();
   if (unserialisable) {
     VX_LOG(sessionLogScope(), Error, "dataWithJSONObject: %s",
            unserialisable->description().c_str());
@@ -302,12 +316,10 @@ void VXReportingSession::writeSummaryJson() {
   std::optional<Error> error;
   if (const std::unique_ptr<AtomicFile> file = files.createAtomically(directory, name, error)) {
     VXReportingSummaryFile writer(*file);
-    nestedAggregatedPayloadData_.forEach(
-        [&](const Payload& header) { writer.element(header); },
-        [&](const VXReportingNestedEntry& entry) {
-          writer.namedElement(identifierText(static_cast<MessageKind>(entry.kind), entry.count),
-                              entry.payload);
-        });
+    received_.forEach([&](const Payload& header) { writer.element(header); },
+                      [&](const VXReportingRow& row) {
+                        if (row.kind) writer.message(row);
+                      });
     error = writer.finish();
   }
   if (error)
@@ -349,23 +361,21 @@ void VXReportingSession::setVyrReportingAgentToken(
 }
 
 std::optional<std::vector<Payload>> VXReportingSession::aggregatedPayloadData() const {
-  if (!aggregatedPayloadData_.isPresent()) return std::nullopt;
+  if (!received_.isPresent()) return std::nullopt;
   std::vector<Payload> all;
-  aggregatedPayloadData_.forEach([&](const Payload& payload) { all.push_back(payload); });
+  received_.forEach([&](const VXReportingRow& row) { all.push_back(row.payload()); });
   return all;
 }
 
 std::optional<std::vector<Payload>> VXReportingSession::nestedAggregatedPayloadData() const {
-  if (!nestedAggregatedPayloadData_.isPresent()) return std::nullopt;
+  if (!received_.isPresent()) return std::nullopt;
   std::vector<Payload> all;
-  nestedAggregatedPayloadData_.forEach(
-      [&](const Payload& header) { all.push_back(header); },
-      [&](const VXReportingNestedEntry& entry) {
-        all.push_back(PayloadBuilder()
-                          .set(identifierText(static_cast<MessageKind>(entry.kind), entry.count),
-                               entry.payload)
-                          .build());
-      });
+  received_.forEach([&](const Payload& header) { all.push_back(header); },
+                    [&](const VXReportingRow& row) {
+                      if (!row.kind) return;
+                      const std::string identifier = messageIdentifier(*row.kind, row.count);
+                      all.push_back(PayloadBuilder().set(identifier, row.payload()).build());
+                    });
   return all;
 }
 

@@ -136,7 +136,11 @@ class VXReportingSession : public std::enable_shared_from_this<VXReportingSessio
   VXReportingSession(ReporterID reporterID, std::vector<int32_t> processIdentifiers);
   void mergeIntoUserInfo(const std::optional<Payload>& entries);
   KindCount nextIdentifier(MessageCategory category, MessageType type);
-  static std::string identifierText(MessageKind kind, uint64_t count);
+  enum class Keep : uint8_t { Copy, Reference };
+  void deliver(const Payload& message, MessageCategory category, MessageType type, Keep keep,
+               MessageReply reply);
+
+  std::optional<Error> checkNested() const;
 
   void registerOrientationHandlers();
   void unregisterOrientationHandlers();
@@ -158,8 +162,7 @@ class VXReportingSession : public std::enable_shared_from_this<VXReportingSessio
   const std::shared_ptr<VXReportingUserInfo> userInfo_ = std::make_shared<VXReportingUserInfo>();
   std::shared_ptr<DriverSnapShot> driverSnapShot_;
   Function<void(bool)> transactionCompleteBlock_;
-  VXReportingAggregate<Payload> aggregatedPayloadData_;
-  VXReportingAggregate<VXReportingNestedEntry> nestedAggregatedPayloadData_;
+  VXReportingAggregate received_;             // what aggregatedPayloadData and its nested form show
   std::vector<KindCount> messageTypeCounts_;  // bounded by the number of kinds, some hundreds
   std::shared_ptr<WorkQueue> vyrReportingQueue_;
 

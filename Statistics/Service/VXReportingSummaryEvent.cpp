@@ -3,29 +3,33 @@
 #include <span>
 #include <vector>
 
+#include "propertylist/CborReader.h"
+
 namespace vx {
 
 VXReportingSummaryEvent::VXReportingSummaryEvent(ServiceType serviceType) {
-  append(groups_[indexOf("VX_Session_Summary_Event")], std::to_string(serviceType));
+  append(groupFor("VX_Session_Summary_Event"), std::to_string(serviceType));
 }
 
-void VXReportingSummaryEvent::add(const Payload& payload) {
-  next_ = first_;
-  bool atFirst = true;
-  for (const auto& [key, value] : payload) {
-    if (next_ >= groups_.size() || groups_[next_].key != key) next_ = indexOf(key);
-    if (atFirst) first_ = next_;
-    atFirst = false;
-    add(groups_[next_++], value);
+void VXReportingSummaryEvent::add(const VXReportingRow& row) {
+  if (row.shape == VXReportingRows::kNoShape) {
+    for (const auto& [key, value] : row.dictionary) add(groupFor(key), value);
+    return;
   }
+  if (row.shape >= shapes_.size()) shapes_.resize(row.shape + std::size_t{1});
+  std::vector<Group*>& groups = shapes_[row.shape];
+  if (groups.size() < row.keys.size())
+    for (const std::string_view key : row.keys) groups.push_back(&groupFor(key));
+  for (std::size_t i = 0; i < groups.size(); ++i) add(*groups[i], row.values[i]);
 }
 
 void VXReportingSummaryEvent::add(Group& group, const Value& value) {
-  switch (value.kind()) {
-    case ValueKind::String:
-      return append(group, value.asString());
-    case ValueKind::Array:
-    case ValueKind::Dictionary:
+  const cbor::Head head = cbor::head(value.encoded().data());
+  switch (head.major()) {
+    case cbor::kText:
+      return append(group, {reinterpret_cast<const char*>(head.next), head.argument});
+    case cbor::kArray:
+    case cbor::kMap:
       return append(group, value.text());
     default:
       break;
@@ -40,13 +44,13 @@ void VXReportingSummaryEvent::append(Group& group, std::string_view text) {
   group.text.append(text);
 }
 
-std::size_t VXReportingSummaryEvent::indexOf(std::string_view key) {
+VXReportingSummaryEvent::Group& VXReportingSummaryEvent::groupFor(std::string_view key) {
   const auto found = index_.find(key);
-  if (found != index_.end()) return found->second;
+  if (found != index_.end()) return *found->second;
   Group& group = groups_.emplace_back();
   group.key = key;
-  index_.emplace(group.key, groups_.size() - 1);
-  return groups_.size() - 1;
+  index_.emplace(group.key, &group);
+  return group;
 }
 
 Payload VXReportingSummaryEvent::build() const {

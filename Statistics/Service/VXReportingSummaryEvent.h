@@ -6,7 +6,9 @@
 #include <string>
 #include <string_view>
 #include <unordered_map>
+#include <vector>
 
+#include "Statistics/Service/VXReportingRowReader.h"
 #include "Statistics/VXReportingUtility.h"
 #include "base/ChunkList.h"
 
@@ -19,7 +21,7 @@ class VXReportingSummaryEvent {
   // The first value of all is the service type, under "VX_Session_Summary_Event". A payload that
   // holds this key too appends to it: nothing prevents that.
   explicit VXReportingSummaryEvent(ServiceType serviceType);
-  void add(const Payload& payload);
+  void add(const VXReportingRow& row);
   // std::length_error when the event would be larger than a Payload can be.
   Payload build() const;
 
@@ -31,14 +33,11 @@ class VXReportingSummaryEvent {
   };
   static void add(Group& group, const Value& value);
   static void append(Group& group, std::string_view text);
-  std::size_t indexOf(std::string_view key);
+  Group& groupFor(std::string_view key);
 
   std::deque<Group> groups_;  // in order of their first values; never moves its elements
-  std::unordered_map<std::string_view, std::size_t> index_;
-  // Messages of one kind tend to hold the same keys in the same order, so the group after the one
-  // used last is tried before the index is asked.
-  std::size_t next_ = 0;
-  std::size_t first_ = 0;  // the group of the last dictionary's first key
+  std::unordered_map<std::string_view, Group*> index_;
+  std::vector<std::vector<Group*>> shapes_;  // the groups of a shape's keys
 };
 
 }  // namespace vx

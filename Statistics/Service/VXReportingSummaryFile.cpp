@@ -1,6 +1,7 @@
 #include "Statistics/Service/VXReportingSummaryFile.h"
 
 #include <algorithm>
+#include <charconv>
 
 #include "propertylist/FileNames.h"
 #include "propertylist/JsonWriter.h"
@@ -25,14 +26,45 @@ void VXReportingSummaryFile::element(const Payload& payload) {
   dictionary(payload, 1);
 }
 
-void VXReportingSummaryFile::namedElement(const std::string& name, const Payload& payload) {
+void VXReportingSummaryFile::message(const VXReportingRow& row) {
   separate();
-  text_ += "{\n  ";
-  appendJsonString(text_, name);
-  text_ += ": ";
-  dictionary(payload, 2);
-  text_ += "\n }";
+  std::size_t bytes = 0;
+  for (const Value& value : row.values) bytes += value.encoded().size();
+  if (row.shape == VXReportingRows::kNoShape || bytes >= kWriteBytes) {
+    appendOpening(text_, row);
+    text_ += std::to_string(row.count) + "\": ";
+    dictionary(row.payload(), 2);
+    text_ += "\n }";
+    return writeWhenFull();
+  }
+  const ShapeText& shape = textOf(row);
+  text_ += shape.opening;
+  char count[Value::kMaxScalarText];
+  text_.append(count, std::to_chars(count, std::end(count), row.count).ptr);
+  text_ += "\": {";
+  appendPrettyEntries(text_, shape.entries, row.values, 3);
+  text_ += row.values.empty() ? "}\n }" : "\n  }\n }";
   writeWhenFull();
+}
+
+// Up to the count.
+void VXReportingSummaryFile::appendOpening(std::string& text, const VXReportingRow& row) {
+  text += "{\n  ";
+  appendJsonString(text, messageKindName(row.kind.value_or(0), '_') + "_");
+  text.pop_back();  // the closing quote
+}
+
+const VXReportingSummaryFile::ShapeText& VXReportingSummaryFile::textOf(const VXReportingRow& row) {
+  if (row.shape >= shapes_.size()) shapes_.resize(row.shape + std::size_t{1});
+  ShapeText& shape = shapes_[row.shape];
+  if (!shape.opening.empty()) return shape;
+  appendOpening(shape.opening, row);
+  for (const std::string_view key : row.keys) {
+    std::string& entry = shape.entries.emplace_back(shape.entries.empty() ? "\n   " : ",\n   ");
+    appendJsonString(entry, key);
+    entry += ": ";
+  }
+  return shape;
 }
 
 std::optional<Error> VXReportingSummaryFile::finish() {

@@ -4,7 +4,9 @@
 #include <optional>
 #include <string>
 #include <string_view>
+#include <vector>
 
+#include "Statistics/Service/VXReportingRowReader.h"
 #include "Statistics/VXReportingUtility.h"
 #include "base/Error.h"
 #include "platform/DiagnosticFiles.h"
@@ -23,12 +25,19 @@ class VXReportingSummaryFile {
 
   explicit VXReportingSummaryFile(AtomicFile& file) : file_(file) {}
   void element(const Payload& payload);
-  // A dictionary of one entry.
-  void namedElement(const std::string& name, const Payload& payload);
+  // A dictionary of one entry, under the message's identifier.
+  void message(const VXReportingRow& row);
   // Puts the file in its place, or tells of the first write that failed.
   std::optional<Error> finish();
 
  private:
+  // What the messages of a shape have in common.
+  struct ShapeText {
+    std::string opening;
+    std::vector<std::string> entries;
+  };
+  static void appendOpening(std::string& text, const VXReportingRow& row);
+  const ShapeText& textOf(const VXReportingRow& row);
   void separate();
   void dictionary(const Payload& payload, int indent);
   void string(std::string_view text);
@@ -37,6 +46,7 @@ class VXReportingSummaryFile {
 
   AtomicFile& file_;
   std::string text_;
+  std::vector<ShapeText> shapes_;
   std::optional<Error> failed_;
   bool first_ = true;
 };

@@ -19,6 +19,7 @@
 #include "platform/Log.h"
 #include "platform/linux/PlatformConfiguration.h"
 #include "platform/linux/RelayReporting.h"
+#include "platform/linux/aggregates/AggregateSegments.h"
 #include "platform/linux/device/ConfiguredDeviceProperties.h"
 #include "platform/linux/device/CounterChannels.h"
 #include "platform/linux/device/ImmediateProcessControl.h"
@@ -111,6 +112,7 @@ class RunningPlatform final : public LinuxPlatform {
  public:
   RunningPlatform(const Directories& directories, const PlatformConfiguration& configuration)
       : configuration_(configuration),
+        aggregates_({.folder = directories.runtime + "/journal"}),
         loop_(executor_, clock_),
         listener_(loop_, executor_, clock_, configuration.listener),
         preferences_(directories.configuration + "/preferences"),
@@ -163,6 +165,7 @@ class RunningPlatform final : public LinuxPlatform {
         .trace = trace_,
         .diagnosticFiles = diagnosticFiles_,
         .inputs = *inputs_,
+        .aggregates = aggregates_,
     });
     return true;
   }
@@ -176,7 +179,11 @@ class RunningPlatform final : public LinuxPlatform {
     connect();
   }
   void recover(const Function<std::shared_ptr<ServiceListenerDelegate>()>& makeDelegate) override {
-    if (left_.records.empty()) return endReplay(journalFolder_);
+    if (left_.records.empty()) {
+      aggregates_.snapshotBegan();
+      aggregates_.snapshotCompleted();
+      return endReplay(journalFolder_);
+    }
     const Monotonic began = clock_.monotonic();
     executor_.adoptInteractiveThread();
     recovery_.emplace(RecoveryMeans{*services_, executor_, *journal_, backendNames(),
@@ -187,6 +194,7 @@ class RunningPlatform final : public LinuxPlatform {
     store_->endReplay();
     endReplay(journalFolder_);
     recoveredWaits_ = journal_->beginGeneration().ok();
+    aggregates_.snapshotBegan();
     VX_LOG(nullptr, Default,
            "finished what an earlier process had accepted: calls=%llu undone=%llu connections=%llu "
            "unreadable=%llu ms=%lld",
@@ -215,7 +223,10 @@ class RunningPlatform final : public LinuxPlatform {
         static_cast<unsigned long long>(log_.droppedLines()));
     executor_.stop(clock_.monotonic() + kThreadTime);
     const int status = drained && stored ? 0 : 1;
-    if (status == 0 && journal_ != nullptr && journal_->allDone()) journal_->discard();
+    if (status == 0 && journal_ != nullptr && journal_->allDone()) {
+      journal_->discard();
+      aggregates_.discard();
+    }
     // A thread that could not be ended must not find the services destroyed.
     if (status != 0) std::_Exit(status);
     return status;
@@ -240,6 +251,14 @@ class RunningPlatform final : public LinuxPlatform {
                why.text().c_str());
       });
       listener_.setRecorder(*recorder_);
+      if (const Status kept = aggregates_.open(journalComplaints_); !kept.ok())
+        journalComplaints_.push_back(kept.text());
+      aggregates_.setUnrecordedHandler([](const Status& why) {
+        VX_LOG(nullptr, Error,
+               "%s: what sessions receive from now on may miss in summaries that a "
+               "later process makes",
+               why.text().c_str());
+      });
     } else {
       journalComplaints_.push_back(opened.status().text() +
                                    ": what is accepted does not survive this process");
@@ -254,6 +273,7 @@ class RunningPlatform final : public LinuxPlatform {
   void cutJournal() {
     if (!recoveredWaits_ || !journal_->earlierCallsAreDone()) return;
     recoveredWaits_ = !journal_->endSnapshot().ok();
+    if (!recoveredWaits_) aggregates_.snapshotCompleted();
   }
 
   void reportOnJournal() {
@@ -349,7 +369,7 @@ class RunningPlatform final : public LinuxPlatform {
       VX_LOG(nullptr, Error,
              "counters: %s rows=%llu commits=%llu write_failures=%llu relay_backlog=%zu "
              "journal_entries=%llu journal_bytes=%llu journal_segments=%llu journal_full=%llu "
-             "unrecorded=%llu",
+             "unrecorded=%llu aggregate_bytes=%llu aggregates_unrecorded=%llu",
              listener_.counters().text().c_str(),
              static_cast<unsigned long long>(counters.rowsCommitted),
              static_cast<unsigned long long>(counters.commits),
@@ -358,13 +378,16 @@ class RunningPlatform final : public LinuxPlatform {
              static_cast<unsigned long long>(journal.bytes),
              static_cast<unsigned long long>(journal.segmentsInUse),
              static_cast<unsigned long long>(journal.full),
-             static_cast<unsigned long long>(recorder_ ? recorder_->counters().unrecorded : 0));
+             static_cast<unsigned long long>(recorder_ ? recorder_->counters().unrecorded : 0),
+             static_cast<unsigned long long>(aggregates_.counters().fileBytes),
+             static_cast<unsigned long long>(aggregates_.counters().unrecordedBytes));
     }
   }
 
   const PlatformConfiguration configuration_;
   SystemClock clock_;
   SystemLog log_;
+  AggregateSegments aggregates_;  // before the executor, whose work may hold blocks
   Executor executor_;
   SystemThreading threading_{executor_.background()};
   EventLoop loop_;

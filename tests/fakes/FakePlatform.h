@@ -2,6 +2,7 @@
 #pragma once
 
 #include "platform/linux/device/CounterChannels.h"
+#include "tests/fakes/FakeAggregateMemory.h"
 #include "tests/fakes/FakeServices.h"
 
 namespace vx::fakes {
@@ -74,7 +75,8 @@ class FakePlatform {
                   .log = log,
                   .trace = services,
                   .diagnosticFiles = services,
-                 .inputs = inputs} {
+                  .inputs = inputs,
+                  .aggregates = aggregates} {
     installPlatform(&platform_);
   }
   ~FakePlatform() { installPlatform(nullptr); }
@@ -92,6 +94,7 @@ class FakePlatform {
   FakeServices services{journal};
   FakeListener listener;
   FakeInputs inputs;
+  FakeAggregateMemory aggregates;
 
  private:
   Platform platform_;

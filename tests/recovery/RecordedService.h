@@ -173,7 +173,8 @@ class RecordedService {
                     .log = quiet_,
                     .trace = quiet_,
                     .diagnosticFiles = small_,
-                    .inputs = inputs};
+                    .inputs = inputs,
+                    .aggregates = fakes.aggregates};
 };
 
 }  // namespace vx::lnx

@@ -150,7 +150,7 @@ Result<UniqueFd> JournalFolder::createSegment(const std::string& name) const {
 void JournalFolder::remove(const std::string& name) const { unlinkat(fd_.get(), name.c_str(), 0); }
 
 bool JournalFolder::setAside(const std::string& name) const {
-  const uint64_t number = nextAside(path_, kPrefix);
+  const uint64_t number = nextAside(path_, name.substr(0, name.find('-') + 1));
   const std::string as = name + std::string(kAside) + std::to_string(number);
   return renameat(fd_.get(), name.c_str(), fd_.get(), as.c_str()) == 0;
 }

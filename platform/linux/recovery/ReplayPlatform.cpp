@@ -348,7 +348,8 @@ struct ReplayPlatform::Parts {
                  .log = log,
                  .trace = trace,
                  .diagnosticFiles = files,
-                 .inputs = inputs} {}
+                 .inputs = inputs,
+                 .aggregates = live.aggregates} {}
   ReplayQueues queues;
   RecordedClock clock;
   WaitlessThreading threading;

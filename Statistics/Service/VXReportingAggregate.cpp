@@ -1,0 +1,90 @@
+#include "Statistics/Service/VXReportingAggregate.h"
+
+#include "platform/Platform.h"
+
+namespace vx {
+
+bool VXReportingAggregate::isPresent() const {
+  MutexLock lock(mutex_);
+  return present_;
+}
+
+std::size_t VXReportingAggregate::flatSize() const {
+  MutexLock lock(mutex_);
+  return rows_ == nullptr ? 0 : rows_->rows();
+}
+
+std::size_t VXReportingAggregate::nestedSize() const {
+  MutexLock lock(mutex_);
+  return headers_.size() + (rows_ == nullptr ? 0 : rows_->messages());
+}
+
+void VXReportingAggregate::renew() { (void)exchange(nullptr, true); }
+
+VXReportingAggregate::Contents VXReportingAggregate::removeAll() {
+  return exchange(nullptr, false);
+}
+
+VXReportingAggregate::Contents VXReportingAggregate::exchange(Contents rows, bool present) {
+  std::vector<Payload> headers;  // destroyed after the lock is released
+  MutexLock lock(mutex_);
+  headers_.swap(headers);
+  rows_.swap(rows);
+  present_ = present;
+  return rows;
+}
+
+VXReportingRows& VXReportingAggregate::rows() {
+  if (rows_ == nullptr) rows_ = std::make_unique<VXReportingRows>(platform().aggregates);
+  return *rows_;
+}
+
+void VXReportingAggregate::appendMessage(MessageKind kind, uint64_t count, const Payload& payload) {
+  MutexLock lock(mutex_);
+  if (present_) rows().append(kind, count, payload);
+}
+
+void VXReportingAggregate::appendReference(MessageKind kind, uint64_t count,
+                                           const Payload& payload) {
+  MutexLock lock(mutex_);
+  if (present_) rows().appendReference(kind, count, payload);
+}
+
+void VXReportingAggregate::appendToFlat(const Payload& payload) {
+  MutexLock lock(mutex_);
+  if (present_) rows().append(std::nullopt, 0, payload);
+}
+
+void VXReportingAggregate::insertHeader(Payload header) {
+  MutexLock lock(mutex_);
+  headers_.insert(headers_.begin(), std::move(header));
+}
+
+bool VXReportingAggregate::mayHoldNonFinite() const {
+  MutexLock lock(mutex_);
+  return rows_ != nullptr && rows_->mayHoldNonFinite();
+}
+
+VXReportingAggregate::State VXReportingAggregate::state() const {
+  MutexLock lock(mutex_);
+  if (rows_ == nullptr) return {.present = present_};
+  return {.present = present_, .aggregate = rows_->aggregate(), .bytes = rows_->bytes()};
+}
+
+Status VXReportingAggregate::restore(const State& state) {
+  if (!state.present || state.aggregate == 0) {
+    (void)exchange(nullptr, state.present);
+    return {};
+  }
+  Result<Contents> rows =
+      VXReportingRows::restore(platform().aggregates, state.aggregate, state.bytes);
+  (void)exchange(rows.ok() ? std::move(rows).value() : nullptr, true);
+  return rows.status();
+}
+
+uint64_t VXReportingAggregate::unrecordedBytes() const {
+  MutexLock lock(mutex_);
+  return rows_ == nullptr ? 0 : rows_->offset() - rows_->bytes();
+}
+
+}  // namespace vx

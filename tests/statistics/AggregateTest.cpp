@@ -1,0 +1,226 @@
+// The aggregate of a session against a list of payloads, and the summaries against the
+// straightforward way to make them.
+#include <random>
+
+#include "Statistics/Service/VXReportingSummaryEvent.h"
+#include "Statistics/Service/VXReportingSummaryFile.h"
+#include "propertylist/JsonWriter.h"
+#include "propertylist/PlacedPayload.h"
+#include "tests/statistics/ServiceFixture.h"
+
+extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size);
+
+namespace vx {
+namespace {
+
+struct Received {
+  std::optional<MessageKind> kind;
+  uint64_t count;
+  Payload payload;
+};
+
+class AggregateTest : public PlatformTest {
+ protected:
+  using State = VXReportingAggregate::State;
+
+  // A message of some kind, or an orientation entry, of keys and values that come again and again.
+  Received any() {
+    std::optional<MessageKind> kind;
+    if (below(8) > 0) kind = static_cast<MessageKind>(below(2) == 0 ? kMessageKinds - 1 : below(4));
+    if (kind && below(9) == 0) counts_[*kind] += below(3) == 0 ? 1 : uint64_t{1} << below(63);
+    return {kind, kind ? ++counts_[*kind] : 0, anyDictionary(0)};
+  }
+  static void appendTo(VXReportingAggregate& to, const Received& one) {
+    if (one.kind)
+      to.appendMessage(*one.kind, one.count, one.payload);
+    else
+      to.appendToFlat(one.payload);
+  }
+  void append(const Received& one) {
+    received.push_back(one);
+    appendTo(aggregate, one);
+  }
+  void append(int rows) {
+    for (; rows > 0; --rows) append(any());
+  }
+  uint32_t below(std::size_t bound) { return static_cast<uint32_t>(random_() % bound); }
+
+  void expectHolds(const VXReportingAggregate& shown, const std::vector<Received>& expected) {
+    std::size_t i = 0;
+    std::size_t messages = 0;
+    shown.forEach([&](const VXReportingRow& row) {
+      ASSERT_LT(i, expected.size());
+      ASSERT_EQ(row.kind, expected[i].kind) << i;
+      ASSERT_TRUE(!row.kind || row.count == expected[i].count) << i;
+      ASSERT_EQ(row.payload(), expected[i].payload) << i << " " << row.payload().text();
+      messages += row.kind ? 1 : 0;
+      ++i;
+    });
+    EXPECT_EQ(i, expected.size());
+    EXPECT_EQ(shown.flatSize(), expected.size());
+    EXPECT_EQ(shown.nestedSize(), messages);
+  }
+
+  VXReportingAggregate aggregate;
+  std::vector<Received> received;
+
+ private:
+  Payload anyDictionary(int depth) {
+    static const std::vector<std::string> kKeys = {
+        "a", "bb", "sample_rate_hz", "quote\"\\", "VX_Session_Summary_Event", "\xC3\xBC", "", "z"};
+    PayloadBuilder builder;
+    const uint32_t first = below(3);
+    for (uint32_t i = below(6); i > 0; --i) {
+      const std::string key =
+          below(40) == 0 ? "k" + std::to_string(below(5000)) : kKeys[(first + i) % kKeys.size()];
+      switch (below(depth > 1 ? 7 : 9)) {
+        case 0:
+          builder.set(key, static_cast<int64_t>(random_()) >> below(32));
+          break;
+        case 1:
+          builder.set(key, kDoubles[below(kDoubles.size())]);
+          break;
+        case 2:
+          builder.set(key, static_cast<float>(below(100)) / 8);
+          break;
+        case 3:
+          builder.set(key, below(2) == 0);
+          break;
+        case 4:
+          builder.set(key, PayloadDate{below(100000) / 4.0});
+          break;
+        case 5:
+        case 6:
+          builder.set(key, std::string(below(50) == 0 ? 3000 : below(12), "xy\n,"[below(4)]));
+          break;
+        case 7:
+          builder.set(key, ArrayBuilder().add(below(3)).add("y").add(anyDictionary(depth + 1)));
+          break;
+        default:
+          builder.set(key, anyDictionary(depth + 1));
+      }
+    }
+    return builder.build();
+  }
+
+  static inline const std::vector<double> kDoubles = {
+      0, -0.0, 0.1, 0.5, -12.345, 1e300, 97.65625, 1e-310, 16777217, 44100, -0.001};
+  std::mt19937 random_{7};
+  std::map<MessageKind, uint64_t> counts_;
+};
+
+TEST_F(AggregateTest, IsThereAgainInTheNextProcess) {
+  append(3000);
+  const State then = aggregate.state();
+  const std::vector<Received> before = received;
+  append(1000);
+  expectHolds(aggregate, received);
+  for (const uint32_t surviving : {UINT32_MAX, 2u}) {  // blocks
+    p.aggregates.surviving = surviving;
+    VXReportingAggregate again;
+    for (const Received& one : before) appendTo(again, one);
+    const State state = again.state();
+    EXPECT_EQ(again.unrecordedBytes() > 0, surviving == 2);
+    ASSERT_TRUE(again.restore(state).ok());
+    if (surviving == 2) {
+      EXPECT_GT(again.flatSize(), 0u);
+      EXPECT_LT(again.flatSize(), before.size());
+    } else {
+      expectHolds(again, before);
+    }
+  }
+  p.aggregates.surviving = UINT32_MAX;
+  ASSERT_TRUE(aggregate.restore(then).ok());
+  expectHolds(aggregate, before);
+  received = before;
+  append(1000);
+  expectHolds(aggregate, received);
+  EXPECT_FALSE(aggregate.restore({true, 77, 10}).ok());
+  EXPECT_TRUE(aggregate.isPresent());
+  EXPECT_EQ(aggregate.flatSize(), 0u);
+  ASSERT_TRUE(aggregate.restore({.present = false}).ok());
+  EXPECT_FALSE(aggregate.isPresent());
+}
+
+// Blocks go back, and payloads are let go of at once.
+TEST_F(AggregateTest, KeepsNothingThatItNeedNot) {
+  append(500);
+  const Payload sent = dictionary("a", 1);
+  static bool released = false;
+  PlacedPayload::setOwner([](void*) { released = true; });
+  alignas(8) uint8_t place[64];
+  aggregate.appendMessage(1, 1, PlacedPayload::at(place, sent.validated()));
+  EXPECT_TRUE(released);
+  EXPECT_GT(p.aggregates.held, 2u);
+  EXPECT_EQ(aggregate.removeAll()->rows(), 501u);
+  EXPECT_EQ(p.aggregates.held, 0u);
+  aggregate.appendMessage(1, 2, sent);
+  aggregate.appendToFlat(sent);
+  EXPECT_EQ(aggregate.flatSize(), 0u);
+  aggregate.renew();
+  aggregate.appendReference(1, 3, sent);
+  aggregate.forEach([&](const VXReportingRow& row) {
+    EXPECT_EQ(row.count, 3u);
+    EXPECT_TRUE(row.payload().isSameObject(sent));
+  });
+  EXPECT_EQ(aggregate.state().bytes, 3u);  // its count alone
+}
+
+// As they were made before there were rows: by key, one payload after the other.
+TEST_F(AggregateTest, SummariesAreThoseOfThePayloads) {
+  append(4000);
+  for (int i = 0; i < 1200; ++i)  // more shapes than are kept
+    append({MessageKind{5}, static_cast<uint64_t>(i) + 1, dictionary("x" + std::to_string(i), i)});
+  append({MessageKind{6}, 1, dictionary("large", std::string(200000, '"'), "n", 1)});
+
+  std::vector<std::pair<std::string, std::string>> groups = {{"VX_Session_Summary_Event", "3"}};
+  std::string file = "[";
+  for (const Received& one : received) {
+    for (const auto& [key, value] : one.payload) {
+      const auto group =
+          std::ranges::find(groups, key, &std::pair<std::string, std::string>::first);
+      if (group == groups.end())
+        groups.emplace_back(key, value.text());
+      else
+        group->second += "," + value.text();
+    }
+    if (!one.kind) continue;
+    file += file.size() > 1 ? ",\n {\n  \"" : "\n {\n  \"";
+    file += messageIdentifier(*one.kind, one.count) + "\": ";
+    appendPrettyJson(file, one.payload, 2);
+    file += "\n }";
+  }
+  PayloadBuilder expected;
+  for (const auto& [key, text] : groups) expected.set(key, text);
+
+  VXReportingSummaryEvent event(3);
+  aggregate.forEach([&](const VXReportingRow& row) { event.add(row); });
+  EXPECT_TRUE(event.build() == expected.build());
+  std::optional<Error> error;
+  const auto out = p.services.createAtomically("/logs", "name", error);
+  VXReportingSummaryFile writer(*out);
+  aggregate.forEach([&](const VXReportingRow& row) {
+    if (row.kind) writer.message(row);
+  });
+  EXPECT_EQ(writer.finish(), std::nullopt);
+  EXPECT_TRUE(p.services.files.begin()->second == file + "\n]\n");
+}
+
+TEST_F(AggregateTest, WhateverWasLeftIsRefusedOrRead) {
+  p.aggregates.least = 4096;
+  append(60);
+  const State state = aggregate.state();
+  std::vector<uint8_t> bytes = {255};  // in blocks of 4096
+  for (const auto& block : p.aggregates.find(state.aggregate, state.bytes))
+    bytes.insert(bytes.end(), block.bytes, block.bytes + block.size);
+  for (int i = 0; i < 3000; ++i) {
+    std::vector<uint8_t> changed(bytes.begin(), bytes.begin() + 1 + below(bytes.size()));
+    for (uint32_t changes = below(4); changes > 0; --changes)
+      changed[below(changed.size())] = static_cast<uint8_t>(below(3) == 0 ? below(256) : below(8));
+    changed[0] = below(2) == 0 ? 255 : changed[0];
+    LLVMFuzzerTestOneInput(changed.data(), changed.size());
+  }
+}
+
+}  // namespace
+}  // namespace vx
