@@ -136,7 +136,7 @@ class RecoveryTest : public JournalFixture {
     service->fakes.services.preferences = {{"device_name", name}, {"disable_reporting", disabled}};
     const Cause cause{recorder->preferencesChanged("com.quorvel.sonik.reporting"), {}};
     const CauseScope scope(cause);
-    service->fakes.services.notifyQueue->async([handler = service->fakes.services.notifyHandler] {
+    serviceQueue()->async([handler = service->fakes.services.notifyHandler] {
       (*handler)(fakes::FakeServices::kToken);
     });
     service->runQueues();
