@@ -5,6 +5,7 @@
 #include <string_view>
 
 #include "base/Function.h"
+#include "platform/WorkQueue.h"
 #include "propertylist/Payload.h"
 
 namespace vx {
@@ -19,6 +20,10 @@ class RecordedInputs {
   // source is never asked. `what` is a literal that names the question.
   virtual std::optional<Payload> once(std::string_view what,
                                       const Function<std::optional<Payload>()>& source) = 0;
+  // Records work that waits for long as a call of its own, so that the one that it goes back to
+  // need not be kept for it. The work keeps its name. Again: in the place of the record before.
+  virtual void keepDelayed(const Payload& /*facts*/, const Payload& /*content*/,
+                           WorkCause& /*cause*/) {}
 };
 
 }  // namespace vx

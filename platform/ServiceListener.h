@@ -4,6 +4,7 @@
 #include <memory>
 
 #include "platform/ClientConnection.h"
+#include "platform/ServiceState.h"
 
 namespace vx {
 
@@ -16,6 +17,28 @@ class ServiceListenerDelegate {
   // resumed it by then.
   virtual bool listener(ServiceListener& listener,
                         const std::shared_ptr<ClientConnection>& connection) = 0;
+
+  // Calls back on its own queue, later, with the state that all work leaves which reached the
+  // service before this call. False: it has none that could be kept.
+  virtual bool saveState(Function<void(SavedService)> /*saved*/) { return false; }
+
+  // For a service that has just been made, on the interactive thread while its queues are idle.
+  // What cannot be understood is left out, and the answer is false. Clients have been accepted
+  // again before, in the order in which they were saved.
+  virtual bool restoreService(const Payload& /*facts*/) { return false; }
+  virtual bool restoreClient(ExportedObject& /*object*/, const Payload& /*facts*/) { return false; }
+  // Once for each piece of information.
+  virtual bool restoreSession(ExportedObject& /*object*/, int64_t /*reporterID*/,
+                              const Payload& /*facts*/, const Payload& /*information*/) {
+    return false;
+  }
+  // As work of the origin that the session named.
+  virtual bool restoreRelay(ExportedObject& /*object*/, int64_t /*reporterID*/) { return false; }
+  // What RecordedInputs::keepDelayed was given.
+  virtual bool restoreDelayed(const Payload& /*facts*/, const Payload& /*content*/,
+                              std::unique_ptr<WorkCause> /*cause*/) {
+    return false;
+  }
 };
 
 class ServiceListener {

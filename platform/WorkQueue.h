@@ -2,7 +2,9 @@
 #pragma once
 
 #include <chrono>
+#include <cstdint>
 #include <memory>
+#include <optional>
 #include <string_view>
 
 #include "base/Check.h"
@@ -34,6 +36,14 @@ class CAPABILITY("queue") WorkQueue {
   void assertIsCurrent() const ASSERT_CAPABILITY(this) { VX_DCHECK(isCurrent()); }
 };
 
+// A piece of work of a recorded call, by which a later process can name it.
+struct WorkOrigin {
+  uint64_t call = 0;
+  uint32_t place = 0;
+  uint8_t depth = 0;
+  double time = 0;  // at which the call was accepted, seconds since 1970
+};
+
 // The recorded call that a piece of work goes back to, for work that waits elsewhere than on a
 // queue. Let go of before run(), the work is found undone after a crash.
 class WorkCause {
@@ -49,6 +59,8 @@ class WorkQueues {
   // What the caller's work goes back to, as asyncAfter would take it along. Null where a call is
   // run again after a crash whose work was done before it.
   virtual std::unique_ptr<WorkCause> takeCause() { return std::make_unique<WorkCause>(); }
+  // Of the work that the caller runs; none where it goes back to no recorded call.
+  virtual std::optional<WorkOrigin> currentOrigin() { return std::nullopt; }
   // Runs `work` before it returns, as work for the service's own sake: what it queues goes back to
   // no call.
   virtual void withoutCause(const Work& work) { work(); }

@@ -16,17 +16,6 @@ constexpr std::string_view kType = "type";
 constexpr std::string_view kServiceType = "service type";
 constexpr std::string_view kDue = "due";
 
-double since1970(Date date) {
-  return std::chrono::duration<double>(date.time_since_epoch()).count();
-}
-
-// None further off than any clock shows: a number of seconds may be anything.
-Date dateOf(double seconds) {
-  constexpr double kMost = 6e9;
-  return Date(std::chrono::round<std::chrono::microseconds>(
-      std::chrono::duration<double>(std::clamp(seconds, 0.0, kMost))));
-}
-
 template <class Number>
 bool readNumber(const Payload& from, std::string_view key, Number& number) {
   const std::optional<Value> value = from.find(key);
@@ -43,6 +32,7 @@ void VXReportingDelayedMessages::add(VXReportingDelayedMessage message) {
   std::unique_ptr<WorkCause> cause = platform().workQueues.takeCause();
   if (cause == nullptr) return;  // it went out before
   message.message = PayloadBuilder(message.message).build();
+  platform().inputs.keepDelayed(facts(message), message.message, *cause);
   add(std::move(message), std::move(cause));
 }
 
@@ -93,10 +83,10 @@ void VXReportingDelayedMessages::sendDue(Monotonic until) {
   }
 }
 
-void VXReportingDelayedMessages::forEach(
-    const Function<void(const VXReportingDelayedMessage&, WorkCause&)>& visit) const {
+void VXReportingDelayedMessages::keepAgain() {
   MutexLock lock(mutex_);
-  for (const auto& [key, waiting] : waiting_) visit(waiting.message, *waiting.cause);
+  for (auto& [key, waiting] : waiting_)
+    platform().inputs.keepDelayed(facts(waiting.message), waiting.message.message, *waiting.cause);
 }
 
 std::size_t VXReportingDelayedMessages::size() const {
@@ -109,7 +99,7 @@ Payload VXReportingDelayedMessages::facts(const VXReportingDelayedMessage& messa
       .set(kCategory, message.category)
       .set(kType, message.type)
       .set(kServiceType, message.serviceType)
-      .set(kDue, PayloadDate{since1970(message.due)})
+      .set(kDue, PayloadDate{secondsSince1970(message.due)})
       .build();
 }
 
@@ -121,7 +111,7 @@ std::optional<VXReportingDelayedMessage> VXReportingDelayedMessages::fromFacts(c
       !readNumber(facts, kType, read.type) || !readNumber(facts, kServiceType, read.serviceType))
     return std::nullopt;
   read.message = std::move(message);
-  read.due = dateOf(due->asDouble());
+  read.due = dateFromSeconds(due->asDouble());
   return read;
 }
 

@@ -42,8 +42,8 @@ class VXReportingDelayedMessages : public std::enable_shared_from_this<VXReporti
   // Sends all, in the order in which they are due, before it returns; waits for nothing.
   void sendAllNow();
 
-  // In the order in which they are due. Called with the list's lock held.
-  void forEach(const Function<void(const VXReportingDelayedMessage&, WorkCause&)>& visit) const;
+  // Has all of them recorded anew, as RecordedInputs::keepDelayed does.
+  void keepAgain();
   std::size_t size() const;
   // All but the message itself and the reply, and back; none when it is not that.
   static Payload facts(const VXReportingDelayedMessage& message);

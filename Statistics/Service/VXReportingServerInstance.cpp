@@ -12,6 +12,8 @@ namespace {
 constexpr uint32_t kTraceCreate = 0x21042814;
 constexpr uint32_t kTraceDestroy = 0x21042820;
 constexpr int kExitStatusOfKill = 2;
+constexpr std::string_view kSavedStart = "start";
+constexpr std::string_view kSavedName = "name";
 
 long long ll(ReporterID reporterID) { return static_cast<long long>(reporterID); }
 
@@ -66,6 +68,56 @@ std::shared_ptr<VXReportingSession> VXReportingServerInstance::findReportingSess
   const auto delegate = delegate_.lock();
   return delegate != nullptr ? delegate->findReportingSessionForID(reporterID) : nullptr;
 }
+
+// ---------------------------------------------------------------------------------------------------------------------
+// Saved and restored
+
+SavedClient VXReportingServerInstance::savedState(bool& complete) {
+  serviceQueue()->assertIsCurrent();
+  SavedClient saved;
+  saved.object = this;
+  PayloadBuilder facts;
+  if (const std::optional<Date> start = clientStartDate()) {
+    facts.set(kSavedStart, PayloadDate{secondsSince1970(*start)});
+  }
+  if (const std::optional<std::string> name = clientProcessName()) facts.set(kSavedName, *name);
+  saved.facts = facts.build();
+  for (const auto& [reporterID, session] : clientReportingSessionMap_)
+    saved.sessions.push_back(session->savedState(complete));
+  return saved;
+}
+
+bool VXReportingServerInstance::restore(const Payload& facts) {
+  const std::optional<Value> start = facts.find(kSavedStart);
+  const std::optional<Value> name = facts.find(kSavedName);
+  if (!start || start->kind() != ValueKind::Date) return false;
+  setRegistration(dateFromSeconds(start->asDouble()),
+                  name ? std::optional(std::string(name->asString())) : std::nullopt);
+  return true;
+}
+
+bool VXReportingServerInstance::restoreSession(ReporterID reporterID, const Payload& facts,
+                                               const Payload& information) {
+  bool whole = true;
+  auto found = clientReportingSessionMap_.find(reporterID);
+  if (found == clientReportingSessionMap_.end()) {
+    auto session = VXReportingSession::restored(reporterID, {processIdentifier_}, facts, whole);
+    if (session == nullptr) return false;
+    found = clientReportingSessionMap_.emplace(reporterID, std::move(session)).first;
+  }
+  found->second->restoreInformation(information);
+  return whole;
+}
+
+bool VXReportingServerInstance::restoreRelay(ReporterID reporterID) {
+  const auto found = clientReportingSessionMap_.find(reporterID);
+  if (found == clientReportingSessionMap_.end()) return false;
+  found->second->restoreRelay();
+  return true;
+}
+
+// ---------------------------------------------------------------------------------------------------------------------
+// Operations
 
 void VXReportingServerInstance::createReportingSession(ReporterID reporterID, BooleanReply reply) {
   VX_VERBOSE(serverLogScope(), "creating session for reporter %lli", ll(reporterID));

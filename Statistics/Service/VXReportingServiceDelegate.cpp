@@ -3,6 +3,7 @@
 #include <algorithm>
 #include <utility>
 
+#include "Statistics/VXReportingProcessState.h"
 #include "platform/Log.h"
 
 namespace vx {
@@ -18,6 +19,9 @@ constexpr std::string_view kDeviceName = "device_name";
 std::shared_ptr<WorkQueue> theServiceQueue;
 std::atomic<const LogScope*> theServerLogScope{nullptr};
 std::atomic<int> preferencesToken{-1};
+
+constexpr std::string_view kSavedReporting = "reporting";
+constexpr std::string_view kSavedDefaults = "defaults";
 
 constexpr std::string_view kProcessName = "process name";
 
@@ -222,6 +226,59 @@ void VXReportingServiceDelegate::preferencesChanged(int token) {
   if (const std::optional<Value> disabled = defaults_->find(kDisableReporting)) {
     reportingEnabled_.store(!disabled->asBool());
   }
+}
+
+// ---------------------------------------------------------------------------------------------------------------------
+// Saved and restored
+
+bool VXReportingServiceDelegate::saveState(Function<void(SavedService)> saved) {
+  serviceQueue()->async(
+      [self = shared_from_this(), saved = std::move(saved)] { saved(self->savedState()); });
+  return true;
+}
+
+SavedService VXReportingServiceDelegate::savedState() {
+  serviceQueue()->assertIsCurrent();
+  SavedService saved;
+  PayloadBuilder facts;
+  facts.set(kSavedReporting, isReportingEnabled());
+  if (defaults_) facts.set(kSavedDefaults, *defaults_);
+  saved.facts = facts.build();
+  for (const auto& client : clients_) saved.clients.push_back(client->savedState(saved.complete));
+  VXReportingProcessState::current().delayedMessages().keepAgain();
+  return saved;
+}
+
+bool VXReportingServiceDelegate::restoreService(const Payload& facts) {
+  const std::optional<Value> reporting = facts.find(kSavedReporting);
+  if (!reporting) return false;
+  reportingEnabled_.store(reporting->asBool());
+  if (const std::optional<Value> defaults = facts.find(kSavedDefaults))
+    defaults_ = Payload::copyOf(*defaults);
+  return true;
+}
+
+bool VXReportingServiceDelegate::restoreClient(ExportedObject& object, const Payload& facts) {
+  return static_cast<VXReportingServerInstance&>(object).restore(facts);
+}
+
+bool VXReportingServiceDelegate::restoreSession(ExportedObject& object, int64_t reporterID,
+                                                const Payload& facts, const Payload& information) {
+  return static_cast<VXReportingServerInstance&>(object).restoreSession(reporterID, facts,
+                                                                        information);
+}
+
+bool VXReportingServiceDelegate::restoreRelay(ExportedObject& object, int64_t reporterID) {
+  return static_cast<VXReportingServerInstance&>(object).restoreRelay(reporterID);
+}
+
+bool VXReportingServiceDelegate::restoreDelayed(const Payload& facts, const Payload& content,
+                                                std::unique_ptr<WorkCause> cause) {
+  std::optional<VXReportingDelayedMessage> message =
+      VXReportingDelayedMessages::fromFacts(facts, content);
+  if (!message) return false;
+  VXReportingProcessState::current().delayedMessages().add(std::move(*message), std::move(cause));
+  return true;
 }
 
 // ---------------------------------------------------------------------------------------------------------------------

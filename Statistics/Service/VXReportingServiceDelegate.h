@@ -84,6 +84,13 @@ class VXReportingServerInstance final
   // The connection is gone: stops this client's started sessions and takes it off the list, once.
   void handleConnectionError();
 
+  // On the service queue; `complete` becomes false where a session cannot be saved.
+  SavedClient savedState(bool& complete);
+  // Before any work of this client.
+  bool restore(const Payload& facts);
+  bool restoreSession(ReporterID reporterID, const Payload& facts, const Payload& information);
+  bool restoreRelay(ReporterID reporterID);
+
   int32_t processIdentifier() const { return processIdentifier_; }
   const SessionMap& clientReportingSessionMap() const;
   // Written at registration, read by the connection's invalidation without a hop.
@@ -132,6 +139,15 @@ class VXReportingServiceDelegate final
   bool listener(ServiceListener& listener,
                 const std::shared_ptr<ClientConnection>& connection) override;
 
+  bool saveState(Function<void(SavedService)> saved) override;
+  bool restoreService(const Payload& facts) override;
+  bool restoreClient(ExportedObject& object, const Payload& facts) override;
+  bool restoreSession(ExportedObject& object, int64_t reporterID, const Payload& facts,
+                      const Payload& information) override;
+  bool restoreRelay(ExportedObject& object, int64_t reporterID) override;
+  bool restoreDelayed(const Payload& facts, const Payload& content,
+                      std::unique_ptr<WorkCause> cause) override;
+
   std::optional<Payload> getDefaults() override;
   const Clients& getAllClients() override;
   bool isReportingEnabled() override { return reportingEnabled_.load(std::memory_order_relaxed); }
@@ -149,6 +165,7 @@ class VXReportingServiceDelegate final
  private:
   VXReportingServiceDelegate() = default;
   void init();
+  SavedService savedState();
   void preferencesChanged(int token);
   static void clientInvalidated(const std::weak_ptr<VXReportingServerInstance>& client,
                                 int32_t processIdentifier);

@@ -25,6 +25,15 @@ constexpr const char* kReportingSubdirectory = "/Audio/Reporting";
 constexpr const char* kDateFormat = "%Y%m%d-%H%M%S%z";
 constexpr unsigned kDirectoryMode = 0777;
 
+constexpr std::string_view kSavedType = "type";
+constexpr std::string_view kSavedStarted = "started";
+constexpr std::string_view kSavedPresent = "present";
+constexpr std::string_view kSavedAggregate = "aggregate";
+constexpr std::string_view kSavedBytes = "bytes";
+constexpr std::string_view kSavedCounts = "counts";  // kind, count, kind, count...
+// What one client's call may be, and beside it what else a record says.
+constexpr std::size_t kMostPieceBytes = std::size_t{512} << 10;
+
 // Seconds since `start`, to the nearest millisecond, halves away from zero.
 double secondsSince(Date start) {
   const double d = std::chrono::duration<double>(start - platform().clock.now()).count();
@@ -37,10 +46,27 @@ const LogScope* sessionLogScope() { return VXReportingProcessState::current().se
 
 void VXReportingUserInfo::merge(const Payload& entries) {
   MutexLock lock(mutex_);
-  if (entries_.empty())
-    entries_ = entries;
-  else
-    entries_ = PayloadBuilder(entries_).merge(entries).build();
+  entries_ = PayloadBuilder(entries_).merge(entries).build();
+}
+
+std::vector<Payload> VXReportingUserInfo::pieces(std::size_t bytes) const {
+  const Payload all = snapshot();
+  if (all.encoded().size() <= bytes) return {all};
+  std::vector<Payload> pieces;
+  PayloadBuilder piece;
+  std::size_t size = 0;
+  for (const auto& [key, value] : all) {
+    const std::size_t more = key.size() + value.encoded().size();
+    if (size > 0 && size + more > bytes) {
+      pieces.push_back(piece.build());
+      piece = PayloadBuilder();
+      size = 0;
+    }
+    piece.set(key, value);
+    size += more;
+  }
+  pieces.push_back(piece.build());
+  return pieces;
 }
 
 // ---------------------------------------------------------------------------------------------------------------------
@@ -104,11 +130,12 @@ void VXReportingSession::start() {
   received_.renew();
   platform().trace.emit(kTraceStarted, 0, 0, 0, 0);
   if (shouldReportOrientation()) registerOrientationHandlers();
+  relaySetUp_ = std::make_shared<RelaySetUp>();
   // The set-up holds the user information itself, not a copy: what is merged before it runs is seen
   // by it.
-  vyrReportingQueue_->async(
-      [self = shared_from_this(), name = serviceName_, type = serviceType(),
-       done = vyrReportingSessionStarted()] { self->setUpRelay(name, type, done); });
+  vyrReportingQueue_->async([self = shared_from_this(), name = serviceName_, type = serviceType(),
+                             done = vyrReportingSessionStarted(),
+                             setUp = relaySetUp_] { self->setUpRelay(name, type, done, setUp); });
 }
 
 void VXReportingSession::stop() {
@@ -135,6 +162,74 @@ void VXReportingSession::stop() {
     platform().threading.memoryWasFreed(bytes);
   });
   started_ = false;
+}
+
+// ---------------------------------------------------------------------------------------------------------------------
+// Saved and restored
+
+// What was received lies in memory that survives by itself: only its name is saved. Orientation is
+// not watched for a client that is gone, nor are drivers asked.
+SavedSession VXReportingSession::savedState(bool& complete) const {
+  serviceQueue()->assertIsCurrent();
+  SavedSession saved;
+  saved.reporterID = reporterID_;
+  ArrayBuilder counts;
+  for (const KindCount& known : messageTypeCounts_) counts.add(known.kind).add(known.count);
+  PayloadBuilder facts;
+  const VXReportingAggregate::State received = received_.state();
+  facts.set(kSavedType, serviceType())
+      .set(kSavedStarted, started_)
+      .set(kSavedCounts, counts)
+      .set(kSavedPresent, received.present)
+      .set(kSavedAggregate, received.aggregate)
+      .set(kSavedBytes, received.bytes);
+  saved.facts = facts.build();
+  if (received_.unrecordedBytes() > 0) complete = false;
+  saved.information = userInfo_->pieces(kMostPieceBytes);
+  if (started_ && relaySetUp_ != nullptr) {
+    saved.relay = [setUp = relaySetUp_] {
+      MutexLock lock(setUp->mutex);
+      return setUp->origin;
+    };
+  }
+  return saved;
+}
+
+std::shared_ptr<VXReportingSession> VXReportingSession::restored(
+    ReporterID reporterID, std::vector<int32_t> processIdentifiers, const Payload& facts,
+    bool& whole) {
+  const auto number = [&](std::string_view key) {
+    const std::optional<Value> value = facts.find(key);
+    return value ? value->asUInt64() : 0;
+  };
+  const std::optional<Value> type = facts.find(kSavedType);
+  const std::optional<Value> started = facts.find(kSavedStarted);
+  const std::optional<Value> counts = facts.find(kSavedCounts);
+  if (!type || !started || !counts || counts->asArray().size() % 2 != 0) return nullptr;
+  auto session = initWithID(reporterID, std::move(processIdentifiers));
+  const auto code = static_cast<ServiceType>(type->asUInt64());
+  session->serviceType_.store(code, std::memory_order_relaxed);
+  session->serviceName_ = VXReportingServiceTypeName(code);
+  session->started_ = started->asBool();
+  std::optional<uint64_t> kind;
+  for (const Value& item : counts->asArray()) {
+    if (!kind) {
+      kind = item.asUInt64();
+      if (*kind >= kMessageKinds) return nullptr;
+    } else {
+      session->messageTypeCounts_.push_back({static_cast<MessageKind>(*kind), item.asUInt64()});
+      kind.reset();
+    }
+  }
+  const Status received = session->received_.restore({.present = number(kSavedPresent) != 0,
+                                                      .aggregate = number(kSavedAggregate),
+                                                      .bytes = number(kSavedBytes)});
+  if (!received.ok()) {
+    VX_LOG(sessionLogScope(), Error, "reporter %lli: %s", static_cast<long long>(reporterID),
+           received.text().c_str());
+    whole = false;
+  }
+  return session;
 }
 
 // ---------------------------------------------------------------------------------------------------------------------

@@ -18,13 +18,14 @@
 #include "base/Function.h"
 #include "base/Mutex.h"
 #include "platform/ScopedLog.h"
+#include "platform/ServiceState.h"
 #include "platform/VyrReporting.h"
 #include "platform/WorkQueue.h"
 
 namespace vx {
 
-// A mutable dictionary that several owners share: configuration and service defaults merged.
-// Thread-safe.
+// A mutable dictionary that several owners share: configuration and service defaults merged. Keeps
+// copies: what is merged may lie where it must not stay for long. Thread-safe.
 class VXReportingUserInfo {
  public:
   void merge(const Payload& entries);
@@ -32,6 +33,8 @@ class VXReportingUserInfo {
     MutexLock lock(mutex_);
     return entries_;
   }
+  // In pieces of at most about `bytes`, but for an entry that is larger by itself.
+  std::vector<Payload> pieces(std::size_t bytes) const;
 
  private:
   mutable Mutex mutex_;
@@ -91,6 +94,17 @@ class VXReportingSession : public std::enable_shared_from_this<VXReportingSessio
   std::optional<Payload> createSummaryEventForSession() const;
   void writeSummaryJson();
 
+  // What a session that is made anew in a later process must be given; `complete` becomes false
+  // where some of it does not survive this one. And that session: none where the facts are none,
+  // not whole where what it had received cannot be read.
+  SavedSession savedState(bool& complete) const;
+  static std::shared_ptr<VXReportingSession> restored(ReporterID reporterID,
+                                                      std::vector<int32_t> processIdentifiers,
+                                                      const Payload& facts, bool& whole);
+  void restoreInformation(const Payload& entries) { userInfo_->merge(entries); }
+  // Opens the relay session again that set-up had opened, as work of that set-up.
+  void restoreRelay();
+
   // Fields. Those that other queues see are guarded; the others belong to the service queue.
   bool started() const { return started_; }
   void setStarted(bool started) { started_ = started; }
@@ -146,7 +160,16 @@ class VXReportingSession : public std::enable_shared_from_this<VXReportingSessio
   void unregisterOrientationHandlers();
   void orientationChanged(const char* mode, std::string_view key, int64_t orientation);
 
-  void setUpRelay(std::string_view serviceName, ServiceType serviceType, bool configurationDone);
+  // What one set-up has come to. Written by its work, read when that is over.
+  struct RelaySetUp {
+    Mutex mutex;
+    std::optional<WorkOrigin> origin GUARDED_BY(mutex);  // of the relay session that is there
+  };
+  void setUpRelay(std::string_view serviceName, ServiceType serviceType, bool configurationDone,
+                  const std::shared_ptr<RelaySetUp>& setUp);
+  std::shared_ptr<VyrReportingSession> openRelay(std::string_view serviceName,
+                                                 ServiceType serviceType);
+  void configureRelay(const std::shared_ptr<VyrReportingSession>& relay, bool configurationDone);
   void relayMessage(const Payload& normalised, const Payload& message, MessageCategory category,
                     MessageType type, bool startedThen);
   void flushRelay();
@@ -165,6 +188,8 @@ class VXReportingSession : public std::enable_shared_from_this<VXReportingSessio
   VXReportingAggregate received_;             // what aggregatedPayloadData and its nested form show
   std::vector<KindCount> messageTypeCounts_;  // bounded by the number of kinds, some hundreds
   std::shared_ptr<WorkQueue> vyrReportingQueue_;
+  std::shared_ptr<RelaySetUp> relaySetUp_;  // of the last start
+  std::optional<WorkOrigin> relayOrigin_;   // belongs to the relay queue
 
   mutable Mutex fieldsMutex_;  // the references below, each read and replaced as a whole
   std::optional<std::string> orientationCallbackID_ GUARDED_BY(fieldsMutex_);

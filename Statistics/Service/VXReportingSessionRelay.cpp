@@ -35,8 +35,7 @@ std::optional<Date> standaloneDue(ServiceType serviceType, Date now) {
       });
   const std::optional<Value> due = answer ? answer->find(kDue) : std::nullopt;
   if (!due) return std::nullopt;
-  return Date(std::chrono::round<std::chrono::microseconds>(
-      std::chrono::duration<double>(due->asDouble())));
+  return dateFromSeconds(due->asDouble());
 }
 
 uint16_t relayCategory(MessageCategory category) {
@@ -58,14 +57,10 @@ struct ConfigurationState {
 
 }  // namespace
 
-void VXReportingSession::setUpRelay(std::string_view serviceName, ServiceType serviceTypeThen,
-                                    bool configurationDone) {
-  vyrReportingQueue_->assertIsCurrent();
-  static constexpr const char* kFunction = "start";
-  if (serviceType() == kServiceTypeTest) return;
+std::shared_ptr<VyrReportingSession> VXReportingSession::openRelay(std::string_view serviceName,
+                                                                   ServiceType serviceTypeThen) {
   setVyrReportingAgentToken(
       platform().vyrReporting.newSecureHierarchyTokenFromParentToken(nullptr));
-
   const bool realtime = serviceTypeThen == kServiceTypeApiUsage;
   const VyrSessionInfo sessionInfo = {
       {kVyrReportingSessionInfoClientType, kClientType},
@@ -80,10 +75,29 @@ void VXReportingSession::setUpRelay(std::string_view serviceName, ServiceType se
   userInformation.set(kVyrReportingUserInfoServiceName, std::string(serviceName) + "_session");
   const Payload configured = userInfo_->snapshot();
   if (!configured.empty()) userInformation.merge(configured);
-  const std::shared_ptr<VyrReportingSession> relay =
+  std::shared_ptr<VyrReportingSession> relay =
       platform().vyrReporting.initWithSessionInfo(sessionInfo, userInformation.build(), {});
   setVyrReportingSession(relay);
+  return relay;
+}
 
+void VXReportingSession::restoreRelay() { (void)openRelay(serviceName_, serviceType()); }
+
+void VXReportingSession::setUpRelay(std::string_view serviceName, ServiceType serviceTypeThen,
+                                    bool configurationDone,
+                                    const std::shared_ptr<RelaySetUp>& setUp) {
+  vyrReportingQueue_->assertIsCurrent();
+  if (serviceType() != kServiceTypeTest) {
+    relayOrigin_ = platform().workQueues.currentOrigin();
+    configureRelay(openRelay(serviceName, serviceTypeThen), configurationDone);
+  }
+  MutexLock lock(setUp->mutex);
+  if (vyrReportingSession() != nullptr) setUp->origin = relayOrigin_;
+}
+
+void VXReportingSession::configureRelay(const std::shared_ptr<VyrReportingSession>& relay,
+                                        bool configurationDone) {
+  static constexpr const char* kFunction = "start";
   const auto state = std::make_shared<ConfigurationState>();
   state->done = configurationDone;
   relay->startConfigurationWithCompletionHandler(

@@ -39,6 +39,7 @@
 #include "platform/linux/recovery/JournaledInputs.h"
 #include "platform/linux/recovery/Records.h"
 #include "platform/linux/recovery/Recovery.h"
+#include "platform/linux/recovery/Snapshots.h"
 #include "platform/linux/settings/PreferencesWatcher.h"
 #include "platform/linux/settings/TomlPreferences.h"
 #include "platform/linux/store/LocalStore.h"
@@ -189,15 +190,21 @@ class RunningPlatform final : public LinuxPlatform {
     recovery_.emplace(RecoveryMeans{*services_, executor_, *journal_, backendNames(),
                                     [this] { return store_->isCongested(); }},
                       std::move(left_));
-    store_->beginReplay(recovery_->firstUndone());
+    store_->beginReplay(recovery_->calls());
     const RecoveryOutcome outcome = recovery_->run(makeDelegate);
     store_->endReplay();
     endReplay(journalFolder_);
-    recoveredWaits_ = journal_->beginGeneration().ok();
-    aggregates_.snapshotBegan();
+    snapshots_->demand();
+    if (outcome.unreadable > 0) {
+      store_->note({"recovery_incomplete", "", 0,
+                    std::to_string(outcome.unreadable) + " records could not be understood"});
+      VX_LOG(nullptr, Error, "%llu records of what an earlier process had accepted were left out",
+             static_cast<unsigned long long>(outcome.unreadable));
+    }
     VX_LOG(nullptr, Default,
-           "finished what an earlier process had accepted: calls=%llu undone=%llu connections=%llu "
-           "unreadable=%llu ms=%lld",
+           "finished what an earlier process had accepted: restored=%llu calls=%llu undone=%llu "
+           "connections=%llu unreadable=%llu ms=%lld",
+           static_cast<unsigned long long>(outcome.restored),
            static_cast<unsigned long long>(outcome.calls),
            static_cast<unsigned long long>(outcome.undone),
            static_cast<unsigned long long>(outcome.ended),
@@ -222,6 +229,7 @@ class RunningPlatform final : public LinuxPlatform {
         static_cast<unsigned long long>(counters.rowsLost),
         static_cast<unsigned long long>(log_.droppedLines()));
     executor_.stop(clock_.monotonic() + kThreadTime);
+    Journal::setCallsDoneHandler(nullptr, nullptr);
     const int status = drained && stored ? 0 : 1;
     if (status == 0 && journal_ != nullptr && journal_->allDone()) {
       journal_->discard();
@@ -246,10 +254,14 @@ class RunningPlatform final : public LinuxPlatform {
       poisoned_ = std::move(opened->poisoned);
       journalComplaints_ = std::move(opened->complaints);
       recorder_.emplace(*journal_, clock_);
-      recorder_->setUnrecordedHandler([](const Status& why) {
-        VX_LOG(nullptr, Error, "%s: what is accepted from now on may not survive this process",
-               why.text().c_str());
+      recorder_->setUnrecordedHandler([this](const Status& why) {
+        if (recorder_->counters().unrecorded == 1) {
+          VX_LOG(nullptr, Error, "%s: what is accepted from now on may not survive this process",
+                 why.text().c_str());
+        }
+        snapshots_->demand();  // a replay of the calls would not come to the state that there is
       });
+      cutJournal();
       listener_.setRecorder(*recorder_);
       if (const Status kept = aggregates_.open(journalComplaints_); !kept.ok())
         journalComplaints_.push_back(kept.text());
@@ -269,11 +281,24 @@ class RunningPlatform final : public LinuxPlatform {
     journalInMemory_ = statfs(folder.c_str(), &files) == 0 && files.f_type == TMPFS_MAGIC;
   }
 
-  // What was recovered is no longer wanted once nothing waits because of it.
   void cutJournal() {
-    if (!recoveredWaits_ || !journal_->earlierCallsAreDone()) return;
-    recoveredWaits_ = !journal_->endSnapshot().ok();
-    if (!recoveredWaits_) aggregates_.snapshotCompleted();
+    snapshots_.emplace(Snapshots::Means{
+        .journal = *journal_,
+        .clock = clock_,
+        .save =
+            [this](Function<void(SavedService)> saved) {
+              const std::shared_ptr<ServiceListenerDelegate> delegate = listener_.delegate();
+              return delegate != nullptr && delegate->saveState(std::move(saved));
+            },
+        .connections = [this] { return listener_.recordedConnections(); },
+        .commitSoon = [this] { store_->commitSoon(); },
+        .freed = [this] { listener_.congestionEnded(); },
+        .began = [this] { aggregates_.snapshotBegan(); },
+        .completed = [this] { aggregates_.snapshotCompleted(); },
+    });
+    loop_.addPassEndHook([this] { snapshots_->afterPass(); });
+    loop_.addDeadline([this] { return snapshots_->nextDue(); }, [this] { snapshots_->onDue(); });
+    Journal::setCallsDoneHandler([](void* loop) { static_cast<EventLoop*>(loop)->wake(); }, &loop_);
   }
 
   void reportOnJournal() {
@@ -317,7 +342,8 @@ class RunningPlatform final : public LinuxPlatform {
     listener_.setHooks({
         .congested =
             [this] {
-              return store_->isCongested() || executor_.utilityBacklog() > kRelayBacklogHigh;
+              return store_->isCongested() || executor_.utilityBacklog() > kRelayBacklogHigh ||
+                     (journal_ != nullptr && !journal_->hasCapacity());
             },
         .listening = [] { sd_notify(0, "READY=1"); },
         .stopping = [] { sd_notify(0, "STOPPING=1"); },
@@ -331,7 +357,6 @@ class RunningPlatform final : public LinuxPlatform {
     watch(signalFd_.get(), signalSource_);
 
     loop_.addPassEndHook([this] { heapPages_.askForNew(); });
-    loop_.addPassEndHook([this] { cutJournal(); });
     if (recorder_) {
       loop_.addPassEndHook([this] { recorder_->endPass(); });
       watcher_->setPoster([this](std::string_view name, const PreferencesWatcher::Post& post) {
@@ -366,10 +391,13 @@ class RunningPlatform final : public LinuxPlatform {
       const LocalStore::Counters counters = store_->counters();
       const JournalCounters journal =
           journal_ != nullptr ? journal_->counters() : JournalCounters{};
+      const Snapshots::Counters snapshots =
+          snapshots_ ? snapshots_->counters() : Snapshots::Counters{};
       VX_LOG(nullptr, Error,
              "counters: %s rows=%llu commits=%llu write_failures=%llu relay_backlog=%zu "
              "journal_entries=%llu journal_bytes=%llu journal_segments=%llu journal_full=%llu "
-             "unrecorded=%llu aggregate_bytes=%llu aggregates_unrecorded=%llu",
+             "unrecorded=%llu aggregate_bytes=%llu aggregates_unrecorded=%llu snapshots=%llu "
+             "snapshot_bytes=%llu snapshot_us=%lld",
              listener_.counters().text().c_str(),
              static_cast<unsigned long long>(counters.rowsCommitted),
              static_cast<unsigned long long>(counters.commits),
@@ -380,7 +408,11 @@ class RunningPlatform final : public LinuxPlatform {
              static_cast<unsigned long long>(journal.full),
              static_cast<unsigned long long>(recorder_ ? recorder_->counters().unrecorded : 0),
              static_cast<unsigned long long>(aggregates_.counters().fileBytes),
-             static_cast<unsigned long long>(aggregates_.counters().unrecordedBytes));
+             static_cast<unsigned long long>(aggregates_.counters().unrecordedBytes),
+             static_cast<unsigned long long>(snapshots.completed),
+             static_cast<unsigned long long>(snapshots.bytes),
+             static_cast<long long>(
+                 std::chrono::round<std::chrono::microseconds>(snapshots.longest).count()));
     }
   }
 
@@ -413,7 +445,7 @@ class RunningPlatform final : public LinuxPlatform {
   std::optional<JournalRecorder> recorder_;
   std::optional<JournaledInputs> inputs_;
   std::optional<Recovery> recovery_;
-  bool recoveredWaits_ = false;
+  std::optional<Snapshots> snapshots_;
   std::optional<RelayReporting> relay_;
   std::optional<Platform> services_;
   UniqueFd signalFd_;

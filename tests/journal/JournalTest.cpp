@@ -193,15 +193,20 @@ TEST_F(JournalTest, IsFullAtItsLimitButForTheSnapshotThatMakesSpace) {
   options.maxBytes = 8 * kSegmentBytes;
   open();
   std::vector<JournalTicket> held;
-  for (uint8_t i = 0; i < 12; ++i) held.push_back(appendLarge(i)->ticket);  // six segments
+  for (uint8_t i = 0; i < 12; ++i) {  // six segments
+    EXPECT_EQ(journal->hasCapacity(), i < 11) << "told before it is full";
+    held.push_back(appendLarge(i)->ticket);
+  }
   const auto refused = appendLarge(12);
   EXPECT_EQ(refused.status().code(), ENOSPC);
   EXPECT_EQ(journal->counters().full, 1u);
-  EXPECT_THAT(files(), SizeIs(6));
+  EXPECT_THAT(files(), SizeIs(8)) << "two are for the snapshot";
   EXPECT_EQ(readKinds(), "0 1 2 3 4 5 6 7 8 9 10 11");
   held.clear();
   EXPECT_FALSE(appendLarge(12).ok()) << "there is no snapshot after them";
+  EXPECT_FALSE(journal->lookForCapacity());
   snapshot(20);
+  EXPECT_TRUE(journal->hasCapacity());
   EXPECT_TRUE(appendLarge(21).ok());
   for (uint8_t i = 22; i < 26; ++i) EXPECT_TRUE(appendLarge(i).ok());
   EXPECT_EQ(readKinds(), "20s 21d 22d 23d 24d 25d") << "done, but after the snapshot";
@@ -209,7 +214,7 @@ TEST_F(JournalTest, IsFullAtItsLimitButForTheSnapshotThatMakesSpace) {
 
 TEST_F(JournalTest, AFileSystemWithoutSpaceMakesItFullAndNoWorse) {
   open();
-  appendDone(1);
+  for (uint8_t i = 0; i < 3; ++i) ASSERT_TRUE(appendLarge(i).ok());  // two segments, and two spares
   rlimit before{};
   ASSERT_EQ(getrlimit(RLIMIT_FSIZE, &before), 0);
   std::signal(SIGXFSZ, SIG_IGN);
@@ -217,10 +222,18 @@ TEST_F(JournalTest, AFileSystemWithoutSpaceMakesItFullAndNoWorse) {
   none.rlim_cur = kSegmentBytes / 2;
   ASSERT_EQ(setrlimit(RLIMIT_FSIZE, &none), 0);
   int refused = 0;
-  for (uint8_t i = 0; i < 4; ++i) refused += appendLarge(i).status().code() == ENOSPC;
-  setrlimit(RLIMIT_FSIZE, &before);
+  bool told = false;
+  for (uint8_t i = 0; i < 8; ++i) {
+    told = told || !journal->hasCapacity();
+    const bool full = appendLarge(i).status().code() == ENOSPC;
+    EXPECT_TRUE(told || !full) << "before";
+    refused += full ? 1 : 0;
+  }
   EXPECT_GE(refused, 2);
-  EXPECT_THAT(files(), SizeIs(1)) << "part of a segment was left";
+  snapshot(20);  // there is space for it, and it makes some
+  EXPECT_TRUE(appendLarge(9).ok());
+  setrlimit(RLIMIT_FSIZE, &before);
+  EXPECT_THAT(files(), SizeIs(4)) << "part of a segment was left";
   bool again = false;
   for (int i = 0; i < 1000 && !again; ++i) again = appendLarge(9).ok();
   EXPECT_TRUE(again);

@@ -116,7 +116,8 @@ class Rows final : public VyrReporting, public AnalyticsEventService, public Pow
 // The platform of one life of the service. Its own thread is the test's, unless it serves.
 class RecordedService {
  public:
-  explicit RecordedService(Journal* journal) : inputs(journal) {
+  explicit RecordedService(Journal* journal, AggregateMemory* surviving = nullptr)
+      : memory(surviving != nullptr ? *surviving : fakes.aggregates), inputs(journal) {
     installPlatform(&platform);
     delegate = VXReportingServiceDelegate::create();
   }
@@ -137,6 +138,7 @@ class RecordedService {
   EventLoop loop{executor, steady};
   SocketListener listener{loop, executor, steady, {}};
   SystemThreading threading{executor.background()};
+  AggregateMemory& memory;
   JournaledInputs inputs;
   std::shared_ptr<VXReportingServiceDelegate> delegate;
 
@@ -174,7 +176,7 @@ class RecordedService {
                     .trace = quiet_,
                     .diagnosticFiles = small_,
                     .inputs = inputs,
-                    .aggregates = fakes.aggregates};
+                    .aggregates = memory};
 };
 
 }  // namespace vx::lnx

@@ -9,6 +9,7 @@
 #include "platform/linux/recovery/JournalOpening.h"
 #include "platform/linux/recovery/Records.h"
 #include "platform/linux/recovery/Recovery.h"
+#include "platform/linux/recovery/Snapshots.h"
 #include "tests/ipc/IpcTest.h"
 #include "tests/journal/JournalFixture.h"
 #include "tests/recovery/RecordedService.h"
@@ -31,16 +32,36 @@ class RecoveryTest : public JournalFixture {
     left = std::move(opened->left);
     poisoned = opened->poisoned;
     processState.emplace();
-    service = std::make_unique<RecordedService>(journal.get());
+    service = std::make_unique<RecordedService>(journal.get(), &memory);
     service->fakes.services.processNames = {{200, "player"}, {201, "phone"}};
     service->fakes.services.internalBuild = true;
     service->fakes.services.random = 30;
     service->fakes.clock.wall = wall;
     service->fakes.clock.steady = service->steady.monotonic();
     recorder.emplace(*journal, service->fakes.clock);
+    snapshots.emplace(Snapshots::Means{
+        .journal = *journal,
+        .clock = service->fakes.clock,
+        .save = [this](auto saved) { return service->delegate->saveState(std::move(saved)); },
+        .connections =
+            [this] {
+              std::unordered_map<const ExportedObject*, SocketListener::Recorded> all;
+              for (const auto& [client, known] : connections) {
+                all.emplace(
+                    known.second->object.get(),
+                    SocketListener::Recorded{known.first, known.second->processIdentifier(), 1000});
+              }
+              return all;
+            },
+        .commitSoon = [this] { service->rows.commit(); },
+        .freed = [] {},
+        .began = [] {},
+        .completed = [] {},
+    });
   }
   void endLife() {
     recovery.reset();
+    snapshots.reset();
     connections.clear();
     if (service != nullptr) {  // whose handlers hold sessions
       service->fakes.services.deviceHandlers.clear();
@@ -150,14 +171,30 @@ class RecoveryTest : public JournalFixture {
     connections.erase(client);
   }
 
+  // What came before has been committed; what comes next belongs to a new generation.
+  void beginSnapshot() {
+    snapshots->demand();
+    snapshots->afterPass();
+    service->runQueues();
+  }
+  void snapshot() {
+    const uint64_t before = snapshots->counters().completed;
+    beginSnapshot();
+    service->rows.commit();
+    snapshots->afterPass();
+    EXPECT_EQ(snapshots->counters().completed, before + 1);
+  }
+
   std::vector<std::string> written() { return service->rows.texts(); }
 
   Date wall{std::chrono::hours(24 * 365 * 50)};
   JournalContents left;
   std::string poisoned;
+  fakes::FakeAggregateMemory memory;  // of all lives
   std::optional<VXReportingProcessState> processState;
   std::unique_ptr<RecordedService> service;
   std::optional<JournalRecorder> recorder;
+  std::optional<Snapshots> snapshots;
   std::optional<Recovery> recovery;
   std::map<int, std::pair<uint64_t, std::shared_ptr<fakes::FakeConnection>>> connections;
 };
@@ -172,6 +209,8 @@ std::vector<std::string> together(std::vector<std::string> some,
   std::ranges::sort(some);
   return some;
 }
+
+enum class Cut : uint8_t { No, Begun, Whole };  // of the journal, in the middle
 
 // Wherever a process is killed, and the next one as well: together they write what one would have
 // that had lost its clients at that moment.
@@ -205,25 +244,42 @@ TEST_F(RecoveryTest, AKilledProcessLosesNothingAndWritesNothingTwice) {
   }();
   const Date begin = wall;
   for (std::size_t steps = 1; steps <= script.size(); ++steps) {
-    for (const int deaths : {1, 2}) {
-      SCOPED_TRACE(std::to_string(deaths) + " deaths after " + std::to_string(steps) + " steps");
-      std::filesystem::remove_all(options.folder);
-      wall = begin;
-      beginLife();
-      for (std::size_t i = 0; i < steps; ++i) script[i]();
-      while (!connections.empty()) end(connections.begin()->first, CallRecorder::End::Orderly);
-      const std::vector<std::string> whole = together(written(), {});
-      const auto files = service->fakes.services.files;
-      endLife();
+    std::filesystem::remove_all(options.folder);
+    wall = begin;
+    beginLife();
+    for (std::size_t i = 0; i < steps; ++i) script[i]();
+    while (!connections.empty()) end(connections.begin()->first, CallRecorder::End::Orderly);
+    const std::vector<std::string> whole = together(written(), {});
+    const auto files = service->fakes.services.files;
+    endLife();
 
+    constexpr std::pair<int, Cut> kOthers[] = {
+        {2, Cut::No}, {1, Cut::Begun}, {1, Cut::Whole}, {2, Cut::Whole}};
+    for (const auto& [deaths, cut] : {std::pair(1, Cut::No), kOthers[steps % 4]}) {
+      SCOPED_TRACE(std::to_string(deaths) + " deaths after " + std::to_string(steps) +
+                   " steps, cut: " + std::to_string(static_cast<int>(cut)));
       std::filesystem::remove_all(options.folder);
       wall = begin;
       beginLife();
-      for (std::size_t i = 0; i < steps / 2; ++i) script[i]();
-      std::vector<std::string> rows = written();
-      service->rows.commit();
+      const std::size_t middle = cut == Cut::Whole ? steps * 3 / 4 : steps / 2;
+      for (std::size_t i = 0; i < middle; ++i) script[i]();
+      std::vector<std::string> rows;
+      if (cut == Cut::Begun) {
+        const bool waits = !journal->allDone();
+        beginSnapshot();
+        snapshots->afterPass();
+        EXPECT_EQ(snapshots->counters().completed, waits ? 0u : 1u);
+      } else {
+        rows = written();
+        service->rows.commit();
+      }
+      if (cut == Cut::Whole) {
+        snapshot();
+        snapshot();
+        for (const auto& record : read().records) EXPECT_EQ(record.type, EntryType::Snapshot);
+      }
       auto filesNow = service->fakes.services.files;
-      for (std::size_t i = steps / 2; i < steps; ++i) script[i]();
+      for (std::size_t i = middle; i < steps; ++i) script[i]();
       const std::size_t open = connections.size();
       for (const auto& [name, text] : service->fakes.services.files) filesNow[name] = text;
       kill();
@@ -273,19 +329,81 @@ TEST_F(RecoveryTest, WhatALaterProcessAcceptedIsRunAgainAsItFoundThings) {
 }
 
 TEST_F(RecoveryTest, AStandaloneWaitsForTheRestOfItsDelay) {
-  for (const auto& [later, sent] : {std::pair{10, 0}, {40, 2}}) {
+  std::vector<std::string> rows;  // of one that nothing disturbs
+  enum class Original : uint8_t { Done, Undone };
+  for (const auto& [original, snapshotsTaken] :
+       std::initializer_list<std::pair<Original, int>>{{Original::Done, 0},
+                                                       {Original::Done, 0},
+                                                       {Original::Undone, 0},
+                                                       {Original::Done, 1},
+                                                       {Original::Done, 2}}) {
     std::filesystem::remove_all(options.folder);
     beginLife();
     connect(1, 200);
     create(1, 11, 4);
     send(1, 1, {11});
-    service->rows.commit();
+    if (original == Original::Done) service->rows.commit();
+    if (rows.empty()) {
+      processState->delayedMessages().sendAllNow();
+      rows = written();
+      EXPECT_THAT(rows, SizeIs(2));
+      service->rows.commit();
+      EXPECT_TRUE(journal->allDone());
+      endLife();
+      continue;
+    }
+    for (int i = 0; i < snapshotsTaken; ++i) snapshot();  // which do not wait for it
     kill();
-    recover(std::chrono::seconds(later));
-    EXPECT_EQ(service->rows.places("one-off").size(), static_cast<std::size_t>(sent)) << later;
-    service->rows.commit();
-    EXPECT_EQ(journal->allDone(), sent != 0) << later;
-    endLife();
+    for (const auto& [later, sent, done] :
+         {std::tuple{10, 0, false}, {15, 0, false}, {10, 2, true}, {10, 0, true}}) {
+      EXPECT_EQ(recover(std::chrono::seconds(later)).unreadable, 0u);
+      const std::vector<std::string> now = written();
+      EXPECT_EQ(
+          std::ranges::count_if(rows, [&](auto& row) { return std::ranges::count(now, row); }),
+          sent);
+      EXPECT_EQ(service->rows.places("one-off").size(), static_cast<std::size_t>(sent));
+      service->rows.commit();
+      EXPECT_EQ(journal->allDone(), done);
+      endReplay(options.folder);
+      kill();
+    }
+  }
+}
+
+TEST_F(RecoveryTest, PartsOfASnapshotThatCannotBeBelievedAreLeftOut) {
+  beginLife();
+  connect(1, 200);
+  create(1, 11, 3);
+  start(1, 11);
+  send(1, 1);
+  snapshot();
+  const JournalContents good = read();
+  EXPECT_THAT(good.records, SizeIs(4));  // the service, a client, a session and its relay
+  for (std::size_t damaged = 0; damaged < good.records.size(); ++damaged) {
+    for (const bool cut : {true, false}) {
+      service->rows.commit();
+      ASSERT_TRUE(journal->beginGeneration().ok());
+      for (std::size_t i = 0; i < good.records.size(); ++i) {
+        const JournalContents::Record& record = good.records[i];
+        Bytes head = record.head;
+        if (i == damaged && cut) head.pop_back();
+        if (i == damaged && !cut) head[head.size() / 2] ^= 0x15;
+        EXPECT_TRUE(journal
+                        ->appendToSnapshot({.kind = record.kind,
+                                            .connection = record.connection,
+                                            .head = head,
+                                            .forEarlier = i == 3})
+                        .ok());
+      }
+      EXPECT_TRUE(journal->endSnapshot().ok());
+      kill();
+      const RecoveryOutcome outcome = recover();
+      if (cut) {
+        EXPECT_GT(outcome.unreadable, 0u) << damaged;
+      }
+      EXPECT_EQ(outcome.ended, cut && damaged == 1 ? 0u : 1u);
+      endReplay(options.folder);
+    }
   }
 }
 

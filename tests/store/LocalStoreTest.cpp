@@ -233,7 +233,7 @@ TEST_F(LocalStoreTest, ReplayWritesWhatIsMissingAndNothingTwice) {
   run(2);
   reopen();
   EXPECT_EQ(store->epoch(), epoch);
-  store->beginReplay(2);  // the first is found although it is older
+  store->beginReplay({.first = 2, .sessionsFrom = 1});  // the first is found although it is older
   run(3);
   store->endReplay();
   power(3);

@@ -161,7 +161,9 @@ TEST_F(RowWriterTest, EveryFewThousandRowsAreMarkedForTheNextReplay) {
   EXPECT_TRUE(write().ok());
   EXPECT_THAT(query("SELECT call, last_row FROM store_marks"), ElementsAre("2|4096"));
   auto known = [&](uint64_t first, uint64_t call) {
-    return KnownRows::load(database.get(), first)->find({call, 0}).value_or(0);
+    return KnownRows::load(database.get(), {.first = first, .sessionsFrom = first})
+        ->find({call, 0})
+        .value_or(0);
   };
   EXPECT_EQ(known(1, 1), 1);
   EXPECT_EQ(known(2, 1), 0);

@@ -11,7 +11,7 @@ struct Bits {
   uint32_t most;
 };
 constexpr Bits kBits[] = {{30, 3}, {8, (1u << 22) - 1}, {4, 15}, {0, 15}};
-constexpr uint8_t kDeepest = std::size(kBits) - 1;
+static_assert(kDeepestCause == std::size(kBits) - 1);
 
 thread_local CauseScope* innermost = nullptr;
 
@@ -29,6 +29,13 @@ const JournalTicket* CauseScope::current() {
   return innermost != nullptr && innermost->ticket_ ? &innermost->ticket_ : nullptr;
 }
 
+std::optional<WorkOrigin> CauseScope::origin() {
+  const CauseScope* const scope = innermost;
+  if (scope == nullptr || !scope->ticket_) return std::nullopt;
+  const JournalTicket& ticket = scope->ticket_;
+  return WorkOrigin{ticket.namedCall(), scope->place_, scope->depth_, ticket.time()};
+}
+
 Cause Cause::take() {
   CauseScope* const scope = innermost;
   if (scope == nullptr || !scope->ticket_) return {};
@@ -37,7 +44,7 @@ Cause Cause::take() {
   const uint32_t taken = std::min(scope->taken_++, bits.most);
   return {scope->ticket_,
           {scope->place_ | taken << bits.shift,
-           std::min<uint8_t>(static_cast<uint8_t>(scope->depth_ + 1), kDeepest)}};
+           std::min<uint8_t>(static_cast<uint8_t>(scope->depth_ + 1), kDeepestCause)}};
 }
 
 void HeldCause::run(const Work& work) {

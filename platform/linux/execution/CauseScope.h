@@ -2,6 +2,7 @@
 #pragma once
 
 #include <cstdint>
+#include <optional>
 #include <utility>
 
 #include "platform/WorkQueue.h"
@@ -21,6 +22,7 @@ struct CausePosition {
   uint32_t place = 0;
   uint8_t depth = 0;
 };
+inline constexpr uint8_t kDeepestCause = 3;
 
 // A row's name within an epoch; call 0 stands for none.
 struct RowKey {
@@ -37,7 +39,7 @@ struct Cause {
   // For work that the caller queues now, or a row that it appends: takes a place. None outside of
   // a call.
   static Cause take();
-  RowKey key() const { return {ticket.call(), ticket ? position.place : 0}; }
+  RowKey key() const { return {ticket.namedCall(), ticket ? position.place : 0}; }
 };
 
 // While one lives, the calling thread works because of `cause`. Confined to its thread; scopes
@@ -51,6 +53,8 @@ class CauseScope {
 
   // Of the innermost scope; none outside of one.
   static const JournalTicket* current();
+  // Names the innermost scope's work; none outside of a call.
+  static std::optional<WorkOrigin> origin();
 
  private:
   friend struct Cause;

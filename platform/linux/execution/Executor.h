@@ -38,6 +38,7 @@ class Executor final : public WorkQueues {
   std::shared_ptr<WorkQueue> makeSerial(std::string_view label, QualityOfService quality) override;
   WorkQueue& background() override { return concurrent_; }
   std::unique_ptr<WorkCause> takeCause() override;
+  std::optional<WorkOrigin> currentOrigin() override { return CauseScope::origin(); }
   void withoutCause(const Work& work) override;
   void beginBlocking() override { Lane::beginBlocking(); }
   void endBlocking() override { Lane::endBlocking(); }

@@ -64,6 +64,7 @@ class SocketConnection final : public ClientConnection,
   void onReady(uint32_t events) override;
 
   uid_t user() const { return uid_; }
+  uint64_t recordedAs() const { return recordedAs_; }
   // What the service does next belongs to this connection's being accepted.
   Cause recordAccepted();
   // The listener says that reading may go on.

@@ -170,6 +170,18 @@ bool SocketListener::turnAwayForLackOfDescriptors() {
   return turnedAway;
 }
 
+std::unordered_map<const ExportedObject*, SocketListener::Recorded>
+SocketListener::recordedConnections() const {
+  std::unordered_map<const ExportedObject*, Recorded> recorded;
+  for (const auto& [key, connection] : connections_) {
+    const std::shared_ptr<ExportedObject> object = connection->exportedObject();
+    if (object == nullptr || connection->recordedAs() == CallRecorder::kUnrecorded) continue;
+    recorded.emplace(object.get(), Recorded{connection->recordedAs(),
+                                            connection->processIdentifier(), connection->user()});
+  }
+  return recorded;
+}
+
 void SocketListener::waitForReading(const std::shared_ptr<SocketConnection>& connection) {
   VX_DCHECK(executor_.isInteractiveThread());
   waiting_.push_back(connection);

@@ -51,6 +51,15 @@ class SocketListener final : public ServiceListener,
   // Serves until the loop is stopped, then ends every connection in order, within kShutdownTime.
   void resume() override;
 
+  // The recorded connections, by the objects that they export.
+  struct Recorded {
+    uint64_t connection = 0;
+    pid_t pid = 0;
+    uid_t uid = 0;
+  };
+  std::unordered_map<const ExportedObject*, Recorded> recordedConnections() const;
+  std::shared_ptr<ServiceListenerDelegate> delegate() const { return delegate_.lock(); }
+
   // From any thread: what was congested no longer is.
   void congestionEnded();
 

@@ -15,6 +15,7 @@ namespace {
 // fails costs milliseconds.
 constexpr uint32_t kAppendsBetweenGrowths = 256;
 constexpr std::size_t kMinSegments = 4;
+constexpr std::size_t kSpares = 2;  // that are kept free, once a second segment was needed
 
 void store(uint32_t& word, uint32_t value, std::memory_order order) {
   std::atomic_ref<uint32_t>(word).store(value, order);
@@ -41,6 +42,7 @@ Result<std::unique_ptr<Journal>> Journal::open(JournalOptions options,
     if (!complaint.empty() && complaints != nullptr) complaints->push_back(std::move(complaint));
   }
   journal->sortAdopted();
+  (void)journal->lookForCapacity();
   return journal;
 }
 
@@ -98,6 +100,10 @@ JournalTicket Journal::resume(JournalPlace place) {
   return JournalTicket(entry);
 }
 
+void Journal::setCallsDoneHandler(void (*handler)(void*), void* with) {
+  JournalSegment::setCallsDoneHandler(handler, with);
+}
+
 bool Journal::earlierCallsAreDone() const {
   MutexLock lock(mutex_);
   return std::ranges::none_of(sealed_, [this](const auto& segment) REQUIRES(mutex_) {
@@ -125,7 +131,7 @@ Result<JournalAppended> Journal::append(const JournalRecord& record) {
 
 Result<JournalAppended> Journal::appendEnd(const JournalRecord& record) {
   MutexLock lock(mutex_);
-  return write(record, EntryType::Call, Use::Snapshot);
+  return write(record, EntryType::Call, Use::Ends);
 }
 
 Result<JournalAppended> Journal::appendToSnapshot(const JournalRecord& record) {
@@ -142,6 +148,7 @@ Status Journal::endSnapshot() {
   inSnapshot_ = false;
   base_ = next_.generation;
   recycle();
+  updateCapacity();
   return {};
 }
 
@@ -164,6 +171,7 @@ Result<JournalAppended> Journal::write(const JournalRecord& record, EntryType ty
   entry->flags = placed               ? EntryHeader::kDictionary
                  : !record.dictionary ? uint8_t{0}
                                       : EntryHeader::kEmptyDictionary;
+  if (record.forEarlier) entry->flags |= EntryHeader::kForEarlier;
   entry->reserved = 0;
   std::memset(bytes + body - kEntryAlignment, 0, record.head.empty() ? 0 : kEntryAlignment);
   copyTo(bytes + sizeof(EntryHeader), record.head);
@@ -186,7 +194,7 @@ Status Journal::note(const JournalTicket& ticket, uint8_t kind, std::span<const 
   MutexLock lock(mutex_);
   const std::size_t length = bodyOffset(0) + bytes.size();
   Status status;
-  EntryHeader* const entry = reserve(length, Use::Calls, status);
+  EntryHeader* const entry = reserve(length, Use::Ends, status);
   if (entry == nullptr) return status;
   *entry = {};
   entry->call = ticket.call();
@@ -243,6 +251,7 @@ Status Journal::roll(Use use) {
   recycle();
   Result<JournalSegment::Pointer> next = acquire(use);
   if (!next.ok()) return next.status();
+  severalNeeded_ = active_ != nullptr || !sealed_.empty();
   if (active_ != nullptr) {
     active_->seal(callsInActive_, payloadsInActive_);
     sealed_.push_back(std::move(active_));
@@ -252,14 +261,51 @@ Status Journal::roll(Use use) {
   offset_ = kFirstEntry;
   callsInActive_ = 0;
   payloadsInActive_ = 0;
+  keepSpares();
+  updateCapacity();
   return {};
 }
 
-Result<JournalSegment::Pointer> Journal::acquire(Use use) {
+bool Journal::isWithinShare(Use use) const {
   const std::size_t most = options_.maxBytes / kSegmentBytes;
-  const std::size_t reserved = use == Use::Snapshot ? 0 : most / 4;
-  if (discarded_ || segmentsInUse() + 1 > most - reserved) return full("cannot record a call");
+  const std::size_t forOthers = use == Use::Calls ? most / 4 : use == Use::Ends ? 1 : 0;
+  return segmentsInUse() < most - forOthers;
+}
+
+// Where the file system has become full there must be a segment for the calls that come next and
+// one for the snapshot that makes the others free. Most processes need one segment, and have no
+// spares.
+void Journal::keepSpares() {
+  if (!severalNeeded_) return;
+  while (free_.size() < kSpares && isWithinShare(Use::Snapshot)) {
+    Result<JournalSegment::Pointer> spare = grow();
+    if (!spare.ok()) return;
+    free_.push_back(std::move(spare).value());
+  }
+}
+
+void Journal::updateCapacity() {
+  const bool spares = !severalNeeded_ || free_.size() >= kSpares || !isWithinShare(Use::Snapshot);
+  full_.store(!isWithinShare(Use::Calls) || !spares, std::memory_order_relaxed);
+}
+
+bool Journal::lookForCapacity() {
+  MutexLock lock(mutex_);
+  appendsUntilGrowth_ = 0;
+  recycle();
+  keepSpares();
+  updateCapacity();
+  return hasCapacity();
+}
+
+Result<JournalSegment::Pointer> Journal::acquire(Use use) {
+  if (discarded_ || !isWithinShare(use)) return full("cannot record a call");
   if (free_.empty()) return grow();
+  // The last one is a snapshot's.
+  if (use != Use::Snapshot && free_.size() == 1 && severalNeeded_) {
+    if (Result<JournalSegment::Pointer> grown = grow(); grown.ok()) return grown;
+    return full("cannot record a call");
+  }
   JournalSegment::Pointer segment = std::move(free_.back());
   free_.pop_back();
   return segment;

@@ -1,6 +1,7 @@
 // Where every call is recorded before it runs, so that what was accepted survives the process.
 #pragma once
 
+#include <atomic>
 #include <cstdint>
 #include <deque>
 #include <optional>
@@ -34,6 +35,8 @@ struct JournalRecord {
   uint64_t connection = 0;
   std::span<const uint8_t> head = {};
   std::optional<Payload::Validated> dictionary = {};
+  // It stands for work of an earlier call, whose number is `connection`.
+  bool forEarlier = false;
 };
 
 struct JournalAppended {
@@ -70,7 +73,13 @@ class Journal {
   ~Journal();
 
   // ENOSPC when full, EMSGSIZE for an entry beyond kMaxEntryBytes: nothing was recorded.
+  // Whoever appends is expected to stop while there is no capacity: what is left is for the ends of
+  // what has begun, and for a snapshot.
   Result<JournalAppended> append(const JournalRecord& record);
+  // Cheap; from any thread.
+  bool hasCapacity() const { return !full_.load(std::memory_order_relaxed); }
+  // Tries to find some where there was none.
+  bool lookForCapacity();
   // Records an input of a call that is not done.
   Status note(const JournalTicket& ticket, uint8_t kind, std::span<const uint8_t> bytes);
 
@@ -84,8 +93,12 @@ class Journal {
   // None when its segment is not here. The entry must have been read from this journal's files, and
   // is resumed once.
   JournalTicket resume(JournalPlace place);
-  // As append(), also with the space that is kept for a snapshot.
+  // As append(), for what cannot wait: also with space that calls may not fill, but for a
+  // snapshot's last segment. So are notes.
   Result<JournalAppended> appendEnd(const JournalRecord& record);
+  // Told, on whatever thread and under a lock, when the last call of a segment that is full is
+  // done. One per process; null ends it.
+  static void setCallsDoneHandler(void (*handler)(void*), void* with);
   // No call of an earlier generation waits any more.
   bool earlierCallsAreDone() const;
   // Nothing that was recorded is wanted any more: a stop that has committed everything. Appends
@@ -97,7 +110,7 @@ class Journal {
   JournalCounters counters() const;
 
  private:
-  enum class Use { Calls, Snapshot };
+  enum class Use { Calls, Ends, Snapshot };
   Journal(JournalOptions options, JournalFolder folder);
   std::string adopt(const std::string& name);
   void sortAdopted();
@@ -113,9 +126,13 @@ class Journal {
   void makeFree(JournalSegment::Pointer segment) REQUIRES(mutex_);
   std::size_t segmentsInUse() const REQUIRES(mutex_);
   Status full(std::string_view tried) REQUIRES(mutex_);
+  bool isWithinShare(Use use) const REQUIRES(mutex_);
+  void keepSpares() REQUIRES(mutex_);
+  void updateCapacity() REQUIRES(mutex_);
 
   const JournalOptions options_;
   const JournalFolder folder_;
+  std::atomic<bool> full_{false};
   mutable Mutex mutex_;
   JournalSegment::Pointer active_ GUARDED_BY(mutex_);
   std::size_t offset_ GUARDED_BY(mutex_) = kSegmentBytes;  // of the next entry
@@ -127,6 +144,7 @@ class Journal {
   JournalNumbers next_ GUARDED_BY(mutex_);  // its generation is the one that is being written
   uint64_t nextFile_ GUARDED_BY(mutex_) = 1;
   uint32_t base_ GUARDED_BY(mutex_) = 0;  // the newest generation whose snapshot is complete
+  bool severalNeeded_ GUARDED_BY(mutex_) = false;  // segments
   bool inSnapshot_ GUARDED_BY(mutex_) = false;
   bool discarded_ GUARDED_BY(mutex_) = false;
   uint32_t appendsUntilGrowth_ GUARDED_BY(mutex_) = 0;

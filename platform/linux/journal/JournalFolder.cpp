@@ -224,10 +224,11 @@ Status JournalFolder::moveTo(const std::string& from, const std::string& to) {
   uint64_t next = 1;
   for (const std::string& name : source->segments()) {
     const Result<Opened> opened = source->openSegment(name, Access::Read);
-    if (!opened.ok() || opened->header.state == SegmentHeader::kFree) continue;
+    if (!opened.ok()) continue;
+    moved.push_back(name);
+    if (opened->header.state == SegmentHeader::kFree) continue;
     Status copied = source->copySegment(name, *target, target->freshSegment(next));
     if (!copied.ok()) return copied;
-    moved.push_back(name);
   }
   if (fsync(target->fd_.get()) != 0) return Status::lastError(quoted("cannot sync", to));
   for (const std::string& name : moved) source->remove(name);

@@ -56,6 +56,7 @@ struct SegmentHeader {
 struct EntryHeader {
   static constexpr uint8_t kDictionary = 1;       // the body is one
   static constexpr uint8_t kEmptyDictionary = 2;  // there is one, and it is empty
+  static constexpr uint8_t kForEarlier = 4;       // work of the call whose number is `connection`
 
   // Beside the tickets of a call that is replayed although it was done.
   static constexpr uint32_t kWasDone = uint32_t{1} << 31;

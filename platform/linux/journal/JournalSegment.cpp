@@ -4,13 +4,38 @@
 
 #include <utility>
 
+#include "base/Mutex.h"
+
 namespace vx::lnx {
 
 namespace {
 
 std::atomic_ref<uint32_t> wordAt(uint32_t& word) { return std::atomic_ref<uint32_t>(word); }
 
+struct CallsDone {
+  Mutex mutex;
+  void (*handler)(void*) GUARDED_BY(mutex) = nullptr;
+  void* with GUARDED_BY(mutex) = nullptr;
+};
+CallsDone& callsDone() {
+  static CallsDone done;
+  return done;
+}
+
 }  // namespace
+
+void JournalSegment::setCallsDoneHandler(void (*handler)(void*), void* with) {
+  CallsDone& done = callsDone();
+  MutexLock lock(done.mutex);
+  done.handler = handler;
+  done.with = with;
+}
+
+void JournalSegment::tellCallsDone() {
+  CallsDone& done = callsDone();
+  MutexLock lock(done.mutex);
+  if (done.handler != nullptr) done.handler(done.with);
+}
 
 Result<JournalSegment::Pointer> JournalSegment::map(const UniqueFd& fd, std::string name) {
   // Twice the size holds an aligned part of the size; the rest is given back.

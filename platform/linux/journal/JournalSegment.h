@@ -44,7 +44,14 @@ class JournalSegment {
   }
   bool hasPayloads() const { return (uses_.load(std::memory_order_acquire) & kPayloads) != 0; }
 
-  void callDone() { drop(kOneCall); }
+  void callDone() {
+    const uint64_t before = uses_.fetch_sub(kOneCall, std::memory_order_acq_rel);
+    if (before == kOneCall) delete this;
+    if ((before & kCalls) == kOneCall) [[unlikely]]
+      tellCallsDone();
+  }
+  // See Journal.
+  static void setCallsDoneHandler(void (*handler)(void*), void* with);
   void payloadReleased() { drop(kOnePayload); }
 
   const std::string& name() const { return name_; }
@@ -64,6 +71,7 @@ class JournalSegment {
 
   JournalSegment(uint8_t* base, std::string name);
   ~JournalSegment();
+  static void tellCallsDone();
   SegmentHeader& header() const { return *reinterpret_cast<SegmentHeader*>(base_); }
   void drop(uint64_t uses) {
     if (uses_.fetch_sub(uses, std::memory_order_acq_rel) == uses) delete this;

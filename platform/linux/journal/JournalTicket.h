@@ -27,6 +27,12 @@ class JournalTicket {
   void abandon() noexcept { entry_ = nullptr; }
   explicit operator bool() const { return entry_ != nullptr; }
   uint64_t call() const { return entry_ == nullptr ? 0 : entry_->call; }
+  // The call that rows are named after: the entry's own, or the earlier one whose work it stands
+  // for.
+  uint64_t namedCall() const {
+    if (entry_ == nullptr) return 0;
+    return (entry_->flags & EntryHeader::kForEarlier) != 0 ? entry_->connection : entry_->call;
+  }
   // When the call was accepted, seconds since 1970; and the kind of its record. Of a call only.
   double time() const { return entry_->time; }
   uint8_t kind() const { return entry_->kind; }

@@ -19,8 +19,10 @@ enum class RecordKind : uint8_t {
   PreferencesChanged = 9,
   ClientState = 10,  // parts of a snapshot
   SessionState = 11,
-  MessageState = 12,
-  ServiceBegan = 13,  // what comes next was recorded by a process that knew nothing of what was
+  RelayState = 12,
+  ServiceState = 14,    // part of a snapshot
+  DelayedMessage = 15,  // a call's, which waits for so long that it has a record of its own
+  ServiceBegan = 13,    // what comes next was recorded by a process that knew nothing of what was
 };
 
 }  // namespace vx::lnx

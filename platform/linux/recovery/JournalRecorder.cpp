@@ -41,7 +41,7 @@ RecordKind kindOf(CallRecorder::End how) {
 CallRecorder::Accepted JournalRecorder::accepted(pid_t pid, uid_t uid) {
   std::array<uint8_t, kAcceptedHeadBytes> head;
   writeAccepted({pid, uid}, head);
-  JournalAppended appended = append(RecordKind::Accepted, kUnrecorded, head);
+  JournalAppended appended = append(RecordKind::Accepted, kUnrecorded, head, {}, Must::Always);
   return {appended.call, std::move(appended.ticket)};
 }
 
@@ -59,20 +59,24 @@ CallRecorder::Called JournalRecorder::called(uint64_t connection, const Frame& c
 }
 
 JournalTicket JournalRecorder::ended(uint64_t connection, End how) {
-  return append(kindOf(how), connection, {}).ticket;
+  return append(kindOf(how), connection, {}, {}, Must::Always).ticket;
 }
 
 JournalTicket JournalRecorder::preferencesChanged(std::string_view notification) {
   const auto* const bytes = reinterpret_cast<const uint8_t*>(notification.data());
-  return append(RecordKind::PreferencesChanged, kUnrecorded, {bytes, notification.size()}).ticket;
+  return append(RecordKind::PreferencesChanged, kUnrecorded, {bytes, notification.size()}, {},
+                Must::Always)
+      .ticket;
 }
 
 JournalAppended JournalRecorder::append(RecordKind kind, uint64_t connection,
                                         std::span<const uint8_t> head,
-                                        const std::optional<Payload::Validated>& dictionary) {
+                                        const std::optional<Payload::Validated>& dictionary,
+                                        Must must) {
   if (!time_) time_ = std::chrono::duration<double>(clock_.now().time_since_epoch()).count();
+  const JournalRecord record{static_cast<uint8_t>(kind), *time_, connection, head, dictionary};
   Result<JournalAppended> appended =
-      journal_.append({static_cast<uint8_t>(kind), *time_, connection, head, dictionary});
+      must == Must::Always ? journal_.appendEnd(record) : journal_.append(record);
   if (!appended.ok()) [[unlikely]] {
     countUnrecorded(appended.status());
     return {};
@@ -82,7 +86,8 @@ JournalAppended JournalRecorder::append(RecordKind kind, uint64_t connection,
 }
 
 void JournalRecorder::countUnrecorded(const Status& why) {
-  if (counters_.unrecorded++ == 0 && unrecorded_) unrecorded_(why);
+  ++counters_.unrecorded;
+  if (unrecorded_) unrecorded_(why);
 }
 
 }  // namespace vx::lnx

@@ -14,9 +14,10 @@
 
 namespace vx::lnx {
 
-// Owned by the platform; used on the interactive thread. What the journal has no space for runs
-// unrecorded, which is counted. A connection that could not be recorded stays so, with its calls:
-// without it they could not be run again.
+// Owned by the platform; used on the interactive thread. Connections are not read while the journal
+// has no capacity. What cannot be recorded even so (the file system takes no more) runs unrecorded,
+// which is counted. A connection that could not be recorded stays so, with its calls: without it
+// they could not be run again.
 class JournalRecorder final : public CallRecorder {
  public:
   struct Counters {
@@ -25,7 +26,7 @@ class JournalRecorder final : public CallRecorder {
   };
 
   JournalRecorder(Journal& journal, Clock& clock) : journal_(journal), clock_(clock) {}
-  // Told about the first that is not recorded, and why.
+  // Told about each that is not recorded, and why.
   void setUnrecordedHandler(Function<void(const Status& why)> handler) {
     unrecorded_ = std::move(handler);
   }
@@ -43,8 +44,11 @@ class JournalRecorder final : public CallRecorder {
   const Counters& counters() const { return counters_; }
 
  private:
+  // Calls wait in their sockets while there is no capacity; what else happens cannot.
+  enum class Must : uint8_t { WithinShare, Always };
   JournalAppended append(RecordKind kind, uint64_t connection, std::span<const uint8_t> head,
-                         const std::optional<Payload::Validated>& dictionary = {});
+                         const std::optional<Payload::Validated>& dictionary = {},
+                         Must must = Must::WithinShare);
   void countUnrecorded(const Status& why);
 
   Journal& journal_;

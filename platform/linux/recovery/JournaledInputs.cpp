@@ -16,4 +16,20 @@ std::optional<Payload> JournaledInputs::once(std::string_view what,
   return answer;
 }
 
+// Where there is no space the call waits with its work.
+void JournaledInputs::keepDelayed(const Payload& facts, const Payload& content, WorkCause& cause) {
+  auto& held = static_cast<HeldCause&>(cause);
+  const JournalTicket& ticket = held.cause().ticket;
+  if (journal_ == nullptr || !ticket) return;
+  const std::vector<uint8_t> head = writeDelayed(held.cause().position, facts);
+  Result<JournalAppended> appended =
+      journal_->appendEnd({.kind = static_cast<uint8_t>(RecordKind::DelayedMessage),
+                           .time = ticket.time(),
+                           .connection = ticket.namedCall(),
+                           .head = head,
+                           .dictionary = content.validated(),
+                           .forEarlier = true});
+  if (appended.ok()) held.moveTo(std::move(appended->ticket));
+}
+
 }  // namespace vx::lnx

@@ -24,6 +24,51 @@ T numberAt(std::span<const uint8_t> bytes, std::size_t offset) {
   return value;
 }
 
+template <class T>
+void put(std::vector<uint8_t>& head, T number) {
+  const auto* const bytes = reinterpret_cast<const uint8_t*>(&number);
+  head.insert(head.end(), bytes, bytes + sizeof number);
+}
+
+void put(std::vector<uint8_t>& head, const Payload& facts) {
+  const std::span<const uint8_t> bytes = facts.encoded();
+  head.insert(head.end(), bytes.begin(), bytes.end());
+}
+
+// Of what a process wrote that is gone: believes nothing.
+class HeadReader {
+ public:
+  explicit HeadReader(std::span<const uint8_t> head) : left_(head) {}
+  template <class T>
+  T number() {
+    if (left_.size() < sizeof(T)) understood_ = false;
+    if (!understood_) return T();
+    const T value = numberAt<T>(left_, 0);
+    left_ = left_.subspan(sizeof(T));
+    return value;
+  }
+  CausePosition position() {
+    CausePosition position;
+    position.place = number<uint32_t>();
+    const auto depth = number<uint32_t>();
+    if (depth > kDeepestCause) understood_ = false;
+    position.depth = static_cast<uint8_t>(depth);
+    return position;
+  }
+  // The rest.
+  Payload dictionary() {
+    std::optional<Payload> read = Payload::decode(left_);
+    left_ = {};
+    if (!read) understood_ = false;
+    return std::move(read).value_or(Payload());
+  }
+  bool understood() const { return understood_ && left_.empty(); }
+
+ private:
+  std::span<const uint8_t> left_;
+  bool understood_ = true;
+};
+
 }  // namespace
 
 void writeAccepted(const RecordedClient& client, std::span<uint8_t, kAcceptedHeadBytes> head) {
@@ -75,6 +120,75 @@ Result<RecordedCall> readCall(std::span<const uint8_t> head,
     call.arguments.set(*element - wire::kCallHead,
                        std::optional<Payload>(dictionary.value_or(Payload())));
   return call;
+}
+
+// ---------------------------------------------------------------------------------------------------------------------
+// States
+
+std::vector<uint8_t> writeDelayed(const CausePosition& position, const Payload& facts) {
+  std::vector<uint8_t> head;
+  put(head, position.place);
+  put(head, uint32_t{position.depth});
+  put(head, facts);
+  return head;
+}
+
+std::optional<RecordedDelay> readDelayed(std::span<const uint8_t> head) {
+  RecordedDelay delay;
+  HeadReader reader(head);
+  delay.position = reader.position();
+  delay.facts = reader.dictionary();
+  return reader.understood() ? std::optional(std::move(delay)) : std::nullopt;
+}
+
+std::vector<uint8_t> writeClientState(const RecordedClient& client, const Payload& facts) {
+  std::vector<uint8_t> head;
+  put(head, client.pid);
+  put(head, client.uid);
+  put(head, facts);
+  return head;
+}
+
+std::optional<RecordedClientState> readClientState(std::span<const uint8_t> head) {
+  RecordedClientState state;
+  HeadReader reader(head);
+  state.client.pid = reader.number<pid_t>();
+  state.client.uid = reader.number<uid_t>();
+  state.facts = reader.dictionary();
+  return reader.understood() ? std::optional(std::move(state)) : std::nullopt;
+}
+
+std::vector<uint8_t> writeSessionState(int64_t reporterID, const Payload& facts) {
+  std::vector<uint8_t> head;
+  put(head, reporterID);
+  put(head, facts);
+  return head;
+}
+
+std::optional<RecordedSessionState> readSessionState(std::span<const uint8_t> head) {
+  RecordedSessionState state;
+  HeadReader reader(head);
+  state.reporterID = reader.number<int64_t>();
+  state.facts = reader.dictionary();
+  return reader.understood() ? std::optional(std::move(state)) : std::nullopt;
+}
+
+std::vector<uint8_t> writeRelayState(const RecordedRelayState& state) {
+  std::vector<uint8_t> head;
+  put(head, state.position.place);
+  put(head, uint32_t{state.position.depth});
+  put(head, state.connection);
+  put(head, state.reporterID);
+  return head;
+}
+
+std::optional<RecordedRelayState> readRelayState(std::span<const uint8_t> head) {
+  RecordedRelayState state;
+  HeadReader reader(head);
+  state.position = reader.position();
+  state.connection = reader.number<uint64_t>();
+  state.reporterID = reader.number<int64_t>();
+  return reader.understood() ? std::optional(state) : std::nullopt;
 }
 
 std::string_view endWordOf(const JournalTicket& call) {

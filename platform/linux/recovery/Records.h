@@ -7,6 +7,15 @@
 //   Ended...            | none                                              | none
 //   ServiceBegan        | none                                              | none
 //   PreferencesChanged  | the notification's name                           | none
+//   DelayedMessage      | place 4 | depth 4 | facts                         | the message
+//   ServiceState        | facts                                             | none
+//   ClientState         | pid 4 | uid 4 | facts                             | none
+//   SessionState        | reporter 8 | facts                                | a piece of
+//   information RelayState          | place 4 | depth 4 | connection 8 | reporter 8     | none
+//
+// Facts are a dictionary in CBOR that only the service understands. The States are parts of a
+// snapshot. A DelayedMessage and a RelayState stand for work of an earlier call: their connection
+// is that call's number. A session whose information has several pieces has as many SessionStates.
 //
 // A connection is known by the call number of its Accepted record, whose own connection is 0; all
 // other records of a connection bear that number. Notes have one kind:
@@ -26,6 +35,7 @@
 
 #include "base/Status.h"
 #include "platform/ClientConnection.h"
+#include "platform/linux/execution/CauseScope.h"
 #include "platform/linux/journal/JournalReader.h"
 #include "platform/linux/journal/JournalTicket.h"
 #include "platform/linux/journal/RecordKind.h"
@@ -62,6 +72,33 @@ struct RecordedInput {
 };
 std::vector<uint8_t> writeInput(uint32_t place, std::string_view what, const Payload& answer);
 std::optional<RecordedInput> readInput(std::span<const uint8_t> note);
+
+// Each is none when the head is not of its kind.
+std::vector<uint8_t> writeDelayed(const CausePosition& position, const Payload& facts);
+struct RecordedDelay {
+  CausePosition position;
+  Payload facts;
+};
+std::optional<RecordedDelay> readDelayed(std::span<const uint8_t> head);
+std::vector<uint8_t> writeClientState(const RecordedClient& client, const Payload& facts);
+struct RecordedClientState {
+  RecordedClient client;
+  Payload facts;
+};
+std::optional<RecordedClientState> readClientState(std::span<const uint8_t> head);
+std::vector<uint8_t> writeSessionState(int64_t reporterID, const Payload& facts);
+struct RecordedSessionState {
+  int64_t reporterID = 0;
+  Payload facts;
+};
+std::optional<RecordedSessionState> readSessionState(std::span<const uint8_t> head);
+struct RecordedRelayState {
+  CausePosition position;
+  uint64_t connection = 0;
+  int64_t reporterID = 0;
+};
+std::vector<uint8_t> writeRelayState(const RecordedRelayState& state);
+std::optional<RecordedRelayState> readRelayState(std::span<const uint8_t> head);
 
 // How the session ended that the work of this call ended; empty when such a call ends none.
 std::string_view endWordOf(const JournalTicket& call);

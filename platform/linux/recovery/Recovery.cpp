@@ -24,17 +24,27 @@ Recovery::Recovery(RecoveryMeans means, JournalContents contents)
       platform_(means_.live, means_.backends, inputs_),
       patience_(kPatience) {}
 
-uint64_t Recovery::firstUndone() const {
-  const auto first =
-      std::ranges::find_if(contents_.records, [](const Record& record) { return !record.done; });
-  return first != contents_.records.end() ? first->call : contents_.next.call;
+ReplayedCalls Recovery::calls() const {
+  ReplayedCalls calls{.first = contents_.next.call, .sessionsFrom = contents_.next.call};
+  for (const Record& record : contents_.records) {
+    const auto kind = static_cast<RecordKind>(record.kind);
+    if (kind == RecordKind::RelayState || (kind == RecordKind::DelayedMessage && !record.done))
+      calls.earlierSessions.push_back(record.connection);
+    if (record.type == EntryType::Snapshot) continue;
+    calls.sessionsFrom = std::min(calls.sessionsFrom, record.call);
+    if (!record.done) calls.first = std::min(calls.first, record.call);
+  }
+  return calls;
 }
 
 RecoveryOutcome Recovery::run(const MakeDelegate& makeDelegate) {
   installPlatform(&platform_.services());
   makeDelegate_ = &makeDelegate;
   beginService();
+  for (const Record& record : contents_.records)
+    if (record.type == EntryType::Snapshot) restore(record);
   for (const Record& record : contents_.records) {
+    if (record.type == EntryType::Snapshot) continue;
     lastTime_ = std::max(lastTime_, record.time);
     runRecord(record);
   }
@@ -79,6 +89,9 @@ void Recovery::runRecord(const Record& record) {
         break;
       case RecordKind::PreferencesChanged:
         platform_.notify({reinterpret_cast<const char*>(record.head.data()), record.head.size()});
+        break;
+      case RecordKind::DelayedMessage:
+        delayed(record);
         break;
       case RecordKind::ServiceBegan:
         beginService();
@@ -127,6 +140,91 @@ void Recovery::end(const Record& record) {
   connections_.erase(found);
   if (record.kind == static_cast<uint8_t>(RecordKind::EndedInterrupted)) connection->interrupt();
   connection->invalidate();
+}
+
+// Where its call is run again, that makes it wait again: then this record has had its time, as one
+// has that another took the place of.
+void Recovery::delayed(const Record& record) {
+  if (record.done || isUndone(record.connection)) return;
+  std::optional<RecordedDelay> delay = readDelayed(record.head);
+  if (!delay || !record.dictionary) {
+    ++outcome_.unreadable;
+    return;
+  }
+  if (!delayed_.emplace(record.connection, delay->position.place).second) return;
+  auto cause =
+      std::make_unique<HeldCause>(Cause{*CauseScope::current(), std::move(delay->position)});
+  if (!delegate_->restoreDelayed(delay->facts, *record.dictionary, std::move(cause)))
+    ++outcome_.unreadable;
+}
+
+bool Recovery::isUndone(uint64_t call) const {
+  const auto found = std::ranges::lower_bound(contents_.records, call, {}, &Record::call);
+  return found != contents_.records.end() && found->call == call && !found->done;
+}
+
+// ---------------------------------------------------------------------------------------------------------------------
+// The snapshot
+
+// All that it stands for was done before.
+void Recovery::restore(const Record& record) {
+  Cause cause{means_.journal.resume(record.place), {}};
+  if (record.kind == static_cast<uint8_t>(RecordKind::RelayState)) {
+    if (const std::optional<RecordedRelayState> state = readRelayState(record.head))
+      cause.position = state->position;
+  }
+  const CauseScope scope(cause);
+  if (!restorePart(record)) ++outcome_.unreadable;
+  runInteractive();
+}
+
+bool Recovery::restorePart(const Record& record) {
+  switch (static_cast<RecordKind>(record.kind)) {
+    case RecordKind::ServiceState: {
+      const std::optional<Payload> facts = Payload::decode(record.head);
+      return facts && delegate_->restoreService(*facts);
+    }
+    case RecordKind::ClientState:
+      return restoreClient(record);
+    case RecordKind::SessionState:
+      return restoreSession(record);
+    case RecordKind::RelayState:
+      return restoreRelay(record);
+    default:
+      return false;
+  }
+}
+
+bool Recovery::restoreClient(const Record& record) {
+  const std::optional<RecordedClientState> state = readClientState(record.head);
+  if (!state) return false;
+  const auto connection =
+      std::make_shared<RecoveredConnection>(state->client.pid, state->client.uid);
+  if (!delegate_->listener(means_.live.serviceListener, connection)) return false;
+  runInteractive();
+  connections_.emplace(record.connection, connection);
+  ++outcome_.restored;
+  const std::shared_ptr<ExportedObject> object = connection->exportedObject();
+  return object != nullptr && delegate_->restoreClient(*object, state->facts);
+}
+
+bool Recovery::restoreSession(const Record& record) {
+  const std::optional<RecordedSessionState> state = readSessionState(record.head);
+  const auto found = connections_.find(record.connection);
+  if (!state || found == connections_.end()) return false;
+  const std::shared_ptr<ExportedObject> object = found->second->exportedObject();
+  ++outcome_.restored;
+  return object != nullptr && delegate_->restoreSession(*object, state->reporterID, state->facts,
+                                                        record.dictionary.value_or(Payload()));
+}
+
+bool Recovery::restoreRelay(const Record& record) {
+  const std::optional<RecordedRelayState> state = readRelayState(record.head);
+  if (!state) return false;
+  const auto found = connections_.find(state->connection);
+  if (found == connections_.end()) return false;
+  const std::shared_ptr<ExportedObject> object = found->second->exportedObject();
+  return object != nullptr && delegate_->restoreRelay(*object, state->reporterID);
 }
 
 // ---------------------------------------------------------------------------------------------------------------------

@@ -5,7 +5,9 @@
 #include <cstdint>
 #include <map>
 #include <memory>
+#include <set>
 #include <string>
+#include <utility>
 #include <vector>
 
 #include "base/Function.h"
@@ -18,6 +20,7 @@
 #include "platform/linux/recovery/RecoveredConnection.h"
 #include "platform/linux/recovery/ReplayInputs.h"
 #include "platform/linux/recovery/ReplayPlatform.h"
+#include "platform/linux/store/KnownRows.h"
 
 namespace vx::lnx {
 
@@ -34,14 +37,16 @@ struct RecoveryOutcome {
   uint64_t calls = 0;       // run again
   uint64_t undone = 0;      // of these, what an earlier process had not finished
   uint64_t ended = 0;       // connections that were open
-  uint64_t unreadable = 0;  // records that no operation understands
+  uint64_t restored = 0;    // clients and sessions, from the snapshot before the calls
+  uint64_t unreadable = 0;  // records that no operation understands, and parts of snapshots
 };
 
-// Every recorded call goes through the service's own code once more, in its order, on a platform
-// that stands for the time it was accepted at: those that were done for the state they leave, the
-// others for their rows too. Then each connection that was open ends, and with it its sessions.
-// Rows of a call keep their names, so that whoever writes them finds those that are there already:
-// a recovery that is cut short at any point can be begun again.
+// What a snapshot holds is given back to the service. Every call recorded since goes through the
+// service's own code once more, in its order, on a platform that stands for the time it was
+// accepted at: those that were done for the state they leave, the others for their rows too. Then
+// each connection that was open ends, and with it its sessions. Rows of a call keep their names, so
+// that whoever writes them finds those that are there already: a recovery that is cut short at any
+// point can be begun again.
 //
 // Owned by the platform, and kept: work that has to wait (a delayed message) goes on after run().
 // Used on the interactive thread, before the listener listens.
@@ -54,8 +59,8 @@ class Recovery {
   Recovery(const Recovery&) = delete;
   Recovery& operator=(const Recovery&) = delete;
 
-  // The number of the first call that has rows to be written.
-  uint64_t firstUndone() const;
+  // Whose rows may be written, and which relay sessions are gone back to.
+  ReplayedCalls calls() const;
   // Makes delegates of its own, on a platform that is installed until it returns.
   RecoveryOutcome run(const MakeDelegate& makeDelegate);
 
@@ -66,6 +71,15 @@ class Recovery {
   void accept(const Record& record);
   void call(const Record& record);
   void end(const Record& record);
+  void delayed(const Record& record);
+  bool isUndone(uint64_t call) const;
+
+  // Parts of a snapshot.
+  void restore(const Record& record);
+  bool restorePart(const Record& record);
+  bool restoreClient(const Record& record);
+  bool restoreSession(const Record& record);
+  bool restoreRelay(const Record& record);
   void endOpenConnections();
   Cause append(RecordKind kind, uint64_t connection);
   void runInteractive();
@@ -79,6 +93,8 @@ class Recovery {
   std::shared_ptr<ServiceListenerDelegate> delegate_;
   // In the order in which they were accepted.
   std::map<uint64_t, std::shared_ptr<RecoveredConnection>> connections_;
+  // The work that waits by itself: its call and place.
+  std::set<std::pair<uint64_t, uint32_t>> delayed_;
   double lastTime_ = 0;  // the latest that was recorded
   std::chrono::nanoseconds patience_;
   RecoveryOutcome outcome_;

@@ -1,5 +1,8 @@
 #include "platform/linux/store/KnownRows.h"
 
+#include <algorithm>
+#include <unordered_set>
+
 #include "platform/linux/store/Database.h"
 
 namespace vx::lnx {
@@ -33,7 +36,8 @@ uint64_t KnownRows::lastCall(sqlite3* database) {
   return last.row() ? static_cast<uint64_t>(last.integer(0)) : 0;
 }
 
-Result<KnownRows> KnownRows::load(sqlite3* database, uint64_t firstCall) {
+Result<KnownRows> KnownRows::load(sqlite3* database, const ReplayedCalls& calls) {
+  const uint64_t firstCall = calls.first;
   KnownRows known;
   known.firstCall_ = firstCall;
   Statement mark(database, kLastMark);
@@ -44,7 +48,27 @@ Result<KnownRows> KnownRows::load(sqlite3* database, uint64_t firstCall) {
     if (known.read(database, sql, after) != SQLITE_DONE)
       return Status::failure(sqlite3_errmsg(database));
   }
+  if (known.readSessions(database, calls) != SQLITE_DONE)
+    return Status::failure(sqlite3_errmsg(database));
   return known;
+}
+
+// There is no order of calls to search by: one pass for all of them.
+int KnownRows::readSessions(sqlite3* database, const ReplayedCalls& calls) {
+  const std::unordered_set<uint64_t> single(calls.earlierSessions.begin(),
+                                            calls.earlierSessions.end());
+  uint64_t lowest = calls.sessionsFrom;
+  for (const uint64_t call : single) lowest = std::min(lowest, call);
+  Statement rows(database,
+                 "SELECT call, place, id FROM relay_sessions WHERE call >= ? AND call < ?");
+  rows.bind(static_cast<int64_t>(lowest)).bind(static_cast<int64_t>(calls.first));
+  while (rows.row()) {
+    const RowKey key{static_cast<uint64_t>(rows.integer(0)),
+                     static_cast<uint32_t>(rows.integer(1))};
+    if (key.call >= calls.sessionsFrom || single.contains(key.call))
+      rows_.insert_or_assign(key, rows.integer(2));
+  }
+  return rows.code();
 }
 
 int KnownRows::read(sqlite3* database, const char* sql, int64_t after) {
@@ -62,13 +86,6 @@ std::optional<int64_t> KnownRows::find(const RowKey& key) const {
   if (key.call == 0) return std::nullopt;
   const auto found = rows_.find(key);
   return found == rows_.end() ? std::nullopt : std::optional<int64_t>(found->second);
-}
-
-std::optional<int64_t> KnownRows::findSession(sqlite3* database, const RowKey& key) const {
-  if (key.call == 0 || key.call >= firstCall_) return find(key);
-  Statement query(database, "SELECT id FROM relay_sessions WHERE call = ? AND place = ?");
-  query.bind(static_cast<int64_t>(key.call)).bind(int64_t{key.place});
-  return query.row() ? std::optional<int64_t>(query.integer(0)) : std::nullopt;
 }
 
 }  // namespace vx::lnx

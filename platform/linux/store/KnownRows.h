@@ -7,23 +7,32 @@
 #include <cstdint>
 #include <optional>
 #include <unordered_map>
+#include <vector>
 
 #include "base/Status.h"
 #include "platform/linux/execution/CauseScope.h"
 
 namespace vx::lnx {
 
+// What a replay may write: rows of the calls from the first one on; and what it goes back to: relay
+// sessions of later calls than `sessionsFrom`, and of single earlier ones.
+struct ReplayedCalls {
+  uint64_t first = 0;
+  uint64_t sessionsFrom = 0;
+  std::vector<uint64_t> earlierSessions = {};
+};
+
 // Confined to the store's writer. Bounded by what was written since the first call of a journal was
 // accepted.
 class KnownRows {
  public:
-  // The keys of the rows of `firstCall` and later ones. A failure when the database cannot be read.
-  static Result<KnownRows> load(sqlite3* database, uint64_t firstCall);
+  // A failure when the database cannot be read.
+  static Result<KnownRows> load(sqlite3* database, const ReplayedCalls& calls);
   // The highest number of a call among the newest rows; 0 when there is none.
   static uint64_t lastCall(sqlite3* database);
-  // The identifier of the row with this key. A relay session may be of any call.
+  // The identifier of the row with this key.
   std::optional<int64_t> find(const RowKey& key) const;
-  std::optional<int64_t> findSession(sqlite3* database, const RowKey& key) const;
+  bool isEarlier(const RowKey& key) const { return key.call != 0 && key.call < firstCall_; }
 
  private:
   struct Hash {
@@ -32,6 +41,8 @@ class KnownRows {
     }
   };
   int read(sqlite3* database, const char* sql, int64_t after);
+
+  int readSessions(sqlite3* database, const ReplayedCalls& calls);
 
   uint64_t firstCall_ = 0;
   std::unordered_map<RowKey, int64_t, Hash> rows_;

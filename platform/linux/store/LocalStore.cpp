@@ -57,9 +57,9 @@ void LocalStore::start() {
   writer_.start();
 }
 
-void LocalStore::beginReplay(uint64_t firstCall) {
+void LocalStore::beginReplay(ReplayedCalls calls) {
   writer_.queue().setReplaying(true);
-  writer_.queue().runSoon([this, firstCall] { writer_.expectKnownRows(firstCall); });
+  writer_.queue().runSoon([this, calls = std::move(calls)] { writer_.expectKnownRows(calls); });
 }
 
 void LocalStore::endReplay() {

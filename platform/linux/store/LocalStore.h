@@ -41,14 +41,18 @@ class LocalStore final : public AnalyticsEventService, public PowerEventLog {
   // The word for how a session ended, by the call whose work ended it; before start().
   void setEndWord(EndWord word) { writer_.setEndWord(word); }
 
-  // What is appended until endReplay() comes from recorded calls from `firstCall` on: rows of
-  // theirs that are there already are not written again, and new ones bear the time of their call.
-  // Nothing else may be appended meanwhile.
-  void beginReplay(uint64_t firstCall);
+  // What is appended until endReplay() comes from recorded calls: rows of theirs that are there
+  // already are not written again, and new ones bear the time of their call. Nothing else may be
+  // appended meanwhile.
+  void beginReplay(ReplayedCalls calls);
   void endReplay();
 
   // A row of the ledger; before start().
   void noteAtStart(LedgerNote note) { writer_.noteAtStart(std::move(note)); }
+  // A row of the ledger, with what is committed next.
+  void note(LedgerNote note) {
+    runSoon([this, note = std::move(note)] { writer_.noteAtStart(note); });
+  }
   // Starts the writer. Logs, so the platform must be installed; what is appended before is kept.
   void start();
 
@@ -60,6 +64,11 @@ class LocalStore final : public AnalyticsEventService, public PowerEventLog {
 
   // Runs a job on the writer's thread, before anything that waits to be written.
   void runSoon(Function<void()> job) { writer_.queue().runSoon(std::move(job)); }
+  // What waits is committed as soon as it can be.
+  void commitSoon() {
+    FlushHandler nobodyWaits = [](std::optional<Error>) {};
+    (void)writer_.queue().appendFlush(nobodyWaits);
+  }
   bool isCongested() const { return writer_.queue().isCongested(); }  // cheap: one atomic load
   // Called on the writer's thread when a congested store has drained to half its bound. Set before
   // any traffic.

@@ -34,6 +34,8 @@ std::optional<int64_t> flag(const VyrSessionInfo& info, std::string_view key) {
 }
 
 // A client gives its session's identifier with 64 bits, a standalone message with 32.
+constexpr int64_t kStandaloneID = -1;
+
 int64_t sessionIDOf(const VyrSessionInfo& info) {
   constexpr std::string_view kKey = kVyrReportingSessionInfoSessionID;
   if (const auto wide = infoValue<int64_t>(info, kKey)) return *wide;
@@ -66,9 +68,9 @@ RowWriter::RowWriter(sqlite3* database, std::size_t mostText, EndWord endWord, C
                    "DELETE FROM store_marks WHERE id <= (SELECT max(id) FROM store_marks) - ?"),
       endWord_(endWord) {}
 
-Status RowWriter::loadKnownRows(uint64_t firstCall) {
+Status RowWriter::loadKnownRows(const ReplayedCalls& calls) {
   thread_.assertHere();
-  Result<KnownRows> known = KnownRows::load(database_, firstCall);
+  Result<KnownRows> known = KnownRows::load(database_, calls);
   if (!known.ok()) return known.status();
   known_ = std::move(*known);
   return {};
@@ -161,8 +163,12 @@ int RowWriter::writeRecord(const StoreRecords& batch, const StoreRecord& record)
 
 int RowWriter::writeRelaySession(const StoreRecord& record, const RelayOpenRecord& session) {
   if (known_) {
-    if (const auto row = known_->findSession(database_, record.cause.key())) {
+    const RowKey key = record.cause.key();
+    if (const auto row = known_->find(key)) {
       session.row->id = *row;
+      // A standalone's message lies in the queue right behind it.
+      session.row->hasItsMessage =
+          known_->isEarlier(key) && sessionIDOf(session.information->first) == kStandaloneID;
       return SQLITE_OK;
     }
   }
@@ -200,7 +206,8 @@ int RowWriter::writeRelayEnd(const StoreRecord& record, const RelayEndRecord& en
 int RowWriter::writeRelayMessage(const StoreRecords& batch, const StoreRecord& record,
                                  const RelayMessageRecord& message) {
   const StoreRecord* event = record.event == StoreRecord::kNone ? nullptr : &batch[record.event];
-  if (isKnown(record)) return event != nullptr ? writeEvent(*event) : SQLITE_OK;
+  if (isKnown(record) || message.row->hasItsMessage)
+    return event != nullptr ? writeEvent(*event) : SQLITE_OK;
   json_.clear();
   appendJson(json_, message.payload);
   ++written_.rows;

@@ -37,7 +37,7 @@ class RowWriter {
   RowWriter& operator=(const RowWriter&) = delete;
 
   // Rows that are there already will not be written again, until they are forgotten.
-  Status loadKnownRows(uint64_t firstCall);
+  Status loadKnownRows(const ReplayedCalls& calls);
   bool knowsRows() const { return known_.has_value(); }
   void forgetKnownRows() { known_.reset(); }
 

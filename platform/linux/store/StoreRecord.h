@@ -19,6 +19,7 @@ namespace vx::lnx {
 // The row of a relay session, known to the writer's thread once it has inserted it.
 struct RelayRow {
   int64_t id = 0;
+  bool hasItsMessage = false;  // it was written together with its only one
 };
 
 struct RelayOpenRecord {

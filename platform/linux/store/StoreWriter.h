@@ -45,7 +45,7 @@ class StoreWriter {
   void setEndWord(EndWord word) { endWord_ = word; }
   void start();
   // On the writer's thread; see LocalStore::beginReplay.
-  void expectKnownRows(uint64_t firstCall) { replayFrom_ = firstCall; }
+  void expectKnownRows(ReplayedCalls calls) { replayFrom_ = std::move(calls); }
 
   StoreQueue& queue() { return queue_; }
   const StoreQueue& queue() const { return queue_; }
@@ -92,7 +92,7 @@ class StoreWriter {
   Database unchecked_;        // until the thread has checked it
   std::optional<Open> open_;  // none: the file cannot be opened
   EventPairing pairing_;
-  std::optional<uint64_t> replayFrom_;  // until what is replayed is committed
+  std::optional<ReplayedCalls> replayFrom_;  // until what is replayed is committed
   Function<void()> drained_;
   std::vector<LedgerNote> notes_;  // for the next transaction
   bool failing_ = false;
