@@ -3,12 +3,13 @@ import threading
 import time
 
 from harness import CREATE, SEND, SET_TYPE, START, STOP, Client
-from service import spread
+from service import PATIENCE, spread
 from store_check import Check, stopped
-from traffic import Session, Start, scene
+from traffic import ALARMS, Session, Start, scene
 
 ROUNDS_IN_A_CHAIN = 10
 MARKER = 1 << 40   # an identifier
+CUT_BYTES = 9 << 20  # of messages: more than the journal takes before it is cut
 LONGEST_START = 5  # seconds: no session's set-up is waited for again
 
 
@@ -23,6 +24,31 @@ def loaded_until_killed(r, service, traffic):
         pass  # the moment has come
     killer.join()
     service.process.wait()
+    traffic.process_ended("crashed")
+
+
+def kept_open_until_killed(r, service, traffic):
+    """Sessions that stay open for so much traffic that the journal is cut meanwhile, again and again."""
+    traffic.connect(2)
+    for peer in traffic.peers:
+        for type_ in (2, 7, ALARMS):
+            traffic.create(peer, type_)
+    for cut in range(1, 4):
+        sent = 0
+        while sent < CUT_BYTES:
+            size = r.choice((0, 3000))
+            for peer in traffic.peers:
+                traffic.burst(peer, 60, size=size)
+                peer.take()
+                sent += 60 * size
+            traffic.send(r.choice(traffic.peers), None)
+            if r.random() < 0.1:
+                traffic.create(r.choice(traffic.peers), start=False)
+        end = time.monotonic() + PATIENCE
+        while service.counter("snapshots") < cut and time.monotonic() < end:
+            time.sleep(0.1)
+    traffic.burst(r.choice(traffic.peers), r.randrange(100), size=100)
+    service.kill()
     traffic.process_ended("crashed")
 
 
@@ -52,14 +78,14 @@ def settled(traffic, aside=(), seconds=1):
 
 def chain(argument):
     """Rounds in the same folders."""
-    seed, rounds, waits = argument
+    seed, rounds, waits, kept_open = argument
     with scene(seed) as (r, service, traffic):
         # With slow syncs the store's thread lags: sessions stay in set-up, rows in the queue.
         shim = {"sync_ms": "5,80"} if r.random() < 0.5 else {}
         twice_killed = set()
         service.start(**shim)
         for n in range(rounds):
-            loaded_until_killed(r, service, traffic)
+            (kept_open_until_killed if kept_open else loaded_until_killed)(r, service, traffic)
             deaths = r.choice((0, 0, 0, 0, 0, 0, 1, 1, 1, 2))  # of those that recover
             twice_killed |= {n} if deaths > 1 else set()
             for _ in range(deaths):
@@ -84,6 +110,7 @@ def chain(argument):
 
 def run(options):
     rounds = options.rounds or (50 if options.small else 500)
-    chains = [(options.seed * 1000 + i, min(ROUNDS_IN_A_CHAIN, rounds - i * ROUNDS_IN_A_CHAIN), i == 0 and not options.small)
+    chains = [(options.seed * 1000 + i, min(ROUNDS_IN_A_CHAIN, rounds - i * ROUNDS_IN_A_CHAIN), i == 0 and not options.small, False)
               for i in range((rounds + ROUNDS_IN_A_CHAIN - 1) // ROUNDS_IN_A_CHAIN)]
+    chains += [(options.seed * 1000 + 999 - i, 2, False, True) for i in range(1 if options.small else 5)]
     return spread(chain, chains, options)

@@ -89,6 +89,20 @@ class Service(Daemon):
             self.told += self.notify.recv(4096).decode() + "\n"  # to the service manager
         return bool(there)
 
+    def counter(self, name):
+        """What the daemon says when it is asked for its counters."""
+        at = os.path.getsize(self.log_path)
+        self.process.send_signal(signal.SIGUSR1)
+        end = time.monotonic() + PATIENCE
+        while time.monotonic() < end:
+            with open(self.log_path, encoding="utf-8", errors="replace") as log:
+                log.seek(at)
+                said = re.findall(rf"\b{name}=(\d+)", log.read())
+            if said:
+                return int(said[-1])
+            time.sleep(0.01)
+        raise AssertionError(f"the daemon does not say {name}")
+
     def is_ready(self):
         """Waits until the process is ready (True) or has ended."""
         while "READY=1" not in self.told and self.process.poll() is None:

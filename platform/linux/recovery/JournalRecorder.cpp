@@ -50,7 +50,10 @@ CallRecorder::Called JournalRecorder::called(uint64_t connection, const Frame& c
   writeCall(call, dictionary, head_);
   std::optional<Payload::Validated> bytes;
   if (dictionary) bytes = call.validated(*dictionary);
-  JournalAppended appended = append(kindOf(call), connection, head_, bytes);
+  const RecordKind kind = kindOf(call);
+  // A session that is found open would end a second time.
+  const Must must = kind == RecordKind::Call ? Must::WithinShare : Must::Always;
+  JournalAppended appended = append(kind, connection, head_, bytes, must);
   if (head_.capacity() > kMostHeadKept) [[unlikely]]
     head_ = {};
   Called called{std::move(appended.ticket), std::nullopt};
