@@ -43,6 +43,21 @@ class Faults(DaemonTest):
             self.assertIn(b"another", second.stderr)
         self.assert_unharmed(d)
 
+    def test_unusable_state_directory_is_named_and_rows_wait_for_it(self):
+        d = self.daemon()
+        d.stop()
+        path = d.folder + "/file"
+        open(path, "w").close()
+        d.environment["STATE_DIRECTORY"] = path + "/x"
+        d.start()
+        d.client().session(1)
+        d.wait_until(lambda: path in d.log(), "the folder is named")
+        os.unlink(path)
+        os.mkdir(path)
+        d.database = path + "/x/telemetry.db"
+        d.wait_until(lambda: os.path.exists(d.database) and "written again" in d.log(), "the rows are written")
+        self.assertEqual(d.rows("SELECT category FROM relay_messages ORDER BY id"), [(3,), (0xFFFF,)])
+
     def test_killed_and_started_again(self):
         d = self.daemon()
         self.assertEqual(os.stat(d.socket_path).st_mode & 0o777, 0o666)

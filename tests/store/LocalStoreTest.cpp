@@ -180,10 +180,15 @@ TEST_F(LocalStoreTest, DamageIsMovedAsideWithALedgerRow) {
   open();
   power(1, "fresh");
   EXPECT_TRUE(close());
-  EXPECT_THAT(query("SELECT name FROM power_records"), ElementsAre("fresh"));
+  // All but those of one page are taken over.
+  EXPECT_THAT(query("SELECT count(*) BETWEEN 450 AND 499, max(name = 'fresh') FROM power_records"),
+              ElementsAre("1|1"));
+  EXPECT_THAT(query("SELECT id IN (SELECT min(id) FROM power_records UNION SELECT 500)"
+                    " FROM power_records WHERE id IN (1, 500)"),
+              ElementsAre("1", "1"));
   EXPECT_THAT(query("SELECT event, detail LIKE 'failed its check (%); now %damaged-%' "
                     "FROM store_ledger"),
-              ElementsAre("moved_aside|1"));
+              ElementsAre("moved_aside|0", "moved_aside|1"));
 }
 
 TEST_F(LocalStoreTest, WhatIsRemovedIsInTheLedgerEvenAtTheEnd) {
@@ -196,14 +201,63 @@ TEST_F(LocalStoreTest, WhatIsRemovedIsInTheLedgerEvenAtTheEnd) {
               ElementsAre("removed_for_age|power_records|1"));
 }
 
-TEST_F(LocalStoreTest, SecondOpenerAndNewerSchemaAreRefused) {
+TEST_F(LocalStoreTest, SecondOpenerIsRefused) {
   open();
-  EXPECT_FALSE(LocalStore::open(folder, options, clock).ok());
-  EXPECT_TRUE(close());
+  EXPECT_THAT(LocalStore::open(folder, options, clock).status().text(), HasSubstr("another"));
+}
+
+TEST_F(LocalStoreTest, NewerStoreIsLeftAloneAndOneBesideItIsBegun) {
+  open();
+  close();
   store.reset();
   query("PRAGMA user_version = 99");
-  const auto refused = LocalStore::open(folder, options, clock);
-  EXPECT_THAT(refused.status().text(), HasSubstr("newer version"));
+  open();
+  power(1);
+  reopen();
+  power(2);
+  EXPECT_TRUE(close());
+  EXPECT_THAT(query("SELECT count(*) FROM power_records"), ElementsAre("0"));
+  std::filesystem::rename(folder + "/telemetry-schema3.db", folder + "/telemetry.db");
+  EXPECT_THAT(query("SELECT record FROM power_records"), ElementsAre("{\"i\":1}", "{\"i\":2}"));
+  EXPECT_THAT(query("SELECT event FROM store_ledger"), ElementsAre("beside_newer", "beside_newer"));
+}
+
+// What cannot be used now says nothing of what is in it.
+TEST_F(LocalStoreTest, RowsWaitUntilTheStoreCanBeBegun) {
+  open();
+  power(1);
+  close();
+  store.reset();
+  const JournalEpoch other{7};
+  std::filesystem::rename(folder + "/telemetry.db", folder + "/kept");
+  std::filesystem::create_directory(folder + "/telemetry.db");
+  store = std::move(*LocalStore::open(folder, options, clock, other));
+  store->start();
+  power(2);
+  const auto flushed = flush();
+  waitUntil([&] { return store->counters().writeFailures > 1; });
+  std::filesystem::remove(folder + "/telemetry.db");
+  std::filesystem::rename(folder + "/kept", folder + "/telemetry.db");
+  EXPECT_TRUE(close());
+  EXPECT_THAT(query("SELECT record FROM power_records"), ElementsAre("{\"i\":1}", "{\"i\":2}"));
+  EXPECT_THAT(query("SELECT count(*) FROM store_ledger"), ElementsAre("0"));
+  EXPECT_EQ(store->epoch(), other);  // promised meanwhile
+  EXPECT_THAT(query("SELECT hex(substr(epoch, 1, 1)), after_power FROM store_info"),
+              ElementsAre("07|1"));
+}
+
+TEST_F(LocalStoreTest, FolderThatCannotBeMadeIsNoReasonNotToStart) {
+  write("file", "");
+  const std::string whole = std::exchange(folder, folder + "/file/state");
+  open();
+  power(1);
+  const auto flushed = flush();
+  waitUntil([&] { return store->counters().writeFailures > 0; });
+  std::filesystem::remove(whole + "/file");
+  std::filesystem::create_directory(whole + "/file");
+  EXPECT_TRUE(close());
+  EXPECT_THAT(query("SELECT count(*) FROM power_records"), ElementsAre("1"));
+  folder = whole;
 }
 
 // As after a crash: the same calls run again, from the first that is not known to be done.

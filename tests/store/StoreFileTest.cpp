@@ -65,23 +65,35 @@ TEST_F(StoreFileTest, WhatIsNoDatabaseIsDamagedAndWhatCannotBeUsedIsNot) {
   EXPECT_THAT(opened.status.text(), HasSubstr("cannot use " + folder + "/telemetry.db: "));
 }
 
+TEST_F(StoreFileTest, CheckThatCannotReadFindsNoDamage) {
+  EXPECT_EQ(faultOfFinding("Tree 2 page 3: unable to get the page. error code=266"),
+            StoreFault::Unusable);
+  EXPECT_EQ(faultOfFinding("Tree 2 page 3: btreeInitPage() returns error code 11"),
+            StoreFault::Damaged);
+  EXPECT_EQ(faultOfFinding("Page 3: never used"), StoreFault::Damaged);
+  EXPECT_EQ(faultOf(SQLITE_IOERR_READ), StoreFault::Unusable);
+  EXPECT_EQ(faultOf(SQLITE_CORRUPT_SEQUENCE), StoreFault::Damaged);
+}
+
 TEST_F(StoreFileTest, SecondLockIsRefusedUntilTheFirstIsGone) {
   const std::string state = folder + "/state";
-  Result<UniqueFd> first = lockStore(state);
-  ASSERT_TRUE(first.ok());
-  EXPECT_THAT(lockStore(state).status().text(), HasSubstr("another vxreportingd uses"));
-  first->reset();
-  EXPECT_TRUE(lockStore(state).ok());
-  EXPECT_THAT(lockStore(folder + "/none/state").status().text(),
-              HasSubstr("cannot create the state directory"));
+  StoreLock first = lockStore(state);
+  ASSERT_TRUE(first.status.ok());
+  EXPECT_TRUE(lockStore(state).heldByAnother);
+  EXPECT_THAT(lockStore(state).status.text(), HasSubstr("another vxreportingd uses"));
+  first.fd.reset();
+  EXPECT_TRUE(lockStore(state).status.ok());
+  const StoreLock none = lockStore(folder + "/none/state");
+  EXPECT_THAT(none.status.text(), HasSubstr("cannot create the state directory"));
+  EXPECT_FALSE(none.heldByAnother);
   write("file", "");
-  EXPECT_THAT(lockStore(folder + "/file").status().text(), HasSubstr("set STATE_DIRECTORY"));
+  EXPECT_THAT(lockStore(folder + "/file").status.text(), HasSubstr("set STATE_DIRECTORY"));
 }
 
 TEST_F(StoreFileTest, NewerSchemaIsRefusedAndLeftAlone) {
   query(open(), "PRAGMA user_version = 4");
   const OpenedStore opened = open();
-  EXPECT_EQ(opened.fault, StoreFault::Unusable);
+  EXPECT_EQ(opened.fault, StoreFault::Newer);
   EXPECT_THAT(opened.status.text(), HasSubstr("newer version of the service (schema 4)"));
   EXPECT_THAT(StoreTest::query("PRAGMA user_version"), ElementsAre("4"));
 }

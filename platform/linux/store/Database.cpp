@@ -35,6 +35,11 @@ Statement& Statement::bindNull() {
   return *this;
 }
 
+Statement& Statement::bindCopyOf(const Statement& row, int column) {
+  sqlite3_bind_value(statement_.get(), next_++, sqlite3_column_value(row.statement_.get(), column));
+  return *this;
+}
+
 int Statement::run() {
   if (statement_ == nullptr) return code_ != SQLITE_OK ? code_ : SQLITE_MISUSE;
   sqlite3_step(statement_.get());

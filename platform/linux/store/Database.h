@@ -31,6 +31,8 @@ class Statement {
   // A blob, which must stay until run().
   Statement& bind(std::span<const uint8_t> bytes);
   Statement& bindNull();
+  // A column of another statement's row, whatever its type.
+  Statement& bindCopyOf(const Statement& row, int column);
   // NULL for none.
   template <class T>
   Statement& bind(const std::optional<T>& value) {

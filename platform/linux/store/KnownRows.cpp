@@ -11,14 +11,18 @@ namespace {
 
 // Rows up to the last mark before the call are of earlier calls: messages and events, which are
 // many, are read from there on.
-constexpr const char* kLastMark = "SELECT ifnull(max(last_row), 0) FROM store_marks WHERE call < ?";
+constexpr const char* kLastMark =
+    "SELECT max(after_row, ifnull((SELECT max(last_row) FROM store_marks WHERE call < ?), 0))"
+    " FROM store_info";
 constexpr const char* kReads[] = {
     "SELECT call, place, id FROM relay_messages WHERE id > ?2 AND call >= ?1",
     "SELECT call, event_place, id FROM relay_messages"
     " WHERE id > ?2 AND call >= ?1 AND event_place IS NOT NULL",
     "SELECT call, place, id FROM analytics_entries WHERE id > ?2 AND call >= ?1",
-    "SELECT call, place, id FROM power_records WHERE call >= ?1 AND ?2 IS NOT NULL",
-    "SELECT call, place, id FROM relay_sessions WHERE call >= ?1 AND ?2 IS NOT NULL",
+    "SELECT call, place, id FROM power_records WHERE call >= ?1 AND ?2 >= 0"
+    " AND id > (SELECT after_power FROM store_info)",
+    "SELECT call, place, id FROM relay_sessions WHERE call >= ?1 AND ?2 >= 0"
+    " AND id > (SELECT after_session FROM store_info)",
 };
 
 // Rows of calls are written nearly in the calls' order.
@@ -60,7 +64,8 @@ int KnownRows::readSessions(sqlite3* database, const ReplayedCalls& calls) {
   uint64_t lowest = calls.sessionsFrom;
   for (const uint64_t call : single) lowest = std::min(lowest, call);
   Statement rows(database,
-                 "SELECT call, place, id FROM relay_sessions WHERE call >= ? AND call < ?");
+                 "SELECT call, place, id FROM relay_sessions WHERE call >= ? AND call < ?"
+                 " AND id > (SELECT after_session FROM store_info)");
   rows.bind(static_cast<int64_t>(lowest)).bind(static_cast<int64_t>(calls.first));
   while (rows.row()) {
     const RowKey key{static_cast<uint64_t>(rows.integer(0)),

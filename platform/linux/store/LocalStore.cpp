@@ -4,10 +4,6 @@
 
 #include <utility>
 
-#include "platform/Log.h"
-#include "platform/linux/store/KnownRows.h"
-#include "platform/linux/store/StoreFile.h"
-
 namespace vx::lnx {
 
 namespace {
@@ -23,39 +19,16 @@ JournalEpoch randomEpoch() {
 Result<std::unique_ptr<LocalStore>> LocalStore::open(
     const std::string& stateDirectory, const StoreOptions& options, Clock& clock,
     const std::optional<JournalEpoch>& epochIfNew) {
-  Result<UniqueFd> lock = lockStore(stateDirectory);
-  if (!lock.ok()) return lock.status();
-  const std::string path = stateDirectory + "/telemetry.db";
-  std::string damage;
-  const JournalEpoch fresh = epochIfNew ? *epochIfNew : randomEpoch();
-  OpenedStore opened = openStoreDatabase(path, fresh);
-  if (opened.fault == StoreFault::Damaged) {
-    const Result<std::string> aside = moveAside(path);
-    if (!aside.ok()) return aside.status();
-    damage = opened.status.text() + "; now " + *aside;
-    opened = openStoreDatabase(path, fresh);
-  }
-  if (!opened.status.ok()) return opened.status;
-  return std::unique_ptr<LocalStore>(
-      new LocalStore(std::move(*lock), path, std::move(opened), std::move(damage), options, clock));
+  auto beginning =
+      std::make_unique<StoreBeginning>(stateDirectory, epochIfNew ? *epochIfNew : randomEpoch());
+  Status refused;
+  if (!beginning->lock(refused)) return refused;
+  return std::unique_ptr<LocalStore>(new LocalStore(std::move(beginning), options, clock));
 }
 
-LocalStore::LocalStore(UniqueFd lock, std::string path, OpenedStore opened, std::string damage,
-                       const StoreOptions& options, Clock& clock)
-    : lock_(std::move(lock)),
-      epoch_(opened.epoch),
-      lastCall_(KnownRows::lastCall(opened.database.get())),
-      damage_(std::move(damage)),
-      writer_(std::move(path), std::move(opened), options, clock),
-      backend_(writer_.queue()) {}
-
-void LocalStore::start() {
-  if (!damage_.empty()) {
-    VX_LOG(nullptr, Error, "the store was damaged and a fresh one is begun: %s", damage_.c_str());
-    writer_.noteAtStart({"moved_aside", "", 0, damage_});
-  }
-  writer_.start();
-}
+LocalStore::LocalStore(std::unique_ptr<StoreBeginning> beginning, const StoreOptions& options,
+                       Clock& clock)
+    : writer_(std::move(beginning), options, clock), backend_(writer_.queue()) {}
 
 void LocalStore::beginReplay(ReplayedCalls calls) {
   writer_.queue().setReplaying(true);

@@ -9,7 +9,6 @@
 #include "base/Clock.h"
 #include "base/Function.h"
 #include "base/Status.h"
-#include "base/UniqueFd.h"
 #include "platform/EventServices.h"
 #include "platform/linux/RelayBackend.h"
 #include "platform/linux/store/Database.h"
@@ -26,18 +25,19 @@ class LocalStore final : public AnalyticsEventService, public PowerEventLog {
  public:
   using Counters = StoreCounters;
 
-  // Opens or creates <state>/telemetry.db and locks <state>/telemetry.lock. A failure when another
-  // process has it or the folder cannot be used. The quick check runs on the writer's thread before
-  // its first write, so start-up does not wait for it.
-  // `epochIfNew`: of a store that has none yet; random without one.
+  // Locks <state>/telemetry.lock and opens or creates <state>/telemetry.db. Fails only when another
+  // process has it: whatever else is wrong is tried again before each write, and rows wait. The
+  // quick check runs on the writer's thread before its first write, so start-up does not wait for
+  // it. `epochIfNew`: of a store that has none yet; random without one.
   static Result<std::unique_ptr<LocalStore>> open(
       const std::string& stateDirectory, const StoreOptions& options, Clock& clock,
       const std::optional<JournalEpoch>& epochIfNew = std::nullopt);
 
   // Within which (call, place) names a row. The same as long as this object lives.
-  const JournalEpoch& epoch() const { return epoch_; }
-  // The highest number that a call has among the newest rows; 0 when there is none.
-  uint64_t lastCall() const { return lastCall_; }
+  const JournalEpoch& epoch() const { return writer_.epoch(); }
+  // The highest number that a call has among the newest rows; 0 when there is none, or when the
+  // store cannot be read yet.
+  uint64_t lastCall() const { return writer_.lastCall(); }
   // The word for how a session ended, by the call whose work ended it; before start().
   void setEndWord(EndWord word) { writer_.setEndWord(word); }
 
@@ -54,7 +54,7 @@ class LocalStore final : public AnalyticsEventService, public PowerEventLog {
     runSoon([this, note = std::move(note)] { writer_.noteAtStart(note); });
   }
   // Starts the writer. Logs, so the platform must be installed; what is appended before is kept.
-  void start();
+  void start() { writer_.start(); }
 
   RelayBackend& relayBackend() { return backend_; }
   void sendEventLazy(std::string_view name, Function<Payload()> builder,
@@ -82,13 +82,8 @@ class LocalStore final : public AnalyticsEventService, public PowerEventLog {
   Counters counters() const { return writer_.counters(); }
 
  private:
-  LocalStore(UniqueFd lock, std::string path, OpenedStore opened, std::string damage,
-             const StoreOptions& options, Clock& clock);
+  LocalStore(std::unique_ptr<StoreBeginning> beginning, const StoreOptions& options, Clock& clock);
 
-  const UniqueFd lock_;
-  const JournalEpoch epoch_;
-  const uint64_t lastCall_;
-  const std::string damage_;  // what was found and moved aside when the store was opened
   StoreWriter writer_;
   StoreBackend backend_;
 };

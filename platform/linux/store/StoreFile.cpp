@@ -8,7 +8,10 @@
 #include <algorithm>
 #include <cerrno>
 #include <cstdio>
+#include <cstdlib>
 #include <ctime>
+#include <string_view>
+#include <utility>
 
 #include "platform/linux/store/StoreSchema.h"
 
@@ -33,27 +36,41 @@ void configureOnce() {
   (void)configured;
 }
 
-bool isDamage(int code) {
-  const int primary = code & 0xFF;
-  return primary == SQLITE_NOTADB || primary == SQLITE_CORRUPT;
-}
-
 }  // namespace
 
-Result<UniqueFd> lockStore(const std::string& directory) {
+StoreFault faultOf(int code) {
+  const int primary = code & 0xFF;
+  return primary == SQLITE_NOTADB || primary == SQLITE_CORRUPT ? StoreFault::Damaged
+                                                               : StoreFault::Unusable;
+}
+
+StoreFault faultOfFinding(const std::string& finding) {
+  constexpr std::string_view kCode = "error code";
+  const std::size_t at = finding.find(kCode);
+  if (at == std::string::npos) return StoreFault::Damaged;
+  const std::size_t digits = finding.find_first_of("0123456789", at + kCode.size());
+  if (digits == std::string::npos) return StoreFault::Damaged;
+  return faultOf(std::atoi(finding.c_str() + digits));
+}
+
+StoreLock lockStore(const std::string& directory) {
   if (mkdir(directory.c_str(), 0750) != 0 && errno != EEXIST)
-    return Status::lastError("cannot create the state directory " + directory);
+    return {{}, Status::lastError("cannot create the state directory " + directory)};
   const std::string path = directory + "/telemetry.lock";
   UniqueFd lock(::open(path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW, 0640));
   if (!lock) {
-    return Status::lastError("cannot open " + path)
-        .withHint(" (set STATE_DIRECTORY to a folder that can be written)");
+    return {{},
+            Status::lastError("cannot open " + path)
+                .withHint(" (set STATE_DIRECTORY to a folder that can be written)")};
   }
   if (flock(lock.get(), LOCK_EX | LOCK_NB) != 0) {
-    return Status::failure("another vxreportingd uses the store in " + directory +
-                           "; stop it, or set STATE_DIRECTORY to a folder of its own");
+    if (errno != EWOULDBLOCK) return {{}, Status::lastError("cannot lock " + path)};
+    return {{},
+            Status::failure("another vxreportingd uses the store in " + directory +
+                            "; stop it, or set STATE_DIRECTORY to a folder of its own"),
+            true};
   }
-  return lock;
+  return {std::move(lock), {}};
 }
 
 OpenedStore openStoreDatabase(const std::string& path, const JournalEpoch& epochIfNew) {
@@ -66,15 +83,12 @@ OpenedStore openStoreDatabase(const std::string& path, const JournalEpoch& epoch
   OpenedStore opened{Database(database), Status(), StoreFault::None, {}};
   auto fail = [&](int failure) {
     const char* why = database != nullptr ? sqlite3_errmsg(database) : sqlite3_errstr(failure);
-    const StoreFault fault = isDamage(failure) ? StoreFault::Damaged : StoreFault::Unusable;
-    return OpenedStore{nullptr, Status::failure("cannot use " + path + ": " + why), fault, {}};
+    return OpenedStore{
+        nullptr, Status::failure("cannot use " + path + ": " + why), faultOf(failure), {}};
   };
   if (code != SQLITE_OK) return fail(code);
   sqlite3_busy_timeout(database, 1000);
-  for (const char* pragma : kPragmas) {
-    code = execute(database, pragma);
-    if (code != SQLITE_OK) return fail(code);
-  }
+  // Before anything is written: a newer one is left as it is.
   Statement versionQuery(database, "PRAGMA user_version");
   if (!versionQuery.row()) return fail(sqlite3_extended_errcode(database));
   const int64_t version = versionQuery.integer(0);
@@ -82,9 +96,13 @@ OpenedStore openStoreDatabase(const std::string& path, const JournalEpoch& epoch
   if (version > kStoreSchemaVersion) {
     return {nullptr,
             Status::failure(path + " was written by a newer version of the service (schema " +
-                            std::to_string(version) + "); move it away or install that version"),
-            StoreFault::Unusable,
+                            std::to_string(version) + ")"),
+            StoreFault::Newer,
             {}};
+  }
+  for (const char* pragma : kPragmas) {
+    code = execute(database, pragma);
+    if (code != SQLITE_OK) return fail(code);
   }
   code = bringSchemaUpToDate(database, version, epochIfNew);
   if (code != SQLITE_OK) return fail(code);
@@ -95,11 +113,14 @@ OpenedStore openStoreDatabase(const std::string& path, const JournalEpoch& epoch
   return opened;
 }
 
-Status quickCheck(sqlite3* database) {
+StoreCheck quickCheck(sqlite3* database) {
   Statement check(database, "PRAGMA quick_check(1)");
-  if (!check.row()) return Status::failure(sqlite3_errmsg(database));
+  if (!check.row()) {
+    return {Status::failure(sqlite3_errmsg(database)), faultOf(sqlite3_extended_errcode(database))};
+  }
   const std::string found = check.text(0);
-  return found == "ok" ? Status() : Status::failure(found);
+  if (found == "ok") return {};
+  return {Status::failure(found), faultOfFinding(found)};
 }
 
 Result<std::string> moveAside(const std::string& path) {

@@ -11,14 +11,19 @@
 
 namespace vx::lnx {
 
-// Creates the folder if need be. A failure when another process holds the lock, or the folder
-// cannot be used. The lock lasts as long as the descriptor.
-Result<UniqueFd> lockStore(const std::string& directory);
+// Creates the folder if need be. The lock lasts as long as the descriptor.
+struct StoreLock {
+  UniqueFd fd;    // none unless the status is ok
+  Status status;  // why there is none
+  bool heldByAnother = false;
+};
+StoreLock lockStore(const std::string& directory);
 
 enum class StoreFault : uint8_t {
   None,
-  Damaged,   // not a database, or not one that can be read: to be moved aside
-  Unusable,  // the folder or file cannot be used
+  Damaged,   // not a database, or not a whole one: to be moved aside
+  Newer,     // of a later version of the service: to be left alone
+  Unusable,  // cannot be read or written now; says nothing about what is in it
 };
 
 struct OpenedStore {
@@ -32,8 +37,16 @@ struct OpenedStore {
 // epoch yet gets this one.
 OpenedStore openStoreDatabase(const std::string& path, const JournalEpoch& epochIfNew);
 
-// Fails, with what was found, unless `PRAGMA quick_check` finds nothing.
-Status quickCheck(sqlite3* database);
+struct StoreCheck {
+  Status status;  // what `PRAGMA quick_check` found, or why it could not look
+  StoreFault fault = StoreFault::None;
+};
+StoreCheck quickCheck(sqlite3* database);
+
+// What an SQLite error says about the file.
+StoreFault faultOf(int code);
+// The same of what the check found: among that is a page that could not be read.
+StoreFault faultOfFinding(const std::string& finding);
 
 // Moves the file and its companions out of the way, to "<path>.damaged-YYYYMMDD-HHMMSS[-n]". The
 // new name.

@@ -20,10 +20,11 @@ CREATE VIEW session_messages AS
 constexpr const char* kEventNames =
     "CREATE TABLE event_names(id INTEGER PRIMARY KEY, name TEXT NOT NULL UNIQUE);";
 
-// The epoch within which a row's (call, place) is its name; and every so many rows, the highest
-// call so far and the last id of messages and events (see KnownRows).
+// The epoch within which the (call, place) of a row after the given ones is its name; and every so
+// many rows, the highest call so far and the last id of messages and events (see KnownRows).
 constexpr const char* kBookkeeping = R"sql(
-CREATE TABLE store_info(id INTEGER PRIMARY KEY CHECK (id = 1), epoch BLOB NOT NULL);
+CREATE TABLE store_info(id INTEGER PRIMARY KEY CHECK (id = 1), epoch BLOB NOT NULL,
+  after_row INTEGER NOT NULL DEFAULT 0, after_power INTEGER NOT NULL DEFAULT 0, after_session INTEGER NOT NULL DEFAULT 0);
 CREATE TABLE store_marks(id INTEGER PRIMARY KEY, call INTEGER NOT NULL, last_row INTEGER NOT NULL);
 )sql";
 
@@ -89,7 +90,8 @@ ALTER TABLE analytics_entries ADD COLUMN relay_session INTEGER;
 ALTER TABLE power_records ADD COLUMN call INTEGER;
 ALTER TABLE power_records ADD COLUMN place INTEGER;
 UPDATE analytics_entries SET message = NULL WHERE message IS NOT NULL AND substr(payload, 1, 1) = '{';
-CREATE TABLE store_info(id INTEGER PRIMARY KEY CHECK (id = 1), epoch BLOB NOT NULL);
+CREATE TABLE store_info(id INTEGER PRIMARY KEY CHECK (id = 1), epoch BLOB NOT NULL,
+  after_row INTEGER NOT NULL DEFAULT 0, after_power INTEGER NOT NULL DEFAULT 0, after_session INTEGER NOT NULL DEFAULT 0);
 CREATE TABLE store_marks(id INTEGER PRIMARY KEY, call INTEGER NOT NULL, last_row INTEGER NOT NULL);
 )sql";
 
@@ -122,6 +124,17 @@ int beginEpoch(sqlite3* database, const JournalEpoch& epoch) {
 }
 
 }  // namespace
+
+Status adoptEpoch(sqlite3* database, const JournalEpoch& epoch) {
+  Statement update(database,
+                   "UPDATE store_info SET epoch = ?, after_row ="
+                   " max(ifnull((SELECT max(id) FROM relay_messages), 0),"
+                   " ifnull((SELECT max(id) FROM analytics_entries), 0)),"
+                   " after_power = ifnull((SELECT max(id) FROM power_records), 0),"
+                   " after_session = ifnull((SELECT max(id) FROM relay_sessions), 0)");
+  if (update.bind(std::span<const uint8_t>(epoch)).run() == SQLITE_OK) return {};
+  return Status::failure(sqlite3_errmsg(database));
+}
 
 int bringSchemaUpToDate(sqlite3* database, int64_t version, const JournalEpoch& epochIfNew) {
   if (version == kStoreSchemaVersion) return SQLITE_OK;

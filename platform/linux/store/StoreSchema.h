@@ -5,6 +5,7 @@
 
 #include <cstdint>
 
+#include "base/Status.h"
 #include "platform/linux/journal/JournalFormat.h"
 
 namespace vx::lnx {
@@ -14,5 +15,8 @@ inline constexpr int64_t kStoreSchemaVersion = 3;
 // Brings a database of `version` (0: an empty one) up to kStoreSchemaVersion, in one transaction. A
 // database that has no epoch gets this one. SQLITE_OK or SQLite's extended error code.
 int bringSchemaUpToDate(sqlite3* database, int64_t version, const JournalEpoch& epochIfNew);
+
+// Makes keys from here on those of another epoch: earlier rows' keys no longer count.
+Status adoptEpoch(sqlite3* database, const JournalEpoch& epoch);
 
 }  // namespace vx::lnx

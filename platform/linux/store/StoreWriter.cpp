@@ -10,6 +10,7 @@
 
 #include "platform/Log.h"
 #include "platform/linux/execution/Threads.h"
+#include "platform/linux/store/StoreSchema.h"
 
 namespace vx::lnx {
 
@@ -35,14 +36,13 @@ StoreWriter::Open::Open(Database opened, const StoreOptions& options, EndWord en
       rows(database.get(), mostTextOf(options), endWord, clock),
       retention(database.get(), options, clock) {}
 
-StoreWriter::StoreWriter(std::string path, OpenedStore opened, const StoreOptions& options,
+StoreWriter::StoreWriter(std::unique_ptr<StoreBeginning> beginning, const StoreOptions& options,
                          Clock& clock)
-    : path_(std::move(path)),
-      options_(options),
-      clock_(clock),
-      queue_(options, clock),
-      epoch_(opened.epoch),
-      unchecked_(std::move(opened.database)) {}
+    : options_(options), clock_(clock), queue_(options, clock), beginning_(std::move(beginning)) {
+  unchecked_ = beginning_->open(found_);
+  epoch_ = beginning_->epoch();
+  if (unchecked_.status.ok()) lastCall_ = KnownRows::lastCall(unchecked_.database.get());
+}
 
 StoreWriter::~StoreWriter() {
   if (!thread_.joinable()) return;
@@ -75,8 +75,8 @@ bool StoreWriter::close(Monotonic deadline) {
 void StoreWriter::threadMain() {
   setpriority(PRIO_PROCESS, static_cast<id_t>(syscall(SYS_gettid)), kWriterNiceness);
   runJobs();
-  checkDatabase();
-  if (open_) add(open_->retention.apply());
+  report(std::move(found_));
+  (void)begin();  // tried again when there is something to write
   StoreBatch batch;
   for (;;) {
     const StoreQueue::Turn turn = queue_.take(batch, pairing_.heldSince());
@@ -95,26 +95,26 @@ void StoreWriter::runJobs() {
   for (const Function<void()>& job : queue_.takeJobs()) job();
 }
 
-void StoreWriter::checkDatabase() {
-  const Status check = quickCheck(unchecked_.get());
-  if (check.ok()) {
-    open_.emplace(std::move(unchecked_), options_, endWord_, clock_);
-    return;
+Status StoreWriter::begin() {
+  if (open_) return {};
+  std::vector<LedgerNote> notes;
+  if (unchecked_.database == nullptr) unchecked_ = beginning_->open(notes);
+  if (unchecked_.status.ok()) unchecked_ = beginning_->check(std::move(unchecked_), notes);
+  report(std::move(notes));
+  if (unchecked_.database == nullptr) return unchecked_.status;
+  if (unchecked_.epoch != epoch_) {
+    if (const Status adopted = adoptEpoch(unchecked_.database.get(), epoch_); !adopted.ok())
+      return adopted;
   }
-  unchecked_.reset();
-  const Result<std::string> aside = moveAside(path_);
-  OpenedStore fresh = openStoreDatabase(path_, epoch_);
-  if (!fresh.status.ok()) {
-    VX_LOG(nullptr, Error, "the store failed its check (%s) and cannot be begun afresh: %s",
-           check.text().c_str(), fresh.status.text().c_str());
-    return;
-  }
-  open_.emplace(std::move(fresh.database), options_, endWord_, clock_);
-  const std::string where = aside.ok() ? *aside : "";
-  VX_LOG(nullptr, Error,
-         "the store failed its check (%s); it was moved to %s and a fresh one begun",
-         check.text().c_str(), where.c_str());
-  notes_.push_back({"moved_aside", "", 0, "failed its check (" + check.text() + "); now " + where});
+  open_.emplace(std::move(unchecked_.database), options_, endWord_, clock_);
+  add(open_->retention.apply());
+  return {};
+}
+
+void StoreWriter::report(std::vector<LedgerNote> found) {
+  for (const LedgerNote& note : found)
+    VX_LOG(nullptr, Error, "the store: %s: %s", note.event.c_str(), note.detail.c_str());
+  add(std::move(found));
 }
 
 void StoreWriter::writeBatch(StoreBatch& batch) {
@@ -144,7 +144,7 @@ void StoreWriter::writeBatch(StoreBatch& batch) {
 
 Result<RowWriter::Written> StoreWriter::write(const StoreBatch& batch, std::size_t first,
                                               std::size_t last) {
-  if (!open_) return Status::failure("the database cannot be opened");
+  if (Status begun = begin(); !begun.ok()) return begun;
   if (replayFrom_ && !open_->rows.knowsRows()) {
     if (Status read = open_->rows.loadKnownRows(*replayFrom_); !read.ok()) return read;
   }
@@ -199,11 +199,7 @@ bool StoreWriter::waitBeforeRetry(const Status& failure) {
   if (!failing_) {
     failing_ = true;
     VX_LOG(nullptr, Error, "cannot write %s: %s; what was accepted is kept and tried again",
-           path_.c_str(), failure.text().c_str());
-  }
-  if (!open_) {
-    OpenedStore again = openStoreDatabase(path_, epoch_);
-    if (again.status.ok()) open_.emplace(std::move(again.database), options_, endWord_, clock_);
+           beginning_->path().c_str(), failure.text().c_str());
   }
   backoff_ = std::clamp(backoff_ * 2, kFirstBackoff, kLastBackoff);
   const Monotonic until = clock_.monotonic() + backoff_;

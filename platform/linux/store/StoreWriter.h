@@ -4,6 +4,7 @@
 #include <atomic>
 #include <chrono>
 #include <cstdint>
+#include <memory>
 #include <optional>
 #include <string>
 #include <thread>
@@ -16,7 +17,7 @@
 #include "platform/linux/store/EventPairing.h"
 #include "platform/linux/store/Retention.h"
 #include "platform/linux/store/RowWriter.h"
-#include "platform/linux/store/StoreFile.h"
+#include "platform/linux/store/StoreBeginning.h"
 #include "platform/linux/store/StoreOptions.h"
 #include "platform/linux/store/StoreQueue.h"
 
@@ -33,7 +34,8 @@ struct StoreCounters {
 // writer's thread. Bounded by its queue.
 class StoreWriter {
  public:
-  StoreWriter(std::string path, OpenedStore opened, const StoreOptions& options, Clock& clock);
+  // Opens the store if that is possible now.
+  StoreWriter(std::unique_ptr<StoreBeginning> beginning, const StoreOptions& options, Clock& clock);
   ~StoreWriter();
   StoreWriter(const StoreWriter&) = delete;
   StoreWriter& operator=(const StoreWriter&) = delete;
@@ -52,6 +54,9 @@ class StoreWriter {
   // See LocalStore::close.
   bool close(Monotonic deadline);
   StoreCounters counters() const;
+  // As found by the constructor; see LocalStore.
+  const JournalEpoch& epoch() const { return epoch_; }
+  uint64_t lastCall() const { return lastCall_; }
 
  private:
   // What lives as long as one opened database.
@@ -64,7 +69,10 @@ class StoreWriter {
 
   void threadMain();
   void runJobs();
-  void checkDatabase();
+  // Opens and checks the store unless that is done.
+  Status begin();
+  // What was found while the store was begun, for the log and the ledger.
+  void report(std::vector<LedgerNote> found);
   void writeBatch(StoreBatch& batch);
   Result<RowWriter::Written> write(const StoreBatch& batch, std::size_t first, std::size_t last);
   void onCommitted(StoreBatch& batch, std::size_t first, std::size_t last);
@@ -74,7 +82,6 @@ class StoreWriter {
   bool waitBeforeRetry(const Status& failure);
   void add(std::vector<LedgerNote> notes);
 
-  const std::string path_;
   const StoreOptions options_;
   Clock& clock_;
   StoreQueue queue_;
@@ -87,10 +94,13 @@ class StoreWriter {
   bool finished_ GUARDED_BY(mutex_) = false;
 
   // The writer's thread.
-  const JournalEpoch epoch_;
+  const std::unique_ptr<StoreBeginning> beginning_;
+  JournalEpoch epoch_;
+  uint64_t lastCall_ = 0;
+  std::vector<LedgerNote> found_;  // by the constructor
   EndWord endWord_ = nullptr;
-  Database unchecked_;        // until the thread has checked it
-  std::optional<Open> open_;  // none: the file cannot be opened
+  OpenedStore unchecked_;     // until the thread has checked it
+  std::optional<Open> open_;  // none: not begun
   EventPairing pairing_;
   std::optional<ReplayedCalls> replayFrom_;  // until what is replayed is committed
   Function<void()> drained_;

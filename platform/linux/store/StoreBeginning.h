@@ -1,0 +1,47 @@
+// How a store is begun, at start and again: the lock, the file or one beside it, and what is
+// damaged out of the way.
+#pragma once
+
+#include <string>
+#include <vector>
+
+#include "base/Status.h"
+#include "base/UniqueFd.h"
+#include "platform/linux/journal/JournalFormat.h"
+#include "platform/linux/store/StoreFile.h"
+#include "platform/linux/store/StoreRecord.h"
+
+namespace vx::lnx {
+
+// Owned by the store's writer; used by one thread at a time. "Cannot be read" is not "is damaged":
+// only a file that is no database, or whose check finds something, is moved aside.
+class StoreBeginning {
+ public:
+  StoreBeginning(std::string directory, const JournalEpoch& epochIfNew)
+      : directory_(std::move(directory)), epoch_(epochIfNew) {}
+
+  // False when another process has the store. A lock that cannot be had for another reason is tried
+  // again by open().
+  bool lock(Status& why);
+
+  // Opens the store without checking it. What was found on the way, for the log and the ledger, is
+  // added to `notes`.
+  OpenedStore open(std::vector<LedgerNote>& notes);
+  // Checks what was opened. A damaged one is moved aside and a fresh one begun, with what can be
+  // read of it.
+  OpenedStore check(OpenedStore opened, std::vector<LedgerNote>& notes);
+
+  const std::string& path() const { return path_; }
+  const JournalEpoch& epoch() const { return epoch_; }
+
+ private:
+  OpenedStore beginAfresh(const std::string& why, std::vector<LedgerNote>& notes);
+
+  const std::string directory_;
+  std::string path_;
+  JournalEpoch epoch_;  // the first store's that was opened
+  bool hasEpoch_ = false;
+  UniqueFd lock_;
+};
+
+}  // namespace vx::lnx
