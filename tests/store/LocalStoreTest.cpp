@@ -41,6 +41,15 @@ class LocalStoreTest : public StoreTest {
     session()->flush([told](std::optional<Error> error) { told->set_value(std::move(error)); });
     return told->get_future();
   }
+  uintmax_t storeBytes() {
+    uintmax_t bytes = 0;
+    std::error_code missing;
+    for (const char* suffix : {"", "-wal"}) {
+      const uintmax_t size = std::filesystem::file_size(folder + "/telemetry.db" + suffix, missing);
+      bytes += missing ? 0 : size;
+    }
+    return bytes;
+  }
   // Makes the rows of a table impossible to write, from outside.
   void refusePower() {
     query(
@@ -199,6 +208,49 @@ TEST_F(LocalStoreTest, WhatIsRemovedIsInTheLedgerEvenAtTheEnd) {
   EXPECT_TRUE(close());
   EXPECT_THAT(query("SELECT event, table_name, rows FROM store_ledger"),
               ElementsAre("removed_for_age|power_records|1"));
+}
+
+TEST_F(LocalStoreTest, FileAndLogStayWithinTheSizeAndItsSlack) {
+  options.maxBytes = 32 << 20;
+  open();
+  uintmax_t largest = 0;
+  for (int i = 0; i < 24; ++i) {
+    const std::size_t bytes = i % 6 == 5 ? 7 << 20 : 900 << 10;  // now and then a long summary
+    store->logRegisteredEvent(28, "n", PayloadBuilder().set("f", std::string(bytes, 'x')).build(),
+                              nullptr);
+    if (i % 4 == 3) flush().get();
+    largest = std::max(largest, storeBytes());
+  }
+  flush().get();
+  EXPECT_LE(storeBytes(), options.maxBytes + StoreOptions::kSlackBytes);
+  EXPECT_LE(largest, options.maxBytes + StoreOptions::kSlackBytes);
+  EXPECT_EQ(query("SELECT count(*) > 0 FROM store_ledger WHERE event = 'removed_for_size'").at(0),
+            "1");
+  options.maxBytes = 16 << 20;
+  reopen();
+  EXPECT_TRUE(close());
+  store.reset();
+  EXPECT_LE(storeBytes(), options.maxBytes);
+}
+
+TEST_F(LocalStoreTest, WritingPausesWhileAReaderHoldsTheLogAtItsBound) {
+  open();
+  EXPECT_EQ(flush().get(), std::nullopt);
+  sqlite3* opened = nullptr;
+  sqlite3_open((folder + "/telemetry.db").c_str(), &opened);
+  const Database reader(opened);
+  StoreTest::query(opened, "BEGIN; SELECT count(*) FROM power_records");
+  const Payload large = PayloadBuilder().set("f", std::string(500000, 'x')).build();
+  for (int i = 0; i < 40; ++i) store->logRegisteredEvent(28, "n", large, nullptr);
+  auto flushed = flush();
+  waitUntil([&] { return store->counters().writeFailures > 0; });
+  EXPECT_LE(storeBytes(), StoreOptions::kSlackBytes);
+  EXPECT_EQ(flushed.wait_for(0s), std::future_status::timeout);
+  StoreTest::query(opened, "COMMIT");
+  EXPECT_EQ(flushed.get(), std::nullopt);
+  EXPECT_TRUE(close());
+  EXPECT_THAT(query("SELECT count(*) FROM power_records"), ElementsAre("40"));
+  EXPECT_THAT(query("SELECT event FROM store_ledger"), ElementsAre("log_held"));
 }
 
 TEST_F(LocalStoreTest, SecondOpenerIsRefused) {

@@ -1,6 +1,9 @@
 #include "platform/linux/store/Retention.h"
 
+#include <algorithm>
 #include <chrono>
+#include <span>
+#include <utility>
 
 namespace vx::lnx {
 
@@ -23,22 +26,68 @@ const RetainedTable kTables[] = {{"relay_messages", "relay_messages"},
 
 }  // namespace
 
+namespace {
+
+void tell(std::vector<LedgerNote>& notes, const char* event, std::span<const int64_t> removed,
+          const std::string& why) {
+  for (std::size_t i = 0; i < removed.size(); ++i) {
+    if (removed[i] > 0) notes.push_back({event, kTables[i].shownAs, removed[i], why});
+  }
+}
+
+}  // namespace
+
 std::vector<LedgerNote> Retention::apply() {
   thread_.assertHere();
   batches_ = 0;
   removalsLeft_ = kRemovalsPerPass;
-  std::vector<LedgerNote> notes;
-  auto tell = [&notes](const char* event, const Counts& removed, const std::string& why) {
-    for (std::size_t i = 0; i < removed.size(); ++i) {
-      if (removed[i] > 0) notes.push_back({event, kTables[i].shownAs, removed[i], why});
-    }
-  };
   Counts old{};
   removeForAge(old);
-  tell("removed_for_age", old, "older than " + std::to_string(options_.maxAgeDays) + " days");
+  std::vector<LedgerNote> notes;
+  tell(notes, "removed_for_age", old,
+       "older than " + std::to_string(options_.maxAgeDays) + " days");
   Counts large{};
-  removeForSize(large);
-  tell("removed_for_size", large, "above " + std::to_string(options_.maxBytes) + " bytes");
+  removeForSize(large, options_.maxBytes);
+  shrinkFile(options_.maxBytes);
+  for (LedgerNote& note : notesOfSize(large)) notes.push_back(std::move(note));
+  return notes;
+}
+
+std::vector<LedgerNote> Retention::makeRoom(uint64_t bytes) {
+  thread_.assertHere();
+  const uint64_t limit = options_.maxBytes - std::min(bytes, options_.maxBytes);
+  Counts removed{};
+  for (uint64_t before = UINT64_MAX, used = usedBytes(); used > limit && used < before;) {
+    before = used;
+    removalsLeft_ = kRemovalsPerPass;
+    removeForSize(removed, limit);
+    used = usedBytes();
+  }
+  return notesOfSize(removed);
+}
+
+void Retention::shrinkFile(uint64_t bytes) {
+  const int64_t pageSize = pragma("PRAGMA page_size");
+  if (pageSize <= 0 || fileBytes() <= bytes) return;
+  if (pragma("PRAGMA auto_vacuum") == 0) {
+    // Begun before files could shrink: written anew, once.
+    if (usedBytes() > bytes) return;
+    for (const char* sql : {"PRAGMA temp_store = FILE", "PRAGMA auto_vacuum = INCREMENTAL",
+                            "VACUUM", "PRAGMA temp_store = MEMORY"})
+      execute(database_, sql);
+  }
+  // In steps, so that the log of each is short.
+  for (uint64_t before = UINT64_MAX, now = fileBytes(); now > bytes && now < before;) {
+    before = now;
+    execute(database_, "PRAGMA incremental_vacuum(256)");
+    now = fileBytes();
+  }
+  sqlite3_wal_checkpoint_v2(database_, nullptr, SQLITE_CHECKPOINT_TRUNCATE, nullptr, nullptr);
+}
+
+std::vector<LedgerNote> Retention::notesOfSize(const Counts& removed) const {
+  std::vector<LedgerNote> notes;
+  tell(notes, "removed_for_size", removed, "above " + std::to_string(options_.maxBytes) + " bytes");
   return notes;
 }
 
@@ -60,8 +109,8 @@ void Retention::removeForAge(Counts& removed) {
   }
 }
 
-void Retention::removeForSize(Counts& removed) {
-  while (removalsLeft_-- > 0 && usedBytes() > options_.maxBytes) {
+void Retention::removeForSize(Counts& removed, uint64_t limit) {
+  while (removalsLeft_-- > 0 && usedBytes() > limit) {
     std::optional<double> oldest;
     std::size_t oldestTable = 0;
     for (std::size_t table = 0; table < kSessions; ++table) {  // sessions go with their messages
@@ -138,6 +187,10 @@ std::optional<double> Retention::oldestTime(std::size_t table) {
 int64_t Retention::pragma(const char* sql) {
   Statement query(database_, sql);
   return query.row() ? query.integer(0) : 0;
+}
+
+uint64_t Retention::fileBytes() {
+  return static_cast<uint64_t>(pragma("PRAGMA page_count") * pragma("PRAGMA page_size"));
 }
 
 uint64_t Retention::usedBytes() {

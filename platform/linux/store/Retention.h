@@ -29,6 +29,10 @@ class Retention {
   // Removes rows that are too old (looked at every ten minutes) and, oldest first, what is above
   // the size. What the ledger is to say of it.
   std::vector<LedgerNote> apply();
+  // Removes the oldest rows until so many bytes fit below the size.
+  std::vector<LedgerNote> makeRoom(uint64_t bytes);
+  // Gives what the file has beyond so many bytes and does not use back to the file system.
+  void shrinkFile(uint64_t bytes);
   // To be called after each batch: applies it every kBatchesPerPass.
   std::vector<LedgerNote> onBatchWritten();
 
@@ -39,7 +43,7 @@ class Retention {
   using Counts = std::array<int64_t, kTableCount>;
 
   void removeForAge(Counts& removed);
-  void removeForSize(Counts& removed);
+  void removeForSize(Counts& removed, uint64_t limit);
   // Removes some of a table's oldest rows, those before a time if one is given. False: none.
   bool removeOldest(std::size_t table, std::optional<double> before, Counts& removed);
   bool removeOldestMessages(int64_t last, std::optional<double> before, Counts& removed);
@@ -47,7 +51,9 @@ class Retention {
   int64_t lastOfOldest(std::size_t table);
   std::optional<double> oldestTime(std::size_t table);
   int64_t pragma(const char* sql);
+  uint64_t fileBytes();
   uint64_t usedBytes();
+  std::vector<LedgerNote> notesOfSize(const Counts& removed) const;
 
   sqlite3* const database_;
   const StoreOptions options_;

@@ -15,6 +15,7 @@ namespace {
 
 constexpr std::size_t kKnownNames = 4096;
 constexpr std::size_t kKeptText = 256 << 10;  // a session's summary may be megabytes
+constexpr int kDoesNotFit = -1;               // beside SQLite's codes
 constexpr int64_t kRowsPerMark = 4096;
 constexpr int64_t kKeptMarks = 1024;
 
@@ -77,11 +78,12 @@ Status RowWriter::loadKnownRows(const ReplayedCalls& calls) {
 }
 
 Result<RowWriter::Written> RowWriter::write(const StoreRecords& batch, std::size_t first,
-                                            std::size_t last,
-                                            const std::vector<LedgerNote>& notes) {
+                                            std::size_t last, const std::vector<LedgerNote>& notes,
+                                            std::size_t allowance) {
   thread_.assertHere();
   written_ = {};
   leftOut_.clear();
+  allowance_ = allowance;
   const int64_t markedBefore = lastMarkedRow_;
   const int code = writeTransaction(batch, first, last, notes);
   for (std::string* text : {&json_, &eventJson_}) {
@@ -99,14 +101,29 @@ int RowWriter::writeTransaction(const StoreRecords& batch, std::size_t first, st
                                 const std::vector<LedgerNote>& notes) {
   int code = execute(database_, "BEGIN IMMEDIATE");
   if (code == SQLITE_OK) code = prepare();
-  for (std::size_t i = first; code == SQLITE_OK && i < last; ++i)
-    code = writeRecord(batch, batch[i]);
+  written_.last = first;
+  while (code == SQLITE_OK && written_.last < last) {
+    code = writeRecord(batch, batch[written_.last]);
+    if (code == SQLITE_OK) ++written_.last;
+  }
+  if (code == kDoesNotFit)
+    code = written_.last > first ? SQLITE_OK : execute(database_, "ROLLBACK");
+  if (written_.wanted > 0 && written_.last == first) return code;
   for (const std::vector<LedgerNote>* some : {&notes, &std::as_const(leftOut_)}) {
     for (std::size_t i = 0; code == SQLITE_OK && i < some->size(); ++i)
       code = writeLedger((*some)[i]);
   }
   if (code == SQLITE_OK) code = writeMark();
   return code == SQLITE_OK ? execute(database_, "COMMIT") : code;
+}
+
+bool RowWriter::take(std::size_t bytes) {
+  if (bytes > allowance_) {
+    written_.wanted = bytes;
+    return false;
+  }
+  allowance_ -= bytes;
+  return true;
 }
 
 int RowWriter::prepare() {
@@ -177,6 +194,8 @@ int RowWriter::writeRelaySession(const StoreRecord& record, const RelayOpenRecor
   appendJson(json_, userInfo);
   const std::string clientName = textUnder(userInfo, kVyrReportingUserInfoClientName);
   const std::string serviceName = textUnder(userInfo, kVyrReportingUserInfoServiceName);
+  const std::string_view text = storable(json_, "relay_sessions");
+  if (!take(text.size())) return kDoesNotFit;
   ++written_.rows;
   const int code = insertRelaySession_.run(
       {.time = record.time,
@@ -187,7 +206,7 @@ int RowWriter::writeRelaySession(const StoreRecord& record, const RelayOpenRecor
        .serviceName = serviceName,
        .batchEvent = flag(info, kVyrReportingSessionInfoBatchEvent),
        .containsRealtimeEvents = flag(info, kVyrReportingSessionInfoContainsRealtimeEvents),
-       .userInfo = storable(json_, "relay_sessions"),
+       .userInfo = text,
        .key = keyOf(record)});
   if (code == SQLITE_OK) session.row->id = sqlite3_last_insert_rowid(database_);
   return code;
@@ -210,25 +229,30 @@ int RowWriter::writeRelayMessage(const StoreRecords& batch, const StoreRecord& r
     return event != nullptr ? writeEvent(*event) : SQLITE_OK;
   json_.clear();
   appendJson(json_, message.payload);
+  const std::string_view payload = storable(json_, "relay_messages");
+  const AnalyticsRecord* built = nullptr;
+  EventText text = EventText::None;
+  if (event != nullptr && !isKnown(*event)) {
+    built = &std::get<AnalyticsRecord>(event->what);
+    text = buildEvent(*built, &message.payload);
+  }
+  if (!take(payload.size() + (built != nullptr ? eventJson_.size() : 0))) return kDoesNotFit;
   ++written_.rows;
   RelayMessageRow row = {.id = nextRow_++,
                          .time = record.time,
                          .relaySession = message.row->id,
                          .category = message.category,
                          .type = message.type,
-                         .payload = storable(json_, "relay_messages"),
+                         .payload = payload,
                          .key = keyOf(record),
                          .eventName = {},
                          .eventPlace = {},
                          .eventMicroseconds = {},
                          .eventTail = {}};
-  if (event == nullptr || isKnown(*event)) return insertRelayMessage_.run(row);
-  const auto& built = std::get<AnalyticsRecord>(event->what);
-  const EventText text = buildEvent(built, &message.payload);
   const bool shares = text == EventText::Tail && eventJson_.size() <= mostText_;
   if (shares) {
     int64_t name = 0;
-    if (const int code = nameRow(built.name, name); code != SQLITE_OK) return code;
+    if (const int code = nameRow(built->name, name); code != SQLITE_OK) return code;
     ++written_.rows;
     row.eventName = name;
     row.eventPlace = keyOf(*event).place;
@@ -237,24 +261,27 @@ int RowWriter::writeRelayMessage(const StoreRecords& batch, const StoreRecord& r
   }
   const int code = insertRelayMessage_.run(row);
   if (code != SQLITE_OK || shares || text == EventText::None) return code;
-  return writeEventRow(*event, built.name);
+  return writeEventRow(*event, built->name);
 }
 
 int RowWriter::writePower(const StoreRecord& record, const PowerRecord& power) {
   if (isKnown(record)) return SQLITE_OK;
   json_.clear();
   appendJson(json_, power.record);
+  const std::string_view text = storable(json_, "power_records");
+  if (!take(text.size())) return kDoesNotFit;
   ++written_.rows;
   return insertPower_.run({.time = record.time,
                            .clientIdentifier = power.clientIdentifier,
                            .name = power.name,
-                           .record = storable(json_, "power_records"),
+                           .record = text,
                            .key = keyOf(record)});
 }
 
 int RowWriter::writeEvent(const StoreRecord& record) {
   const auto& event = std::get<AnalyticsRecord>(record.what);
   if (isKnown(record) || buildEvent(event, nullptr) == EventText::None) return SQLITE_OK;
+  if (!take(std::min(eventJson_.size(), mostText_))) return kDoesNotFit;
   return writeEventRow(record, event.name);
 }
 

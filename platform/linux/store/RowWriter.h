@@ -29,6 +29,8 @@ class RowWriter {
   struct Written {
     uint64_t rows = 0;            // the ledger's not counted
     uint64_t failedBuilders = 0;  // events that are left out, because their builder failed
+    std::size_t last = 0;         // records before this one are written
+    std::size_t wanted = 0;       // bytes of the row at `last`, which did not fit
   };
 
   // `mostText`: of one payload, in bytes; a larger one is left out and the ledger says so.
@@ -42,11 +44,15 @@ class RowWriter {
   void forgetKnownRows() { known_.reset(); }
 
   // Writes records [first, last) of a batch, the events that share their text, and the notes, in
-  // one transaction. On a failure none of them is there.
+  // one transaction of at most `allowance` bytes of text; what goes beyond it is left for the next
+  // one. Nothing is written when the first row does not fit. On a failure none of them is there.
   Result<Written> write(const StoreRecords& batch, std::size_t first, std::size_t last,
-                        const std::vector<LedgerNote>& notes);
+                        const std::vector<LedgerNote>& notes, std::size_t allowance = SIZE_MAX);
 
  private:
+  // Takes so many bytes of the allowance; false, and the row is left for later, if they are not
+  // there.
+  bool take(std::size_t bytes);
   int writeTransaction(const StoreRecords& batch, std::size_t first, std::size_t last,
                        const std::vector<LedgerNote>& notes);
   // What there is to know of the database before the first row is written.
@@ -92,6 +98,7 @@ class RowWriter {
   std::unordered_map<std::string_view, int64_t> nameRows_;
   Written written_;                  // of the running transaction
   std::vector<LedgerNote> leftOut_;  // of the running transaction
+  std::size_t allowance_ = 0;        // what is left of it
   std::string json_;
   std::string eventJson_;
   std::optional<KnownRows> known_;

@@ -20,13 +20,10 @@ namespace vx::lnx {
 namespace {
 
 // Set before anything is read: page_size holds for a file that is begun now.
-constexpr const char* kPragmas[] = {"PRAGMA page_size = 16384",
-                                    "PRAGMA journal_mode = WAL",
-                                    "PRAGMA synchronous = FULL",
-                                    "PRAGMA wal_autocheckpoint = 1000",
-                                    "PRAGMA journal_size_limit = 67108864",
-                                    "PRAGMA cache_size = -1024",
-                                    "PRAGMA temp_store = MEMORY"};
+constexpr const char* kPragmas[] = {
+    "PRAGMA page_size = 4096",   "PRAGMA auto_vacuum = INCREMENTAL",    "PRAGMA journal_mode = WAL",
+    "PRAGMA synchronous = FULL", "PRAGMA journal_size_limit = 4194304", "PRAGMA cache_size = -1024",
+    "PRAGMA temp_store = MEMORY"};
 
 // One connection on one thread, and nobody who asks how much memory SQLite uses: it may leave out
 // its locks.
@@ -104,6 +101,11 @@ OpenedStore openStoreDatabase(const std::string& path, const JournalEpoch& epoch
     code = execute(database, pragma);
     if (code != SQLITE_OK) return fail(code);
   }
+  // A checkpoint at every 4 MiB of log, whatever the size of a page.
+  Statement pageSize(database, "PRAGMA page_size");
+  if (!pageSize.row()) return fail(sqlite3_extended_errcode(database));
+  sqlite3_wal_autocheckpoint(database, static_cast<int>((4 << 20) / pageSize.integer(0)));
+  pageSize.reset();
   code = bringSchemaUpToDate(database, version, epochIfNew);
   if (code != SQLITE_OK) return fail(code);
   Statement epochQuery(database, "SELECT epoch FROM store_info");

@@ -7,11 +7,15 @@
 
 namespace vx::lnx {
 
+// Whether a row that was accepted and is not committed survives the process. When it does, the
+// interval between two commits is only what a power cut may cost.
+inline constexpr bool kAcceptedSurvivesProcess = false;
+
 // When what has been accepted is committed: at whichever comes first.
 struct CommitWindow {
   std::size_t rows = 1000;
   std::size_t bytes = 1 << 20;
-  std::chrono::milliseconds interval{200};
+  std::chrono::milliseconds interval{kAcceptedSurvivesProcess ? 5000 : 200};
 
   bool isFull(std::size_t waitingRows, std::size_t waitingBytes) const {
     return waitingRows >= rows || waitingBytes >= bytes;
@@ -19,7 +23,9 @@ struct CommitWindow {
 };
 
 struct StoreOptions {
-  uint64_t maxBytes = 256u << 20;   // of the database file
+  static constexpr uint64_t kSlackBytes = 16u << 20;
+  // Of the database file; with its log never more than kSlackBytes beyond it.
+  uint64_t maxBytes = 256u << 20;
   uint32_t maxAgeDays = 30;         // 0: no limit
   uint64_t queueBytes = 32u << 20;  // not yet committed; reading from clients pauses above it
   CommitWindow commit;

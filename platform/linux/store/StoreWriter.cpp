@@ -1,6 +1,7 @@
 #include "platform/linux/store/StoreWriter.h"
 
 #include <sys/resource.h>
+#include <sys/stat.h>
 #include <sys/syscall.h>
 #include <unistd.h>
 
@@ -24,6 +25,9 @@ constexpr double kHoldSeconds = 0.05;                   // how far the relay may
 // nothing behind it either.
 constexpr uint64_t kMostText = 512u << 20;
 constexpr int kWriterNiceness = 15;
+// Of text, in one transaction; and of the log, before which it must have been checkpointed.
+constexpr std::size_t kTransactionBytes = 2u << 20;
+constexpr off_t kLogBytes = 8 << 20;
 
 std::size_t mostTextOf(const StoreOptions& options) {
   return static_cast<std::size_t>(std::min<uint64_t>(options.maxBytes / 4, kMostText));
@@ -130,8 +134,8 @@ void StoreWriter::writeBatch(StoreBatch& batch) {
     const std::size_t last = std::min(batch.records.size(), first + options_.commit.rows);
     const Result<RowWriter::Written> written = write(batch, first, last);
     if (written.ok()) {
-      onCommitted(batch, first, last);
-      first = last;
+      onCommitted(batch, first, written->last);
+      first = written->last;
       runJobs();
     } else if (!waitBeforeRetry(written.status())) {
       onLost(batch, first, written.status());
@@ -148,13 +152,57 @@ Result<RowWriter::Written> StoreWriter::write(const StoreBatch& batch, std::size
   if (replayFrom_ && !open_->rows.knowsRows()) {
     if (Status read = open_->rows.loadKnownRows(*replayFrom_); !read.ok()) return read;
   }
-  Result<RowWriter::Written> written = open_->rows.write(batch.records, first, last, notes_);
+  if (Status held = boundLog(); !held.ok()) return held;
+  const std::size_t allowance =
+      std::min<std::size_t>(kTransactionBytes, static_cast<std::size_t>(options_.maxBytes / 16));
+  makeRoomFor(allowance);
+  Result<RowWriter::Written> written =
+      open_->rows.write(batch.records, first, last, notes_, allowance);
+  if (written.ok() && written->last == first && written->wanted > 0) {  // a large one, by itself
+    makeRoomFor(written->wanted);
+    written = open_->rows.write(batch.records, first, first + 1, notes_, written->wanted);
+  }
   if (!written.ok()) return written;
   notes_.clear();
   ++commits_;
   rowsCommitted_ += written->rows;
   writeFailures_ += written->failedBuilders;
   return written;
+}
+
+Status StoreWriter::boundLog() {
+  struct stat log {};
+  if (stat((beginning_->path() + "-wal").c_str(), &log) != 0 || log.st_size < kLogBytes) {
+    logHeld_ = false;
+    return {};
+  }
+  int frames = 0;
+  const int code = sqlite3_wal_checkpoint_v2(open_->database.get(), nullptr,
+                                             SQLITE_CHECKPOINT_TRUNCATE, &frames, nullptr);
+  if (code == SQLITE_OK) {
+    logHeld_ = false;
+    return {};
+  }
+  const std::string why = (code & 0xFF) == SQLITE_BUSY
+                              ? "a reader keeps a transaction open; the log may not grow further"
+                              : sqlite3_errmsg(open_->database.get());
+  if (!logHeld_) notes_.push_back({"log_held", "", 0, why});
+  logHeld_ = true;
+  return Status::failure(why);
+}
+
+// A transaction of so many bytes may grow the file and its log by that and a little more.
+void StoreWriter::makeRoomFor(std::size_t bytes) {
+  const uint64_t growth = bytes + bytes / 4;
+  add(open_->retention.makeRoom(growth));
+  if (bytes <= kTransactionBytes) return;
+  sqlite3_wal_checkpoint_v2(open_->database.get(), nullptr, SQLITE_CHECKPOINT_TRUNCATE, nullptr,
+                            nullptr);
+  const uint64_t both = 2 * growth;
+  if (both <= StoreOptions::kSlackBytes) return;
+  const uint64_t beyond = both - StoreOptions::kSlackBytes;
+  add(open_->retention.makeRoom(beyond));
+  open_->retention.shrinkFile(options_.maxBytes - std::min(beyond, options_.maxBytes));
 }
 
 void StoreWriter::onCommitted(StoreBatch& batch, std::size_t first, std::size_t last) {

@@ -74,7 +74,11 @@ class StoreWriter {
   // What was found while the store was begun, for the log and the ledger.
   void report(std::vector<LedgerNote> found);
   void writeBatch(StoreBatch& batch);
+  // As many of the records as fit in one transaction.
   Result<RowWriter::Written> write(const StoreBatch& batch, std::size_t first, std::size_t last);
+  // Keeps the log below its bound: false while a reader holds it there.
+  Status boundLog();
+  void makeRoomFor(std::size_t bytes);
   void onCommitted(StoreBatch& batch, std::size_t first, std::size_t last);
   void onLost(StoreBatch& batch, std::size_t first, const Status& why);
   void release(StoreBatch& batch, std::size_t bytes);
@@ -106,6 +110,7 @@ class StoreWriter {
   Function<void()> drained_;
   std::vector<LedgerNote> notes_;  // for the next transaction
   bool failing_ = false;
+  bool logHeld_ = false;  // by a reader
   std::chrono::milliseconds backoff_{0};
   std::thread thread_;
 };
