@@ -165,6 +165,7 @@ Result<JournalAppended> Journal::write(const JournalRecord& record, EntryType ty
   entry->call = next_.call;
   entry->time = record.time;
   entry->connection = record.connection;
+  entry->user = record.user;
   entry->headBytes = static_cast<uint32_t>(record.head.size());
   entry->kind = record.kind;
   entry->type = type;
@@ -172,7 +173,7 @@ Result<JournalAppended> Journal::write(const JournalRecord& record, EntryType ty
                  : !record.dictionary ? uint8_t{0}
                                       : EntryHeader::kEmptyDictionary;
   if (record.forEarlier) entry->flags |= EntryHeader::kForEarlier;
-  entry->reserved = 0;
+  std::ranges::fill(entry->reserved, uint8_t{0});
   std::memset(bytes + body - kEntryAlignment, 0, record.head.empty() ? 0 : kEntryAlignment);
   copyTo(bytes + sizeof(EntryHeader), record.head);
   JournalAppended appended;

@@ -37,6 +37,7 @@ struct JournalRecord {
   std::optional<Payload::Validated> dictionary = {};
   // It stands for work of an earlier call, whose number is `connection`.
   bool forEarlier = false;
+  uint32_t user = kNoUser;
 };
 
 struct JournalAppended {

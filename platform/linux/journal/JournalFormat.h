@@ -28,6 +28,9 @@ inline constexpr std::size_t kMaxEntryBytes = (std::size_t{1} << 20) + 4096;
 
 using JournalEpoch = std::array<uint8_t, 16>;
 
+// No user has this number (chown(2)).
+inline constexpr uint32_t kNoUser = UINT32_MAX;
+
 enum class EntryType : uint8_t {
   Call = 1,              // waits until its tickets have gone
   Note = 2,              // an input of an earlier call, whose number it bears
@@ -37,7 +40,7 @@ enum class EntryType : uint8_t {
 
 struct SegmentHeader {
   static constexpr uint64_t kMagic = 0x314C4E524A5856;  // "VXJRNL1"
-  static constexpr uint32_t kVersion = 1;
+  static constexpr uint32_t kVersion = 2;
   static constexpr uint32_t kFree = 0;
   static constexpr uint32_t kInUse = 1;
 
@@ -67,13 +70,14 @@ struct EntryHeader {
   uint64_t call;
   double time;  // seconds since 1970
   uint64_t connection;
+  uint32_t user;  // whose call it is; kNoUser when it is nobody's
   uint32_t headBytes;
   uint8_t kind;
   EntryType type;
   uint8_t flags;
-  uint8_t reserved;
+  uint8_t reserved[5];
 };
-static_assert(sizeof(SegmentHeader) == 72 && sizeof(EntryHeader) == 48);
+static_assert(sizeof(SegmentHeader) == 72 && sizeof(EntryHeader) == 56);
 
 inline constexpr std::size_t kFirstEntry = 128;
 inline constexpr std::size_t kMaxEntriesPerSegment = kSegmentBytes / sizeof(EntryHeader);

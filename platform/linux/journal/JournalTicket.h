@@ -33,6 +33,7 @@ class JournalTicket {
     if (entry_ == nullptr) return 0;
     return (entry_->flags & EntryHeader::kForEarlier) != 0 ? entry_->connection : entry_->call;
   }
+  uint32_t user() const { return entry_ == nullptr ? kNoUser : entry_->user; }
   // When the call was accepted, seconds since 1970; and the kind of its record. Of a call only.
   double time() const { return entry_->time; }
   uint8_t kind() const { return entry_->kind; }

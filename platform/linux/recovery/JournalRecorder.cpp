@@ -41,7 +41,8 @@ RecordKind kindOf(CallRecorder::End how) {
 CallRecorder::Accepted JournalRecorder::accepted(pid_t pid, uid_t uid) {
   std::array<uint8_t, kAcceptedHeadBytes> head;
   writeAccepted({pid, uid}, head);
-  JournalAppended appended = append(RecordKind::Accepted, kUnrecorded, head, {}, Must::Always);
+  JournalAppended appended = append(RecordKind::Accepted, kUnrecorded, head, {}, Must::Always, uid);
+  if (appended.ticket) users_[appended.call] = uid;
   return {appended.call, std::move(appended.ticket)};
 }
 
@@ -62,7 +63,9 @@ CallRecorder::Called JournalRecorder::called(uint64_t connection, const Frame& c
 }
 
 JournalTicket JournalRecorder::ended(uint64_t connection, End how) {
-  return append(kindOf(how), connection, {}, {}, Must::Always).ticket;
+  JournalTicket ticket = append(kindOf(how), connection, {}, {}, Must::Always).ticket;
+  users_.erase(connection);
+  return ticket;
 }
 
 JournalTicket JournalRecorder::preferencesChanged(std::string_view notification) {
@@ -75,9 +78,14 @@ JournalTicket JournalRecorder::preferencesChanged(std::string_view notification)
 JournalAppended JournalRecorder::append(RecordKind kind, uint64_t connection,
                                         std::span<const uint8_t> head,
                                         const std::optional<Payload::Validated>& dictionary,
-                                        Must must) {
+                                        Must must, uint32_t user) {
   if (!time_) time_ = std::chrono::duration<double>(clock_.now().time_since_epoch()).count();
-  const JournalRecord record{static_cast<uint8_t>(kind), *time_, connection, head, dictionary};
+  const JournalRecord record{.kind = static_cast<uint8_t>(kind),
+                             .time = *time_,
+                             .connection = connection,
+                             .head = head,
+                             .dictionary = dictionary,
+                             .user = user != kNoUser ? user : userOf(connection)};
   Result<JournalAppended> appended =
       must == Must::Always ? journal_.appendEnd(record) : journal_.append(record);
   if (!appended.ok()) [[unlikely]] {
@@ -86,6 +94,11 @@ JournalAppended JournalRecorder::append(RecordKind kind, uint64_t connection,
   }
   ++counters_.recorded;
   return std::move(appended).value();
+}
+
+uint32_t JournalRecorder::userOf(uint64_t connection) const {
+  const auto found = users_.find(connection);
+  return found == users_.end() ? kNoUser : found->second;
 }
 
 void JournalRecorder::countUnrecorded(const Status& why) {

@@ -4,6 +4,7 @@
 #include <cstdint>
 #include <optional>
 #include <string_view>
+#include <unordered_map>
 #include <vector>
 
 #include "base/Clock.h"
@@ -48,15 +49,17 @@ class JournalRecorder final : public CallRecorder {
   enum class Must : uint8_t { WithinShare, Always };
   JournalAppended append(RecordKind kind, uint64_t connection, std::span<const uint8_t> head,
                          const std::optional<Payload::Validated>& dictionary = {},
-                         Must must = Must::WithinShare);
+                         Must must = Must::WithinShare, uint32_t user = kNoUser);
+  uint32_t userOf(uint64_t connection) const;
   void countUnrecorded(const Status& why);
 
   Journal& journal_;
   Clock& clock_;
   Function<void(const Status&)> unrecorded_;
   Counters counters_;
-  std::optional<double> time_;  // of this pass
-  std::vector<uint8_t> head_;   // of the call that is being recorded
+  std::unordered_map<uint64_t, uint32_t> users_;  // of the connections that are recorded
+  std::optional<double> time_;                    // of this pass
+  std::vector<uint8_t> head_;                     // of the call that is being recorded
 };
 
 }  // namespace vx::lnx

@@ -18,6 +18,7 @@ class RecoveredConnection final : public ClientConnection {
   RecoveredConnection(pid_t pid, uid_t uid) : pid_(pid), uid_(uid) {}
 
   int32_t processIdentifier() const override { return pid_; }
+  uid_t user() const { return uid_; }
   std::string description() const override {
     return "<RecoveredConnection pid " + std::to_string(pid_) + " uid " + std::to_string(uid_) +
            ">";

@@ -237,7 +237,7 @@ void Recovery::endOpenConnections() {
     const auto [number, connection] = *connections_.begin();
     connections_.erase(connections_.begin());
     {
-      const Cause cause = append(RecordKind::EndedCrashed, number);
+      const Cause cause = append(RecordKind::EndedCrashed, number, connection->user());
       const CauseScope scope(cause);
       connection->invalidate();
     }
@@ -247,9 +247,11 @@ void Recovery::endOpenConnections() {
   }
 }
 
-Cause Recovery::append(RecordKind kind, uint64_t connection) {
-  Result<JournalAppended> appended = means_.journal.appendEnd(
-      {.kind = static_cast<uint8_t>(kind), .time = lastTime_, .connection = connection});
+Cause Recovery::append(RecordKind kind, uint64_t connection, uint32_t user) {
+  Result<JournalAppended> appended = means_.journal.appendEnd({.kind = static_cast<uint8_t>(kind),
+                                                               .time = lastTime_,
+                                                               .connection = connection,
+                                                               .user = user});
   Cause cause;
   if (appended.ok()) cause.ticket = std::move(appended->ticket);
   return cause;

@@ -81,7 +81,7 @@ class Recovery {
   bool restoreSession(const Record& record);
   bool restoreRelay(const Record& record);
   void endOpenConnections();
-  Cause append(RecordKind kind, uint64_t connection);
+  Cause append(RecordKind kind, uint64_t connection, uint32_t user = kNoUser);
   void runInteractive();
   void waitForStore();
 
