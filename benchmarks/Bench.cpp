@@ -23,6 +23,8 @@ constexpr Measurement kMeasurements[] = {
     {"accepted", measureAccepted},
     {"sustained", measureSustained},
     {"idle", measureIdle},
+    {"trickle", measureTrickle},
+    {"journal", measureCrashSafety},
     {"sessions", measureSessions},
     {"stop", measureStop},
     {"client", measureClientSend},

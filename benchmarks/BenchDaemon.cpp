@@ -24,6 +24,8 @@ namespace {
 
 namespace fs = std::filesystem;
 
+constexpr const char* kSyncCounter = "libvx-bench-syncs.so";
+
 uint64_t statusField(const std::string& path, const std::string& field) {
   std::ifstream file(path);
   std::string line;
@@ -50,7 +52,9 @@ BenchDaemon::BenchDaemon(const DaemonOptions& options) {
   folder_ = pattern;
   for (const char* name : {"run", "state", "etc", "log", "drivers"})
     fs::create_directory(folder_ + "/" + name);
-  socketPath_ = folder_ + "/run/service.socket";
+  std::string memory = "/dev/shm/vxbench-XXXXXX";
+  runtimeFolder_ = mkdtemp(memory.data()) != nullptr ? memory : folder_ + "/run";
+  socketPath_ = runtimeFolder_ + "/service.socket";
   std::ofstream(folder_ + "/etc/platform.toml")
       << "[device]\ninternal_build = " << (options.internalBuild ? "true" : "false")
       << "\n[log]\ndestination = \"stderr\"\n[listener]\nmax_connections = 20000\n"
@@ -80,7 +84,12 @@ BenchDaemon::BenchDaemon(const DaemonOptions& options) {
       sched_setaffinity(0, sizeof set, &set);
     }
     setenv("NOTIFY_SOCKET", notifyPath.c_str(), 1);
-    setenv("RUNTIME_DIRECTORY", (folder_ + "/run").c_str(), 1);
+    setenv("RUNTIME_DIRECTORY", runtimeFolder_.c_str(), 1);
+    if (options.countSyncs) {
+      setenv("VX_BENCH_SYNCS", (folder_ + "/syncs").c_str(), 1);
+      const fs::path counter = fs::read_symlink("/proc/self/exe").parent_path() / kSyncCounter;
+      setenv("LD_PRELOAD", counter.c_str(), 1);
+    }
     setenv("STATE_DIRECTORY", (folder_ + "/state").c_str(), 1);
     setenv("CONFIGURATION_DIRECTORY", (folder_ + "/etc").c_str(), 1);
     setenv("LOGS_DIRECTORY", (folder_ + "/log").c_str(), 1);
@@ -105,6 +114,7 @@ BenchDaemon::~BenchDaemon() {
   }
   std::error_code ignored;
   fs::remove_all(folder_, ignored);
+  fs::remove_all(runtimeFolder_, ignored);
 }
 
 int BenchDaemon::stop() {
@@ -148,6 +158,16 @@ uint64_t BenchDaemon::voluntarySwitches() const {
     sum += statusField(task.path() / "status", "voluntary_ctxt_switches");
   }
   return sum;
+}
+
+uint64_t BenchDaemon::writtenBytes() const {
+  return statusField("/proc/" + std::to_string(pid_) + "/io", "write_bytes");
+}
+
+uint64_t BenchDaemon::syncs() const {
+  std::error_code none;
+  const auto count = fs::file_size(folder_ + "/syncs", none);  // a byte each
+  return none ? 0 : count;
 }
 
 void BenchDaemon::waitUntilIdle() const {

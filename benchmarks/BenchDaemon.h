@@ -13,6 +13,7 @@ struct DaemonOptions {
   int cpu = -1;  // pin all its threads; -1: no pinning
   bool internalBuild = false;
   std::string extraConfiguration;
+  bool countSyncs = false;
 };
 
 class BenchDaemon {
@@ -32,6 +33,8 @@ class BenchDaemon {
   uint64_t aggregateBytes() const;     // what sessions received: shared memory
   uint64_t residentBytes() const;      // VmRSS
   uint64_t voluntarySwitches() const;  // all threads
+  uint64_t writtenBytes() const;       // that the kernel has for a disk; 0 on a tmpfs
+  uint64_t syncs() const;              // fsync and fdatasync, if they are counted
   // Until it has used no more than a few hundred microseconds of CPU for a while.
   void waitUntilIdle() const;
   // SIGTERM; its exit status.
@@ -39,6 +42,7 @@ class BenchDaemon {
 
  private:
   std::string folder_;
+  std::string runtimeFolder_;  // on a tmpfs, as on a device
   std::string socketPath_;
   pid_t pid_ = -1;
   double startToReadyMs_ = 0;

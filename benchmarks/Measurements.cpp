@@ -2,11 +2,14 @@
 
 #include <sqlite3.h>
 #include <sys/resource.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <atomic>
 #include <chrono>
 #include <cstdio>
+#include <cstring>
+#include <filesystem>
 #include <fstream>
 #include <memory>
 #include <stdexcept>
@@ -19,6 +22,7 @@
 #include "benchmarks/RawClient.h"
 #include "benchmarks/Workload.h"
 #include "client/ReportingClient.h"
+#include "platform/linux/journal/Journal.h"
 
 namespace vx::bench {
 
@@ -102,6 +106,7 @@ Effort Effort::quickEffort() {
   effort.roundTripsPerRound = 5000;
   effort.sustainedMessages = 250000;
   effort.idleSeconds = 5;
+  effort.trickleSeconds = 20;
   return effort;
 }
 
@@ -300,6 +305,95 @@ void measureIdle(Results& results, const Effort& effort) {
        .reach = {},
        .what = "voluntary context switches of all threads, one idle client, one started session"},
       0, 0, false);
+}
+
+void measureTrickle(Results& results, const Effort& effort) {
+  progress("two messages a second for " + std::to_string(effort.trickleSeconds) + " s");
+  constexpr std::chrono::milliseconds kPause{500};
+  DaemonOptions options;
+  options.countSyncs = true;
+  BenchDaemon daemon(options);
+  RawClient client(daemon.socketPath());
+  client.create(1);
+  client.start(1);
+  const auto frames = workloadFrames();
+  const std::size_t messages = effort.trickleSeconds * 2;
+  auto next = SteadyClock::now();
+  auto send = [&](std::size_t count) {
+    for (std::size_t i = 0; i < count; ++i) {
+      std::this_thread::sleep_until(next += kPause);
+      client.sendOnce(frames[i % frames.size()]);
+    }
+  };
+  send(12);  // the session is set up, and the store begun and committed to
+  const uint64_t bytes = daemon.writtenBytes();
+  const uint64_t syncs = daemon.syncs();
+  const uint64_t switches = daemon.voluntarySwitches();
+  send(messages);
+  const auto count = static_cast<double>(messages);
+  results.add({.name = "flash_bytes_per_message",
+               .value = static_cast<double>(daemon.writtenBytes() - bytes) / count,
+               .unit = "B",
+               .floor = {},
+               .ratio = {},
+               .reach = {},
+               .what = "bytes for the disk at two messages a second into one session"},
+              4096, 1024, false);
+  results.add({.name = "syncs_per_minute",
+               .value = static_cast<double>(daemon.syncs() - syncs) * 60.0 /
+                        static_cast<double>(effort.trickleSeconds),
+               .unit = "1/min",
+               .floor = {},
+               .ratio = {},
+               .reach = {},
+               .what = "fsync and fdatasync meanwhile"},
+              12, 12, false);
+  results.add({.name = "wakeups_per_message",
+               .value = static_cast<double>(daemon.voluntarySwitches() - switches) / count,
+               .unit = "",
+               .floor = {},
+               .ratio = {},
+               .reach = {},
+               .what = "voluntary context switches of all threads meanwhile"},
+              4, 4, false);
+}
+
+void measureCrashSafety(Results& results, const Effort& effort) {
+  progress("recording a call");
+  lnx::JournalOptions options;
+  options.folder = "/dev/shm/vxbench-journal-" + std::to_string(getpid());
+  const auto journal = lnx::Journal::open(options);
+  if (!journal.ok()) throw std::runtime_error(journal.status().text());
+  const Payload payload = workloadPayload(1);
+  const std::span<const uint8_t> bytes = payload.encoded();
+  const uint8_t head[] = {1, 2, 3, 4, 5, 6, 7, 8};
+  const lnx::JournalRecord record{1, 1.5, 2, head, payload.validated()};
+  constexpr int kCalls = 1 << 14;  // between snapshots of nothing, after which segments are reused
+  std::vector<double> added;
+  for (std::size_t round = 0; round < effort.rounds * 8; ++round) {
+    const auto start = SteadyClock::now();
+    for (int i = 0; i < kCalls; ++i) {
+      std::unique_ptr<uint8_t[]> copy(new uint8_t[bytes.size()]);
+      std::memcpy(copy.get(), bytes.data(), bytes.size());
+      asm volatile("" : : "r"(copy.get()) : "memory");
+    }
+    const double heap = secondsSince(start);
+    const auto recording = SteadyClock::now();
+    bool ok = journal.value()->beginGeneration().ok() && journal.value()->endSnapshot().ok();
+    for (int i = 0; i < kCalls; ++i) ok = journal.value()->append(record).ok() && ok;
+    if (!ok) throw std::runtime_error("the journal is full");
+    added.push_back((secondsSince(recording) - heap) * 1e9 / kCalls);
+  }
+  journal.value()->discard();
+  std::filesystem::remove_all(options.folder);
+  results.add({.name = "crash_safe_ns",
+               .value = median(added),
+               .unit = "ns",
+               .floor = {},
+               .ratio = {},
+               .reach = {},
+               .what = "what the journal adds to a call: recorded, instead of copied to the heap"},
+              150, 40, false);
 }
 
 void measureSessions(Results& results, const Effort&) {

@@ -15,6 +15,7 @@ struct Effort {
   std::size_t burstMessages = 30000;
   std::size_t sustainedMessages = 1000000;  // over all rounds
   std::size_t idleSeconds = 20;
+  std::size_t trickleSeconds = 60;
   static Effort quickEffort();
 };
 
@@ -24,6 +25,9 @@ void measureAccepted(Results& results, const Effort& effort);
 void measureSustained(Results& results,
                       const Effort& effort);  // stored_per_s, CPU, aggregated memory
 void measureIdle(Results& results, const Effort& effort);
+// flash_bytes_per_message, syncs_per_minute, wakeups_per_message
+void measureTrickle(Results& results, const Effort& effort);
+void measureCrashSafety(Results& results, const Effort& effort);
 void measureSessions(Results& results, const Effort& effort);
 void measureStop(Results& results, const Effort& effort);
 void measureClientSend(Results& results, const Effort& effort);
