@@ -132,9 +132,10 @@ class Daemon:
         for name in ("run", "state", "etc", "log", "drivers"):
             os.makedirs(f"{self.folder}/{name}", exist_ok=True)
         sensor = "" if "[orientation]" in config else "[orientation]\ndevice_sensor = false\n"
+        store = "" if "[store]" in config else "[store]\ncommit_interval_ms = 100\n"
         with open(f"{self.folder}/etc/platform.toml", "w") as f:
             f.write(f'[log]\ndestination = "stderr"\nlevel = "info"\nburst = 0\n'
-                    f'[drivers]\nroot = "{self.folder}/drivers"\n{sensor}{config}')
+                    f'[drivers]\nroot = "{self.folder}/drivers"\n{sensor}{store}{config}')
         self.environment = dict(
             os.environ, RUNTIME_DIRECTORY=f"{self.folder}/run", STATE_DIRECTORY=f"{self.folder}/state",
             CONFIGURATION_DIRECTORY=f"{self.folder}/etc", LOGS_DIRECTORY=f"{self.folder}/log", **(environment or {}))

@@ -7,15 +7,12 @@
 
 namespace vx::lnx {
 
-// Whether a row that was accepted and is not committed survives the process. When it does, the
-// interval between two commits is only what a power cut may cost.
-inline constexpr bool kAcceptedSurvivesProcess = false;
-
-// When what has been accepted is committed: at whichever comes first.
+// When what has been accepted is committed: at whichever comes first. What is accepted survives the
+// process: the interval is what a power cut may cost.
 struct CommitWindow {
   std::size_t rows = 1000;
   std::size_t bytes = 1 << 20;
-  std::chrono::milliseconds interval{kAcceptedSurvivesProcess ? 5000 : 200};
+  std::chrono::milliseconds interval{5000};
 
   bool isFull(std::size_t waitingRows, std::size_t waitingBytes) const {
     return waitingRows >= rows || waitingBytes >= bytes;
