@@ -69,7 +69,7 @@ class Faults(DaemonTest):
         d.start()
         d.client().session(1)
         self.assertEqual(d.stop(), 0)
-        self.assertEqual(d.rows("SELECT count(*) FROM relay_messages WHERE category = 3"), [(2,)])
+        self.assertEqual(d.rows("SELECT count(*), uid FROM relay_messages WHERE category = 3"), [(2, os.getuid())])
 
     def test_socket_activation_and_readiness(self):
         folder = tempfile.mkdtemp(prefix="vx")

@@ -4,6 +4,9 @@
 namespace vx::lnx {
 namespace {
 
+using ::testing::Contains;
+using ::testing::Each;
+
 constexpr double kNow = 1576800000;  // the fake clock's
 constexpr double kDay = 86400;
 
@@ -110,6 +113,23 @@ TEST_F(RetentionTest, OldestGoFirstUntilTheSizeFits) {
   EXPECT_EQ(more[0], "removed_for_size relay_messages 500");
   EXPECT_EQ(more[3], "removed_for_size relay_sessions 1");
   EXPECT_EQ(query("SELECT min(id) > 1 AND max(id) = 5500 FROM power_records").at(0), "1");
+}
+
+TEST_F(RetentionTest, WhoeverHasTheMostMakesSpaceWhateverIsOlder) {
+  options.maxBytes = 1 << 20;
+  addPower(500, kNow - kDay, 200);
+  query("UPDATE power_records SET uid = 7");
+  addSession(1500, kNow, 1000);
+  query("UPDATE relay_messages SET uid = 8");
+  addSession(100, kNow + 1, 1000);  // nobody's
+  EXPECT_THAT(apply(), Contains("removed_for_size relay_messages 1000"));
+  EXPECT_EQ(query("SELECT count(*) FROM power_records").at(0), "500");
+  EXPECT_EQ(query("SELECT count(*) FROM relay_messages WHERE uid IS NULL").at(0), "100");
+  retention().noteWritten({{7, 1 << 20}});
+  query(
+      "INSERT INTO power_records(time, client_identifier, name, record, uid)"
+      " SELECT time + 9e5, 1, 'n', printf('%*c', 2000, 'x'), 7 FROM power_records");
+  EXPECT_THAT(apply(), Each(HasSubstr("removed_for_size power_records")));
 }
 
 TEST_F(RetentionTest, IsAppliedEverySoManyBatches) {

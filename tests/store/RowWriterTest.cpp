@@ -44,15 +44,15 @@ TEST_F(RowWriterTest, EveryColumnIsWhatWasGivenAndOfItsKind) {
   EXPECT_TRUE(write({{"what", "", 0, "why"}, {"what", "t", 3, "why"}}).ok());
   EXPECT_EQ(written.rows, 5u);
   EXPECT_THAT(query("SELECT * FROM relay_sessions"),
-              ElementsAre("1|1.5|-1|null|null|||null|null|{}|null|null|null|null",
+              ElementsAre("1|1.5|-1|null|null|||null|null|{}|null|null|null|null|null",
                           "2|2.0|1099511627776|19|2.5|c|s|1|0|{\"clientName\":\"c\","
-                          "\"serviceName\":\"s\"}|null|null|null|null"));
+                          "\"serviceName\":\"s\"}|null|null|null|null|null"));
   EXPECT_THAT(
       query("SELECT * FROM relay_messages"),
-      ElementsAre("1|2.5|2|65535|65534|{\"x\":0.5,\"t\":true}|null|null|null|null|null|null"));
+      ElementsAre("1|2.5|2|65535|65534|{\"x\":0.5,\"t\":true}|null|null|null|null|null|null|null"));
   EXPECT_THAT(query("SELECT * FROM analytics_events"), ElementsAre("2|3.0|name|{\"i\":1}"));
   EXPECT_THAT(query("SELECT * FROM power_records"),
-              ElementsAre("1|4.0|28|Lumo_Haptics|{\"i\":2}|null|null"));
+              ElementsAre("1|4.0|28|Lumo_Haptics|{\"i\":2}|null|null|null"));
   EXPECT_THAT(query("SELECT id, time = 1576800000, event, table_name, rows, detail "
                     "FROM store_ledger"),
               ElementsAre("1|1|what|null|0|why", "2|1|what|t|3|why"));

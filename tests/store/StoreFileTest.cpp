@@ -125,7 +125,7 @@ TEST_F(StoreFileTest, MigrationThatFailsChangesNothing) {
   StoreTest::query(
       "CREATE TABLE event_names(x); CREATE TABLE analytics_events(x);"
       "CREATE VIEW client_uptimes AS SELECT 1; PRAGMA user_version = 1");
-  EXPECT_EQ(open().fault, StoreFault::Unusable);
+  EXPECT_EQ(open().fault, StoreFault::Damaged);
   EXPECT_THAT(StoreTest::query("SELECT name FROM sqlite_master ORDER BY name"),
               ElementsAre("analytics_events", "client_uptimes", "event_names"));
 }

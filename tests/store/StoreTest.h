@@ -46,7 +46,7 @@ class StoreTest : public FolderTest {
   JournalTicket recorded(double time = 7.5, uint8_t kind = 1) {
     if (journal == nullptr)
       journal = std::move(*Journal::open({.folder = folder + "/journal", .epoch = kEpoch}));
-    return journal->append({.kind = kind, .time = time})->ticket;
+    return journal->append({.kind = kind, .time = time, .user = 1000})->ticket;
   }
   // How many of the recorded calls are not done.
   int undone() {
@@ -77,8 +77,9 @@ class StoreTest : public FolderTest {
   }
   static RelayOpenRecord opening(std::shared_ptr<RelayRow> of, VyrSessionInfo info,
                                  Payload user = userInfo()) {
-    return {std::move(of),
-            std::make_unique<std::pair<VyrSessionInfo, Payload>>(std::move(info), std::move(user))};
+    of->information =
+        std::make_unique<std::pair<VyrSessionInfo, Payload>>(std::move(info), std::move(user));
+    return {std::move(of)};
   }
   RelayMessageRecord message(Payload payload) { return {row, std::move(payload), 5, 7}; }
   static AnalyticsRecord event(std::string_view name, Payload built, Payload message = Payload()) {

@@ -28,7 +28,8 @@ void JournaledInputs::keepDelayed(const Payload& facts, const Payload& content, 
                            .connection = ticket.namedCall(),
                            .head = head,
                            .dictionary = content.validated(),
-                           .forEarlier = true});
+                           .forEarlier = true,
+                           .user = ticket.user()});
   if (appended.ok()) held.moveTo(std::move(appended->ticket));
 }
 

@@ -93,4 +93,13 @@ std::optional<int64_t> KnownRows::find(const RowKey& key) const {
   return found == rows_.end() ? std::nullopt : std::optional<int64_t>(found->second);
 }
 
+std::optional<int64_t> KnownRows::sessionOf(sqlite3* database, const RowKey& key) {
+  if (key.call == 0) return std::nullopt;
+  Statement query(database,
+                  "SELECT id FROM relay_sessions WHERE call = ? AND place = ?"
+                  " AND id > (SELECT after_session FROM store_info)");
+  query.bind(static_cast<int64_t>(key.call)).bind(int64_t{key.place});
+  return query.row() ? std::optional<int64_t>(query.integer(0)) : std::nullopt;
+}
+
 }  // namespace vx::lnx

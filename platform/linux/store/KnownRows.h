@@ -33,6 +33,8 @@ class KnownRows {
   // The identifier of the row with this key.
   std::optional<int64_t> find(const RowKey& key) const;
   bool isEarlier(const RowKey& key) const { return key.call != 0 && key.call < firstCall_; }
+  // Reads the sessions one by one.
+  static std::optional<int64_t> sessionOf(sqlite3* database, const RowKey& key);
 
  private:
   struct Hash {

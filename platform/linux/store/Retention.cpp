@@ -15,14 +15,21 @@ constexpr std::chrono::minutes kAgeCheckInterval{10};
 constexpr int64_t kRowsPerRemoval = 500;
 constexpr int kRemovalsPerPass = 64;
 
+constexpr int64_t kMessagesPerOrphans = 50000;
+// Rows from ?1 to ?2 before the time ?3, of the user ?4 or of all.
+const std::string kSelected =
+    " WHERE id BETWEEN ?1 AND ?2 AND time < ?3 AND (?4 IS NULL OR ifnull(uid, " +
+    std::to_string(kNoUser) + ") = ?4)";
+
 struct RetainedTable {
   std::string name;
   std::string shownAs;
+  std::string text;  // the column
 };
-const RetainedTable kTables[] = {{"relay_messages", "relay_messages"},
-                                 {"analytics_entries", "analytics_events"},
-                                 {"power_records", "power_records"},
-                                 {"relay_sessions", "relay_sessions"}};
+const RetainedTable kTables[] = {{"relay_messages", "relay_messages", "payload"},
+                                 {"analytics_entries", "analytics_events", "payload"},
+                                 {"power_records", "power_records", "record"},
+                                 {"relay_sessions", "relay_sessions", "user_info"}};
 
 }  // namespace
 
@@ -48,6 +55,7 @@ std::vector<LedgerNote> Retention::apply() {
        "older than " + std::to_string(options_.maxAgeDays) + " days");
   Counts large{};
   removeForSize(large, options_.maxBytes);
+  if (messagesSinceOrphans_ > 0) removeOrphans(large);
   shrinkFile(options_.maxBytes);
   for (LedgerNote& note : notesOfSize(large)) notes.push_back(std::move(note));
   return notes;
@@ -76,6 +84,7 @@ void Retention::shrinkFile(uint64_t bytes) {
                             "VACUUM", "PRAGMA temp_store = MEMORY"})
       execute(database_, sql);
   }
+  shrunk_ = true;
   // In steps, so that the log of each is short.
   for (uint64_t before = UINT64_MAX, now = fileBytes(); now > bytes && now < before;) {
     before = now;
@@ -95,6 +104,12 @@ std::vector<LedgerNote> Retention::onBatchWritten() {
   return ++batches_ >= kBatchesPerPass ? apply() : std::vector<LedgerNote>();
 }
 
+void Retention::noteWritten(const UserBytes& bytes) {
+  for (const auto& [user, some] : bytes) {
+    if (measured_) addTo(bytes_, user, some);
+  }
+}
+
 void Retention::removeForAge(Counts& removed) {
   if (options_.maxAgeDays == 0) return;
   if (lastAgeCheck_ && clock_.monotonic() - *lastAgeCheck_ < kAgeCheckInterval) return;
@@ -103,7 +118,7 @@ void Retention::removeForAge(Counts& removed) {
   const double before = (now - std::chrono::duration<double>(Days(options_.maxAgeDays))).count();
   for (std::size_t table = 0; table < kTableCount; ++table) {
     while (removalsLeft_ > 0 && oldestTime(table).value_or(before) < before) {
-      if (!removeOldest(table, before, removed)) break;
+      if (!removeOldest(table, {.user = {}, .before = before}, removed)) break;
       --removalsLeft_;
     }
   }
@@ -111,77 +126,139 @@ void Retention::removeForAge(Counts& removed) {
 
 void Retention::removeForSize(Counts& removed, uint64_t limit) {
   while (removalsLeft_-- > 0 && usedBytes() > limit) {
+    if (!measured_) measureUsers();
+    if (!removeOfGreatest(removed)) break;
+  }
+  // Looked for where that is worth reading all messages' sessions.
+  if (messagesSinceOrphans_ >= kMessagesPerOrphans) removeOrphans(removed);
+}
+
+bool Retention::removeOfGreatest(Counts& removed) {
+  while (!bytes_.empty()) {
+    const auto greatest =
+        std::ranges::max_element(bytes_, {}, [](const auto& e) { return e.second; });
+    const uint32_t user = greatest->first;
     std::optional<double> oldest;
     std::size_t oldestTable = 0;
     for (std::size_t table = 0; table < kSessions; ++table) {  // sessions go with their messages
-      const std::optional<double> time = oldestTime(table);
+      const std::optional<double> time = oldestTime(table, user);
       if (time && (!oldest || *time < *oldest)) {
         oldest = time;
         oldestTable = table;
       }
     }
-    if (!oldest || !removeOldest(oldestTable, std::nullopt, removed)) break;
+    if (oldest) return removeOldest(oldestTable, {.user = user, .before = {}}, removed);
+    bytes_.erase(greatest);  // has nothing left
   }
-  if (removed[kMessages] == 0) return;
-  // Sessions whose every message is gone, and that came before the oldest message left.
-  Statement orphans(
-      database_,
-      "DELETE FROM relay_sessions WHERE id < (SELECT min(relay_session) FROM relay_messages)");
+  measured_ = false;
+  return false;
+}
+
+void Retention::measureUsers() {
+  bytes_.clear();
+  first_.clear();
+  for (std::size_t table = 0; table < kSessions; ++table) {
+    Statement users(database_, "SELECT ifnull(uid, " + std::to_string(kNoUser) + "), sum(length(" +
+                                   kTables[table].text + ")), min(id) FROM " + kTables[table].name +
+                                   " GROUP BY 1");
+    while (users.row()) {
+      const auto user = static_cast<uint32_t>(users.integer(0));
+      addTo(bytes_, user, users.integer(1) + 1);
+      first_[{table, user}] = users.integer(2);
+    }
+  }
+  measured_ = true;
+}
+
+// Sessions whose every message is gone. One that may still get messages stays while an older one
+// has some.
+void Retention::removeOrphans(Counts& removed) {
+  messagesSinceOrphans_ = 0;
+  Statement orphans(database_,
+                    "DELETE FROM relay_sessions WHERE id NOT IN"
+                    " (SELECT relay_session FROM relay_messages) AND (ended_at IS NOT NULL"
+                    " OR id < (SELECT min(relay_session) FROM relay_messages))");
   if (orphans.run() == SQLITE_OK) removed[kSessions] += sqlite3_changes64(database_);
 }
 
-bool Retention::removeOldest(std::size_t table, std::optional<double> before, Counts& removed) {
-  const int64_t last = lastOfOldest(table);
-  if (table == kMessages) return removeOldestMessages(last, before, removed);
-  const int64_t rows = removeUpTo(table, last, before);
+bool Retention::removeOldest(std::size_t table, Selection which, Counts& removed) {
+  which.last = lastOfOldest(table, which.user);
+  if (table == kMessages) return removeOldestMessages(which, removed);
+  const int64_t rows = removeSelected(table, which);
   removed[table] += rows;
   return rows > 0;
 }
 
 // Removes messages, and with them the events that share their text. Those of the second schema lie
 // at the beginning of a table of their own: both tables name messages in the same order.
-bool Retention::removeOldestMessages(int64_t last, std::optional<double> before, Counts& removed) {
+bool Retention::removeOldestMessages(const Selection& which, Counts& removed) {
   if (execute(database_, "BEGIN IMMEDIATE") != SQLITE_OK) return false;
   Statement events(database_,
-                   "SELECT count(event_name) FROM relay_messages WHERE id <= ? AND time < ?");
-  const int64_t within =
-      events.bind(last).bind(before.value_or(1e18)).row() ? events.integer(0) : 0;
+                   std::string("SELECT count(event_name) FROM relay_messages") + kSelected);
+  bindSelection(events, kMessages, which);
+  const int64_t within = events.row() ? events.integer(0) : 0;
   events.reset();
-  const int64_t rows = removeUpTo(kMessages, last, before);
+  const int64_t rows = removeSelected(kMessages, which);
   Statement sharers(database_,
                     "DELETE FROM analytics_entries AS e WHERE e.message <= ?1"
                     " AND e.id < ifnull((SELECT id FROM analytics_entries WHERE message > ?1"
                     " ORDER BY id LIMIT 1), 9e18)"
                     " AND NOT EXISTS (SELECT 1 FROM relay_messages m WHERE m.id = e.message)");
-  int code = sharers.bind(last).run();
+  int code = sharers.bind(which.last).run();
   const int64_t sharing = sqlite3_changes64(database_);
   if (code == SQLITE_OK) code = execute(database_, "COMMIT");
   if (code != SQLITE_OK) {
     execute(database_, "ROLLBACK");
+    measured_ = false;
     return false;
   }
   removed[kMessages] += rows;
   removed[kEvents] += within + sharing;
+  messagesSinceOrphans_ += rows;
   return rows > 0;
 }
 
-// Removes rows up to an identifier, those before a time if one is given; how many.
-int64_t Retention::removeUpTo(std::size_t table, int64_t last, std::optional<double> before) {
-  Statement remove(database_, "DELETE FROM " + kTables[table].name + " WHERE id <= ? AND time < ?");
-  if (remove.bind(last).bind(before.value_or(1e18)).run() != SQLITE_OK) return 0;
+void Retention::bindSelection(Statement& statement, std::size_t table, const Selection& which) {
+  statement.bind(firstOf(table, which.user)).bind(which.last).bind(which.before.value_or(1e18));
+  statement.bind(which.user ? std::optional<int64_t>(*which.user) : std::nullopt);
+}
+
+// How many.
+int64_t Retention::removeSelected(std::size_t table, const Selection& which) {
+  if (measured_ && table != kSessions) {
+    Statement text(database_, "SELECT ifnull(uid, " + std::to_string(kNoUser) + "), sum(length(" +
+                                  kTables[table].text + ")) FROM " + kTables[table].name +
+                                  kSelected + " GROUP BY 1");
+    bindSelection(text, table, which);
+    while (text.row()) addTo(bytes_, static_cast<uint32_t>(text.integer(0)), -text.integer(1));
+  }
+  Statement remove(database_, "DELETE FROM " + kTables[table].name + kSelected);
+  bindSelection(remove, table, which);
+  if (remove.run() != SQLITE_OK) return 0;
+  if (which.user) first_[{table, *which.user}] = which.last + 1;
   return sqlite3_changes64(database_);
 }
 
 // The identifier of the last of the kRowsPerRemoval oldest rows, or of the last there is.
-int64_t Retention::lastOfOldest(std::size_t table) {
+int64_t Retention::lastOfOldest(std::size_t table, std::optional<uint32_t> user) {
   Statement query(database_, "SELECT max(id) FROM (SELECT id FROM " + kTables[table].name +
-                                 " ORDER BY id LIMIT " + std::to_string(kRowsPerRemoval) + ")");
+                                 kSelected + " ORDER BY id LIMIT " +
+                                 std::to_string(kRowsPerRemoval) + ")");
+  bindSelection(query, table, {.user = user, .before = {}, .last = INT64_MAX});
   return query.row() ? query.integer(0) : 0;
 }
 
-std::optional<double> Retention::oldestTime(std::size_t table) {
-  Statement query(database_, "SELECT time FROM " + kTables[table].name + " ORDER BY id LIMIT 1");
+std::optional<double> Retention::oldestTime(std::size_t table, std::optional<uint32_t> user) {
+  Statement query(database_,
+                  "SELECT time FROM " + kTables[table].name + kSelected + " ORDER BY id LIMIT 1");
+  bindSelection(query, table, {.user = user, .before = {}, .last = INT64_MAX});
   return query.row() ? std::optional<double>(query.real(0)) : std::nullopt;
+}
+
+int64_t Retention::firstOf(std::size_t table, std::optional<uint32_t> user) const {
+  if (!user) return 0;
+  const auto found = first_.find({table, *user});
+  return found == first_.end() ? 0 : found->second;
 }
 
 int64_t Retention::pragma(const char* sql) {

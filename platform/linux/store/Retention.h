@@ -1,11 +1,15 @@
-// The store's size and age: the oldest rows go first, and the ledger says so.
+// The store's size and age: the oldest rows go first, and the ledger says so. Above the size they
+// are those of the user who has the most, so that a client that writes much removes nothing but its
+// own.
 #pragma once
 
 #include <array>
 #include <cstddef>
 #include <cstdint>
+#include <map>
 #include <optional>
 #include <string>
+#include <utility>
 #include <vector>
 
 #include "base/Clock.h"
@@ -13,6 +17,7 @@
 #include "platform/linux/store/Database.h"
 #include "platform/linux/store/StoreOptions.h"
 #include "platform/linux/store/StoreRecord.h"
+#include "platform/linux/store/UserBytes.h"
 
 namespace vx::lnx {
 
@@ -33,6 +38,10 @@ class Retention {
   std::vector<LedgerNote> makeRoom(uint64_t bytes);
   // Gives what the file has beyond so many bytes and does not use back to the file system.
   void shrinkFile(uint64_t bytes);
+  // Whether the file was made shorter since this was asked.
+  bool takeShrunk() { return std::exchange(shrunk_, false); }
+  // Text that was written since.
+  void noteWritten(const UserBytes& bytes);
   // To be called after each batch: applies it every kBatchesPerPass.
   std::vector<LedgerNote> onBatchWritten();
 
@@ -44,12 +53,25 @@ class Retention {
 
   void removeForAge(Counts& removed);
   void removeForSize(Counts& removed, uint64_t limit);
-  // Removes some of a table's oldest rows, those before a time if one is given. False: none.
-  bool removeOldest(std::size_t table, std::optional<double> before, Counts& removed);
-  bool removeOldestMessages(int64_t last, std::optional<double> before, Counts& removed);
-  int64_t removeUpTo(std::size_t table, int64_t last, std::optional<double> before);
-  int64_t lastOfOldest(std::size_t table);
-  std::optional<double> oldestTime(std::size_t table);
+  // Which of a table's rows are to go: the oldest, of a user or before a time.
+  struct Selection {
+    std::optional<uint32_t> user;  // none: of all users
+    std::optional<double> before;
+    int64_t last = 0;
+  };
+  // Removes some of a table's oldest rows. False: none.
+  bool removeOldest(std::size_t table, Selection which, Counts& removed);
+  bool removeOldestMessages(const Selection& which, Counts& removed);
+  int64_t removeSelected(std::size_t table, const Selection& which);
+  void bindSelection(Statement& statement, std::size_t table, const Selection& which);
+  int64_t lastOfOldest(std::size_t table, std::optional<uint32_t> user);
+  std::optional<double> oldestTime(std::size_t table, std::optional<uint32_t> user = {});
+  // From here on the table has rows of a user.
+  int64_t firstOf(std::size_t table, std::optional<uint32_t> user) const;
+  // Removes the oldest rows of whoever has the most. False: there are none.
+  bool removeOfGreatest(Counts& removed);
+  void measureUsers();
+  void removeOrphans(Counts& removed);
   int64_t pragma(const char* sql);
   uint64_t fileBytes();
   uint64_t usedBytes();
@@ -60,6 +82,12 @@ class Retention {
   Clock& clock_;
   ThreadChecker thread_;
   int removalsLeft_ = 0;  // of this pass
+  // Known once the size has been reached; the ids are per table and user.
+  bool measured_ = false;
+  UserBytes bytes_;
+  std::map<std::pair<std::size_t, uint32_t>, int64_t> first_;
+  int64_t messagesSinceOrphans_ = 0;  // removed
+  bool shrunk_ = false;
   std::optional<Monotonic> lastAgeCheck_;
   std::size_t batches_ = 0;  // since the last pass
 };

@@ -50,10 +50,12 @@ std::string textUnder(const Payload& payload, std::string_view key) {
 
 }  // namespace
 
-RowWriter::RowWriter(sqlite3* database, std::size_t mostText, EndWord endWord, Clock& clock)
+RowWriter::RowWriter(sqlite3* database, std::size_t mostText, EndWord endWord, Clock& clock,
+                     uint32_t store)
     : database_(database),
       mostText_(mostText),
       clock_(clock),
+      store_(store),
       insertRelaySession_(database, kRelaySessions),
       insertRelayMessage_(database, kRelayMessages),
       insertEvent_(database, kAnalyticsEntries),
@@ -83,6 +85,7 @@ Result<RowWriter::Written> RowWriter::write(const StoreRecords& batch, std::size
   thread_.assertHere();
   written_ = {};
   leftOut_.clear();
+  begun_.clear();
   allowance_ = allowance;
   const int64_t markedBefore = lastMarkedRow_;
   const int code = writeTransaction(batch, first, last, notes);
@@ -91,6 +94,7 @@ Result<RowWriter::Written> RowWriter::write(const StoreRecords& batch, std::size
   }
   if (code == SQLITE_OK) return written_;
   lastMarkedRow_ = markedBefore;
+  for (RelayRow* session : begun_) session->id = 0;
   Status failure = Status::failure(sqlite3_errmsg(database_));
   nameRows_.clear();  // the names that were added are not there
   if (sqlite3_get_autocommit(database_) == 0) execute(database_, "ROLLBACK");
@@ -106,9 +110,11 @@ int RowWriter::writeTransaction(const StoreRecords& batch, std::size_t first, st
     code = writeRecord(batch, batch[written_.last]);
     if (code == SQLITE_OK) ++written_.last;
   }
-  if (code == kDoesNotFit)
-    code = written_.last > first ? SQLITE_OK : execute(database_, "ROLLBACK");
-  if (written_.wanted > 0 && written_.last == first) return code;
+  if (code == kDoesNotFit && written_.last == first) {
+    for (RelayRow* session : begun_) session->id = 0;
+    return execute(database_, "ROLLBACK");
+  }
+  if (code == kDoesNotFit) code = SQLITE_OK;
   for (const std::vector<LedgerNote>* some : {&notes, &std::as_const(leftOut_)}) {
     for (std::size_t i = 0; code == SQLITE_OK && i < some->size(); ++i)
       code = writeLedger((*some)[i]);
@@ -117,12 +123,13 @@ int RowWriter::writeTransaction(const StoreRecords& batch, std::size_t first, st
   return code == SQLITE_OK ? execute(database_, "COMMIT") : code;
 }
 
-bool RowWriter::take(std::size_t bytes) {
+bool RowWriter::take(std::size_t bytes, uint32_t user) {
   if (bytes > allowance_) {
     written_.wanted = bytes;
     return false;
   }
   allowance_ -= bytes;
+  addTo(written_.bytes, user, static_cast<int64_t>(bytes));
   return true;
 }
 
@@ -155,11 +162,11 @@ int RowWriter::writeMark() {
   return code == SQLITE_OK ? removeMarks_.bind(kKeptMarks).run() : code;
 }
 
-KeyColumns RowWriter::keyOf(const StoreRecord& record) {
-  const RowKey key = record.cause.key();
+KeyColumns RowWriter::columnsOf(const RowKey& key, uint32_t user) {
   if (key.call == 0) return {};
   highestCall_ = std::max(highestCall_, key.call);
-  return {static_cast<int64_t>(key.call), int64_t{key.place}};
+  return {static_cast<int64_t>(key.call), int64_t{key.place},
+          user != kNoUser ? std::optional<int64_t>(user) : std::nullopt};
 }
 
 int RowWriter::writeRecord(const StoreRecords& batch, const StoreRecord& record) {
@@ -170,35 +177,52 @@ int RowWriter::writeRecord(const StoreRecords& batch, const StoreRecord& record)
                         record.sharing == StoreRecord::Sharing::Written;
     return shares ? SQLITE_OK : writeEvent(record);
   }
-  if (const auto* session = std::get_if<RelayOpenRecord>(&record.what))
-    return writeRelaySession(record, *session);
+  if (const auto* opening = std::get_if<RelayOpenRecord>(&record.what)) {
+    noteFirst(record, *opening->row);
+    return writeRelaySession(*opening->row);
+  }
   if (const auto* end = std::get_if<RelayEndRecord>(&record.what))
     return writeRelayEnd(record, *end);
   if (const auto* power = std::get_if<PowerRecord>(&record.what)) return writePower(record, *power);
   return SQLITE_OK;  // a place without a row
 }
 
-int RowWriter::writeRelaySession(const StoreRecord& record, const RelayOpenRecord& session) {
+void RowWriter::noteFirst(const StoreRecord& record, RelayRow& session) {
+  session.time = record.time;
+  session.key = record.cause.key();
+  session.user = record.user();
+}
+
+int RowWriter::writeRelaySession(RelayRow& session) {
+  if (session.id != 0 && session.store == store_) return SQLITE_OK;
+  const bool ofAnotherStore = session.id != 0;
+  session.id = 0;
+  session.store = store_;
+  if (ofAnotherStore) {  // its row may have been taken over
+    const auto row = KnownRows::sessionOf(database_, session.key);
+    session.id = row.value_or(0);
+    if (row) return SQLITE_OK;
+  }
   if (known_) {
-    const RowKey key = record.cause.key();
-    if (const auto row = known_->find(key)) {
-      session.row->id = *row;
+    if (const auto row = known_->find(session.key)) {
+      session.id = *row;
       // A standalone's message lies in the queue right behind it.
-      session.row->hasItsMessage =
-          known_->isEarlier(key) && sessionIDOf(session.information->first) == kStandaloneID;
+      session.hasItsMessage = known_->isEarlier(session.key) && session.information != nullptr &&
+                              sessionIDOf(session.information->first) == kStandaloneID;
       return SQLITE_OK;
     }
   }
+  if (session.information == nullptr) return SQLITE_OK;
   const auto& [info, userInfo] = *session.information;
   json_.clear();
   appendJson(json_, userInfo);
   const std::string clientName = textUnder(userInfo, kVyrReportingUserInfoClientName);
   const std::string serviceName = textUnder(userInfo, kVyrReportingUserInfoServiceName);
   const std::string_view text = storable(json_, "relay_sessions");
-  if (!take(text.size())) return kDoesNotFit;
+  if (!take(text.size(), session.user)) return kDoesNotFit;
   ++written_.rows;
   const int code = insertRelaySession_.run(
-      {.time = record.time,
+      {.time = session.time,
        .sessionID = sessionIDOf(info),
        .clientType = infoValue<int32_t>(info, kVyrReportingSessionInfoClientType),
        .clientVersion = infoValue<float>(info, kVyrReportingSessionInfoClientVersion),
@@ -207,12 +231,15 @@ int RowWriter::writeRelaySession(const StoreRecord& record, const RelayOpenRecor
        .batchEvent = flag(info, kVyrReportingSessionInfoBatchEvent),
        .containsRealtimeEvents = flag(info, kVyrReportingSessionInfoContainsRealtimeEvents),
        .userInfo = text,
-       .key = keyOf(record)});
-  if (code == SQLITE_OK) session.row->id = sqlite3_last_insert_rowid(database_);
+       .key = columnsOf(session.key, session.user)});
+  if (code != SQLITE_OK) return code;
+  session.id = sqlite3_last_insert_rowid(database_);
+  begun_.push_back(&session);
   return code;
 }
 
 int RowWriter::writeRelayEnd(const StoreRecord& record, const RelayEndRecord& end) {
+  if (const int code = writeRelaySession(*end.row); code != SQLITE_OK) return code;
   const std::string_view how = endWord_ != nullptr && record.cause.ticket
                                    ? endWord_(record.cause.ticket)
                                    : std::string_view();
@@ -227,6 +254,7 @@ int RowWriter::writeRelayMessage(const StoreRecords& batch, const StoreRecord& r
   const StoreRecord* event = record.event == StoreRecord::kNone ? nullptr : &batch[record.event];
   if (isKnown(record) || message.row->hasItsMessage)
     return event != nullptr ? writeEvent(*event) : SQLITE_OK;
+  if (const int code = writeRelaySession(*message.row); code != SQLITE_OK) return code;
   json_.clear();
   appendJson(json_, message.payload);
   const std::string_view payload = storable(json_, "relay_messages");
@@ -236,7 +264,8 @@ int RowWriter::writeRelayMessage(const StoreRecords& batch, const StoreRecord& r
     built = &std::get<AnalyticsRecord>(event->what);
     text = buildEvent(*built, &message.payload);
   }
-  if (!take(payload.size() + (built != nullptr ? eventJson_.size() : 0))) return kDoesNotFit;
+  if (!take(payload.size() + (built != nullptr ? storedBytes(eventJson_) : 0), record.user()))
+    return kDoesNotFit;
   ++written_.rows;
   RelayMessageRow row = {.id = nextRow_++,
                          .time = record.time,
@@ -269,7 +298,7 @@ int RowWriter::writePower(const StoreRecord& record, const PowerRecord& power) {
   json_.clear();
   appendJson(json_, power.record);
   const std::string_view text = storable(json_, "power_records");
-  if (!take(text.size())) return kDoesNotFit;
+  if (!take(text.size(), record.user())) return kDoesNotFit;
   ++written_.rows;
   return insertPower_.run({.time = record.time,
                            .clientIdentifier = power.clientIdentifier,
@@ -281,7 +310,7 @@ int RowWriter::writePower(const StoreRecord& record, const PowerRecord& power) {
 int RowWriter::writeEvent(const StoreRecord& record) {
   const auto& event = std::get<AnalyticsRecord>(record.what);
   if (isKnown(record) || buildEvent(event, nullptr) == EventText::None) return SQLITE_OK;
-  if (!take(std::min(eventJson_.size(), mostText_))) return kDoesNotFit;
+  if (!take(storedBytes(eventJson_), record.user())) return kDoesNotFit;
   return writeEventRow(record, event.name);
 }
 

@@ -16,6 +16,7 @@
 #include "platform/linux/store/KnownRows.h"
 #include "platform/linux/store/StoreRecord.h"
 #include "platform/linux/store/StoreTables.h"
+#include "platform/linux/store/UserBytes.h"
 
 namespace vx::lnx {
 
@@ -31,10 +32,13 @@ class RowWriter {
     uint64_t failedBuilders = 0;  // events that are left out, because their builder failed
     std::size_t last = 0;         // records before this one are written
     std::size_t wanted = 0;       // bytes of the row at `last`, which did not fit
+    UserBytes bytes;              // of text
   };
 
-  // `mostText`: of one payload, in bytes; a larger one is left out and the ledger says so.
-  RowWriter(sqlite3* database, std::size_t mostText, EndWord endWord, Clock& clock);
+  // `mostText`: of one payload, in bytes; a larger one is left out and the ledger says so. `store`:
+  // a relay session that has its row in another one gets one in this.
+  RowWriter(sqlite3* database, std::size_t mostText, EndWord endWord, Clock& clock,
+            uint32_t store = 1);
   RowWriter(const RowWriter&) = delete;
   RowWriter& operator=(const RowWriter&) = delete;
 
@@ -50,16 +54,18 @@ class RowWriter {
                         const std::vector<LedgerNote>& notes, std::size_t allowance = SIZE_MAX);
 
  private:
-  // Takes so many bytes of the allowance; false, and the row is left for later, if they are not
-  // there.
-  bool take(std::size_t bytes);
+  // Takes so many bytes of the allowance, for a user's row; false, and the row is left for later,
+  // if they are not there.
+  bool take(std::size_t bytes, uint32_t user);
   int writeTransaction(const StoreRecords& batch, std::size_t first, std::size_t last,
                        const std::vector<LedgerNote>& notes);
   // What there is to know of the database before the first row is written.
   int prepare();
   int writeMark();
   int writeRecord(const StoreRecords& batch, const StoreRecord& record);
-  int writeRelaySession(const StoreRecord& record, const RelayOpenRecord& session);
+  // The row of a session, unless it has one.
+  int writeRelaySession(RelayRow& session);
+  static void noteFirst(const StoreRecord& record, RelayRow& session);
   int writeRelayEnd(const StoreRecord& record, const RelayEndRecord& end);
   int writeRelayMessage(const StoreRecords& batch, const StoreRecord& record,
                         const RelayMessageRecord& message);
@@ -74,7 +80,14 @@ class RowWriter {
   bool isKnown(const StoreRecord& record) const {
     return known_ && known_->find(record.cause.key()).has_value();
   }
-  KeyColumns keyOf(const StoreRecord& record);
+  KeyColumns columnsOf(const RowKey& key, uint32_t user);
+  KeyColumns keyOf(const StoreRecord& record) {
+    return columnsOf(record.cause.key(), record.user());
+  }
+  // One that is too large is left out.
+  std::size_t storedBytes(const std::string& json) const {
+    return json.size() <= mostText_ ? json.size() : 0;
+  }
   // The text as it may be stored in a table: one larger than mostText_ is left out and noted.
   const std::string& storable(std::string& json, const char* table);
   // The identifier of an event name. SQLITE_OK or an error.
@@ -83,6 +96,7 @@ class RowWriter {
   sqlite3* const database_;
   const std::size_t mostText_;
   Clock& clock_;
+  const uint32_t store_;
   ThreadChecker thread_;
   Insertion<RelaySessionRow> insertRelaySession_;
   Insertion<RelayMessageRow> insertRelayMessage_;
@@ -98,6 +112,7 @@ class RowWriter {
   std::unordered_map<std::string_view, int64_t> nameRows_;
   Written written_;                  // of the running transaction
   std::vector<LedgerNote> leftOut_;  // of the running transaction
+  std::vector<RelayRow*> begun_;     // by the running transaction
   std::size_t allowance_ = 0;        // what is left of it
   std::string json_;
   std::string eventJson_;

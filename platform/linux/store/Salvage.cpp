@@ -1,5 +1,6 @@
 #include "platform/linux/store/Salvage.h"
 
+#include <algorithm>
 #include <vector>
 
 #include "platform/linux/store/Database.h"
@@ -24,7 +25,9 @@ class TableCopy {
  public:
   TableCopy(sqlite3* from, sqlite3* to, std::string table)
       : from_(from), to_(to), table_(std::move(table)) {
-    for (const std::string& name : columnsOf(from, table_)) {
+    const std::vector<std::string> there = columnsOf(from, table_);
+    for (const std::string& name : columnsOf(to, table_)) {
+      if (std::ranges::find(there, name) == there.end()) continue;
       columns_ += (columns_.empty() ? "" : ",") + name;
       places_ += places_.empty() ? "?" : ",?";
       ++count_;

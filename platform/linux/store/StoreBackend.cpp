@@ -20,10 +20,9 @@ class StoreSession final : public RelayBackend::Session {
     std::erase_if(kept, [](const auto& entry) {
       return entry.first == kVyrReportingSessionInfoHierarchyToken;
     });
-    auto information =
+    row_->information =
         std::make_unique<std::pair<VyrSessionInfo, Payload>>(std::move(kept), userInfo);
-    return append(RelayOpenRecord{row_, std::move(information)},
-                  userInfo.encoded().size() + kTypicalSessionInfoBytes);
+    return append(RelayOpenRecord{row_}, userInfo.encoded().size() + kTypicalSessionInfoBytes);
   }
 
   std::optional<Error> send(uint16_t category, uint16_t type, const Payload& payload) override {
@@ -33,7 +32,7 @@ class StoreSession final : public RelayBackend::Session {
   void flush(Function<void(std::optional<Error>)> handler) override {
     // Flushed when it ends, and only then.
     (void)queue_.append(RelayEndRecord{row_}, 0);
-    if (!queue_.appendFlush(handler)) handler(closed());
+    if (!queue_.appendFlush(handler, row_)) handler(closed());
   }
 
  private:

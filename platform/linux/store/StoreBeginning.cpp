@@ -1,5 +1,7 @@
 #include "platform/linux/store/StoreBeginning.h"
 
+#include <unistd.h>
+
 #include <utility>
 
 #include "platform/linux/store/Salvage.h"
@@ -41,9 +43,24 @@ OpenedStore StoreBeginning::check(OpenedStore opened, std::vector<LedgerNote>& n
   return {nullptr, std::move(check.status), check.fault, {}};
 }
 
+Status StoreBeginning::settle(StoreLoss loss, std::vector<LedgerNote>& notes) {
+  std::string what = textOf(loss);
+  if (loss == StoreLoss::FileGone && access(path_.c_str(), F_OK) == 0) {
+    const Result<std::string> aside = moveAside(path_);
+    if (!aside.ok()) return aside.status();
+    what += "; what lay in its place is now " + *aside;
+  }
+  // With the whole folder the lock is gone.
+  if (access((directory_ + kLockName).c_str(), F_OK) != 0) lock_.reset();
+  if (loss != StoreLoss::LogGone) ++stores_;
+  notes.push_back({loss == StoreLoss::LogGone ? "log_lost" : "store_lost", "", 0, what});
+  return {};
+}
+
 OpenedStore StoreBeginning::beginAfresh(const std::string& why, std::vector<LedgerNote>& notes) {
   const Result<std::string> aside = moveAside(path_);
   if (!aside.ok()) return {nullptr, aside.status(), StoreFault::Unusable, {}};
+  ++stores_;
   OpenedStore fresh = openStoreDatabase(path_, epoch_);
   if (!fresh.status.ok()) return fresh;
   const int64_t taken = takeOverRows(*aside, fresh.database.get());

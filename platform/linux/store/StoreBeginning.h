@@ -2,6 +2,7 @@
 // damaged out of the way.
 #pragma once
 
+#include <cstdint>
 #include <string>
 #include <vector>
 
@@ -9,6 +10,7 @@
 #include "base/UniqueFd.h"
 #include "platform/linux/journal/JournalFormat.h"
 #include "platform/linux/store/StoreFile.h"
+#include "platform/linux/store/StoreIdentity.h"
 #include "platform/linux/store/StoreRecord.h"
 
 namespace vx::lnx {
@@ -30,9 +32,14 @@ class StoreBeginning {
   // Checks what was opened. A damaged one is moved aside and a fresh one begun, with what can be
   // read of it.
   OpenedStore check(OpenedStore opened, std::vector<LedgerNote>& notes);
+  // After the files were lost that were open, before they are opened again: what lies in the place
+  // of a deleted file is moved aside.
+  Status settle(StoreLoss loss, std::vector<LedgerNote>& notes);
 
   const std::string& path() const { return path_; }
   const JournalEpoch& epoch() const { return epoch_; }
+  // Changes when the rows that were written are no longer those of the store.
+  uint32_t stores() const { return stores_; }
 
  private:
   OpenedStore beginAfresh(const std::string& why, std::vector<LedgerNote>& notes);
@@ -41,6 +48,7 @@ class StoreBeginning {
   std::string path_;
   JournalEpoch epoch_;  // the first store's that was opened
   bool hasEpoch_ = false;
+  uint32_t stores_ = 1;
   UniqueFd lock_;
 };
 

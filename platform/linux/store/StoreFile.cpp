@@ -53,7 +53,7 @@ StoreFault faultOfFinding(const std::string& finding) {
 StoreLock lockStore(const std::string& directory) {
   if (mkdir(directory.c_str(), 0750) != 0 && errno != EEXIST)
     return {{}, Status::lastError("cannot create the state directory " + directory)};
-  const std::string path = directory + "/telemetry.lock";
+  const std::string path = directory + kLockName;
   UniqueFd lock(::open(path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW, 0640));
   if (!lock) {
     return {{},
@@ -107,9 +107,17 @@ OpenedStore openStoreDatabase(const std::string& path, const JournalEpoch& epoch
   sqlite3_wal_autocheckpoint(database, static_cast<int>((4 << 20) / pageSize.integer(0)));
   pageSize.reset();
   code = bringSchemaUpToDate(database, version, epochIfNew);
+  if (code == SQLITE_OK) code = findSchema(database);
+  // What the statement says is not wrong: the tables are not those of its version.
+  if (code == SQLITE_ERROR || (code & 0xFF) == SQLITE_CONSTRAINT) {
+    OpenedStore failed = fail(code);
+    failed.fault = StoreFault::Damaged;
+    return failed;
+  }
   if (code != SQLITE_OK) return fail(code);
   Statement epochQuery(database, "SELECT epoch FROM store_info");
-  if (!epochQuery.row()) return fail(sqlite3_extended_errcode(database));
+  if (!epochQuery.row())
+    return fail(epochQuery.code() == SQLITE_DONE ? SQLITE_CORRUPT : epochQuery.code());
   const std::span<const uint8_t> epoch = epochQuery.blob(0);
   std::copy_n(epoch.begin(), std::min(epoch.size(), opened.epoch.size()), opened.epoch.begin());
   return opened;

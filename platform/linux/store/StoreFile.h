@@ -11,6 +11,8 @@
 
 namespace vx::lnx {
 
+inline constexpr const char* kLockName = "/telemetry.lock";
+
 // Creates the folder if need be. The lock lasts as long as the descriptor.
 struct StoreLock {
   UniqueFd fd;    // none unless the status is ok

@@ -63,12 +63,12 @@ bool StoreQueue::append(StoreRecord::What what, std::size_t bytes) {
   return true;
 }
 
-bool StoreQueue::appendFlush(FlushHandler& handler) {
+bool StoreQueue::appendFlush(FlushHandler& handler, std::shared_ptr<RelayRow> session) {
   bool wake = false;
   {
     MutexLock lock(mutex_);
     if (closing_) return false;
-    pending_.flushes.push_back({pending_.records.size(), std::move(handler)});
+    pending_.flushes.push_back({pending_.records.size(), std::move(handler), std::move(session)});
     pending_.urgent = true;
     wake = mustWake(true);
   }

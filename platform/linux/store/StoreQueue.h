@@ -5,6 +5,7 @@
 #include <chrono>
 #include <cstddef>
 #include <cstdint>
+#include <memory>
 #include <optional>
 #include <vector>
 
@@ -19,10 +20,12 @@ namespace vx::lnx {
 
 using FlushHandler = Function<void(std::optional<Error>)>;
 
-// Somebody who waits until the first `records` records of a batch are committed.
+// Somebody who waits until the first `records` records of a batch are committed, and with them all
+// that was sent to the session.
 struct StoreFlush {
   std::size_t records = 0;
   FlushHandler handler;
+  std::shared_ptr<RelayRow> session;  // may be null
 };
 
 struct StoreBatch {
@@ -50,7 +53,7 @@ class StoreQueue {
   // From now on a row that has a recorded call bears the time of that call.
   void setReplaying(bool replaying) { replaying_.store(replaying); }
   // False once closed; the handler is moved from only on success. It makes what waits due at once.
-  bool appendFlush(FlushHandler& handler);
+  bool appendFlush(FlushHandler& handler, std::shared_ptr<RelayRow> session = nullptr);
   // Work for the taking thread, before anything that waits to be written.
   void runSoon(Function<void()> job);
   bool isCongested() const { return congested_.load(std::memory_order_relaxed); }

@@ -16,15 +16,22 @@
 
 namespace vx::lnx {
 
-// The row of a relay session, known to the writer's thread once it has inserted it.
+// A relay session and its row. The information is there before the first record that names it; the
+// rest belongs to the writer's thread.
 struct RelayRow {
-  int64_t id = 0;
+  std::unique_ptr<const std::pair<VyrSessionInfo, Payload>> information;  // of session and user
+  double time = 0;                                                        // of its first record
+  RowKey key;
+  uint32_t user = kNoUser;
+  int64_t id = 0;      // 0: not written
+  uint32_t store = 0;  // in which store it has this id (see StoreBeginning)
+  // Something that was sent to it was given up.
+  bool hasLost = false;
   bool hasItsMessage = false;  // it was written together with its only one
 };
 
 struct RelayOpenRecord {
   std::shared_ptr<RelayRow> row;
-  std::unique_ptr<std::pair<VyrSessionInfo, Payload>> information;  // session and user information
 };
 struct RelayMessageRecord {
   std::shared_ptr<RelayRow> row;
@@ -66,7 +73,8 @@ struct StoreRecord {
   }
   StoreRecord(double when, What whatever, Cause because = {})
       : time(when), cause(std::move(because)), what(std::move(whatever)) {}
-  double time;  // seconds since 1970
+  uint32_t user() const { return cause.ticket.user(); }  // who caused it, or kNoUser
+  double time;                                           // seconds since 1970
   // The call whose row it is; done when the row is committed.
   Cause cause;
   uint32_t event = kNone;         // of a relay message: the place of the event that shares its text

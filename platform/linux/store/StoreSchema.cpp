@@ -76,19 +76,23 @@ DROP VIEW IF EXISTS client_uptimes;
 DROP VIEW IF EXISTS analytics_events;
 ALTER TABLE relay_sessions ADD COLUMN call INTEGER;
 ALTER TABLE relay_sessions ADD COLUMN place INTEGER;
+ALTER TABLE relay_sessions ADD COLUMN uid INTEGER;
 ALTER TABLE relay_sessions ADD COLUMN ended_at REAL;
 ALTER TABLE relay_sessions ADD COLUMN ended_how TEXT;
 ALTER TABLE relay_messages ADD COLUMN call INTEGER;
 ALTER TABLE relay_messages ADD COLUMN place INTEGER;
+ALTER TABLE relay_messages ADD COLUMN uid INTEGER;
 ALTER TABLE relay_messages ADD COLUMN event_name INTEGER;
 ALTER TABLE relay_messages ADD COLUMN event_place INTEGER;
 ALTER TABLE relay_messages ADD COLUMN event_microseconds INTEGER;
 ALTER TABLE relay_messages ADD COLUMN event_tail TEXT;
 ALTER TABLE analytics_entries ADD COLUMN call INTEGER;
 ALTER TABLE analytics_entries ADD COLUMN place INTEGER;
+ALTER TABLE analytics_entries ADD COLUMN uid INTEGER;
 ALTER TABLE analytics_entries ADD COLUMN relay_session INTEGER;
 ALTER TABLE power_records ADD COLUMN call INTEGER;
 ALTER TABLE power_records ADD COLUMN place INTEGER;
+ALTER TABLE power_records ADD COLUMN uid INTEGER;
 UPDATE analytics_entries SET message = NULL WHERE message IS NOT NULL AND substr(payload, 1, 1) = '{';
 CREATE TABLE store_info(id INTEGER PRIMARY KEY CHECK (id = 1), epoch BLOB NOT NULL,
   after_row INTEGER NOT NULL DEFAULT 0, after_power INTEGER NOT NULL DEFAULT 0, after_session INTEGER NOT NULL DEFAULT 0);
@@ -134,6 +138,21 @@ Status adoptEpoch(sqlite3* database, const JournalEpoch& epoch) {
                    " after_session = ifnull((SELECT max(id) FROM relay_sessions), 0)");
   if (update.bind(std::span<const uint8_t>(epoch)).run() == SQLITE_OK) return {};
   return Status::failure(sqlite3_errmsg(database));
+}
+
+int findSchema(sqlite3* database) {
+  int code = SQLITE_OK;
+  for (const std::string& sql :
+       {kRelaySessions.insertSql(), kRelayMessages.insertSql(), kAnalyticsEntries.insertSql(),
+        kPowerRecords.insertSql(), kStoreLedger.insertSql(),
+        std::string("INSERT INTO event_names(id, name) VALUES(?, ?)"),
+        std::string("INSERT INTO store_marks(id, call, last_row) VALUES(?, ?, ?)"),
+        std::string("SELECT epoch, after_row, after_power, after_session FROM store_info"),
+        std::string("SELECT id, time, name, payload FROM analytics_events"),
+        std::string("SELECT payload FROM session_messages")}) {
+    if (code == SQLITE_OK) code = Statement(database, sql).code();
+  }
+  return code;
 }
 
 int bringSchemaUpToDate(sqlite3* database, int64_t version, const JournalEpoch& epochIfNew) {

@@ -16,6 +16,10 @@ inline constexpr int64_t kStoreSchemaVersion = 3;
 // database that has no epoch gets this one. SQLITE_OK or SQLite's extended error code.
 int bringSchemaUpToDate(sqlite3* database, int64_t version, const JournalEpoch& epochIfNew);
 
+// Whether the tables and views are there that the service writes and others read. SQLITE_OK,
+// SQLITE_ERROR, or why it cannot be told.
+int findSchema(sqlite3* database);
+
 // Makes keys from here on those of another epoch: earlier rows' keys no longer count.
 Status adoptEpoch(sqlite3* database, const JournalEpoch& epoch);
 

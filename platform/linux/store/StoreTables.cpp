@@ -18,6 +18,7 @@ constexpr Column<RelaySessionRow> kRelaySessionColumns[] = {
     {"user_info", "TEXT NOT NULL", [](Statement& s, const RelaySessionRow& r) { s.bind(r.userInfo); }},
     {"call", "INTEGER", [](Statement& s, const RelaySessionRow& r) { s.bind(r.key.call); }},
     {"place", "INTEGER", [](Statement& s, const RelaySessionRow& r) { s.bind(r.key.place); }},
+    {"uid", "INTEGER", [](Statement& s, const RelaySessionRow& r) { s.bind(r.key.user); }},
     // Known when it ends.
     {"ended_at", "REAL", [](Statement& s, const RelaySessionRow&) { s.bindNull(); }},
     {"ended_how", "TEXT", [](Statement& s, const RelaySessionRow&) { s.bindNull(); }},
@@ -31,6 +32,7 @@ constexpr Column<RelayMessageRow> kRelayMessageColumns[] = {
     {"payload", "TEXT NOT NULL", [](Statement& s, const RelayMessageRow& r) { s.bind(r.payload); }},
     {"call", "INTEGER", [](Statement& s, const RelayMessageRow& r) { s.bind(r.key.call); }},
     {"place", "INTEGER", [](Statement& s, const RelayMessageRow& r) { s.bind(r.key.place); }},
+    {"uid", "INTEGER", [](Statement& s, const RelayMessageRow& r) { s.bind(r.key.user); }},
     {"event_name", "INTEGER", [](Statement& s, const RelayMessageRow& r) { s.bind(r.eventName); }},
     {"event_place", "INTEGER", [](Statement& s, const RelayMessageRow& r) { s.bind(r.eventPlace); }},
     {"event_microseconds", "INTEGER", [](Statement& s, const RelayMessageRow& r) { s.bind(r.eventMicroseconds); }},
@@ -45,6 +47,7 @@ constexpr Column<EventRow> kEventColumns[] = {
     {"payload", "TEXT NOT NULL", [](Statement& s, const EventRow& r) { s.bind(r.payload); }},
     {"call", "INTEGER", [](Statement& s, const EventRow& r) { s.bind(r.key.call); }},
     {"place", "INTEGER", [](Statement& s, const EventRow& r) { s.bind(r.key.place); }},
+    {"uid", "INTEGER", [](Statement& s, const EventRow& r) { s.bind(r.key.user); }},
     // For the driver counters at a session's end; not known yet.
     {"relay_session", "INTEGER", [](Statement& s, const EventRow&) { s.bindNull(); }},
 };
@@ -55,6 +58,7 @@ constexpr Column<PowerRow> kPowerColumns[] = {
     {"record", "TEXT NOT NULL", [](Statement& s, const PowerRow& r) { s.bind(r.record); }},
     {"call", "INTEGER", [](Statement& s, const PowerRow& r) { s.bind(r.key.call); }},
     {"place", "INTEGER", [](Statement& s, const PowerRow& r) { s.bind(r.key.place); }},
+    {"uid", "INTEGER", [](Statement& s, const PowerRow& r) { s.bind(r.key.user); }},
 };
 constexpr Column<LedgerRow> kLedgerColumns[] = {
     {"time", "REAL NOT NULL", [](Statement& s, const LedgerRow& r) { s.bind(r.time); }},

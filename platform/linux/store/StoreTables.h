@@ -62,10 +62,11 @@ class Insertion {
   Statement statement_;
 };
 
-// Which call a row goes back to, as two columns: NULL where none was recorded.
+// Which call a row goes back to, and who made it: NULL where none was recorded.
 struct KeyColumns {
   std::optional<int64_t> call;
   std::optional<int64_t> place;
+  std::optional<int64_t> user;
 };
 
 struct RelaySessionRow {

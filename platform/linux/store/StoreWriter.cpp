@@ -11,6 +11,7 @@
 
 #include "platform/Log.h"
 #include "platform/linux/execution/Threads.h"
+#include "platform/linux/store/LogReaders.h"
 #include "platform/linux/store/StoreSchema.h"
 
 namespace vx::lnx {
@@ -35,9 +36,11 @@ std::size_t mostTextOf(const StoreOptions& options) {
 
 }  // namespace
 
-StoreWriter::Open::Open(Database opened, const StoreOptions& options, EndWord endWord, Clock& clock)
+StoreWriter::Open::Open(Database opened, const StoreBeginning& beginning,
+                        const StoreOptions& options, EndWord endWord, Clock& clock)
     : database(std::move(opened)),
-      rows(database.get(), mostTextOf(options), endWord, clock),
+      identity(beginning.path(), database.get()),
+      rows(database.get(), mostTextOf(options), endWord, clock, beginning.stores()),
       retention(database.get(), options, clock) {}
 
 StoreWriter::StoreWriter(std::unique_ptr<StoreBeginning> beginning, const StoreOptions& options,
@@ -102,6 +105,10 @@ void StoreWriter::runJobs() {
 Status StoreWriter::begin() {
   if (open_) return {};
   std::vector<LedgerNote> notes;
+  if (lost_ != StoreLoss::None) {
+    if (Status settled = beginning_->settle(lost_, notes); !settled.ok()) return settled;
+    lost_ = StoreLoss::None;
+  }
   if (unchecked_.database == nullptr) unchecked_ = beginning_->open(notes);
   if (unchecked_.status.ok()) unchecked_ = beginning_->check(std::move(unchecked_), notes);
   report(std::move(notes));
@@ -110,9 +117,23 @@ Status StoreWriter::begin() {
     if (const Status adopted = adoptEpoch(unchecked_.database.get(), epoch_); !adopted.ok())
       return adopted;
   }
-  open_.emplace(std::move(unchecked_.database), options_, endWord_, clock_);
+  open_.emplace(std::move(unchecked_.database), *beginning_, options_, endWord_, clock_);
   add(open_->retention.apply());
+  rememberFiles();
   return {};
+}
+
+void StoreWriter::rememberFiles() {
+  using Shrunk = StoreIdentity::Shrunk;
+  if (open_) open_->identity.remember(open_->retention.takeShrunk() ? Shrunk::Yes : Shrunk::No);
+}
+
+bool StoreWriter::keepOpen(StoreLoss loss) {
+  if (loss == StoreLoss::None) return true;
+  if (loss == StoreLoss::LogGone && checkpoint() != SQLITE_OK) return true;
+  open_.reset();
+  lost_ = loss;
+  return false;
 }
 
 void StoreWriter::report(std::vector<LedgerNote> found) {
@@ -144,10 +165,12 @@ void StoreWriter::writeBatch(StoreBatch& batch) {
   } while (first < batch.records.size() || !batch.flushes.empty());
   batch.clear();
   if (open_) add(open_->retention.onBatchWritten());
+  rememberFiles();
 }
 
 Result<RowWriter::Written> StoreWriter::write(const StoreBatch& batch, std::size_t first,
                                               std::size_t last) {
+  if (open_) keepOpen(open_->identity.look());
   if (Status begun = begin(); !begun.ok()) return begun;
   if (replayFrom_ && !open_->rows.knowsRows()) {
     if (Status read = open_->rows.loadKnownRows(*replayFrom_); !read.ok()) return read;
@@ -156,6 +179,7 @@ Result<RowWriter::Written> StoreWriter::write(const StoreBatch& batch, std::size
   const std::size_t allowance =
       std::min<std::size_t>(kTransactionBytes, static_cast<std::size_t>(options_.maxBytes / 16));
   makeRoomFor(allowance);
+  rememberFiles();
   Result<RowWriter::Written> written =
       open_->rows.write(batch.records, first, last, notes_, allowance);
   if (written.ok() && written->last == first && written->wanted > 0) {  // a large one, by itself
@@ -163,11 +187,21 @@ Result<RowWriter::Written> StoreWriter::write(const StoreBatch& batch, std::size
     written = open_->rows.write(batch.records, first, first + 1, notes_, written->wanted);
   }
   if (!written.ok()) return written;
+  // What was committed to a file that nobody can find is to be written again.
+  if (!keepOpen(open_->identity.lookForOthers()) && lost_ != StoreLoss::LogGone)
+    return Status::failure(textOf(lost_));
+  rememberFiles();
   notes_.clear();
   ++commits_;
   rowsCommitted_ += written->rows;
   writeFailures_ += written->failedBuilders;
+  if (open_) open_->retention.noteWritten(written->bytes);
   return written;
+}
+
+int StoreWriter::checkpoint() {
+  return sqlite3_wal_checkpoint_v2(open_->database.get(), nullptr, SQLITE_CHECKPOINT_TRUNCATE,
+                                   nullptr, nullptr);
 }
 
 Status StoreWriter::boundLog() {
@@ -176,16 +210,15 @@ Status StoreWriter::boundLog() {
     logHeld_ = false;
     return {};
   }
-  int frames = 0;
-  const int code = sqlite3_wal_checkpoint_v2(open_->database.get(), nullptr,
-                                             SQLITE_CHECKPOINT_TRUNCATE, &frames, nullptr);
+  const int code = checkpoint();
   if (code == SQLITE_OK) {
     logHeld_ = false;
     return {};
   }
-  const std::string why = (code & 0xFF) == SQLITE_BUSY
-                              ? "a reader keeps a transaction open; the log may not grow further"
-                              : sqlite3_errmsg(open_->database.get());
+  if ((code & 0xFF) != SQLITE_BUSY) return Status::failure(sqlite3_errmsg(open_->database.get()));
+  const std::string who = readersOf(beginning_->path());
+  const std::string why = "a reader keeps a transaction open and the log may not grow further: " +
+                          (who.empty() ? "nobody that can be seen" : who);
   if (!logHeld_) notes_.push_back({"log_held", "", 0, why});
   logHeld_ = true;
   return Status::failure(why);
@@ -196,8 +229,7 @@ void StoreWriter::makeRoomFor(std::size_t bytes) {
   const uint64_t growth = bytes + bytes / 4;
   add(open_->retention.makeRoom(growth));
   if (bytes <= kTransactionBytes) return;
-  sqlite3_wal_checkpoint_v2(open_->database.get(), nullptr, SQLITE_CHECKPOINT_TRUNCATE, nullptr,
-                            nullptr);
+  checkpoint();
   const uint64_t both = 2 * growth;
   if (both <= StoreOptions::kSlackBytes) return;
   const uint64_t beyond = both - StoreOptions::kSlackBytes;
@@ -222,8 +254,10 @@ void StoreWriter::onCommitted(StoreBatch& batch, std::size_t first, std::size_t 
   const auto unanswered =
       std::find_if(batch.flushes.begin(), batch.flushes.end(),
                    [last](const StoreFlush& flush) { return flush.records > last; });
-  for (auto flush = batch.flushes.begin(); flush != unanswered; ++flush)
-    flush->handler(std::nullopt);
+  for (auto flush = batch.flushes.begin(); flush != unanswered; ++flush) {
+    const bool whole = flush->session == nullptr || !flush->session->hasLost;
+    flush->handler(whole ? std::nullopt : lossError_);
+  }
   batch.flushes.erase(batch.flushes.begin(), unanswered);
 }
 
@@ -231,6 +265,13 @@ void StoreWriter::onLost(StoreBatch& batch, std::size_t first, const Status& why
   const uint64_t lost = EventPairing::unwrittenRows(batch.records, first);
   rowsLost_ += lost;
   EventPairing::abandon(batch.records, first);
+  lossError_ = why.error();
+  for (std::size_t i = first; i < batch.records.size(); ++i) {
+    if (auto* message = std::get_if<RelayMessageRecord>(&batch.records[i].what))
+      message->row->hasLost = true;
+    else if (auto* opening = std::get_if<RelayOpenRecord>(&batch.records[i].what))
+      opening->row->hasLost = true;
+  }
   VX_LOG(nullptr, Error, "the store could not be written before the end: %llu rows are lost (%s)",
          static_cast<unsigned long long>(lost), why.text().c_str());
   release(batch, batch.bytes);

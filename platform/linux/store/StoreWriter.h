@@ -18,6 +18,7 @@
 #include "platform/linux/store/Retention.h"
 #include "platform/linux/store/RowWriter.h"
 #include "platform/linux/store/StoreBeginning.h"
+#include "platform/linux/store/StoreIdentity.h"
 #include "platform/linux/store/StoreOptions.h"
 #include "platform/linux/store/StoreQueue.h"
 
@@ -61,8 +62,10 @@ class StoreWriter {
  private:
   // What lives as long as one opened database.
   struct Open {
-    Open(Database opened, const StoreOptions& options, EndWord endWord, Clock& clock);
+    Open(Database opened, const StoreBeginning& beginning, const StoreOptions& options,
+         EndWord endWord, Clock& clock);
     Database database;
+    StoreIdentity identity;
     RowWriter rows;
     Retention retention;
   };
@@ -71,11 +74,16 @@ class StoreWriter {
   void runJobs();
   // Opens and checks the store unless that is done.
   Status begin();
+  // Lets go of files that are no longer the store's: the next begin() makes others. False then.
+  bool keepOpen(StoreLoss loss);
+  void rememberFiles();
   // What was found while the store was begun, for the log and the ledger.
   void report(std::vector<LedgerNote> found);
   void writeBatch(StoreBatch& batch);
   // As many of the records as fit in one transaction.
   Result<RowWriter::Written> write(const StoreBatch& batch, std::size_t first, std::size_t last);
+  // Writes the log back and empties it. SQLITE_OK or SQLite's extended error code.
+  int checkpoint();
   // Keeps the log below its bound: false while a reader holds it there.
   Status boundLog();
   void makeRoomFor(std::size_t bytes);
@@ -103,12 +111,14 @@ class StoreWriter {
   uint64_t lastCall_ = 0;
   std::vector<LedgerNote> found_;  // by the constructor
   EndWord endWord_ = nullptr;
-  OpenedStore unchecked_;     // until the thread has checked it
-  std::optional<Open> open_;  // none: not begun
+  OpenedStore unchecked_;             // until the thread has checked it
+  std::optional<Open> open_;          // none: not begun
+  StoreLoss lost_ = StoreLoss::None;  // of what was open before
   EventPairing pairing_;
   std::optional<ReplayedCalls> replayFrom_;  // until what is replayed is committed
   Function<void()> drained_;
-  std::vector<LedgerNote> notes_;  // for the next transaction
+  std::vector<LedgerNote> notes_;   // for the next transaction
+  std::optional<Error> lossError_;  // why rows were given up
   bool failing_ = false;
   bool logHeld_ = false;  // by a reader
   std::chrono::milliseconds backoff_{0};

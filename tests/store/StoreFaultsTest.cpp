@@ -1,0 +1,168 @@
+// What others do to the store's files while the service writes them.
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <fstream>
+#include <future>
+#include <sstream>
+#include <thread>
+
+#include "platform/linux/execution/SystemThreading.h"
+#include "platform/linux/store/LocalStore.h"
+#include "platform/linux/store/LogReaders.h"
+#include "tests/store/StoreTest.h"
+
+extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size);
+
+namespace vx::lnx {
+namespace {
+
+class StoreFaultsTest : public StoreTest {
+ protected:
+  StoreFaultsTest() { options.commit.interval = 1h; }
+  void open() {
+    store = std::move(*LocalStore::open(folder, options, clock));
+    store->start();
+  }
+  // What the session says until everything before is committed.
+  std::optional<Error> say(int i) {
+    relay->send(5, 1, numbered(i));
+    return flush();
+  }
+  std::optional<Error> flush() {
+    auto told = std::make_shared<std::promise<std::optional<Error>>>();
+    relay->flush([told](std::optional<Error> error) { told->set_value(std::move(error)); });
+    return told->get_future().get();
+  }
+  Rows messages() {
+    return query(
+        "SELECT s.session_id, m.payload FROM relay_messages m"
+        " JOIN relay_sessions s ON s.id = m.relay_session ORDER BY m.id");
+  }
+  Rows ledger() { return query("SELECT event FROM store_ledger ORDER BY id"); }
+  std::string file(const std::string& suffix = "") { return folder + "/telemetry.db" + suffix; }
+
+  SystemClock clock;
+  StoreOptions options;
+  std::unique_ptr<LocalStore> store;
+  std::unique_ptr<RelayBackend::Session> relay;
+};
+
+TEST_F(StoreFaultsTest, LostStoreIsBegunAfreshWithWhatWaitsAndTheSessionsItIsOf) {
+  open();
+  relay = store->relayBackend().open(sessionInfo(42), userInfo());
+  EXPECT_EQ(say(1), std::nullopt);
+  std::filesystem::remove(file());
+  EXPECT_EQ(say(2), std::nullopt);
+  EXPECT_THAT(messages(), ElementsAre("42|{\"i\":2}"));
+  EXPECT_THAT(ledger(), ElementsAre("store_lost"));
+  EXPECT_EQ(say(3), std::nullopt);
+  EXPECT_THAT(messages(), ElementsAre("42|{\"i\":2}", "42|{\"i\":3}"));
+
+  write("other", "not ours");
+  std::filesystem::rename(folder + "/other", file());
+  EXPECT_EQ(say(4), std::nullopt);
+  EXPECT_THAT(messages(), ElementsAre("42|{\"i\":4}"));
+  EXPECT_THAT(query("SELECT detail LIKE '%replaced%damaged-%' FROM store_ledger"),
+              ElementsAre("1"));
+
+  std::filesystem::resize_file(file(), 0);
+  EXPECT_EQ(say(5), std::nullopt);
+  EXPECT_EQ(messages().back(), "42|{\"i\":5}");
+
+  for (int i = 0; i < 300; ++i) relay->send(5, 1, numbered(1000 + i));
+  EXPECT_EQ(say(6), std::nullopt);
+  store->close(clock.monotonic() + 60s);
+  store.reset();
+  open();  // the log is written back
+  relay = store->relayBackend().open(sessionInfo(43), userInfo());
+  EXPECT_EQ(say(7), std::nullopt);
+  std::filesystem::resize_file(file(), 3 * 4096);
+  EXPECT_EQ(say(8), std::nullopt);
+  EXPECT_EQ(messages().back(), "43|{\"i\":8}");
+  EXPECT_EQ(ledger().front(), "store_lost");
+}
+
+TEST_F(StoreFaultsTest, DeletedLogIsWrittenBackBeforeAnotherIsBegun) {
+  open();
+  relay = store->relayBackend().open(sessionInfo(42), userInfo());
+  EXPECT_EQ(say(1), std::nullopt);
+  std::filesystem::remove(file("-wal"));
+  EXPECT_EQ(say(2), std::nullopt);
+  EXPECT_THAT(messages(), ElementsAre("42|{\"i\":1}", "42|{\"i\":2}"));
+  EXPECT_THAT(ledger(), ElementsAre("log_lost"));
+  std::filesystem::remove_all(folder);
+  EXPECT_EQ(say(3), std::nullopt);
+  EXPECT_THAT(messages(), ElementsAre("42|{\"i\":3}"));
+  EXPECT_THAT(LocalStore::open(folder, options, clock).status().text(), HasSubstr("another"));
+}
+
+// A reader is another process; it begins before there are threads here.
+TEST_F(StoreFaultsTest, WritingPausesWhileAReaderHoldsTheLogAtItsBoundAndSaysWhoItIs) {
+  int toReader[2], fromReader[2];
+  ASSERT_EQ(pipe(toReader) + pipe(fromReader), 0);
+  const pid_t reader = fork();
+  if (reader == 0) {
+    char word = 0;
+    sqlite3* opened = nullptr;
+    if (::read(toReader[0], &word, 1) != 1 || sqlite3_open(file().c_str(), &opened) != SQLITE_OK ||
+        execute(opened, "BEGIN; SELECT count(*) FROM power_records") != SQLITE_OK ||
+        ::write(fromReader[1], "r", 1) != 1)
+      _exit(1);
+    _exit(::read(toReader[0], &word, 1) == 1 ? 0 : 1);  // the kernel lets go of its locks
+  }
+  open();
+  relay = store->relayBackend().open(sessionInfo(42), userInfo());
+  EXPECT_EQ(flush(), std::nullopt);
+  char word = 0;
+  ASSERT_EQ(::write(toReader[1], "b", 1), 1);
+  ASSERT_EQ(::read(fromReader[0], &word, 1), 1);
+  const Payload large = PayloadBuilder().set("f", std::string(500000, 'x')).build();
+  for (int i = 0; i < 40; ++i) store->logRegisteredEvent(28, "n", large, nullptr);
+  auto flushed = std::async(std::launch::async, [&] { return flush(); });
+  while (store->counters().writeFailures == 0) std::this_thread::yield();
+  EXPECT_LE(std::filesystem::file_size(file()) + std::filesystem::file_size(file("-wal")),
+            StoreOptions::kSlackBytes);
+  EXPECT_EQ(flushed.wait_for(0s), std::future_status::timeout);
+  ASSERT_EQ(::write(toReader[1], "e", 1), 1);
+  int status = 1;
+  waitpid(reader, &status, 0);
+  EXPECT_EQ(status, 0);
+  EXPECT_EQ(flushed.get(), std::nullopt);
+  EXPECT_THAT(query("SELECT count(*) FROM power_records"), ElementsAre("40"));
+  EXPECT_THAT(
+      query("SELECT event, detail LIKE '%(pid " + std::to_string(reader) + ")' FROM store_ledger"),
+      ElementsAre("log_held|1"));
+  for (const int end : {toReader[0], toReader[1], fromReader[0], fromReader[1]}) ::close(end);
+}
+
+TEST_F(StoreFaultsTest, OlderFilesOfTheFuzzerHoldNoSurprise) {
+  int files = 0;
+  for (const auto& entry : std::filesystem::directory_iterator(VX_FUZZ_CORPUS "/store")) {
+    std::ifstream in(entry.path(), std::ios::binary);
+    const std::string bytes((std::istreambuf_iterator<char>(in)), {});
+    EXPECT_EQ(LLVMFuzzerTestOneInput(reinterpret_cast<const uint8_t*>(bytes.data()), bytes.size()),
+              0);
+    ++files;
+  }
+  EXPECT_GE(files, 3);
+}
+
+TEST_F(StoreFaultsTest, ReadersAreThoseWithAReadLockOnTheIndex) {
+  std::istringstream locks(
+      "1: POSIX  ADVISORY  READ 10 fe:01:7 128 128\n"  // has it open, reads nothing
+      "2: POSIX  ADVISORY  READ 11 fe:01:7 124 124\n"
+      "2: -> POSIX  ADVISORY  READ 12 fe:01:7 124 124\n"
+      "3: POSIX  ADVISORY  WRITE 13 fe:01:7 120 120\n"
+      "4: POSIX  ADVISORY  READ 14 fe:01:17 124 124\n"
+      "5: FLOCK  ADVISORY  READ 15 fe:01:7 0 EOF\n"
+      "6: POSIX  ADVISORY  READ 11 fe:01:7 123 123\n"
+      "7: POSIX  ADVISORY  READ " +
+      std::to_string(getpid()) +
+      " fe:01:7 123 127\n"
+      "8: POSIX  ADVISORY  READ 16 fe:01:7 127 127\n");
+  EXPECT_THAT(readersIn(locks, 7), ElementsAre(11, 16));
+}
+
+}  // namespace
+}  // namespace vx::lnx
