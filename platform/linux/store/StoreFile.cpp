@@ -123,14 +123,27 @@ OpenedStore openStoreDatabase(const std::string& path, const JournalEpoch& epoch
   return opened;
 }
 
-StoreCheck quickCheck(sqlite3* database) {
+namespace {
+
+StoreCheck checkOnce(sqlite3* database) {
   Statement check(database, "PRAGMA quick_check(1)");
   if (!check.row()) {
     return {Status::failure(sqlite3_errmsg(database)), faultOf(sqlite3_extended_errcode(database))};
   }
   const std::string found = check.text(0);
   if (found == "ok") return {};
-  return {Status::failure(found), faultOfFinding(found)};
+  // Not every finding says why a page could not be read.
+  int error = 0;
+  sqlite3_file_control(database, "main", SQLITE_FCNTL_LAST_ERRNO, &error);
+  return {Status::failure(found), error != 0 ? StoreFault::Unusable : faultOfFinding(found)};
+}
+
+}  // namespace
+
+StoreCheck quickCheck(sqlite3* database) {
+  StoreCheck check = checkOnce(database);
+  // What is damaged is so a second time too.
+  return check.fault == StoreFault::Damaged ? checkOnce(database) : check;
 }
 
 Result<std::string> moveAside(const std::string& path) {
