@@ -158,10 +158,25 @@ TEST_F(LocalStoreTest, RowsThatCannotBeWrittenByTheDeadlineAreCountedAndTold) {
   EXPECT_EQ(flush().get(), std::nullopt);
   refusePower();
   for (int i = 0; i < 5; ++i) power(i);
+  {
+    const Cause cause{recorded(), {}};
+    const CauseScope scope(cause);
+    for (int i = 0; i < 2; ++i) power(i);
+  }
   auto flushed = flush();
-  EXPECT_FALSE(close(0s));
+  store->stopAccepting();
+  const uint64_t before = store->progress();
+  EXPECT_FALSE(store->waitUntilEnded(clock.monotonic()));
+  EXPECT_EQ(store->counters().unrecordedWaiting, 6u);  // with the flush's session
+  store->giveUp();
+  EXPECT_TRUE(store->waitUntilEnded(Monotonic::max()));
   EXPECT_TRUE(flushed.get());
-  waitUntil([&] { return store->counters().rowsLost == 6; });  // with the flush's session
+  EXPECT_EQ(store->progress(), before);
+  EXPECT_EQ(store->counters().rowsLost, 6u);
+  EXPECT_EQ(store->counters().rowsLeft, 2u);
+  EXPECT_EQ(store->counters().unrecordedWaiting, 0u);
+  EXPECT_FALSE(close());
+  EXPECT_EQ(undone(), 1);
 }
 
 TEST_F(LocalStoreTest, DamageIsMovedAsideWithALedgerRow) {
@@ -235,7 +250,9 @@ TEST_F(LocalStoreTest, ReplayWritesWhatIsMissingAndNothingTwice) {
   EXPECT_EQ(store->epoch(), epoch);
   store->beginReplay({.first = 2, .sessionsFrom = 1});  // the first is found although it is older
   run(3);
-  store->endReplay();
+  std::promise<void> committed;
+  store->endReplay([&] { committed.set_value(); });
+  committed.get_future().get();
   power(3);
   EXPECT_TRUE(close());
   EXPECT_EQ(store->counters().rowsCommitted, 5u);

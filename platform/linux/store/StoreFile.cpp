@@ -95,9 +95,18 @@ OpenedStore openStoreDatabase(const std::string& path, const JournalEpoch& epoch
   return opened;
 }
 
-Status quickCheck(sqlite3* database) {
+Status quickCheck(sqlite3* database, Function<bool()> goOn) {
+  constexpr int kOperations = 20000;
+  const auto mustEnd = [](void* question) {
+    return (*static_cast<Function<bool()>*>(question))() ? 0 : 1;
+  };
+  sqlite3_progress_handler(database, goOn ? kOperations : 0, mustEnd, &goOn);
   Statement check(database, "PRAGMA quick_check(1)");
-  if (!check.row()) return Status::failure(sqlite3_errmsg(database));
+  const bool ended = check.row();
+  sqlite3_progress_handler(database, 0, nullptr, nullptr);
+  if (!ended && sqlite3_errcode(database) == SQLITE_INTERRUPT)
+    return Status::posix("the check was cut short", ECANCELED);
+  if (!ended) return Status::failure(sqlite3_errmsg(database));
   const std::string found = check.text(0);
   return found == "ok" ? Status() : Status::failure(found);
 }

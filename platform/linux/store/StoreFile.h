@@ -4,6 +4,7 @@
 #include <cstdint>
 #include <string>
 
+#include "base/Function.h"
 #include "base/Status.h"
 #include "base/UniqueFd.h"
 #include "platform/linux/journal/JournalFormat.h"
@@ -32,8 +33,9 @@ struct OpenedStore {
 // epoch yet gets this one.
 OpenedStore openStoreDatabase(const std::string& path, const JournalEpoch& epochIfNew);
 
-// Fails, with what was found, unless `PRAGMA quick_check` finds nothing.
-Status quickCheck(sqlite3* database);
+// Fails, with what was found, unless `PRAGMA quick_check` finds nothing; ECANCELED when `goOn`,
+// which is asked every few milliseconds, says no.
+Status quickCheck(sqlite3* database, Function<bool()> goOn = nullptr);
 
 // Moves the file and its companions out of the way, to "<path>.damaged-YYYYMMDD-HHMMSS[-n]". The
 // new name.

@@ -5,6 +5,7 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <cerrno>
 #include <iterator>
 #include <utility>
 
@@ -58,18 +59,27 @@ StoreCounters StoreWriter::counters() const {
   return {.rowsCommitted = rowsCommitted_.load(),
           .commits = commits_.load(),
           .writeFailures = writeFailures_.load(),
-          .rowsLost = rowsLost_.load()};
+          .rowsLeft = rowsLeft_.load(),
+          .rowsLost = rowsLost_.load(),
+          .unrecordedWaiting = queue_.unrecordedRows() - unrecordedDone_.load()};
 }
 
 bool StoreWriter::close(Monotonic deadline) {
   queue_.close(deadline);
-  const auto limit =
-      std::chrono::time_point_cast<std::chrono::steady_clock::duration>(deadline + kCloseMargin);
+  return waitUntilEnded(deadline + kCloseMargin) && rowsLost_.load() == 0;
+}
+
+bool StoreWriter::waitUntilEnded(Monotonic until) {
+  const auto limit = std::chrono::time_point_cast<std::chrono::steady_clock::duration>(until);
   MutexLock lock(mutex_);
   while (!finished_ && thread_.joinable()) {
     if (!ended_.waitUntil(mutex_, limit) && !finished_) return false;
   }
-  return rowsLost_.load() == 0;
+  return true;
+}
+
+void StoreWriter::note(LedgerNote note) {
+  queue_.runSoon([this, note = std::move(note)] { notes_.push_back(note); });
 }
 
 void StoreWriter::threadMain() {
@@ -96,7 +106,13 @@ void StoreWriter::runJobs() {
 }
 
 void StoreWriter::checkDatabase() {
-  const Status check = quickCheck(unchecked_.get());
+  // It may take long: who waits for an answer gets it meanwhile, and a stop need not wait.
+  const Status check = quickCheck(unchecked_.get(), [this] {
+    ++progress_;
+    runJobs();
+    return !queue_.gaveUp();
+  });
+  if (check.code() == ECANCELED) return;
   if (check.ok()) {
     open_.emplace(std::move(unchecked_), options_, endWord_, clock_);
     return;
@@ -163,7 +179,7 @@ void StoreWriter::onCommitted(StoreBatch& batch, std::size_t first, std::size_t 
     backoff_ = {};
     VX_LOG(nullptr, Error, "the store can be written again; nothing was lost");
   }
-  EventPairing::markWritten(batch.records, first, last);
+  unrecordedDone_ += EventPairing::markWritten(batch.records, first, last);
   for (std::size_t i = first; replayFrom_ && i < last; ++i) {
     if (!std::holds_alternative<ReplayEndRecord>(batch.records[i].what)) continue;
     replayFrom_.reset();
@@ -180,11 +196,16 @@ void StoreWriter::onCommitted(StoreBatch& batch, std::size_t first, std::size_t 
 }
 
 void StoreWriter::onLost(StoreBatch& batch, std::size_t first, const Status& why) {
-  const uint64_t lost = EventPairing::unwrittenRows(batch.records, first);
-  rowsLost_ += lost;
+  const EventPairing::Unwritten unwritten = EventPairing::unwrittenRows(batch.records, first);
+  rowsLeft_ += unwritten.recorded;
+  rowsLost_ += unwritten.lost;
+  unrecordedDone_ += unwritten.lost;
   EventPairing::abandon(batch.records, first);
-  VX_LOG(nullptr, Error, "the store could not be written before the end: %llu rows are lost (%s)",
-         static_cast<unsigned long long>(lost), why.text().c_str());
+  VX_LOG(nullptr, Error,
+         "the store could not be written before the end (%s): %llu rows wait in the journal, %llu "
+         "are lost",
+         why.text().c_str(), static_cast<unsigned long long>(unwritten.recorded),
+         static_cast<unsigned long long>(unwritten.lost));
   release(batch, batch.bytes);
   for (const StoreFlush& flush : batch.flushes) flush.handler(why.error());
 }
@@ -201,7 +222,7 @@ bool StoreWriter::waitBeforeRetry(const Status& failure) {
     VX_LOG(nullptr, Error, "cannot write %s: %s; what was accepted is kept and tried again",
            path_.c_str(), failure.text().c_str());
   }
-  if (!open_) {
+  if (!open_ && !queue_.gaveUp()) {
     OpenedStore again = openStoreDatabase(path_, epoch_);
     if (again.status.ok()) open_.emplace(std::move(again.database), options_, endWord_, clock_);
   }
