@@ -155,7 +155,7 @@ TEST_F(JournalFilesTest, AFileThatIsBlankIsRemovedWithAWord) {
   std::ofstream(options.folder + "/segment-0000000000000008.vxj") << std::string(kSegmentBytes, 0);
   for (const std::string& name : files()) chmod((options.folder + "/" + name).c_str(), 0600);
   open();
-  EXPECT_THAT(complaints, ElementsAre(HasSubstr("7.vxj is blank"), HasSubstr("8.vxj is blank")));
+  EXPECT_THAT(complaints, ElementsAre(HasSubstr("7.vxj is blank")));
   EXPECT_THAT(files(), IsEmpty());
   appendDone(1);
   struct stat info {};

@@ -128,7 +128,7 @@ Result<JournalFolder::Opened> JournalFolder::openSegment(const std::string& name
   if (got < 0) return Status::lastError(quoted("cannot read", path));
   const bool known = header.magic == SegmentHeader::kMagic;
   if (header.state == SegmentHeader::kFree && (known || header.magic == 0)) {
-    opened.blank = !known;
+    opened.blank = got == 0;  // one that was allocated for later is of full size
     header = {};
     return opened;
   }

@@ -35,7 +35,7 @@ class JournalFolder {
   struct Opened {
     UniqueFd fd;
     SegmentHeader header{};
-    bool blank = false;  // holds nothing, as if it had never been begun
+    bool blank = false;  // of no size
   };
   Result<Opened> openSegment(const std::string& name, Access access) const;
   // Allocated whole: a hole in a file system that has become full would be a SIGBUS.
