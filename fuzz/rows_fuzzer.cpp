@@ -46,6 +46,8 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   std::size_t count = 0;
   while (const vx::VXReportingRow* row = reader.next()) {
     if (!vx::Payload::decode(row->payload().encoded())) __builtin_trap();
+    if (row->shape != vx::VXReportingRows::kNoShape && row->payload().size() != row->keys.size())
+      __builtin_trap();
     if (++count == (*rows)->rows() && row->payload() != more) __builtin_trap();
   }
   if (count != (*rows)->rows()) __builtin_trap();

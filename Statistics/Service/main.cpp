@@ -5,6 +5,7 @@
 #include <string>
 
 #include "Statistics/Service/VXReportingServiceDelegate.h"
+#include "Statistics/VXReportingProcessState.h"
 #include "platform/Platform.h"
 #include "platform/linux/LinuxPlatform.h"
 
@@ -25,6 +26,7 @@ int main() {
         vx::VXReportingServiceDelegate::create();
     services.serviceListener.setDelegate(delegate);
     services.serviceListener.resume();
+    vx::VXReportingProcessState::current().delayedMessages().sendAllNow();
   }
   return linuxPlatform->shutDown();
 }

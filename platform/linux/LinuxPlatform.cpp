@@ -12,6 +12,7 @@
 #include <unistd.h>
 
 #include <cstdlib>
+#include <future>
 #include <optional>
 #include <vector>
 
@@ -19,6 +20,7 @@
 #include "platform/Log.h"
 #include "platform/linux/PlatformConfiguration.h"
 #include "platform/linux/RelayReporting.h"
+#include "platform/linux/StopDeadline.h"
 #include "platform/linux/aggregates/AggregateSegments.h"
 #include "platform/linux/device/ConfiguredDeviceProperties.h"
 #include "platform/linux/device/CounterChannels.h"
@@ -34,6 +36,7 @@
 #include "platform/linux/execution/SystemThreading.h"
 #include "platform/linux/ipc/SocketListener.h"
 #include "platform/linux/journal/Journal.h"
+#include "platform/linux/recovery/JournalMove.h"
 #include "platform/linux/recovery/JournalOpening.h"
 #include "platform/linux/recovery/JournalRecorder.h"
 #include "platform/linux/recovery/JournaledInputs.h"
@@ -53,9 +56,17 @@ constexpr std::string_view kPreferencesFile = "com.quorvel.sonik.toml";
 // Relay work that accepted messages may have caused before reading from clients pauses.
 constexpr std::size_t kRelayBacklogHigh = 64 << 10;
 constexpr std::size_t kRelayBacklogLow = 32 << 10;
-constexpr std::chrono::milliseconds kDrainTime{1500};
-constexpr std::chrono::milliseconds kStoreTime{1000};
+// Of a stop, from the signal on; then of moving what is left (docs/configuration.md).
+constexpr StopDeadline::Limits kCommitLimits{.first = std::chrono::seconds(5),
+                                             .pause = std::chrono::seconds(5),
+                                             .most = std::chrono::seconds(45)};
+constexpr StopDeadline::Limits kMoveLimits{.first = std::chrono::seconds(3),
+                                           .pause = std::chrono::seconds(3),
+                                           .most = std::chrono::seconds(15)};
 constexpr std::chrono::milliseconds kThreadTime{200};
+// How long clients wait for what was recovered to be committed.
+constexpr std::chrono::seconds kReplayCommit{4};
+constexpr std::chrono::milliseconds kLookAgain{20};
 
 // A descriptor of the loop whose readiness means one call.
 class CallOnReady final : public EventLoop::Source {
@@ -135,9 +146,11 @@ class RunningPlatform final : public LinuxPlatform {
                          {std::string(kPreferencesNotification), std::string(kPreferencesFile)}},
                      configuration_.preferences, clock_);
     journalFolder_ = directories.runtime + "/journal";
+    movedFolder_ = directories.state + "/journal";
     // A store that was lost is begun anew and gets what the journal still has.
-    Result<std::unique_ptr<LocalStore>> opened = LocalStore::open(
-        directories.state, configuration_.store, clock_, epochOfJournal(journalFolder_));
+    Result<std::unique_ptr<LocalStore>> opened =
+        LocalStore::open(directories.state, configuration_.store, clock_,
+                         epochOfJournal(journalFolder_, movedFolder_));
     if (!opened.ok()) {
       problem = opened.status().text();
       return false;
@@ -181,6 +194,8 @@ class RunningPlatform final : public LinuxPlatform {
   }
   void recover(const Function<std::shared_ptr<ServiceListenerDelegate>()>& makeDelegate) override {
     if (left_.records.empty()) {
+      // What could not be taken back is of a process before this one.
+      if (movedStays_) (void)journal_->append({static_cast<uint8_t>(RecordKind::ServiceBegan)});
       aggregates_.snapshotBegan();
       aggregates_.snapshotCompleted();
       return endReplay(journalFolder_);
@@ -192,8 +207,7 @@ class RunningPlatform final : public LinuxPlatform {
                       std::move(left_));
     store_->beginReplay(recovery_->calls());
     const RecoveryOutcome outcome = recovery_->run(makeDelegate);
-    store_->endReplay();
-    endReplay(journalFolder_);
+    commitReplay();
     snapshots_->demand();
     if (outcome.unreadable > 0) {
       store_->note({"recovery_incomplete", "", 0,
@@ -215,28 +229,37 @@ class RunningPlatform final : public LinuxPlatform {
   SystemLog& log() { return log_; }
 
   int shutDown() override {
-    const Monotonic start = clock_.monotonic();
-    const bool drained = executor_.drain(start + kDrainTime);
+    StopDeadline deadline(clock_, stopBegan_.value_or(clock_.monotonic()), kCommitLimits,
+                          askForTime);
+    const bool drained =
+        waitFor(deadline, [this](Monotonic until) { return executor_.drain(until); });
     if (!drained) VX_LOG(nullptr, Error, "relay work was left behind: it did not finish in time");
-    const bool stored = store_->close(clock_.monotonic() + kStoreTime);
-    const LocalStore::Counters counters = store_->counters();
-    VX_LOG(
-        nullptr, Info,
-        "stored: rows=%llu commits=%llu write_failures=%llu rows_lost=%llu log_lines_dropped=%llu",
-        static_cast<unsigned long long>(counters.rowsCommitted),
-        static_cast<unsigned long long>(counters.commits),
-        static_cast<unsigned long long>(counters.writeFailures),
-        static_cast<unsigned long long>(counters.rowsLost),
-        static_cast<unsigned long long>(log_.droppedLines()));
+    store_->stopAccepting();
+    bool ended =
+        waitFor(deadline, [this](Monotonic until) { return store_->waitUntilEnded(until); });
+    if (!ended) {
+      store_->giveUp();
+      ended = store_->waitUntilEnded(clock_.monotonic() + kThreadTime);
+    }
+    // Of what was not recorded, an item is a row or two.
+    const std::size_t left = drained || isAllRecorded() ? 0 : executor_.utilityBacklog();
     executor_.stop(clock_.monotonic() + kThreadTime);
     Journal::setCallsDoneHandler(nullptr, nullptr);
-    const int status = drained && stored ? 0 : 1;
-    if (status == 0 && journal_ != nullptr && journal_->allDone()) {
-      journal_->discard();
-      aggregates_.discard();
-    }
+    const LocalStore::Counters counters = store_->counters();
+    const uint64_t lost = counters.rowsLost + left + (ended ? 0 : counters.unrecordedWaiting);
+    VX_LOG(nullptr, Info,
+           "stored: rows=%llu commits=%llu write_failures=%llu rows_left=%llu rows_lost=%llu "
+           "log_lines_dropped=%llu",
+           static_cast<unsigned long long>(counters.rowsCommitted),
+           static_cast<unsigned long long>(counters.commits),
+           static_cast<unsigned long long>(counters.writeFailures),
+           static_cast<unsigned long long>(counters.rowsLeft),
+           static_cast<unsigned long long>(lost),
+           static_cast<unsigned long long>(log_.droppedLines()));
+    const bool alone = keepWhatIsLeft();
+    const int status = lost == 0 ? 0 : 1;
     // A thread that could not be ended must not find the services destroyed.
-    if (status != 0) std::_Exit(status);
+    if (!drained || !ended || !alone) std::_Exit(status);
     return status;
   }
 
@@ -247,17 +270,19 @@ class RunningPlatform final : public LinuxPlatform {
         vx::lnx::openJournal({.folder = journalFolder_,
                               .epoch = store_->epoch(),
                               .first = {.call = store_->lastCall() + kMostCallsUnseen}},
-                             directories.state + "/journal");
+                             movedFolder_);
     if (opened.ok()) {
       journal_ = std::move(opened->journal);
       left_ = std::move(opened->left);
       poisoned_ = std::move(opened->poisoned);
+      movedStays_ = opened->movedStays;
       journalComplaints_ = std::move(opened->complaints);
       recorder_.emplace(*journal_, clock_);
       recorder_->setUnrecordedHandler([this](const Status& why) {
         if (recorder_->counters().unrecorded == 1) {
           VX_LOG(nullptr, Error, "%s: what is accepted from now on may not survive this process",
                  why.text().c_str());
+          store_->note({"journal_full", "", 0, why.text()});
         }
         snapshots_->demand();  // a replay of the calls would not come to the state that there is
       });
@@ -272,13 +297,67 @@ class RunningPlatform final : public LinuxPlatform {
                why.text().c_str());
       });
     } else {
-      journalComplaints_.push_back(opened.status().text() +
-                                   ": what is accepted does not survive this process");
+      noJournal_ = opened.status().text() + ": what is accepted does not survive this process";
     }
     inputs_.emplace(journal_.get());
     struct statfs files {};
     const std::string& folder = journal_ != nullptr ? journalFolder_ : directories.runtime;
     journalInMemory_ = statfs(folder.c_str(), &files) == 0 && files.f_type == TMPFS_MAGIC;
+  }
+
+  // ------------------------------------------------------------------------------------------ stop
+
+  static void askForTime(std::chrono::milliseconds time) {
+    // With what is needed afterwards.
+    const std::chrono::microseconds wanted = time + kMoveLimits.first + std::chrono::seconds(2);
+    sd_notifyf(0, "EXTEND_TIMEOUT_USEC=%llu", static_cast<unsigned long long>(wanted.count()));
+  }
+
+  bool waitFor(StopDeadline& deadline, const Function<bool(Monotonic until)>& isDone) {
+    while (!isDone(deadline.nextLook())) {
+      if (!deadline.goOn(store_->progress() - executor_.utilityBacklog())) return false;
+    }
+    return true;
+  }
+
+  bool isAllRecorded() const { return recorder_ && recorder_->counters().unrecorded == 0; }
+
+  // What is not in the store goes to the state folder, which outlives a power cut. By a thread of
+  // its own: the disk may be what does not answer. False: that thread still waits for it.
+  bool keepWhatIsLeft() {
+    if (journal_ == nullptr) return true;
+    if (journal_->allDone()) {
+      journal_->discard();
+      aggregates_.discard();
+      return true;
+    }
+    endReplay(journalFolder_);  // of which this process has not died
+    JournalMove move(journalFolder_, movedFolder_);
+    StopDeadline deadline(clock_, clock_.monotonic(), kMoveLimits, askForTime);
+    std::optional<Status> outcome;
+    while (!(outcome = move.waitUntil(deadline.nextLook())) && deadline.goOn(move.progress())) {
+    }
+    const bool moved = outcome && outcome->ok();
+    VX_LOG(nullptr, Error,
+           "what was accepted and is not in the store is kept in %s for the next start%s%s",
+           moved ? movedFolder_.c_str() : journalFolder_.c_str(), moved ? "" : ": ",
+           moved ? "" : (outcome ? outcome->text() : "the disk does not answer").c_str());
+    return outcome.has_value();
+  }
+
+  // A process that dies of a row does so when it is written: until then the replay is not over.
+  void commitReplay() {
+    const auto committed = std::make_shared<std::promise<void>>();
+    store_->endReplay([committed, folder = journalFolder_] {
+      endReplay(folder);
+      committed->set_value();
+    });
+    std::future<void> end = committed->get_future();
+    const Monotonic until = clock_.monotonic() + kReplayCommit;
+    while (end.wait_for(kLookAgain) != std::future_status::ready && clock_.monotonic() < until) {
+      // Nobody dies of a disk that cannot be written.
+      if (store_->counters().writeFailures > 0) return endReplay(journalFolder_);
+    }
   }
 
   void cutJournal() {
@@ -302,8 +381,14 @@ class RunningPlatform final : public LinuxPlatform {
   }
 
   void reportOnJournal() {
-    for (const std::string& complaint : journalComplaints_)
+    for (const std::string& complaint : journalComplaints_) {
       VX_LOG(nullptr, Error, "journal: %s", complaint.c_str());
+      store_->noteAtStart({"journal_damaged", "", 0, complaint});
+    }
+    if (!noJournal_.empty()) {
+      VX_LOG(nullptr, Error, "no journal: %s", noJournal_.c_str());
+      store_->noteAtStart({"journal_absent", "", 0, noJournal_});
+    }
     if (!poisoned_.empty()) {
       VX_LOG(nullptr, Error,
              "processes ended again and again while they finished what an earlier one had "
@@ -346,7 +431,11 @@ class RunningPlatform final : public LinuxPlatform {
                      (journal_ != nullptr && !journal_->hasCapacity());
             },
         .listening = [] { sd_notify(0, "READY=1"); },
-        .stopping = [] { sd_notify(0, "STOPPING=1"); },
+        .stopping =
+            [this] {
+              stopBegan_ = clock_.monotonic();
+              sd_notify(0, "STOPPING=1");
+            },
     });
 
     sigset_t signals;
@@ -436,10 +525,14 @@ class RunningPlatform final : public LinuxPlatform {
   UsdtTracePoint trace_;
   std::optional<PreferencesWatcher> watcher_;
   std::unique_ptr<LocalStore> store_;
+  std::optional<Monotonic> stopBegan_;
   std::string journalFolder_;
+  std::string movedFolder_;  // of what a stop could not commit
   std::vector<std::string> journalComplaints_;
+  std::string noJournal_;  // why there is none
   std::string poisoned_;
   JournalContents left_;
+  bool movedStays_ = false;
   bool journalInMemory_ = false;
   std::unique_ptr<Journal> journal_;
   std::optional<JournalRecorder> recorder_;

@@ -30,8 +30,9 @@ class LinuxPlatform {
       const Function<std::shared_ptr<ServiceListenerDelegate>()>& makeDelegate) = 0;
 
   // After the listener's resume has returned: drains the relay queues, commits the store and ends
-  // all threads, within five seconds of the request to end. The exit status: 0, or 1 when something
-  // accepted could not be stored.
+  // all threads, within five seconds of the request to end, or longer while rows are still being
+  // committed. What is not committed then moves to the state folder, as journal, for the next start.
+  // The exit status: 0, or 1 when something accepted is lost.
   virtual int shutDown() = 0;
 };
 

@@ -60,12 +60,22 @@ class Faults(DaemonTest):
 
     def test_killed_and_started_again(self):
         d = self.daemon()
+        began = time.time()
         self.assertEqual(os.stat(d.socket_path).st_mode & 0o777, 0o666)
         d.client().session(1)
         d.wait_for_messages(2)
         self.assertEqual(d.rows("PRAGMA journal_mode"), [("wal",)])  # readers do not hold up the service
         d.process.kill()
         d.process.wait()
+        # What is recorded runs again elsewhere too, although all of it is done, at its own time.
+        replay = [os.environ["VXREPLAY"], "--journal", d.folder + "/run/journal", "--into", d.folder + "/again"]
+        self.assertEqual(subprocess.run(replay, stderr=subprocess.PIPE, timeout=PATIENCE).returncode, 0)
+        self.assertEqual(subprocess.run(replay, stderr=subprocess.PIPE, timeout=PATIENCE).returncode, 1)  # it is there now
+        query = "SELECT category, payload, time FROM relay_messages ORDER BY id"
+        with contextlib.closing(sqlite3.connect(d.folder + "/again/state/telemetry.db")) as again:
+            for first, second in zip(d.rows(query), again.execute(query).fetchall(), strict=True):
+                self.assertEqual(first[:2], second[:2])
+                self.assertTrue(began <= second[2] <= first[2])
         d.start()
         d.client().session(1)
         self.assertEqual(d.stop(), 0)

@@ -20,7 +20,7 @@ class FakeAggregateMemory final : public AggregateMemory {
   Block acquire(uint64_t aggregate, uint32_t ordinal, std::size_t bytes) override {
     const std::lock_guard lock(mutex_);
     bytes = std::max(bytes, least);
-    std::vector<uint8_t>& memory = memory_.emplace_back(bytes, uint8_t{0xA5});
+    std::vector<uint8_t>& memory = memory_.emplace_back(bytes, fill);
     ++held;
     return blocks[{aggregate, ordinal}] = {memory.data(), bytes, ordinal < surviving};
   }
@@ -45,6 +45,7 @@ class FakeAggregateMemory final : public AggregateMemory {
   std::map<std::pair<uint64_t, uint32_t>, Block> blocks;  // by aggregate and ordinal; ever
   std::size_t held = 0;
   std::size_t least = 0;  // of a block
+  uint8_t fill = 0xA5;    // what a new one holds
   uint64_t named = 0;
   uint32_t surviving = UINT32_MAX;  // the first so many of each aggregate
 

@@ -2,13 +2,12 @@
 // slow or fatal, and records what reaches them. The environment says what it does:
 //
 //   VX_SHIM_MATCH=P[:P..]   the files whose paths begin so
-//   VX_SHIM_FAULT=K,E,F,N   calls of kinds K (of kKinds) fail with errno E (0: only half is
-//   written)
+//   VX_SHIM_FAULT=K,E,F,N   calls of kinds K (their letters below) fail with errno E (0: only half
+//   is written)
 //                           from the F-th on (1 is the first), N times (0: for ever)
-//   VX_SHIM_WHILE=PATH      they fail only while this file is there
+//   VX_SHIM_WHILE=PATH      they fail, or are slow, only while this file is there
 //   VX_SHIM_SYNC_MS=A,B     every sync takes A to B ms longer
 //   VX_SHIM_ABORT=TEXT      a write that holds this text ends the process
-//   VX_SHIM_COUNT=PATH      how many calls of each kind there were: 64 bits each
 //   VX_SHIM_RECORD=PATH     what was done, in order: RecordHeader, then the bytes or the path
 //
 // Made of system calls, so that it calls nothing that it replaces.
@@ -33,12 +32,12 @@
 
 namespace {
 
-// open, read, write, sync, truncate, allocate, map, rename, unlink
-constexpr std::string_view kKinds = "orwstamnu";
 constexpr int kMostFiles = 1 << 16;
 
 struct RecordHeader {
-  uint32_t kind;  // one of kKinds; t: its length has become offset
+  // open, read, write, sync, truncate, allocate, map, rename (n), unlink; t: its length has become
+  // offset
+  uint32_t kind;
   uint32_t fd;    // of o, w, s and t
   uint64_t size;  // of what follows
   uint64_t offset;
@@ -59,12 +58,10 @@ struct Shim {
   const std::string whilePath = setting("VX_SHIM_WHILE");
   const std::string abortText = setting("VX_SHIM_ABORT");
   const int record = openFile(setting("VX_SHIM_RECORD"), O_WRONLY | O_APPEND);
-  const int countFile = openFile(setting("VX_SHIM_COUNT"), O_RDWR);
   char faultKinds[16] = "";
   int faultErrno = 0;
   unsigned long faultFirst = 0, faultTimes = 0;
   long fastest = 0, slowest = 0;
-  std::atomic<uint64_t> counts[kKinds.size()] = {};
   std::atomic<uint64_t> candidates{0};
   std::mutex order;  // one call at a time: the record has their order
   std::atomic<bool> files[kMostFiles] = {};
@@ -82,20 +79,19 @@ struct Shim {
     }
     return false;
   }
+  bool isMeantNow() const {
+    return whilePath.empty() || syscall(SYS_faccessat, AT_FDCWD, whilePath.c_str(), F_OK) == 0;
+  }
   bool has(int fd) const { return fd >= 0 && fd < kMostFiles && files[fd].load(); }
 
   // Counts a call and sets errno if it is to fail; to 0 if half of it is to be done.
   bool fails(char kind, bool watched) {
     if (!watched) return false;
-    const std::size_t index = kKinds.find(kind);
-    const uint64_t count = ++counts[index];
-    if (countFile >= 0) (void)syscall(SYS_pwrite64, countFile, &count, sizeof count, 8 * index);
     const bool meant = std::string_view(faultKinds).find(kind) != std::string_view::npos;
     if (!meant || (faultErrno == 0 && kind != 'w')) return false;
     const uint64_t number = ++candidates;
     if (number < faultFirst || (faultTimes != 0 && number >= faultFirst + faultTimes)) return false;
-    if (!whilePath.empty() && syscall(SYS_faccessat, AT_FDCWD, whilePath.c_str(), F_OK) != 0)
-      return false;
+    if (!isMeantNow()) return false;
     errno = faultErrno;
     return true;
   }
@@ -142,7 +138,7 @@ int openIn(int folder, const char* path, int flags, va_list rest) {
 }
 
 int syncWith(long call, int fd) {
-  if (shim().has(fd) && shim().slowest != 0) {
+  if (shim().has(fd) && shim().slowest != 0 && shim().isMeantNow()) {
     thread_local std::minstd_rand random{std::random_device{}()};
     const long ms = std::uniform_int_distribution(shim().fastest, shim().slowest)(random);
     const timespec time{ms / 1000, ms % 1000 * 1000000};

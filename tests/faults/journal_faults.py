@@ -1,17 +1,13 @@
 """A torn, foreign or poisoned journal: the daemon starts, says so once, keeps the file, and serves."""
 import glob
 import os
-import time
 
 from harness import SEND
-from io_faults import BRIEF
-from kill_faults import end_marker_session
 from service import PATIENCE, Outcome, spread
 from store_check import stopped
 from traffic import scene
 
 POISON = "poisoned" * 4  # in a message: the daemon ends when it writes this to the store
-SERVED = "SELECT 1 FROM relay_messages WHERE payload LIKE '%marker%' AND category = 65535"
 
 
 def change(path, how):
@@ -103,19 +99,12 @@ def poisoned(seed):
         traffic.peers[0].post(SEND, {"text": POISON}, 3, 1, None)
         service.process.wait(PATIENCE)
         traffic.process_ended("crashed")
-        deaths, alive = 0, False
-        while deaths < 5 and not alive:
+        deaths = 0
+        while deaths < 5:
             service.launch(abort=POISON)
-            try:
-                if service.is_ready():
-                    end_marker_session(service, traffic)
-                    deadline = time.monotonic() + BRIEF
-                    while service.process.poll() is None and time.monotonic() < deadline and not service.rows(SERVED):
-                        time.sleep(0.02)
-            except OSError:
-                pass  # it died
-            alive = service.process.poll() is None
-            deaths += not alive
+            if service.is_ready() and service.stop() == 0:  # which writes everything
+                break
+            deaths += 1
         kept = [p for p in files_below(service.folder + "/run", service.folder + "/state") if "aside" in p]
         outcome = Outcome(f"{seed} poisoned")
         outcome.found("deaths", f"{deaths} of those that recovered", deaths - 2)

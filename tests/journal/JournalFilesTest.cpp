@@ -79,6 +79,8 @@ TEST_F(JournalFilesTest, FilesOfOthersAreSetAsideAndReported) {
        "is of version 9"},
       {"header", [](auto& path) { patch(path, offsetof(SegmentHeader, sequence), 9); },
        "has a damaged header"},
+      {"state", [](auto& path) { patch(path, offsetof(SegmentHeader, state), 0x5B); },
+       "has a damaged header"},
       {"size", [](auto& path) { fs::resize_file(path, kSegmentBytes - 1); },
        "is not of a segment's size"},
       {"mode", [](auto& path) { chmod(path.c_str(), 0640); }, "is open to other users"},
@@ -147,13 +149,13 @@ TEST_F(JournalFilesTest, KeepsTheLastFewThatWereSetAside) {
   EXPECT_THAT(names[3], HasSubstr(".aside-6"));
 }
 
-TEST_F(JournalFilesTest, AFileThatWasNeverBegunIsNobodysLoss) {
+TEST_F(JournalFilesTest, AFileThatIsBlankIsRemovedWithAWord) {
   open();
   std::ofstream(options.folder + "/segment-0000000000000007.vxj").flush();
   std::ofstream(options.folder + "/segment-0000000000000008.vxj") << std::string(kSegmentBytes, 0);
   for (const std::string& name : files()) chmod((options.folder + "/" + name).c_str(), 0600);
   open();
-  EXPECT_THAT(complaints, IsEmpty());
+  EXPECT_THAT(complaints, ElementsAre(HasSubstr("7.vxj is blank")));
   EXPECT_THAT(files(), IsEmpty());
   appendDone(1);
   struct stat info {};
@@ -207,17 +209,20 @@ TEST_F(JournalFilesTest, MovesToAnotherFileSystemAndIsReadThere) {
   leaveBehind(2);
   const std::string twice = options.folder + "/segment-0000000000000001.vxj";
   fs::copy_file(twice, root + "/twice");
+  std::ofstream(options.folder + "/aggregate-1.vxa") << std::string(700000, 'a');
   ASSERT_TRUE(JournalFolder::moveTo(options.folder, other).ok());
   EXPECT_THAT(files(), IsEmpty());
+  EXPECT_EQ(fs::file_size(other + "/aggregate-1.vxa"), 700000u);
+  fs::remove(other + "/aggregate-1.vxa");
   EXPECT_THAT(JournalReader::read(other, kEpoch)->records, SizeIs(2));
-  // The process ended between copying and removing: the next move copies it again.
+  // The process ended between copying and removing: the next move leaves it at that.
   fs::copy_file(root + "/twice", twice);
   options.first = JournalReader::read(other, kEpoch)->next;
   leaveBehind(3);
   ASSERT_TRUE(JournalFolder::moveTo(options.folder, other).ok());
   options.folder = other;
   EXPECT_EQ(readKinds(), "1 2 3");
-  EXPECT_THAT(files(), SizeIs(4));
+  EXPECT_THAT(files(), SizeIs(3));
   fs::remove_all(other);
   EXPECT_FALSE(JournalFolder::moveTo(root + "/none", other).ok());
 }

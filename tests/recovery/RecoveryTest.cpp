@@ -2,6 +2,7 @@
 #include <gmock/gmock.h>
 
 #include <filesystem>
+#include <fstream>
 #include <map>
 
 #include "Statistics/VXReportingProcessState.h"
@@ -31,6 +32,7 @@ class RecoveryTest : public JournalFixture {
     journal = std::move(opened->journal);
     left = std::move(opened->left);
     poisoned = opened->poisoned;
+    complaints = opened->complaints;
     processState.emplace();
     service = std::make_unique<RecordedService>(journal.get(), &memory);
     service->fakes.services.processNames = {{200, "player"}, {201, "phone"}};
@@ -433,14 +435,58 @@ TEST_F(RecoveryTest, AJournalWhoseReplaysDieIsMovedAsideAndTheServiceServes) {
   }
 }
 
-TEST_F(RecoveryTest, WhatWasMovedElsewhereIsTakenBack) {
+TEST_F(RecoveryTest, WhatIsDamagedIsKeptAndTheRestIsRunAgain) {
+  beginLife();
+  connect(1, 200);
+  connect(2, 201);
+  const uint64_t damaged = connections[2].first;
+  connect(3, 200);
+  service->rows.commit();
+  kill();
+  const auto contents = JournalReader::read(options.folder, kEpoch);
+  const std::string segment = onlySegment();
+  {
+    std::fstream file(segment, std::ios::binary | std::ios::in | std::ios::out);
+    file.seekp(contents->records[damaged - 1].place.offset + 30);
+    file.put('x');
+  }
+  const Bytes before = bytesOf(segment);
+  EXPECT_EQ(recover().ended, 2u);
+  EXPECT_THAT(complaints, ElementsAre(HasSubstr("0001.vxj is damaged")));
+  EXPECT_EQ(bytesOf(segment + ".aside-1"), before);
+}
+
+TEST_F(RecoveryTest, WhatWasMovedElsewhereIsTakenBackOnce) {
+  const std::string moved = root + "/moved";
+  const auto move = [&](const std::string& from, const std::string& to) {
+    ASSERT_TRUE(JournalFolder::moveTo(from, to).ok());
+  };
   beginLife();
   connect(1, 200);
   kill();
-  EXPECT_EQ(epochOfJournal(options.folder), kEpoch);
-  ASSERT_TRUE(JournalFolder::moveTo(options.folder, root + "/moved").ok());
-  EXPECT_EQ(epochOfJournal(options.folder), std::nullopt);
-  EXPECT_EQ(recover().ended, 1u);
+  EXPECT_EQ(epochOfJournal(options.folder, moved), kEpoch);
+  // The move was cut short: its copies are there, and what it copied.
+  move(options.folder, root + "/other");
+  std::filesystem::copy(root + "/other", moved);
+  for (const char* part : {"/moved", "/moved/segment-0000000000000001.vxj"})
+    std::filesystem::permissions(root + part, std::filesystem::perms(0700));
+  move(root + "/other", options.folder);
+  move(options.folder, moved);
+  EXPECT_EQ(epochOfJournal(options.folder, moved), kEpoch);
+  EXPECT_THAT(JournalReader::read(options.folder, kEpoch)->records, IsEmpty());
+  // Nor can it be taken back at once: the process that finds it so goes on behind it.
+  const std::string obstacle = options.folder + "/segment-0000000000000001.vxj.part";
+  std::filesystem::create_directory(obstacle);
+  beginLife();
+  EXPECT_THAT(complaints, SizeIs(1));
+  const uint64_t first = connections[1].first;
+  connect(2, 201);
+  EXPECT_GT(connections[2].first, first + 1000);
+  kill();
+  std::filesystem::remove(obstacle);
+  EXPECT_EQ(recover().ended, 2u);
+  EXPECT_THAT(complaints, IsEmpty());
+  EXPECT_THAT(JournalReader::read(moved, kEpoch)->records, IsEmpty());
 }
 
 }  // namespace

@@ -206,6 +206,24 @@ TEST_F(AggregateTest, SummariesAreThoseOfThePayloads) {
   EXPECT_TRUE(p.services.files.begin()->second == file + "\n]\n");
 }
 
+// Zeros, which mean that a block ends, are no reason to believe the half of a record before them.
+TEST_F(AggregateTest, NoLengthCutsARowInTwo) {
+  p.aggregates.least = 4096;
+  p.aggregates.fill = 0;
+  std::vector<uint64_t> ends;
+  for (int i = 0; i < 12; ++i) {
+    append({MessageKind{1}, static_cast<uint64_t>(i) + 1, dictionary("d", i / 4.0, "s", "text")});
+    ends.push_back(aggregate.state().bytes);
+  }
+  for (uint64_t bytes = 1; bytes <= ends.back(); ++bytes) {
+    VXReportingAggregate cut;
+    const bool ok = cut.restore({true, aggregate.state().aggregate, bytes}).ok();
+    const auto whole = std::ranges::count_if(ends, [&](uint64_t end) { return end <= bytes; });
+    EXPECT_EQ(cut.flatSize(), ok ? static_cast<std::size_t>(whole) : 0) << bytes;
+    EXPECT_TRUE(ok || std::ranges::find(ends, bytes) == ends.end());
+  }
+}
+
 TEST_F(AggregateTest, WhateverWasLeftIsRefusedOrRead) {
   p.aggregates.least = 4096;
   append(60);
@@ -213,6 +231,8 @@ TEST_F(AggregateTest, WhateverWasLeftIsRefusedOrRead) {
   std::vector<uint8_t> bytes = {255};  // in blocks of 4096
   for (const auto& block : p.aggregates.find(state.aggregate, state.bytes))
     bytes.insert(bytes.end(), block.bytes, block.bytes + block.size);
+  const uint8_t keyTwice[] = {255, 1, 0, 2, 0x61, 'a', 0x61, 'a', 5, 1, 2};
+  LLVMFuzzerTestOneInput(keyTwice, sizeof keyTwice);
   for (int i = 0; i < 3000; ++i) {
     std::vector<uint8_t> changed(bytes.begin(), bytes.begin() + 1 + below(bytes.size()));
     for (uint32_t changes = below(4); changes > 0; --changes)

@@ -74,7 +74,7 @@ TEST_F(EventPairingTest, YoungEventWaitsOneBatchForItsMessage) {
   EXPECT_EQ(pairing.heldSince(), std::nullopt);
   pairing.hold(batch, 10, Monotonic(5s));
   EXPECT_EQ(pairing.heldSince(), Monotonic(5s));
-  EXPECT_EQ(EventPairing::unwrittenRows(batch, 0), 2u);
+  EXPECT_EQ(EventPairing::unwrittenRows(batch, 0).lost, 2u);
   nextBatch();
   EXPECT_EQ(pairing.heldSince(), std::nullopt);
   add(message(late));
@@ -82,7 +82,7 @@ TEST_F(EventPairingTest, YoungEventWaitsOneBatchForItsMessage) {
   EXPECT_EQ(eventOf(2), 0u);
   pairing.hold(batch, 10, Monotonic(6s));
   EXPECT_EQ(pairing.heldSince(), std::nullopt);  // not twice
-  EXPECT_EQ(EventPairing::unwrittenRows(batch, 0), 3u);
+  EXPECT_EQ(EventPairing::unwrittenRows(batch, 0).lost, 3u);
 }
 
 TEST_F(EventPairingTest, WhatIsWrittenIsNeitherLostNorKept) {
@@ -94,9 +94,9 @@ TEST_F(EventPairingTest, WhatIsWrittenIsNeitherLostNorKept) {
   addOf(recorded(), RelayEndRecord{row});
   addOf(batch[0].cause.ticket, event("e", a, a));
   pairing.pair(batch);
-  EXPECT_EQ(EventPairing::unwrittenRows(batch, 0), 4u);
-  EventPairing::markWritten(batch, 0, 2);
-  EXPECT_EQ(EventPairing::unwrittenRows(batch, 2), 2u);  // with the early one
+  EXPECT_EQ(EventPairing::unwrittenRows(batch, 0).recorded, 4u);
+  EXPECT_EQ(EventPairing::markWritten(batch, 0, 2), 0u);
+  EXPECT_EQ(EventPairing::unwrittenRows(batch, 2).recorded, 2u);  // with the early one
   EXPECT_EQ(std::get<RelayMessageRecord>(batch[1].what).payload.identity(), nullptr);
   EXPECT_NE(std::get<RelayMessageRecord>(batch[2].what).payload.identity(), nullptr);
   EXPECT_FALSE(batch[4].cause.ticket);

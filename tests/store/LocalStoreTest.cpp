@@ -170,12 +170,29 @@ TEST_F(LocalStoreTest, RowsThatCannotBeWrittenByTheDeadlineAreCountedAndTold) {
       "CREATE TRIGGER refuse BEFORE INSERT ON relay_messages BEGIN SELECT RAISE(FAIL, 'no'); END");
   const auto relay = session();
   for (int i = 0; i < 5; ++i) relay->send(1, 1, numbered(i));
+  {
+    const Cause cause{recorded(), {}};
+    const CauseScope scope(cause);
+    for (int i = 0; i < 2; ++i) relay->send(1, 1, numbered(i));
+  }
   waitUntil([&] { return store->counters().writeFailures > 0; });
   std::promise<std::optional<Error>> flushed;
   relay->flush([&](std::optional<Error> error) { flushed.set_value(std::move(error)); });
-  EXPECT_FALSE(close(0s));
+  store->stopAccepting();
+  const LocalStore::Counters counters = store->counters();
+  const uint64_t before = store->progress();
+  waitUntil([&] { return store->counters().writeFailures > counters.writeFailures; });
+  EXPECT_EQ(store->progress(), before);
+  EXPECT_EQ(counters.unrecordedWaiting, 6u);  // with the session's
+  EXPECT_FALSE(store->waitUntilEnded(clock.monotonic()));
+  store->giveUp();
+  EXPECT_TRUE(store->waitUntilEnded(Monotonic::max()));
   EXPECT_TRUE(flushed.get_future().get());
-  waitUntil([&] { return store->counters().rowsLost == 6; });  // with the session's
+  EXPECT_EQ(store->counters().rowsLost, 6u);
+  EXPECT_EQ(store->counters().rowsLeft, 2u);
+  EXPECT_EQ(store->counters().unrecordedWaiting, 0u);
+  EXPECT_FALSE(close());
+  EXPECT_EQ(undone(), 1);
 }
 
 TEST_F(LocalStoreTest, DamageIsMovedAsideWithALedgerRow) {
@@ -326,7 +343,9 @@ TEST_F(LocalStoreTest, ReplayWritesWhatIsMissingAndNothingTwice) {
   EXPECT_EQ(store->epoch(), epoch);
   store->beginReplay({.first = 2, .sessionsFrom = 1});  // the first is found although it is older
   run(3);
-  store->endReplay();
+  std::promise<void> committed;
+  store->endReplay([&] { committed.set_value(); });
+  committed.get_future().get();
   power(3);
   EXPECT_TRUE(close());
   EXPECT_EQ(store->counters().rowsCommitted, 5u);

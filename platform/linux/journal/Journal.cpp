@@ -57,7 +57,8 @@ std::string Journal::adopt(const std::string& name) {
   const SegmentHeader header = opened.ok() ? opened->header : SegmentHeader{};
   if (opened.ok() && header.state == SegmentHeader::kFree) {
     folder_.remove(name);
-    return {};
+    // The process ended just then, or somebody emptied it.
+    return opened->blank ? name + " is blank; removed" : std::string();
   }
   std::string why = opened.ok() ? name + " is of another store" : opened.status().text();
   if (opened.ok() && header.epoch == options_.epoch) {

@@ -17,6 +17,8 @@ namespace {
 constexpr std::string_view kPrefix = "segment-";
 constexpr std::string_view kSuffix = ".vxj";
 constexpr std::string_view kAside = ".aside-";
+constexpr std::string_view kPart = ".part";
+constexpr std::string_view kCompanion = ".vxa";  // memory that the recorded state refers to
 constexpr char kAttempts[] = "attempts";
 
 std::string quoted(std::string_view verb, const std::string& path) {
@@ -126,13 +128,15 @@ Result<JournalFolder::Opened> JournalFolder::openSegment(const std::string& name
   if (got < 0) return Status::lastError(quoted("cannot read", path));
   const bool known = header.magic == SegmentHeader::kMagic;
   if (header.state == SegmentHeader::kFree && (known || header.magic == 0)) {
-    header = {};  // or its process ended before it was begun
+    opened.blank = got == 0;  // one that was allocated for later is of full size
+    header = {};
     return opened;
   }
   if (!known) return Status::failure(path + " is no journal segment");
   if (header.version != SegmentHeader::kVersion)
     return Status::failure(path + " is of version " + std::to_string(header.version));
-  if (header.checksum != checksumOf(header)) return Status::failure(path + " has a damaged header");
+  if (header.checksum != checksumOf(header) || header.state != SegmentHeader::kInUse)
+    return Status::failure(path + " has a damaged header");
   return opened;
 }
 
@@ -153,6 +157,11 @@ bool JournalFolder::setAside(const std::string& name) const {
   const uint64_t number = nextAside(path_, name.substr(0, name.find('-') + 1));
   const std::string as = name + std::string(kAside) + std::to_string(number);
   return renameat(fd_.get(), name.c_str(), fd_.get(), as.c_str()) == 0;
+}
+
+bool JournalFolder::copyAside(const std::string& name) const {
+  const uint64_t number = nextAside(path_, kPrefix);
+  return copySegment(name, *this, name + std::string(kAside) + std::to_string(number)).ok();
 }
 
 // -------------------------------------------------------------------------------------- attempts
@@ -187,27 +196,24 @@ Result<std::string> JournalFolder::moveAside(const std::string& path) {
 }
 
 // Under another name first: what has its name is whole.
-Status JournalFolder::copySegment(const std::string& name, const JournalFolder& to,
-                                  const std::string& as) const {
-  Result<Opened> source = openSegment(name, Access::Read);
-  if (!source.ok()) return source.status();
-  const std::string part = as + ".part";
-  to.remove(part);
-  Result<UniqueFd> target = to.createSegment(part);
-  if (!target.ok()) return target.status();
-  std::vector<uint8_t> bytes(kSegmentBytes);
-  std::size_t have = 0;
-  while (have < bytes.size()) {
-    const ssize_t got =
-        pread(source->fd.get(), bytes.data() + have, bytes.size() - have, static_cast<off_t>(have));
-    if (got < 0 && errno == EINTR) continue;
-    if (got < 0) return Status::lastError(quoted("cannot read", path_ + "/" + name));
-    if (got == 0) break;
-    have += static_cast<std::size_t>(got);
-  }
+Status JournalFolder::copyFile(int source, const JournalFolder& to, const std::string& as) const {
+  const std::string part = as + std::string(kPart);
   const std::string path = to.path_ + "/" + part;
-  Status status = writeAll(target->get(), bytes.data(), have, path);
-  if (status.ok() && fsync(target->get()) != 0)
+  to.remove(part);
+  UniqueFd target(openat(to.fd_.get(), part.c_str(),
+                         O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0600));
+  if (!target) return Status::lastError(quoted("cannot create", path));
+  std::vector<uint8_t> bytes(std::size_t{256} << 10);
+  Status status;
+  for (off_t at = 0; status.ok();) {
+    const ssize_t got = pread(source, bytes.data(), bytes.size(), at);
+    if (got < 0 && errno == EINTR) continue;
+    if (got < 0) status = Status::lastError("cannot read what is to become " + path);
+    if (got <= 0) break;
+    status = writeAll(target.get(), bytes.data(), static_cast<std::size_t>(got), path);
+    at += got;
+  }
+  if (status.ok() && fsync(target.get()) != 0)
     status = Status::lastError(quoted("cannot sync", path));
   if (status.ok() && renameat(to.fd_.get(), part.c_str(), to.fd_.get(), as.c_str()) != 0)
     status = Status::lastError(quoted("cannot rename", path));
@@ -215,23 +221,78 @@ Status JournalFolder::copySegment(const std::string& name, const JournalFolder& 
   return status;
 }
 
-Status JournalFolder::moveTo(const std::string& from, const std::string& to) {
+Status JournalFolder::copySegment(const std::string& name, const JournalFolder& to,
+                                  const std::string& as) const {
+  const Result<Opened> source = openSegment(name, Access::Read);
+  return source.ok() ? copyFile(source->fd.get(), to, as) : source.status();
+}
+
+// Files of others that lie here, under their names; those that are there are whole.
+Status JournalFolder::copyCompanions(const JournalFolder& to, std::vector<std::string>& copied,
+                                     const Function<void()>& onFile) const {
+  std::error_code error;
+  for (const auto& file : std::filesystem::directory_iterator(path_, error)) {
+    const std::string name = file.path().filename();
+    if (file.path().extension() != kCompanion) continue;
+    const UniqueFd source(
+        openat(fd_.get(), name.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
+    struct stat info {};
+    if (!source || fstat(source.get(), &info) != 0 || !S_ISREG(info.st_mode)) continue;
+    if (fstatat(to.fd_.get(), name.c_str(), &info, AT_SYMLINK_NOFOLLOW) != 0) {
+      if (Status done = copyFile(source.get(), to, name); !done.ok()) return done;
+    }
+    copied.push_back(name);
+    if (onFile) onFile();
+  }
+  return {};
+}
+
+std::vector<SegmentHeader> JournalFolder::headers() const {
+  std::vector<SegmentHeader> headers;
+  for (const std::string& name : segments()) {
+    const Result<Opened> opened = openSegment(name, Access::Read);
+    if (opened.ok() && opened->header.state == SegmentHeader::kInUse)
+      headers.push_back(opened->header);
+  }
+  return headers;
+}
+
+Status JournalFolder::moveTo(const std::string& from, const std::string& to,
+                             const Function<void()>& onSegment) {
   Result<JournalFolder> source = open(from, IfMissing::Fail);
   if (!source.ok()) return source.status();
   Result<JournalFolder> target = open(to, IfMissing::Create);
   if (!target.ok()) return target.status();
+  const std::vector<SegmentHeader> there = target->headers();
   std::vector<std::string> moved;
   uint64_t next = 1;
   for (const std::string& name : source->segments()) {
     const Result<Opened> opened = source->openSegment(name, Access::Read);
     if (!opened.ok()) continue;
+    if (opened->header.state == SegmentHeader::kFree) {
+      moved.push_back(name);
+      continue;
+    }
+    const bool copiedBefore = std::ranges::any_of(there, [&](const SegmentHeader& header) {
+      return header.epoch == opened->header.epoch && header.sequence == opened->header.sequence;
+    });
+    if (!copiedBefore) {
+      Status copied = source->copySegment(name, *target, target->freshSegment(next));
+      if (!copied.ok()) return copied;
+    }
     moved.push_back(name);
-    if (opened->header.state == SegmentHeader::kFree) continue;
-    Status copied = source->copySegment(name, *target, target->freshSegment(next));
+    if (onSegment) onSegment();
+  }
+  if (!moved.empty()) {
+    Status copied = source->copyCompanions(*target, moved, onSegment);
     if (!copied.ok()) return copied;
   }
   if (fsync(target->fd_.get()) != 0) return Status::lastError(quoted("cannot sync", to));
   for (const std::string& name : moved) source->remove(name);
+  // What earlier moves into this folder began.
+  std::error_code error;
+  for (const auto& file : std::filesystem::directory_iterator(from, error))
+    if (file.path().extension() == kPart) source->remove(file.path().filename());
   return {};
 }
 

@@ -5,6 +5,7 @@
 #include <string_view>
 #include <vector>
 
+#include "base/Function.h"
 #include "base/Status.h"
 #include "base/UniqueFd.h"
 #include "platform/linux/journal/JournalFormat.h"
@@ -34,13 +35,15 @@ class JournalFolder {
   struct Opened {
     UniqueFd fd;
     SegmentHeader header{};
+    bool blank = false;  // of no size
   };
   Result<Opened> openSegment(const std::string& name, Access access) const;
   // Allocated whole: a hole in a file system that has become full would be a SIGBUS.
   Result<UniqueFd> createSegment(const std::string& name) const;
   void remove(const std::string& name) const;
-  // Renames a file to name.aside-N; false when it could not.
+  // Renames a file to name.aside-N, or copies it; false when it could not.
   bool setAside(const std::string& name) const;
+  bool copyAside(const std::string& name) const;
 
   // Counts an attempt to replay what is here, before it begins: how many there were with this one.
   Result<uint32_t> beginAttempt() const;
@@ -48,12 +51,19 @@ class JournalFolder {
 
   // Renames a whole journal to path.aside-N, which it returns.
   static Result<std::string> moveAside(const std::string& path);
-  // Moves the segments in use into another folder (made if missing), also of another file system:
-  // they are removed here when all of them are durable there.
-  static Status moveTo(const std::string& from, const std::string& to);
+  // Moves the segments in use, and the aggregates' files with them, into another folder (made if
+  // missing), also of another file system: they are removed here when all of them are durable
+  // there. One that is there already (a move was cut short) is not moved again. `onSegment`: told
+  // after each.
+  static Status moveTo(const std::string& from, const std::string& to,
+                       const Function<void()>& onSegment = nullptr);
 
  private:
   JournalFolder(std::string path, UniqueFd fd) : path_(std::move(path)), fd_(std::move(fd)) {}
+  std::vector<SegmentHeader> headers() const;
+  Status copyFile(int source, const JournalFolder& to, const std::string& as) const;
+  Status copyCompanions(const JournalFolder& to, std::vector<std::string>& copied,
+                        const Function<void()>& onFile) const;
   Status copySegment(const std::string& name, const JournalFolder& to, const std::string& as) const;
   std::string path_;
   UniqueFd fd_;

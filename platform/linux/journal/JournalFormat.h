@@ -42,7 +42,7 @@ struct SegmentHeader {
   static constexpr uint64_t kMagic = 0x314C4E524A5856;  // "VXJRNL1"
   static constexpr uint32_t kVersion = 2;
   static constexpr uint32_t kFree = 0;
-  static constexpr uint32_t kInUse = 1;
+  static constexpr uint32_t kInUse = 0x5AC3965A;  // no flipped bit makes one of the other
 
   uint64_t magic;
   uint32_t version;

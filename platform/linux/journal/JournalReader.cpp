@@ -97,8 +97,10 @@ JournalReader::Segment JournalReader::readSegment(std::span<const uint8_t> bytes
     std::optional<Entry> entry = entryAt(bytes.subspan(at), header.sequence);
     const bool note = entry && entry->header.type == EntryType::Note;
     if (!entry || (note ? entry->header.call >= next : entry->header.call < next)) {
-      segment.tornBytes = bytes.size() - at;
-      return segment;
+      const std::size_t torn = at;
+      at = nextEntry(bytes, at + kEntryAlignment, header.sequence, next);
+      segment.tornBytes += at - torn;
+      continue;
     }
     if (!note) next = entry->header.call + 1;
     entry->offset = static_cast<uint32_t>(at);
@@ -106,6 +108,23 @@ JournalReader::Segment JournalReader::readSegment(std::span<const uint8_t> bytes
     at = std::min(at + padded(length), bytes.size());
   }
   return segment;
+}
+
+// Where the next call begins that is to be believed; the end when there is none. What an earlier
+// use of the file left has another sequence number, so that no checksum of it agrees.
+std::size_t JournalReader::nextEntry(std::span<const uint8_t> bytes, std::size_t at,
+                                     uint64_t sequence, uint64_t firstCall) {
+  for (std::size_t searched = 0; at + sizeof(EntryHeader) <= bytes.size(); at += kEntryAlignment) {
+    uint32_t length;
+    std::memcpy(&length, bytes.data() + at, sizeof length);
+    if (length < sizeof(EntryHeader) || length > bytes.size() - at) continue;
+    searched += length;
+    if (searched > kMostSearched) break;
+    const std::optional<Entry> entry = entryAt(bytes.subspan(at), sequence);
+    if (entry && entry->header.type != EntryType::Note && entry->header.call >= firstCall)
+      return at;
+  }
+  return bytes.size();
 }
 
 Result<JournalContents> JournalReader::read(const std::string& path, const JournalEpoch& epoch) {
@@ -139,6 +158,7 @@ Result<JournalContents> JournalReader::read(const std::string& path, const Journ
     }
     const Segment segment = readSegment(bytes);
     contents.tornBytes += segment.tornBytes;
+    if (segment.tornBytes > 0) contents.torn.push_back(source.name);
     contents.entries += segment.entries.size();
     for (const Entry& entry : segment.entries) {
       if (entry.header.type == EntryType::Note) {

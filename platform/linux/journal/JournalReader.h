@@ -36,14 +36,15 @@ struct JournalContents {
   std::vector<Record> records;       // by call number
   uint32_t base = 0;                 // the generation whose snapshot counts; 0: none does
   uint64_t entries = 0;              // read, also those that are not given
-  uint64_t tornBytes = 0;            // from entries that are not believed to their segments' ends
+  uint64_t tornBytes = 0;            // from entries that are not believed to the next that is
+  std::vector<std::string> torn;     // the files that they are in
   std::vector<std::string> refused;  // files that are not this journal's, and why
 };
 
 // Reads the folder of a process that has ended, or one that a journal was moved to. Believes no
 // length, checksum or dictionary before it has been checked: of a segment it gives the entries
-// before the first that is torn. Stateless; the caller's thread. Bounds: one segment's bytes beside
-// what it gives.
+// before and after what is torn. Stateless; the caller's thread. Bounds: one segment's bytes beside
+// what it gives; looking for an entry after what is torn ends after kMostSearched bytes.
 class JournalReader {
  public:
   // The base is the newest generation with a complete snapshot. It is given whole; of the calls
@@ -63,6 +64,11 @@ class JournalReader {
     std::size_t tornBytes = 0;
   };
   static Segment readSegment(std::span<const uint8_t> bytes);
+
+ private:
+  static constexpr std::size_t kMostSearched = std::size_t{64} << 20;
+  static std::size_t nextEntry(std::span<const uint8_t> bytes, std::size_t at, uint64_t sequence,
+                               uint64_t firstCall);
 };
 
 }  // namespace vx::lnx

@@ -29,10 +29,23 @@ uint32_t countReplay(const std::string& path) {
   return attempt.ok() ? *attempt : 1;
 }
 
+// The files themselves are used again, some time.
+void keepTorn(const std::string& path, const JournalContents& left,
+              std::vector<std::string>& complaints) {
+  const Result<JournalFolder> folder = JournalFolder::open(path, JournalFolder::IfMissing::Fail);
+  for (const std::string& name : left.torn) {
+    const bool kept = folder.ok() && folder->copyAside(name);
+    complaints.push_back(name + " is damaged: of " + std::to_string(left.tornBytes) +
+                         " bytes in all it cannot be said what was accepted" +
+                         (kept ? "; a copy is set aside" : "; it could not be copied"));
+  }
+}
+
 }  // namespace
 
-std::optional<JournalEpoch> epochOfJournal(const std::string& folder) {
-  const std::vector<SegmentHeader> headers = headersIn(folder);
+std::optional<JournalEpoch> epochOfJournal(const std::string& folder, const std::string& moved) {
+  std::vector<SegmentHeader> headers = headersIn(folder);
+  if (headers.empty()) headers = headersIn(moved);
   if (headers.empty()) return std::nullopt;
   return headers.back().epoch;
 }
@@ -40,14 +53,14 @@ std::optional<JournalEpoch> epochOfJournal(const std::string& folder) {
 Result<OpenedJournal> openJournal(JournalOptions options, const std::string& moved) {
   OpenedJournal opened;
   if (!headersIn(moved).empty()) {
-    if (const Status back = JournalFolder::moveTo(moved, options.folder); !back.ok())
-      opened.complaints.push_back(back.text());
+    const Status back = JournalFolder::moveTo(moved, options.folder);
+    if (!back.ok()) opened.complaints.push_back(back.text());
+    opened.movedStays = !back.ok();
   }
   const std::vector<SegmentHeader> headers = headersIn(options.folder);
-  for (const SegmentHeader& header : headers) {
-    // Of another store they say nothing, and harm nothing.
-    options.first.call = std::max(options.first.call, header.firstCall + kMaxEntriesPerSegment);
-  }
+  // Of another store they say nothing, and harm nothing.
+  for (const SegmentHeader& header : headers) options.first.goPast(header);
+  for (const SegmentHeader& header : headersIn(moved)) options.first.goPast(header);
   if (!headers.empty() && countReplay(options.folder) > kMostReplays) {
     Result<std::string> aside = JournalFolder::moveAside(options.folder);
     if (!aside.ok()) return aside.status();
@@ -56,9 +69,7 @@ Result<OpenedJournal> openJournal(JournalOptions options, const std::string& mov
     // Before the journal is opened: that sets aside what is not its own, and says so.
     Result<JournalContents> left = JournalReader::read(options.folder, options.epoch);
     if (left.ok()) opened.left = std::move(left).value();
-    if (opened.left.tornBytes > 0)
-      opened.complaints.push_back(std::to_string(opened.left.tornBytes) +
-                                  " bytes cannot be believed");
+    keepTorn(options.folder, opened.left, opened.complaints);
   }
   Result<std::unique_ptr<Journal>> journal = Journal::open(options, &opened.complaints);
   if (!journal.ok()) return journal.status();

@@ -15,13 +15,15 @@ namespace vx::lnx {
 // How many processes may end while they replay a journal, before it is believed to be the cause.
 inline constexpr uint32_t kMostReplays = 2;
 
-// The store that the calls in a journal belong to; none when there are none.
-std::optional<JournalEpoch> epochOfJournal(const std::string& folder);
+// The store that the calls in a journal belong to, or in one that was moved; none when there are
+// none.
+std::optional<JournalEpoch> epochOfJournal(const std::string& folder, const std::string& moved);
 
 struct OpenedJournal {
   std::unique_ptr<Journal> journal;
   JournalContents left;                 // to be replayed
   std::vector<std::string> complaints;  // what could not be believed
+  bool movedStays = false;              // it could not be taken back: its calls run another time
   std::string poisoned;                 // where one is now whose replays have all failed; or empty
 };
 

@@ -78,30 +78,34 @@ std::optional<Monotonic> EventPairing::heldSince() const {
   return held_.empty() ? std::nullopt : std::optional<Monotonic>(heldSince_);
 }
 
-void EventPairing::markWritten(StoreRecords& batch, std::size_t first, std::size_t last) {
+uint64_t EventPairing::markWritten(StoreRecords& batch, std::size_t first, std::size_t last) {
+  uint64_t unrecorded = 0;
   for (std::size_t i = first; i < last; ++i) {
     StoreRecord& record = batch[i];
     if (record.sharing == StoreRecord::Sharing::Shares) continue;  // when its message is
+    if (!record.cause.ticket && !record.makesNoRow()) ++unrecorded;
     record.cause = {};
     auto* message = std::get_if<RelayMessageRecord>(&record.what);
     if (message == nullptr) continue;
     message->payload = Payload();
     if (record.event == StoreRecord::kNone) continue;
-    batch[record.event].sharing = StoreRecord::Sharing::Written;
-    batch[record.event].cause = {};
+    StoreRecord& event = batch[record.event];
+    event.sharing = StoreRecord::Sharing::Written;
+    if (!event.cause.ticket) ++unrecorded;
+    event.cause = {};
   }
+  return unrecorded;
 }
 
-uint64_t EventPairing::unwrittenRows(const StoreRecords& batch, std::size_t first) {
-  uint64_t rows = 0;
+EventPairing::Unwritten EventPairing::unwrittenRows(const StoreRecords& batch, std::size_t first) {
+  Unwritten rows;
   for (std::size_t i = 0; i < batch.size(); ++i) {
     const StoreRecord& record = batch[i];
     if (record.makesNoRow()) continue;
     // An event before `first` may share the text of a message after it.
-    rows += record.sharing == StoreRecord::Sharing::Shares ||
-                    (i >= first && record.sharing != StoreRecord::Sharing::Written)
-                ? 1
-                : 0;
+    if (record.sharing == StoreRecord::Sharing::Shares ||
+        (i >= first && record.sharing != StoreRecord::Sharing::Written))
+      ++(record.cause.ticket ? rows.recorded : rows.lost);
   }
   return rows;
 }

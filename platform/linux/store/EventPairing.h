@@ -33,10 +33,15 @@ class EventPairing {
   std::optional<Monotonic> heldSince() const;
 
   // Records [first, last) and the events that share their text are committed. Lets go of their
-  // messages and of their calls, which are done if nothing else waits.
-  static void markWritten(StoreRecords& batch, std::size_t first, std::size_t last);
+  // messages and of their calls, which are done if nothing else waits. How many of their rows no
+  // journal knows of.
+  static uint64_t markWritten(StoreRecords& batch, std::size_t first, std::size_t last);
   // How many rows of the records from `first` on are not.
-  static uint64_t unwrittenRows(const StoreRecords& batch, std::size_t first);
+  struct Unwritten {
+    uint64_t recorded = 0;  // of calls that can be run again
+    uint64_t lost = 0;
+  };
+  static Unwritten unwrittenRows(const StoreRecords& batch, std::size_t first);
   // None of them will be: their calls are not done.
   static void abandon(StoreRecords& batch, std::size_t first);
 

@@ -35,8 +35,12 @@ void LocalStore::beginReplay(ReplayedCalls calls) {
   writer_.queue().runSoon([this, calls = std::move(calls)] { writer_.expectKnownRows(calls); });
 }
 
-void LocalStore::endReplay() {
+void LocalStore::endReplay(Function<void()> committed) {
   (void)writer_.queue().append(ReplayEndRecord(), 0);
+  FlushHandler flushed = [committed = std::move(committed)](const std::optional<Error>& error) {
+    if (!error) committed();
+  };
+  (void)writer_.queue().appendFlush(flushed);
   writer_.queue().setReplaying(false);
 }
 

@@ -43,16 +43,15 @@ class LocalStore final : public AnalyticsEventService, public PowerEventLog {
 
   // What is appended until endReplay() comes from recorded calls: rows of theirs that are there
   // already are not written again, and new ones bear the time of their call. Nothing else may be
-  // appended meanwhile.
+  // appended meanwhile. `committed`: told once all of it is, on the writer's thread; never when
+  // that does not happen.
   void beginReplay(ReplayedCalls calls);
-  void endReplay();
+  void endReplay(Function<void()> committed);
 
   // A row of the ledger; before start().
   void noteAtStart(LedgerNote note) { writer_.noteAtStart(std::move(note)); }
-  // A row of the ledger, with what is committed next.
-  void note(LedgerNote note) {
-    runSoon([this, note = std::move(note)] { writer_.noteAtStart(note); });
-  }
+  // A row of the ledger, with what is committed next. From any thread.
+  void note(LedgerNote note) { writer_.note(std::move(note)); }
   // Starts the writer. Logs, so the platform must be installed; what is appended before is kept.
   void start() { writer_.start(); }
 
@@ -80,6 +79,13 @@ class LocalStore final : public AnalyticsEventService, public PowerEventLog {
   // not be written by the deadline; counters() and the log say how many.
   bool close(Monotonic deadline) { return writer_.close(deadline); }
   Counters counters() const { return writer_.counters(); }
+  // The same in steps, for a stop that gives a slow disk more time: accepts nothing any more; waits
+  // (false: not yet); what is not committed by now stays with the journal, and who waits for it to
+  // be committed gets the error. progress() changes whenever something is committed.
+  void stopAccepting() { writer_.stopAccepting(); }
+  bool waitUntilEnded(Monotonic until) { return writer_.waitUntilEnded(until); }
+  void giveUp() { writer_.giveUp(); }
+  uint64_t progress() const { return writer_.progress(); }
 
  private:
   LocalStore(std::unique_ptr<StoreBeginning> beginning, const StoreOptions& options, Clock& clock);

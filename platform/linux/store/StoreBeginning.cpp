@@ -34,8 +34,9 @@ OpenedStore StoreBeginning::open(std::vector<LedgerNote>& notes) {
   return opened;
 }
 
-OpenedStore StoreBeginning::check(OpenedStore opened, std::vector<LedgerNote>& notes) {
-  StoreCheck check = quickCheck(opened.database.get());
+OpenedStore StoreBeginning::check(OpenedStore opened, std::vector<LedgerNote>& notes,
+                                  Function<bool()> goOn) {
+  StoreCheck check = quickCheck(opened.database.get(), std::move(goOn));
   if (check.fault == StoreFault::None) return opened;
   opened.database.reset();
   if (check.fault == StoreFault::Damaged)

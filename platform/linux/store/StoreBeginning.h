@@ -6,6 +6,7 @@
 #include <string>
 #include <vector>
 
+#include "base/Function.h"
 #include "base/Status.h"
 #include "base/UniqueFd.h"
 #include "platform/linux/journal/JournalFormat.h"
@@ -30,8 +31,9 @@ class StoreBeginning {
   // added to `notes`.
   OpenedStore open(std::vector<LedgerNote>& notes);
   // Checks what was opened. A damaged one is moved aside and a fresh one begun, with what can be
-  // read of it.
-  OpenedStore check(OpenedStore opened, std::vector<LedgerNote>& notes);
+  // read of it. `goOn`: see quickCheck().
+  OpenedStore check(OpenedStore opened, std::vector<LedgerNote>& notes,
+                    Function<bool()> goOn = nullptr);
   // After the files were lost that were open, before they are opened again: what lies in the place
   // of a deleted file is moved aside.
   Status settle(StoreLoss loss, std::vector<LedgerNote>& notes);

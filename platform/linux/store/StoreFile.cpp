@@ -125,11 +125,19 @@ OpenedStore openStoreDatabase(const std::string& path, const JournalEpoch& epoch
 
 namespace {
 
-StoreCheck checkOnce(sqlite3* database) {
+StoreCheck checkOnce(sqlite3* database, Function<bool()>& goOn) {
+  constexpr int kOperations = 20000;
+  const auto mustEnd = [](void* question) {
+    return (*static_cast<Function<bool()>*>(question))() ? 0 : 1;
+  };
+  sqlite3_progress_handler(database, goOn ? kOperations : 0, mustEnd, &goOn);
   Statement check(database, "PRAGMA quick_check(1)");
-  if (!check.row()) {
+  const bool ended = check.row();
+  sqlite3_progress_handler(database, 0, nullptr, nullptr);
+  if (!ended && sqlite3_errcode(database) == SQLITE_INTERRUPT)
+    return {Status::posix("the check was cut short", ECANCELED), StoreFault::Unusable};
+  if (!ended)
     return {Status::failure(sqlite3_errmsg(database)), faultOf(sqlite3_extended_errcode(database))};
-  }
   const std::string found = check.text(0);
   if (found == "ok") return {};
   // Not every finding says why a page could not be read.
@@ -140,10 +148,10 @@ StoreCheck checkOnce(sqlite3* database) {
 
 }  // namespace
 
-StoreCheck quickCheck(sqlite3* database) {
-  StoreCheck check = checkOnce(database);
+StoreCheck quickCheck(sqlite3* database, Function<bool()> goOn) {
+  StoreCheck check = checkOnce(database, goOn);
   // What is damaged is so a second time too.
-  return check.fault == StoreFault::Damaged ? checkOnce(database) : check;
+  return check.fault == StoreFault::Damaged ? checkOnce(database, goOn) : check;
 }
 
 Result<std::string> moveAside(const std::string& path) {

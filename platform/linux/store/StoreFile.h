@@ -4,6 +4,7 @@
 #include <cstdint>
 #include <string>
 
+#include "base/Function.h"
 #include "base/Status.h"
 #include "base/UniqueFd.h"
 #include "platform/linux/journal/JournalFormat.h"
@@ -43,7 +44,8 @@ struct StoreCheck {
   Status status;  // what `PRAGMA quick_check` found, or why it could not look
   StoreFault fault = StoreFault::None;
 };
-StoreCheck quickCheck(sqlite3* database);
+// Is cut short (ECANCELED) when `goOn`, which is asked every few milliseconds, says no.
+StoreCheck quickCheck(sqlite3* database, Function<bool()> goOn = nullptr);
 
 // What an SQLite error says about the file.
 StoreFault faultOf(int code);

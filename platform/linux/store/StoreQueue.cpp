@@ -53,7 +53,10 @@ bool StoreQueue::append(StoreRecord::What what, std::size_t bytes) {
       return false;
     }
     if (pending_.records.empty()) firstPending_ = clock_.monotonic();
-    pending_.records.push_back({time, std::move(what), std::move(cause)});
+    StoreRecord record(time, std::move(what), std::move(cause));
+    if (!record.cause.ticket && !record.makesNoRow()) [[unlikely]]
+      ++unrecorded_;
+    pending_.records.push_back(std::move(record));
     pending_.bytes += size;
     heldBytes_ += size;
     if (heldBytes_ > options_.queueBytes) congested_.store(true, std::memory_order_relaxed);
@@ -90,6 +93,15 @@ void StoreQueue::close(Monotonic deadline) {
     if (closing_) return;
     closing_ = true;
     closeDeadline_ = deadline;
+  }
+  wake_.notifyOne();
+}
+
+void StoreQueue::giveUp() {
+  gaveUp_ = true;
+  {
+    MutexLock lock(mutex_);
+    closeDeadline_ = std::min(closeDeadline_, clock_.monotonic());
   }
   wake_.notifyOne();
 }

@@ -57,8 +57,12 @@ class StoreQueue {
   // Work for the taking thread, before anything that waits to be written.
   void runSoon(Function<void()> job);
   bool isCongested() const { return congested_.load(std::memory_order_relaxed); }
-  // Nothing is accepted any more, and what waits is due. The first deadline counts.
+  // Nothing is accepted any more, and what waits is due. The first deadline counts, and giveUp().
   void close(Monotonic deadline);
+  void giveUp();
+  bool gaveUp() const { return gaveUp_.load(std::memory_order_relaxed); }
+  // Rows so far of which no journal knows.
+  uint64_t unrecordedRows() const { return unrecorded_.load(std::memory_order_relaxed); }
 
   enum class Turn : uint8_t {
     Nothing,  // not yet
@@ -105,6 +109,8 @@ class StoreQueue {
   bool closing_ GUARDED_BY(mutex_) = false;
   Monotonic closeDeadline_ GUARDED_BY(mutex_);
   std::atomic<bool> congested_{false};
+  std::atomic<bool> gaveUp_{false};
+  std::atomic<uint64_t> unrecorded_{0};
 };
 
 }  // namespace vx::lnx

@@ -6,6 +6,7 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <cerrno>
 #include <iterator>
 #include <utility>
 
@@ -65,18 +66,27 @@ StoreCounters StoreWriter::counters() const {
   return {.rowsCommitted = rowsCommitted_.load(),
           .commits = commits_.load(),
           .writeFailures = writeFailures_.load(),
-          .rowsLost = rowsLost_.load()};
+          .rowsLeft = rowsLeft_.load(),
+          .rowsLost = rowsLost_.load(),
+          .unrecordedWaiting = queue_.unrecordedRows() - unrecordedDone_.load()};
 }
 
 bool StoreWriter::close(Monotonic deadline) {
   queue_.close(deadline);
-  const auto limit =
-      std::chrono::time_point_cast<std::chrono::steady_clock::duration>(deadline + kCloseMargin);
+  return waitUntilEnded(deadline + kCloseMargin) && rowsLost_.load() == 0;
+}
+
+bool StoreWriter::waitUntilEnded(Monotonic until) {
+  const auto limit = std::chrono::time_point_cast<std::chrono::steady_clock::duration>(until);
   MutexLock lock(mutex_);
   while (!finished_ && thread_.joinable()) {
     if (!ended_.waitUntil(mutex_, limit) && !finished_) return false;
   }
-  return rowsLost_.load() == 0;
+  return true;
+}
+
+void StoreWriter::note(LedgerNote note) {
+  queue_.runSoon([this, note = std::move(note)] { notes_.push_back(note); });
 }
 
 void StoreWriter::threadMain() {
@@ -104,13 +114,21 @@ void StoreWriter::runJobs() {
 
 Status StoreWriter::begin() {
   if (open_) return {};
+  if (queue_.gaveUp()) return Status::failure("the store was not begun in time");
   std::vector<LedgerNote> notes;
   if (lost_ != StoreLoss::None) {
     if (Status settled = beginning_->settle(lost_, notes); !settled.ok()) return settled;
     lost_ = StoreLoss::None;
   }
   if (unchecked_.database == nullptr) unchecked_ = beginning_->open(notes);
-  if (unchecked_.status.ok()) unchecked_ = beginning_->check(std::move(unchecked_), notes);
+  if (unchecked_.status.ok()) {
+    // It may take long: who waits for an answer gets it meanwhile, and a stop need not wait.
+    unchecked_ = beginning_->check(std::move(unchecked_), notes, [this] {
+      ++progress_;
+      runJobs();
+      return !queue_.gaveUp();
+    });
+  }
   report(std::move(notes));
   if (unchecked_.database == nullptr) return unchecked_.status;
   if (unchecked_.epoch != epoch_) {
@@ -243,7 +261,7 @@ void StoreWriter::onCommitted(StoreBatch& batch, std::size_t first, std::size_t 
     backoff_ = {};
     VX_LOG(nullptr, Error, "the store can be written again; nothing was lost");
   }
-  EventPairing::markWritten(batch.records, first, last);
+  unrecordedDone_ += EventPairing::markWritten(batch.records, first, last);
   for (std::size_t i = first; replayFrom_ && i < last; ++i) {
     if (!std::holds_alternative<ReplayEndRecord>(batch.records[i].what)) continue;
     replayFrom_.reset();
@@ -262,8 +280,10 @@ void StoreWriter::onCommitted(StoreBatch& batch, std::size_t first, std::size_t 
 }
 
 void StoreWriter::onLost(StoreBatch& batch, std::size_t first, const Status& why) {
-  const uint64_t lost = EventPairing::unwrittenRows(batch.records, first);
-  rowsLost_ += lost;
+  const EventPairing::Unwritten unwritten = EventPairing::unwrittenRows(batch.records, first);
+  rowsLeft_ += unwritten.recorded;
+  rowsLost_ += unwritten.lost;
+  unrecordedDone_ += unwritten.lost;
   EventPairing::abandon(batch.records, first);
   lossError_ = why.error();
   for (std::size_t i = first; i < batch.records.size(); ++i) {
@@ -272,8 +292,11 @@ void StoreWriter::onLost(StoreBatch& batch, std::size_t first, const Status& why
     else if (auto* opening = std::get_if<RelayOpenRecord>(&batch.records[i].what))
       opening->row->hasLost = true;
   }
-  VX_LOG(nullptr, Error, "the store could not be written before the end: %llu rows are lost (%s)",
-         static_cast<unsigned long long>(lost), why.text().c_str());
+  VX_LOG(nullptr, Error,
+         "the store could not be written before the end (%s): %llu rows wait in the journal, %llu "
+         "are lost",
+         why.text().c_str(), static_cast<unsigned long long>(unwritten.recorded),
+         static_cast<unsigned long long>(unwritten.lost));
   release(batch, batch.bytes);
   for (const StoreFlush& flush : batch.flushes) flush.handler(why.error());
 }

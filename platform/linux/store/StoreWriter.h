@@ -28,7 +28,10 @@ struct StoreCounters {
   uint64_t rowsCommitted = 0;
   uint64_t commits = 0;
   uint64_t writeFailures = 0;
-  uint64_t rowsLost = 0;  // only at an end with a store that cannot be written
+  // Only at an end with a store that cannot be written: the journal has their calls, or not.
+  uint64_t rowsLeft = 0;
+  uint64_t rowsLost = 0;
+  uint64_t unrecordedWaiting = 0;  // rows of which no journal knows, neither committed nor lost
 };
 
 // Owned by the local store. The public functions are thread-safe; everything private belongs to the
@@ -52,8 +55,13 @@ class StoreWriter {
 
   StoreQueue& queue() { return queue_; }
   const StoreQueue& queue() const { return queue_; }
-  // See LocalStore::close.
+  // See LocalStore.
   bool close(Monotonic deadline);
+  void stopAccepting() { queue_.close(Monotonic::max()); }
+  bool waitUntilEnded(Monotonic until);
+  void giveUp() { queue_.giveUp(); }
+  uint64_t progress() const { return progress_.load() + commits_.load(); }
+  void note(LedgerNote note);
   StoreCounters counters() const;
   // As found by the constructor; see LocalStore.
   const JournalEpoch& epoch() const { return epoch_; }
@@ -100,7 +108,10 @@ class StoreWriter {
   std::atomic<uint64_t> rowsCommitted_{0};
   std::atomic<uint64_t> commits_{0};
   std::atomic<uint64_t> writeFailures_{0};
+  std::atomic<uint64_t> rowsLeft_{0};
   std::atomic<uint64_t> rowsLost_{0};
+  std::atomic<uint64_t> unrecordedDone_{0};  // committed or lost
+  std::atomic<uint64_t> progress_{0};        // besides commits
   Mutex mutex_;
   CondVar ended_;
   bool finished_ GUARDED_BY(mutex_) = false;
