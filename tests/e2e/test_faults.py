@@ -21,6 +21,8 @@ class Faults(DaemonTest):
         for c in crowd:
             c.close()
         d.wait_until(lambda: d.log().count("removing") >= len(crowd) - refused, "the crowd has gone")
+        d.process.send_signal(signal.SIGUSR1)
+        d.wait_until(lambda: f" refused_connections={refused} " in d.log(), "the service accounts for itself")
         self.assert_unharmed(d)
 
     def test_sigterm_with_a_hundred_started_sessions(self):
@@ -35,12 +37,17 @@ class Faults(DaemonTest):
         self.assertEqual(d.rows("SELECT category, count(*) FROM relay_messages GROUP BY 1"), [(3, 100), (0xFFFF, 100)])
         self.assertFalse(os.path.exists(d.socket_path))
 
-    def test_what_is_in_use_is_named(self):
+    def test_what_is_in_use_or_unusable_is_named(self):
         d = self.daemon()
-        for changed in ({}, {"RUNTIME_DIRECTORY": d.folder + "/log"}):  # the socket, and the store
-            second = subprocess.run([DAEMON], env=dict(d.environment, **changed), stderr=subprocess.PIPE, timeout=PATIENCE)
+        free = {"RUNTIME_DIRECTORY": d.folder + "/log"}
+        for changed, said in (({}, "another .*RUNTIME_"), (free, "another .*STATE_"),
+                              ({"RUNTIME_DIRECTORY": d.log_path}, "service.lock: Not a directory"),
+                              (dict(free, STATE_DIRECTORY="/proc/x"), r"/proc/x: .* \(set STATE_DIRECTORY"),
+                              (dict(free, STATE_DIRECTORY=d.log_path), r"Not a directory \(set STATE_DIRECTORY")):
+            second = subprocess.run([DAEMON], env=dict(d.environment, **changed), stderr=subprocess.PIPE, text=True,
+                                    timeout=PATIENCE)
             self.assertEqual(second.returncode, 1)
-            self.assertIn(b"another", second.stderr)
+            self.assertRegex(second.stderr, r"^<3>vxreportingd: .*" + said)
         self.assert_unharmed(d)
 
     def test_killed_and_started_again(self):
@@ -70,9 +77,11 @@ class Faults(DaemonTest):
             with open(wrapper, "w") as f:
                 f.write(f'#!/bin/sh\nLISTEN_PID=$$ LISTEN_FDS=1 exec "{DAEMON}"\n')
             os.chmod(wrapper, 0o755)
-            d = self.daemon(folder=folder, wait=False, environment={"NOTIFY_SOCKET": folder + "/notify"}, program=wrapper,
+            d = self.daemon(folder=folder, wait=False, program=wrapper,
+                            environment={"NOTIFY_SOCKET": folder + "/notify", "WATCHDOG_USEC": "600000000"},
                             preexec=lambda: (os.dup2(listener.fileno(), 3), os.set_inheritable(3, True)))
             self.assertIn(b"READY=1", notify.recv(4096))
+            self.assertIn(b"WATCHDOG=1", notify.recv(4096))
             self.assert_unharmed(d)
             self.assertEqual(d.stop(), 0)
             self.assertIn(b"STOPPING=1", notify.recv(4096))

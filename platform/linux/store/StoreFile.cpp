@@ -40,14 +40,12 @@ bool isDamage(int code) {
 }  // namespace
 
 Result<UniqueFd> lockStore(const std::string& directory) {
+  constexpr std::string_view kHint = "set STATE_DIRECTORY to a folder that can be written";
   if (mkdir(directory.c_str(), 0750) != 0 && errno != EEXIST)
-    return Status::lastError("cannot create the state directory " + directory);
+    return Status::lastError("cannot create the state directory " + directory).withHint(kHint);
   const std::string path = directory + "/telemetry.lock";
   UniqueFd lock(::open(path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW, 0640));
-  if (!lock) {
-    return Status::lastError("cannot open " + path)
-        .withHint(" (set STATE_DIRECTORY to a folder that can be written)");
-  }
+  if (!lock) return Status::lastError("cannot open " + path).withHint(kHint);
   if (flock(lock.get(), LOCK_EX | LOCK_NB) != 0) {
     return Status::failure("another vxreportingd uses the store in " + directory +
                            "; stop it, or set STATE_DIRECTORY to a folder of its own");
