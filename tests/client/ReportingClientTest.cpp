@@ -99,8 +99,6 @@ TEST_F(ReportingClientTest, AHeldStartOutlivesManyLaterCalls) {
 TEST_F(ReportingClientTest, EveryBlockingFormMakesItsCallAndReadsItsAnswer) {
   connect();
   const auto said = [](const ClientStatus& status, const std::string& value = "ok") {
-    if (status.code == Code::ReportingError)
-      return status.domain + " " + std::to_string(status.wireCode);
     return status.ok() ? value : status.code == Code::Refused ? "refused" : status.text;
   };
   const auto shown = [&](const auto& r) { return said(r.status, testing::PrintToString(r.value)); };
@@ -113,7 +111,8 @@ TEST_F(ReportingClientTest, EveryBlockingFormMakesItsCallAndReadsItsAnswer) {
     return said(r.status, std::to_string(r.value.reporterID * 10 + r.value.serviceType));
   };
   const Payload valid = PayloadBuilder().set("reporterID", 7).set("serviceType", 9).build();
-  const Payload error = PayloadBuilder().set("code", 9).set("domain", "d").build();
+  const Payload error =
+      PayloadBuilder().set("code", 9).set("domain", "d").set("reason", "why").build();
   const auto bytes = [](const Payload& p) { return Bytes(p.encoded().begin(), p.encoded().end()); };
   const std::string sent = " 6 {gain=0.5,on=1} 134217733 6 null";
   const struct {
@@ -137,7 +136,7 @@ TEST_F(ReportingClientTest, EveryBlockingFormMakesItsCallAndReadsItsAnswer) {
        [&] {
          return said(client->sendMessage(Payload(), 0xFFFFFFFF, 65535, {7, -1}));
        },
-       "d 9", " 6 {} 4294967295 65535 (7,-1)"},
+       "the service refused the message (d, code 9): why", " 6 {} 4294967295 65535 (7,-1)"},
       {{0xf4}, [&] { return shown(client->stopReportingSession(7)); }, "false", " 7 7"},
       {{0xf5}, [&] { return shown(client->destroyReportingSession(7)); }, "true", " 8 7"},
       {{0x82, 0x20, 0x18, 42}, all, "{ -1, 42 }", " 10"},
@@ -195,10 +194,15 @@ TEST_F(ReportingClientTest, AServiceThatGreetsOtherwiseIsNotConnected) {
     EXPECT_FALSE(lone.isConnected());
     EXPECT_THAT(status.text, HasSubstr(reason));
   }
-  EXPECT_EQ(lone.adopt(dial(service, {}), kShort).code, Code::TimedOut);
+  EXPECT_THAT(lone.connect(std::string(108, 'x')).text, HasSubstr("too long"));
+  EXPECT_THAT(lone.connect(std::string(107, 'x')).text, HasSubstr("cannot connect to xx"));
+  EXPECT_THAT(lone.reconnect().text, HasSubstr("cannot connect to xx"));
+  for (int i = 0; i < 2; ++i)
+    EXPECT_EQ(lone.adopt(dial(service, {5, 0}), kShort).code, Code::TimedOut);
   EXPECT_FALSE(lone.isConnected());
   service.texts();
   EXPECT_TRUE(service.ended()) << "the descriptor is given back";
+  EXPECT_TRUE(lone.adopt(dial(service)).ok()) << "nothing is left of the one before";
 }
 
 TEST_F(ReportingClientTest, TheEndOfTheConnectionFailsEveryCallOnce) {
@@ -219,7 +223,7 @@ TEST_F(ReportingClientTest, TheEndOfTheConnectionFailsEveryCallOnce) {
   };
   for (const auto& [bytes, why] : ends) {
     for (const bool writing : {false, true}) {  // into a socket without a reader
-      connect();
+      connect({}, hello(1, uint64_t{1} << 40));
       create(1, 3);
       ASSERT_TRUE(client->flush().ok());
       service.write(yes(2) + bytes);
