@@ -1,5 +1,6 @@
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <atomic>
 #include <chrono>
 #include <latch>
@@ -7,6 +8,7 @@
 #include <thread>
 #include <vector>
 
+#include "platform/linux/device/KernelRandom.h"
 #include "platform/linux/execution/Executor.h"
 #include "platform/linux/execution/SystemThreading.h"
 #include "tests/fakes/FakePlatform.h"
@@ -121,6 +123,10 @@ TEST_F(ExecutorTest, BlockedQueuesDelayNobodyAndLowWaterIsToldWhenTheyGoOn) {
   release.count_down();
   EXPECT_TRUE(executor.drain(soon()));
   EXPECT_EQ(done, 200);
+  std::atomic<bool> ran{false};
+  executor.background().async([&] { std::this_thread::sleep_for(20ms), ran = true; });
+  EXPECT_TRUE(executor.drain(soon()));
+  EXPECT_TRUE(ran);
   EXPECT_EQ(told, 1);
 }
 
@@ -182,6 +188,13 @@ TEST(RunLoopTest, TimersFireInOrderOfTimeAndMoveAndGoFromOtherThreads) {
   loop->runUntilEmpty();
   other.join();
   EXPECT_EQ(fired, (std::vector<int>{1, 2, 3}));
+}
+
+TEST(KernelRandomTest, DrawsNumbersBelowTheirBound) {
+  KernelRandom random;
+  uint32_t most = random.below(0) + random.below(1);
+  for (int i = 0; i < 5000; ++i) most = std::max(most, random.below(60));
+  EXPECT_EQ(most, 59u);
 }
 
 TEST(FreedMemory, GoesBackInOneStepTwoSecondsAfterAMegabyteWasFreed) {
