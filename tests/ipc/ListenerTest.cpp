@@ -86,6 +86,7 @@ class ListenerTest : public IpcTest, public ServiceListenerDelegate {
 
 TEST_F(ListenerTest, AnybodyMayConnectAndNothingIsLeftBehind) {
   write("run/service.socket", "left behind");
+  write("run/service.lock", "1234567890123");  // more than a pid has
   SocketListener second(loop_, executor_, clock_, options);
   const std::string refusals[][2] = {
       {"/run", "another vxreportingd (pid " + std::to_string(getpid()) + ") serves "},

@@ -80,6 +80,7 @@ TEST_F(SessionTest, ARestartIsAWholeLifeAgain) {
 TEST_F(SessionTest, RelaySessionCarriesWhatTheSetUpTookAndTestSessionsHaveNone) {
   for (const auto& [type, name] : {std::pair(ServiceType{7}, "longformaudio"), {12, "apiusage"}}) {
     const auto s = make(type);
+    EXPECT_FALSE(s->shouldReportOrientation()) << "not on this build";
     s->start();
     s->setServiceType(3);  // too late for the names
     // In time: the set-up holds the dictionary itself.
@@ -100,6 +101,7 @@ TEST_F(SessionTest, RelaySessionCarriesWhatTheSetUpTookAndTestSessionsHaveNone) 
     EXPECT_EQ(s->vyrReportingSession(), p.vyr.sessions.back());
   }
   EXPECT_EQ(p.queues.blockingScopes, 2);
+  EXPECT_EQ(p.log.registrations.size(), 3u) << "one for all sessions";
   mark();
   const auto test = startedSession(11);
   test->sendMessage(message, 3, 1, nullptr);
@@ -220,6 +222,11 @@ TEST_F(OrientationTest, HandlersComeAndGoInOrderWhereAllThreeConditionsHold) {
   mark();
   s->stop();
   EXPECT_EQ(gained({"register"}).size(), 2u);
+  s->start();
+  s->setServiceType(3);
+  mark();
+  s->stop();
+  EXPECT_THAT(gained({"register"}), IsEmpty()) << "asked with the type of the moment";
   p.services.deviceHandlers.clear();
   p.services.interfaceHandlers.clear();
   p.services.deviceClass = 6;
