@@ -197,8 +197,8 @@ TEST_F(ReportingClientTest, AServiceThatGreetsOtherwiseIsNotConnected) {
   EXPECT_THAT(lone.connect(std::string(108, 'x')).text, HasSubstr("too long"));
   EXPECT_THAT(lone.connect(std::string(107, 'x')).text, HasSubstr("cannot connect to xx"));
   EXPECT_THAT(lone.reconnect().text, HasSubstr("cannot connect to xx"));
-  for (int i = 0; i < 2; ++i)
-    EXPECT_EQ(lone.adopt(dial(service, {5, 0}), kShort).code, Code::TimedOut);
+  for (const Bytes& half : {Bytes{5, 0}, Bytes()})
+    EXPECT_EQ(lone.adopt(dial(service, half), kShort).code, Code::TimedOut);
   EXPECT_FALSE(lone.isConnected());
   service.texts();
   EXPECT_TRUE(service.ended()) << "the descriptor is given back";
