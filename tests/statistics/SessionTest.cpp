@@ -161,8 +161,10 @@ TEST_F(SessionTest, SinglesAreTakenAsTheyAreAndThoseOfAlarmsSpreadOverAMinute) {
   EXPECT_EQ(answer, p.vyr.sendError);
   EXPECT_EQ(p.log.lines.back(), "vxrr error sendOneMessageWithSessionInfo broken (x, code 5)");
   p.vyr.sendError.reset();
+  VXReportingSession::sendSingleMessage(dictionary("d e", 1), 1, 1, 5, message, nullptr);
   p.queues.advance(1ms);
-  const auto& single = p.vyr.oneOffs.at(0);
+  EXPECT_EQ(p.vyr.oneOffs.at(0).payload.text(), "{d_e=1}");
+  const auto& single = p.vyr.oneOffs.at(1);
   EXPECT_EQ(single.category, 7);
   EXPECT_EQ(single.payload.text(), "{a_b_c=1}");
   EXPECT_EQ(single.userInfo.text(), "{clientName=com.quorvel.sonik,serviceName=alarms}");
