@@ -209,17 +209,13 @@ TEST_F(ReportingClientTest, TheEndOfTheConnectionFailsEveryCallOnce) {
   const std::pair<Bytes, const char*> ends[] = {
       {{}, "the service went away"},
       {frame(3, nullptr, 1, "a frame was broken"), "a frame was broken"},
-      {{0xFF, 0xFF, 0xFF, 0xFF}, "the service sent"},                      // beyond every limit
-      {{0, 0, 0, 0}, "the service sent"},                                  // an empty frame
-      {framed({0x83, 0x02, 0x01}), "the service sent"},                    // an array cut short
-      {frame(2, 1), "the service sent"},                                   // no value
-      {framed({0x83, 0x02, 0x01, 0xf5, 0x00}), "the service sent"},        // bytes after the array
-      {framed({0x9f, 0x02, 0x01, 0xf5, 0xff}), "the service sent"},        // an indefinite length
-      {frame(99, 1, true), "the service sent"},                            // an unknown kind
-      {frame("x", 1, true), "the service sent"},                           // no integer
-      {framed({0x80}), "the service sent"},                                // no kind
-      {framed({0x83, 0x02, 0x01, 0x62, 0xc3, 0x28}), "the service sent"},  // not UTF-8
-      {hello(1), "the service sent"},                                      // a second one
+      {{0xFF, 0xFF, 0xFF, 0xFF}, "the service sent"},  // beyond every limit
+      {{0, 0, 0, 0}, "the service sent"},              // an empty frame
+      {frame(2, 1), "the service sent"},               // no value
+      {frame(99, 1, true), "the service sent"},        // an unknown kind
+      {frame("x", 1, true), "the service sent"},       // no integer
+      {framed({0x80}), "the service sent"},            // no kind
+      {hello(1), "the service sent"},                  // a second one
   };
   for (const auto& [bytes, why] : ends) {
     for (const bool writing : {false, true}) {  // into a socket without a reader

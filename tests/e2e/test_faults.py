@@ -6,9 +6,11 @@ from harness import *
 
 class Faults(DaemonTest):
     def test_descriptor_exhaustion(self):
-        d = self.daemon(preexec=lambda: resource.setrlimit(resource.RLIMIT_NOFILE, (48, 48)))
+        d = self.daemon("[relay]\nbackends = []\ntypo = 1\n",
+                        preexec=lambda: resource.setrlimit(resource.RLIMIT_NOFILE, (48, 48)))
         first = d.client()
         first.started(5)
+        d.wait_until(lambda: "No backends found" in d.log() and "relay.typo: unknown" in d.log(), "the relay is looked for")
         crowd, refused = [], 0
         for _ in range(80):
             crowd.append(c := d.client(hello=False))

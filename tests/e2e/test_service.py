@@ -72,13 +72,3 @@ class Service(DaemonTest):
         self.assertEqual(d.rows("SELECT count(DISTINCT payload) FROM relay_messages JOIN relay_sessions s"
                                 " ON s.id = relay_session AND session_id = json_extract(payload, '$.client')"),
                          [(clients * messages,)])
-
-    def test_no_back_ends_ends_the_wait_with_dropped_messages(self):
-        d = self.daemon(config="[relay]\nbackends = []\ntypo = 1\n")
-        self.assertIn("relay.typo: unknown key", d.log())
-        c = d.client()
-        c.started(1)
-        c.call(SEND, {"x": 1}, 4, 2, None)
-        d.wait_until(lambda: "No valid VyrReportingSession" in d.log(), "the message was dropped")
-        self.assertEqual(d.stop(), 0)
-        self.assertEqual(d.rows("SELECT count(*) FROM relay_messages"), [(0,)])

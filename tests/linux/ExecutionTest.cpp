@@ -55,6 +55,7 @@ TEST_F(ExecutorTest, SleepingLoopIsWokenOncePerSleepAndRunsInOrder) {
 TEST_F(ExecutorTest, DelayedWorkJoinsInOrderOfItsTimeAndKeepsItsQueue) {
   const Monotonic start = std::chrono::steady_clock::now();
   std::vector<int> ran;
+  std::latch done(2);
   Queue queue = utility();
   const WorkQueue& q = *queue;
   queue->asyncAfter(30ms, [&] {
@@ -62,13 +63,13 @@ TEST_F(ExecutorTest, DelayedWorkJoinsInOrderOfItsTimeAndKeepsItsQueue) {
     EXPECT_TRUE(q.isCurrent());
     EXPECT_FALSE(executor.background().isCurrent());
     ran.push_back(3);
+    done.count_down();
   });
   queue->asyncAfter(10ms, [&] { ran.push_back(1); });
   queue->asyncAfter(20ms, [&] { ran.push_back(2); });
   queue->async([&] { ran.push_back(0); });
   EXPECT_FALSE(queue->isCurrent());
   queue.reset();
-  std::latch done(1);
   executor.background().asyncAfter(31ms, [&] {
     EXPECT_TRUE(executor.background().isCurrent());
     done.count_down();
