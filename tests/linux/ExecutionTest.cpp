@@ -179,12 +179,12 @@ TEST(RunLoopTest, TimersFireInOrderOfTimeAndMoveAndGoFromOtherThreads) {
   std::latch running(1);
   const auto far = threading.makeTimer(1h, [&] { fired.push_back(3); });
   const auto gone = threading.makeTimer(1h, [] { FAIL(); });
+  const auto first = threading.makeTimer(1ms, [&] { fired.push_back(1); });
   const auto second = threading.makeTimer(2ms, [&] {
     fired.push_back(2);
     running.count_down();
     throw std::runtime_error("leaves the loop");
   });
-  const auto first = threading.makeTimer(1ms, [&] { fired.push_back(1); });
   for (const auto& timer : {far, gone, second, first}) loop->attach(timer);
   std::thread other([&] {
     running.wait();
