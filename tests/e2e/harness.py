@@ -5,6 +5,7 @@ are checked against each other.
 """
 import contextlib
 import os
+import pathlib
 import shutil
 import signal
 import socket
@@ -35,8 +36,7 @@ def frame(*items):
 
 
 def replace(path, text):
-    with open(path + ".new", "w") as f:
-        f.write(text)
+    pathlib.Path(path + ".new").write_text(text)
     os.rename(path + ".new", path)
 
 
@@ -173,8 +173,7 @@ class Daemon:
         return c
 
     def log(self):
-        with open(self.log_path, errors="replace") as f:
-            return f.read()
+        return pathlib.Path(self.log_path).read_text(errors="replace")
 
     def summaries(self):
         """The summary files' paths, oldest first."""

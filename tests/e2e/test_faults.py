@@ -27,18 +27,6 @@ class Faults(DaemonTest):
         d.wait_until(lambda: f" refused_connections={refused} " in d.log(), "the service accounts for itself")
         self.assert_unharmed(d)
 
-    def test_sigterm_with_a_hundred_started_sessions(self):
-        d = self.daemon()
-        clients = [d.client() for _ in range(10)]
-        for reporter in range(1, 101):
-            clients[reporter % 10].started(reporter, 8)
-            clients[reporter % 10].post(SEND, {"n": reporter}, 3, 0, [reporter])
-        self.assertEqual(d.stop(), 0)
-        for c in clients:
-            self.assertTrue(c.until_closed().goodbye)
-        self.assertEqual(d.rows("SELECT category, count(*) FROM relay_messages GROUP BY 1"), [(3, 100), (0xFFFF, 100)])
-        self.assertFalse(os.path.exists(d.socket_path))
-
     def test_what_is_in_use_or_unusable_is_named(self):
         d = self.daemon()
         free = {"RUNTIME_DIRECTORY": d.folder + "/log"}
@@ -57,7 +45,6 @@ class Faults(DaemonTest):
         self.assertEqual(os.stat(d.socket_path).st_mode & 0o777, 0o666)
         d.client().session(1)
         d.wait_for_messages(2)
-        self.assertEqual(d.rows("PRAGMA journal_mode"), [("wal",)])  # readers do not hold up the service
         d.process.kill()
         d.process.wait()
         d.start()
@@ -76,8 +63,7 @@ class Faults(DaemonTest):
             listener.listen(16)
             # LISTEN_PID must be the daemon's own: a shell sets it and becomes the daemon.
             wrapper = folder + "/activate"
-            with open(wrapper, "w") as f:
-                f.write(f'#!/bin/sh\nLISTEN_PID=$$ LISTEN_FDS=1 exec "{DAEMON}"\n')
+            pathlib.Path(wrapper).write_text(f'#!/bin/sh\nLISTEN_PID=$$ LISTEN_FDS=1 exec "{DAEMON}"\n')
             os.chmod(wrapper, 0o755)
             d = self.daemon(folder=folder, wait=False, program=wrapper,
                             environment={"NOTIFY_SOCKET": folder + "/notify", "WATCHDOG_USEC": "600000000"},

@@ -107,12 +107,11 @@ TEST_F(ListenerTest, AnybodyMayConnectAndNothingIsLeftBehind) {
   EXPECT_FALSE(std::filesystem::exists(path()));
 }
 
-TEST_F(ListenerTest, ConnectionsOfOneUserAreLimited) {
+TEST_F(ListenerTest, ConnectionsOfOneUserAndInAllAreLimited) {
   options.maxConnectionsPerUser = 2;
   fillUp();
-}
-TEST_F(ListenerTest, ConnectionsInAllAreLimited) {
-  options.maxConnections = 2;
+  std::swap(options.maxConnectionsPerUser, options.maxConnections);
+  clients.clear();
   fillUp();
 }
 

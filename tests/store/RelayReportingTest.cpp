@@ -25,10 +25,7 @@ struct FakeBackend final : RelayBackend {
                                const Payload&) override {
     return take("one " + std::to_string(type));
   }
-  std::optional<Error> take(const std::string& call) {
-    calls.push_back(call);
-    return refusal;
-  }
+  std::optional<Error> take(const std::string& call) { return calls.push_back(call), refusal; }
   const std::string_view label;
   std::vector<std::string> calls;
   std::optional<Error> refusal;
