@@ -5,6 +5,7 @@ are checked against each other.
 """
 import contextlib
 import os
+import pathlib
 import shutil
 import signal
 import socket
@@ -35,8 +36,7 @@ def frame(*items):
 
 
 def replace(path, text):
-    with open(path + ".new", "w") as f:
-        f.write(text)
+    pathlib.Path(path + ".new").write_text(text)
     os.rename(path + ".new", path)
 
 
@@ -48,7 +48,7 @@ class Client:
         self.socket.settimeout(PATIENCE)
         self.socket.connect(path)
         self.number = 0
-        self.data = b""
+        self.stream = self.socket.makefile("rb")
         self.answers = {}
         self.goodbye = False
         if hello:
@@ -65,19 +65,12 @@ class Client:
 
     def next_frame(self):
         """The next frame, or None at the end of the stream."""
-        while True:
-            if len(self.data) >= 4:
-                n = struct.unpack("<I", self.data[:4])[0]
-                if len(self.data) >= 4 + n:
-                    body, self.data = self.data[4:4 + n], self.data[4 + n:]
-                    return loads(body)
-            try:
-                got = self.socket.recv(1 << 16)
-            except ConnectionResetError:
-                got = b""
-            if not got:
-                return None
-            self.data += got
+        try:
+            length = self.stream.read(4)
+            body = self.stream.read(struct.unpack("<I", length)[0]) if length else b""
+        except ConnectionResetError:
+            return None
+        return loads(body) if body else None
 
     def pump(self):
         f = self.next_frame()
@@ -123,6 +116,7 @@ class Client:
         self.call(STOP, reporter)
 
     def close(self):
+        self.stream.close()
         self.socket.close()
 
 
@@ -180,8 +174,7 @@ class Daemon:
         return c
 
     def log(self):
-        with open(self.log_path, errors="replace") as f:
-            return f.read()
+        return pathlib.Path(self.log_path).read_text(errors="replace")
 
     def summaries(self):
         """The summary files' paths, oldest first."""

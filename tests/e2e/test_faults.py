@@ -6,9 +6,11 @@ from harness import *
 
 class Faults(DaemonTest):
     def test_descriptor_exhaustion(self):
-        d = self.daemon(preexec=lambda: resource.setrlimit(resource.RLIMIT_NOFILE, (48, 48)))
+        d = self.daemon("[relay]\nbackends = []\ntypo = 1\n",
+                        preexec=lambda: resource.setrlimit(resource.RLIMIT_NOFILE, (48, 48)))
         first = d.client()
         first.started(5)
+        d.wait_until(lambda: "No backends found" in d.log() and "relay.typo: unknown" in d.log(), "the relay is looked for")
         crowd, refused = [], 0
         for _ in range(80):
             crowd.append(c := d.client(hello=False))
@@ -21,26 +23,19 @@ class Faults(DaemonTest):
         for c in crowd:
             c.close()
         d.wait_until(lambda: d.log().count("removing") >= len(crowd) - refused, "the crowd has gone")
+        d.process.send_signal(signal.SIGUSR1)
+        d.wait_until(lambda: f" refused_connections={refused} " in d.log(), "the service accounts for itself")
         self.assert_unharmed(d)
 
-    def test_sigterm_with_a_hundred_started_sessions(self):
+    def test_what_is_in_use_or_unusable_is_named(self):
         d = self.daemon()
-        clients = [d.client() for _ in range(10)]
-        for reporter in range(1, 101):
-            clients[reporter % 10].started(reporter, 8)
-            clients[reporter % 10].post(SEND, {"n": reporter}, 3, 0, [reporter])
-        self.assertEqual(d.stop(), 0)
-        for c in clients:
-            self.assertTrue(c.until_closed().goodbye)
-        self.assertEqual(d.rows("SELECT category, count(*) FROM relay_messages GROUP BY 1"), [(3, 100), (0xFFFF, 100)])
-        self.assertFalse(os.path.exists(d.socket_path))
-
-    def test_what_is_in_use_is_named(self):
-        d = self.daemon()
-        for changed in ({}, {"RUNTIME_DIRECTORY": d.folder + "/log"}):  # the socket, and the store
-            second = subprocess.run([DAEMON], env=dict(d.environment, **changed), stderr=subprocess.PIPE, timeout=PATIENCE)
+        free = {"RUNTIME_DIRECTORY": d.folder + "/log"}
+        for changed, said in (({}, "another .*RUNTIME_"), (free, "another .*STATE_"),
+                              ({"RUNTIME_DIRECTORY": d.log_path}, "service.lock: Not a directory")):
+            second = subprocess.run([DAEMON], env=dict(d.environment, **changed), stderr=subprocess.PIPE, text=True,
+                                    timeout=PATIENCE)
             self.assertEqual(second.returncode, 1)
-            self.assertIn(b"another", second.stderr)
+            self.assertRegex(second.stderr, r"^<3>vxreportingd: .*" + said)
         self.assert_unharmed(d)
 
     def test_unusable_state_directory_is_named_and_rows_wait_for_it(self):
@@ -51,7 +46,7 @@ class Faults(DaemonTest):
         d.environment["STATE_DIRECTORY"] = path + "/x"
         d.start()
         d.client().session(1)
-        d.wait_until(lambda: path in d.log(), "the folder is named")
+        d.wait_until(lambda: path + "/x: Not a directory (set STATE_DIRECTORY" in d.log(), "the folder is named")
         os.unlink(path)
         os.mkdir(path)
         d.database = path + "/x/telemetry.db"
@@ -64,7 +59,6 @@ class Faults(DaemonTest):
         self.assertEqual(os.stat(d.socket_path).st_mode & 0o777, 0o666)
         d.client().session(1)
         d.wait_for_messages(2)
-        self.assertEqual(d.rows("PRAGMA journal_mode"), [("wal",)])  # readers do not hold up the service
         d.process.kill()
         d.process.wait()
         # What is recorded runs again elsewhere too, although all of it is done, at its own time.
@@ -92,12 +86,13 @@ class Faults(DaemonTest):
             listener.listen(16)
             # LISTEN_PID must be the daemon's own: a shell sets it and becomes the daemon.
             wrapper = folder + "/activate"
-            with open(wrapper, "w") as f:
-                f.write(f'#!/bin/sh\nLISTEN_PID=$$ LISTEN_FDS=1 exec "{DAEMON}"\n')
+            pathlib.Path(wrapper).write_text(f'#!/bin/sh\nLISTEN_PID=$$ LISTEN_FDS=1 exec "{DAEMON}"\n')
             os.chmod(wrapper, 0o755)
-            d = self.daemon(folder=folder, wait=False, environment={"NOTIFY_SOCKET": folder + "/notify"}, program=wrapper,
+            d = self.daemon(folder=folder, wait=False, program=wrapper,
+                            environment={"NOTIFY_SOCKET": folder + "/notify", "WATCHDOG_USEC": "600000000"},
                             preexec=lambda: (os.dup2(listener.fileno(), 3), os.set_inheritable(3, True)))
             self.assertIn(b"READY=1", notify.recv(4096))
+            self.assertIn(b"WATCHDOG=1", notify.recv(4096))
             self.assert_unharmed(d)
             self.assertEqual(d.stop(), 0)
             self.assertIn(b"STOPPING=1", notify.recv(4096))

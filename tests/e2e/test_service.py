@@ -12,8 +12,7 @@ class Service(DaemonTest):
             for name, value in counters.items():
                 path = f"{folder}/drivers/{name.replace('_', '/')}"
                 os.makedirs(os.path.dirname(path), exist_ok=True)
-                with open(path, "w") as f:
-                    f.write(value)
+                pathlib.Path(path).write_text(value)
 
         count(Speaker_underruns="5\n", Haptics_Stats_clicks="0x10", Other_MCA_frames="7")
         d = self.daemon(folder=folder)
@@ -46,7 +45,7 @@ class Service(DaemonTest):
         events = {name.removeprefix("com.quorvel.sonik."): json.loads(text)
                   for name, text in d.rows("SELECT name, payload FROM analytics_events")}
         self.assertEqual(events["Session_Setup.Start"], dict(payload, HostApplicationDisplayID="com.example.player"))
-        self.assertTrue(events["vxreportingclientuptime"]["processName"].startswith("python"), events)
+        self.assertRegex(events["vxreportingclientuptime"]["processName"], r"^python[\d.]*\Z")
         self.assertGreaterEqual(events["vxreportingclientuptime"]["seconds"], 0)
         (drivers,) = [e for name, e in events.items() if name.startswith("ChannelReporting.")]
         self.assertEqual(drivers, {"Speaker_underruns": 7, "Haptics_Stats_clicks": 1, "MCA_frames": 2,
@@ -55,7 +54,7 @@ class Service(DaemonTest):
         self.assertEqual((*power[:2], json.loads(power[2])), (
             28, "Lumo_Haptics", {"EngineOnDuration": 3, "ApplicationName": "Unknown", "TimestampEnd": 1.5}))
 
-    def test_two_hundred_clients_at_once_and_a_small_queue(self):
+    def test_two_hundred_clients_at_once_a_small_queue_and_sessions_open_at_the_end(self):
         clients, messages = 200, 20
         d = self.daemon(config="[store]\nqueue_bytes = 65536\n")  # reading pauses, and nothing is lost
         crowd = [d.client() for _ in range(clients)]
@@ -66,18 +65,14 @@ class Service(DaemonTest):
                  for number, c in enumerate(crowd, 1)]
         for number, (c, sent) in enumerate(zip(crowd, posts), 1):
             self.assertEqual([c.answer(n) for n in sent], [[REPLY, n, None] for n in sent])
-            self.assertIs(c.call(STOP, number), True)
-        d.wait_for_messages(clients * (messages + 1))
+            if number > 100:
+                self.assertIs(c.call(STOP, number), True)
+        d.wait_for_messages(clients * messages + 100)
         self.assertEqual(d.stop(), 0)
+        self.assertEqual([c.until_closed().goodbye for c in crowd], [True] * clients)
+        self.assertFalse(os.path.exists(d.socket_path))
+        self.assertEqual(d.rows("SELECT category, count(*) FROM relay_messages GROUP BY 1"),
+                         [(3, clients * messages), (0xFFFF, clients)])
         self.assertEqual(d.rows("SELECT count(DISTINCT payload) FROM relay_messages JOIN relay_sessions s"
                                 " ON s.id = relay_session AND session_id = json_extract(payload, '$.client')"),
                          [(clients * messages,)])
-
-    def test_no_back_ends_ends_the_wait_with_dropped_messages(self):
-        d = self.daemon(config="[relay]\nbackends = []\n")
-        c = d.client()
-        c.started(1)
-        c.call(SEND, {"x": 1}, 4, 2, None)
-        d.wait_until(lambda: "No valid VyrReportingSession" in d.log(), "the message was dropped")
-        self.assertEqual(d.stop(), 0)
-        self.assertEqual(d.rows("SELECT count(*) FROM relay_messages"), [(0,)])

@@ -36,8 +36,7 @@ class SummaryTest(DaemonTest):
         c.session(3, {"HostApplicationDisplayID": "com.example.phone"}, message)
         (path,) = d.summaries()
         self.assertRegex(os.path.basename(path), r"^\d{8}-\d{6}[+-]\d{4}-sonik-com\.example\.phone-telephony\.json$")
-        with open(path) as f:
-            first, second, *_, last = json.load(f)
+        first, second, *_, last = json.loads(pathlib.Path(path).read_text())
         self.assertEqual(first, {"HostApplicationDisplayID": "com.example.phone"})
         message["a_b"] = message.pop("a b")
         self.assertEqual(second, {"Playback_Start_1": message})
@@ -95,19 +94,20 @@ class OrientationTest(DaemonTest):
         self.assertEqual(sensor.answers(refusals + 1), ["refused"] * refusals + ["asked"])
         return sensor
 
-    def words(self, key, reporter=1):
+    def summary(self):
         """Stops the session, and what it was told."""
-        self.c.call(SEND, {"a": 1}, 3, 1, [reporter])
-        self.c.call(STOP, reporter)
-        with open(self.d.summaries()[-1]) as f:
-            return list(json.load(f)[-1].values())[0].get(key, "").split(",")
+        self.c.call(SEND, {"a": 1}, 3, 1, [1])
+        self.c.call(STOP, 1)
+        return list(json.loads(pathlib.Path(self.d.summaries()[-1]).read_text())[-1].values())[0]
 
     def test_bus_that_comes_late_and_dies_and_sensor_that_wakes_up_and_comes_back(self):
+        replace(f"{self.folder}/run/interface-orientation", "portrait\n")
         self.c.started(1, 7)
         self.d.wait_until(lambda: "device orientation is off for now" in self.d.log(), "the bus is looked for")
         bus = self.start_bus()
         sensor = self.sensor(refusals=2)
         self.assertEqual(sensor.turn("normal", "left-up"), ["told"] * 2)
+        replace(f"{self.folder}/run/interface-orientation", "landscape-left\n")  # the thread of the sensor's words sees it
         sensor.leave()
         sensor = self.sensor()
         self.assertEqual(sensor.turn("right-up"), ["told"])
@@ -118,21 +118,10 @@ class OrientationTest(DaemonTest):
         os.remove(f"{self.folder}/bus")
         self.start_bus()
         self.assertEqual(self.sensor().turn("bottom-up"), ["told"])
-        words = self.words("device_orientation")
+        told = self.summary()
+        self.assertEqual(told["ui_orientation"], "landscape-left")
+        words = told["device_orientation"].split(",")
         self.assertEqual(words[:4], ["normal", "left-up", "undefined", "right-up"])
         self.assertEqual(words[-1], "bottom-up")
         self.assertEqual(self.d.log().count("device orientation is off for now"), 1)  # nothing is said of what lasts
         self.assertEqual(self.d.stop(), 0)
-
-    def test_interface_orientation_from_the_state_file(self):
-        # Nobody sees when the file has been read: sessions of growing length, until two were told of the change.
-        told = 0
-        for reporter in range(1, 20):
-            self.c.started(reporter, 2, {"HostApplicationDisplayID": f"{reporter:04}"})
-            for word in ("portrait", "landscape-left"):
-                replace(f"{self.folder}/run/interface-orientation", word + "\n")
-                time.sleep(0.05 * reporter)
-            told += self.words("ui_orientation", reporter)[-1] == "landscape-left"
-            if told == 2:
-                return
-        self.fail(f"told {told} times")

@@ -392,6 +392,10 @@ TEST_F(ConnectionTest, ShutDownWaitsForAnswersUntilTimeRunsOut) {
   run();
   EXPECT_THAT(answers(), ElementsAre("4"));
   EXPECT_THAT(events, ElementsAre("invalidated"));
+
+  connection = std::make_shared<SocketConnection>(*this, peer.pair(), 200, 501);
+  connection->shutDown();  // before it was let in
+  EXPECT_THAT(ask({}), ElementsAre("4"));
 }
 
 }  // namespace

@@ -86,6 +86,7 @@ class ListenerTest : public IpcTest, public ServiceListenerDelegate {
 
 TEST_F(ListenerTest, AnybodyMayConnectAndNothingIsLeftBehind) {
   write("run/service.socket", "left behind");
+  write("run/service.lock", "1234567890123");  // more than a pid has
   SocketListener second(loop_, executor_, clock_, options);
   const std::string refusals[][2] = {
       {"/run", "another vxreportingd (pid " + std::to_string(getpid()) + ") serves "},
@@ -106,12 +107,11 @@ TEST_F(ListenerTest, AnybodyMayConnectAndNothingIsLeftBehind) {
   EXPECT_FALSE(std::filesystem::exists(path()));
 }
 
-TEST_F(ListenerTest, ConnectionsOfOneUserAreLimited) {
+TEST_F(ListenerTest, ConnectionsOfOneUserAndInAllAreLimited) {
   options.maxConnectionsPerUser = 2;
   fillUp();
-}
-TEST_F(ListenerTest, ConnectionsInAllAreLimited) {
-  options.maxConnections = 2;
+  std::swap(options.maxConnectionsPerUser, options.maxConnections);
+  clients.clear();
   fillUp();
 }
 

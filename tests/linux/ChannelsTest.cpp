@@ -94,6 +94,16 @@ TEST_F(ChannelsTest, ChannelsComeFromRegularFilesOfTheGroupAlone) {
   EXPECT_EQ(Group(channels, std::nullopt, std::nullopt).count, 3);
 }
 
+TEST_F(ChannelsTest, ThoseBeyondALimitAreLeftOutAndSaid) {
+  for (int i = 0; i < 4096; ++i) write("drivers/A/" + std::to_string(i), "1");
+  CounterChannels channels(drivers);
+  EXPECT_EQ(Group(channels, "A", std::nullopt).count, 4096);
+  write("drivers/A/more", "1");
+  write("drivers/B/more", "1");
+  EXPECT_EQ(Group(channels, std::nullopt, std::nullopt).count, 4096);
+  EXPECT_THAT(p.log.lines, ElementsAre(HasSubstr("more than 4096 channels")));
+}
+
 // A stream that is opened and closed while a session runs, and a real folder of kernel counters.
 TEST_F(ChannelsTest, MappedSourcesFollowTheKernel) {
   const std::string status = "asound/card0/pcm0p/sub0/status";
@@ -113,7 +123,8 @@ TEST_F(ChannelsTest, MappedSourcesFollowTheKernel) {
   EXPECT_THAT(alsa.values(channels.createSamplesDelta(closed, open, alsa.error)), IsEmpty());
   EXPECT_FALSE(alsa.error);
   Group codec(channels, std::nullopt, "MCA");
-  EXPECT_EQ(codec.values(codec.sample()).count("rx_packets"), 1u);
+  const Counters counters = codec.values(codec.sample());
+  EXPECT_EQ(counters.count("rx_packets") + counters.count("card0_pcm0p_sub0_delay"), 1u);
 }
 
 }  // namespace

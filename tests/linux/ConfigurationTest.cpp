@@ -49,11 +49,20 @@ TEST_F(ConfigurationTest, ComplaintsNameFileLineAndKeyAndDefaultsStay) {
   EXPECT_THAT(load(), ElementsAre(HasSubstr("not a regular file")));
 }
 
+TEST_F(ConfigurationTest, FoldersAreTheServiceManagersOrTheSystems) {
+  setenv("RUNTIME_DIRECTORY", "/a/:/b", 1);
+  const Directories all = Directories::fromEnvironment();
+  EXPECT_EQ(all.runtime + all.state + all.configuration + all.logs,
+            "/a/var/lib/vxreporting/etc/vxreporting/var/log/vxreporting");
+  setenv("RUNTIME_DIRECTORY", "", 1);
+  EXPECT_EQ(Directories::fromEnvironment().runtime, "/run/vxreporting");
+}
+
 TEST_F(ConfigurationTest, RangesEndWhereTheySay) {
   EXPECT_THAT(complaintsOf("[log]\nburst = 65535\nrefill_per_second = 1\n[listener]\n"
                            "max_frame_bytes = 1048576\n[drivers]\nmapped = []\n"
                            "[relay]\nbackends = []\n[store]\nmax_age_days = 3\n"
-                           "commit_interval_ms = 5\nqueue_bytes = 65536\n"),
+                           "commit_interval_ms = 5\nqueue_bytes = \"64KiB\"\n"),
               IsEmpty());
   EXPECT_EQ(configuration.log.burst, 65535u);
   EXPECT_THAT(configuration.relay.backends, IsEmpty());
@@ -91,13 +100,18 @@ TEST_F(ConfigurationTest, PreferencesKeepTheLastGoodValuesAndComplainOnce) {
   write("d.toml", "k = \"yes\"\nn = 3\nt = { a = 1 }\n");
   EXPECT_TRUE(preferences.open("d")->boolean("k"));
   EXPECT_EQ(preferences.open("d")->string("n"), "3");
+  EXPECT_TRUE(preferences.open("d")->boolean("n"));
   EXPECT_EQ(preferences.open("d")->string("t"), std::nullopt);
   write("d.toml", "ok = 1\nk = \n");
   EXPECT_TRUE(preferences.open("d")->boolean("k"));
   EXPECT_TRUE(preferences.open("d")->boolean("k"));
   EXPECT_THAT(p.log.lines, ElementsAre(HasSubstr("d.toml:2:")));
-  write("d.toml", std::string((1 << 20) + 1, '\n'));
+  std::string large((1 << 20) + 1, '\n');
+  write("d.toml", large);
   EXPECT_TRUE(preferences.open("d")->boolean("k"));
+  large.replace(0, 6, "j = 1");
+  write("d.toml", large);
+  EXPECT_TRUE(preferences.open("d")->boolean("j"));
   std::filesystem::remove(folder + "/d.toml");
   EXPECT_FALSE(preferences.open("d")->hasObject("k"));
 }

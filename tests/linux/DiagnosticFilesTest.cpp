@@ -60,6 +60,7 @@ TEST_F(DiagnosticFilesTest, NothingPlantedIsEverOpenedNorAnythingBesideTheLogs) 
 
 TEST_F(DiagnosticFilesTest, FilesAppearWholeOrNotAtAll) {
   write("log/Audio/.vx.0123456789abcdef.tmp", "of a process that crashed");
+  write("log/Audio/.mine.tmp", "of somebody else");
   ASSERT_EQ(files.createDirectory(directory, 0777), std::nullopt);
   const mode_t before = umask(077);
   std::string expected;
@@ -76,11 +77,12 @@ TEST_F(DiagnosticFilesTest, FilesAppearWholeOrNotAtAll) {
       ASSERT_TRUE(piece.empty());
     }
     EXPECT_FALSE(std::filesystem::exists(directory + "/a"));
+    ASSERT_EQ(files.createDirectory(directory, 0777), std::nullopt);  // of another session
     ASSERT_EQ(first->commit(), std::nullopt);
     ASSERT_EQ(second->commit(), std::nullopt);
   }
   umask(before);
-  EXPECT_EQ(std::distance(std::filesystem::directory_iterator(directory), {}), 1);
+  EXPECT_EQ(std::distance(std::filesystem::directory_iterator(directory), {}), 2);
   EXPECT_TRUE(read("log/Audio/a") == expected);  // the later one
   EXPECT_EQ(modeOf(directory + "/a"), 0644u);
 }

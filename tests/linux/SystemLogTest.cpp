@@ -77,6 +77,8 @@ TEST_F(SystemLogTest, LinesOfOneStatementAreLimitedCountedAndAllowedAgainAsSlowl
   EXPECT_FALSE(log.wantsLine(nullptr, LogLevel::Info, other));
   log.write(nullptr, LogLevel::Error, site, "F.cpp:7:f: text", 10);
   EXPECT_EQ(drain(), "<3>default: F.cpp:7:f: text (7 lines like this were left out)\n");
+  log.write(nullptr, LogLevel::Error, site, "again", 0);
+  EXPECT_EQ(drain(), "<3>default: again\n");
   // The bucket of a statement that wrote its last line some time ago.
   const auto wantedAfter = [&](std::chrono::seconds ago) {
     timespec now{};

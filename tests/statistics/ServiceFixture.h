@@ -68,10 +68,9 @@ class PlatformTest : public ::testing::Test {
   fakes::Journal gained(const std::vector<std::string>& interesting = {}) {
     fakes::Journal lines;
     for (; marked_ < p.journal.size(); ++marked_) {
-      bool wanted = interesting.empty();
-      for (const std::string& part : interesting)
-        wanted = wanted || p.journal[marked_].find(part) != std::string::npos;
-      if (wanted) lines.push_back(p.journal[marked_]);
+      const std::string& line = p.journal[marked_];
+      const auto holds = [&](const std::string& part) { return line.find(part) != line.npos; };
+      if (interesting.empty() || std::ranges::any_of(interesting, holds)) lines.push_back(line);
     }
     return lines;
   }
@@ -120,27 +119,23 @@ class ServiceTest : public PlatformTest {
     run();
     return *clients.back();
   }
-  void create(Client& client, ReporterID id) {
+  using Call = void (Client::*)(ReporterID, Function<void(bool)>);
+  void call(Client& client, ReporterID id, Call operation, const char* name) {
     mark();
-    client.createReportingSession(id, booleans("create"));
+    (client.*operation)(id, booleans(name));
     run();
   }
-  void start(Client& client, ReporterID id) {
-    mark();
-    client.startReportingSessionForID(id, booleans("start"));
-    run();
+  void create(Client& c, ReporterID id) { call(c, id, &Client::createReportingSession, "create"); }
+  void start(Client& c, ReporterID id) {
+    call(c, id, &Client::startReportingSessionForID, "start");
   }
+  void stop(Client& c, ReporterID id) { call(c, id, &Client::stopReportingSessionForID, "stop"); }
   void started(Client& client, ReporterID id) {
     create(client, id);
     start(client, id);
   }
   void configure(Client& client, ReporterID id, std::optional<Payload> with) {
     client.setConfiguration(std::move(with), id, booleans("configure"));
-    run();
-  }
-  void stop(Client& client, ReporterID id) {
-    mark();
-    client.stopReportingSessionForID(id, booleans("stop"));
     run();
   }
   void send(Client& client, const Payload& sent, MessageCategory category, MessageType type,

@@ -80,6 +80,7 @@ TEST_F(SessionTest, ARestartIsAWholeLifeAgain) {
 TEST_F(SessionTest, RelaySessionCarriesWhatTheSetUpTookAndTestSessionsHaveNone) {
   for (const auto& [type, name] : {std::pair(ServiceType{7}, "longformaudio"), {12, "apiusage"}}) {
     const auto s = make(type);
+    EXPECT_FALSE(s->shouldReportOrientation()) << "not on this build";
     s->start();
     s->setServiceType(3);  // too late for the names
     // In time: the set-up holds the dictionary itself.
@@ -100,6 +101,7 @@ TEST_F(SessionTest, RelaySessionCarriesWhatTheSetUpTookAndTestSessionsHaveNone) 
     EXPECT_EQ(s->vyrReportingSession(), p.vyr.sessions.back());
   }
   EXPECT_EQ(p.queues.blockingScopes, 2);
+  EXPECT_EQ(p.log.registrations.size(), 3u) << "one for all sessions";
   mark();
   const auto test = startedSession(11);
   test->sendMessage(message, 3, 1, nullptr);
@@ -159,8 +161,10 @@ TEST_F(SessionTest, SinglesAreTakenAsTheyAreAndThoseOfAlarmsSpreadOverAMinute) {
   EXPECT_EQ(answer, p.vyr.sendError);
   EXPECT_EQ(p.log.lines.back(), "vxrr error sendOneMessageWithSessionInfo broken (x, code 5)");
   p.vyr.sendError.reset();
+  VXReportingSession::sendSingleMessage(dictionary("d e", 1), 1, 1, 5, message, nullptr);
   p.queues.advance(1ms);
-  const auto& single = p.vyr.oneOffs.at(0);
+  EXPECT_EQ(p.vyr.oneOffs.at(0).payload.text(), "{d_e=1}");
+  const auto& single = p.vyr.oneOffs.at(1);
   EXPECT_EQ(single.category, 7);
   EXPECT_EQ(single.payload.text(), "{a_b_c=1}");
   EXPECT_EQ(single.userInfo.text(), "{clientName=com.quorvel.sonik,serviceName=alarms}");
@@ -255,6 +259,11 @@ TEST_F(OrientationTest, HandlersComeAndGoInOrderWhereAllThreeConditionsHold) {
   mark();
   s->stop();
   EXPECT_EQ(gained({"register"}).size(), 2u);
+  s->start();
+  s->setServiceType(3);
+  mark();
+  s->stop();
+  EXPECT_THAT(gained({"register"}), IsEmpty()) << "asked with the type of the moment";
   p.services.deviceHandlers.clear();
   p.services.interfaceHandlers.clear();
   p.services.deviceClass = 6;

@@ -51,15 +51,14 @@ StoreFault faultOfFinding(const std::string& finding) {
 }
 
 StoreLock lockStore(const std::string& directory) {
-  if (mkdir(directory.c_str(), 0750) != 0 && errno != EEXIST)
-    return {{}, Status::lastError("cannot create the state directory " + directory)};
+  constexpr std::string_view kHint = "set STATE_DIRECTORY to a folder that can be written";
+  if (mkdir(directory.c_str(), 0750) != 0 && errno != EEXIST) {
+    return {{},
+            Status::lastError("cannot create the state directory " + directory).withHint(kHint)};
+  }
   const std::string path = directory + kLockName;
   UniqueFd lock(::open(path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW, 0640));
-  if (!lock) {
-    return {{},
-            Status::lastError("cannot open " + path)
-                .withHint(" (set STATE_DIRECTORY to a folder that can be written)")};
-  }
+  if (!lock) return {{}, Status::lastError("cannot open " + path).withHint(kHint)};
   if (flock(lock.get(), LOCK_EX | LOCK_NB) != 0) {
     if (errno != EWOULDBLOCK) return {{}, Status::lastError("cannot lock " + path)};
     return {{},
