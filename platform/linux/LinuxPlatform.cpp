@@ -202,10 +202,13 @@ class RunningPlatform final : public LinuxPlatform {
     }
     const Monotonic began = clock_.monotonic();
     executor_.adoptInteractiveThread();
-    recovery_.emplace(RecoveryMeans{*services_, executor_, *journal_, backendNames(),
-                                    [this] { return store_->isCongested(); }},
-                      std::move(left_));
-    store_->beginReplay(recovery_->calls());
+    recovery_.emplace(
+        RecoveryMeans{*services_, executor_, *journal_, backendNames(),
+                      [this] { return store_->isCongested(); },
+                      [this](uint64_t records) { noteReplaySteps(journalFolder_, records); }},
+        std::move(left_));
+    store_->beginReplay(recovery_->calls(),
+                        [folder = journalFolder_] { noteReplayAchieved(folder); });
     const RecoveryOutcome outcome = recovery_->run(makeDelegate);
     commitReplay();
     snapshots_->demand();
@@ -389,14 +392,15 @@ class RunningPlatform final : public LinuxPlatform {
       VX_LOG(nullptr, Error, "no journal: %s", noJournal_.c_str());
       store_->noteAtStart({"journal_absent", "", 0, noJournal_});
     }
-    if (!poisoned_.empty()) {
+    for (const std::string& poisoned : poisoned_) {
       VX_LOG(nullptr, Error,
              "processes ended again and again while they finished what an earlier one had "
              "accepted; it is now in %s",
-             poisoned_.c_str());
+             poisoned.c_str());
       store_->noteAtStart(
-          {"journal_moved_aside", "", 0, "its replays did not end; now " + poisoned_});
+          {"journal_moved_aside", "", 0, "its replays did not end; now " + poisoned});
     }
+    if (!poisoned_.empty()) store_->commitSoon([poisoned = poisoned_] { told(poisoned); });
     if (!journalInMemory_)
       VX_LOG(nullptr, Info, "the runtime folder is not a tmpfs: each call costs writes to a disk");
   }
@@ -530,7 +534,7 @@ class RunningPlatform final : public LinuxPlatform {
   std::string movedFolder_;  // of what a stop could not commit
   std::vector<std::string> journalComplaints_;
   std::string noJournal_;  // why there is none
-  std::string poisoned_;
+  std::vector<std::string> poisoned_;
   JournalContents left_;
   bool movedStays_ = false;
   bool journalInMemory_ = false;

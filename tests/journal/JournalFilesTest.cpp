@@ -177,12 +177,20 @@ TEST_F(JournalFilesTest, AFolderOfOthersIsRefused) {
 
 TEST_F(JournalFilesTest, AttemptsAreCountedUntilTheyAreCleared) {
   leaveBehind();
-  const auto attempt = [&] {
-    return *JournalFolder::open(options.folder, JournalFolder::IfMissing::Fail)->beginAttempt();
+  const auto folder = [&] {
+    return JournalFolder::open(options.folder, JournalFolder::IfMissing::Fail).value();
   };
+  const auto attempt = [&] { return *folder().beginAttempt(); };
   EXPECT_EQ(attempt(), 1u);
   EXPECT_EQ(attempt(), 2u);
   open();
+  EXPECT_EQ(attempt(), 3u);
+  folder().noteSteps(5);
+  EXPECT_EQ(attempt(), 2u);
+  folder().noteSteps(5);  // no further
+  EXPECT_EQ(attempt(), 3u);
+  folder().noteAchieved();
+  EXPECT_EQ(attempt(), 2u);
   EXPECT_EQ(attempt(), 3u);
   journal->discard();
   EXPECT_EQ(attempt(), 1u);

@@ -88,10 +88,13 @@ class RecoveryTest : public JournalFixture {
     wall += later;
     beginLife();
     service->fakes.services.processNames.clear();  // they are dead
-    recovery.emplace(
-        RecoveryMeans{
-            service->platform, service->executor, *journal, {"test"}, [] { return false; }},
-        std::move(left));
+    recovery.emplace(RecoveryMeans{service->platform,
+                                   service->executor,
+                                   *journal,
+                                   {"test"},
+                                   [] { return false; },
+                                   [this](uint64_t steps) { advanced = steps; }},
+                     std::move(left));
     return recovery->run([] { return VXReportingServiceDelegate::create(); });
   }
 
@@ -191,7 +194,8 @@ class RecoveryTest : public JournalFixture {
 
   Date wall{std::chrono::hours(24 * 365 * 50)};
   JournalContents left;
-  std::string poisoned;
+  std::vector<std::string> poisoned;
+  uint64_t advanced = 0;
   fakes::FakeAggregateMemory memory;  // of all lives
   std::optional<VXReportingProcessState> processState;
   std::unique_ptr<RecordedService> service;
@@ -417,20 +421,24 @@ TEST_F(RecoveryTest, AJournalWhoseReplaysDieIsMovedAsideAndTheServiceServes) {
     kill();
     beginLife();
     EXPECT_THAT(left.records, SizeIs(1));
-    EXPECT_EQ(poisoned, "");
+    EXPECT_THAT(poisoned, IsEmpty());
   }
   kill();
   beginLife();
-  EXPECT_EQ(poisoned, options.folder + ".aside-1");
+  EXPECT_THAT(poisoned, ElementsAre(options.folder + ".aside-1"));
   EXPECT_THAT(left.records, IsEmpty());
-  EXPECT_TRUE(std::filesystem::exists(poisoned));
+  EXPECT_EQ(JournalReader::read(poisoned.at(0), kEpoch)->records.size(), 1u);
   connect(1, 200);
   EXPECT_GT(connections[1].first, first + 1);
+  kill();
+  beginLife();
+  EXPECT_THAT(poisoned, SizeIs(1));  // nobody was told
+  told(poisoned);
   // One that ends counts as none.
   for (int replays = 0; replays < 4; ++replays) {
     kill();
     beginLife();
-    EXPECT_EQ(poisoned, "");
+    EXPECT_THAT(poisoned, IsEmpty());
     endReplay(options.folder);
   }
 }

@@ -64,12 +64,16 @@ Result<OpenedJournal> openJournal(JournalOptions options, const std::string& mov
   if (!headers.empty() && countReplay(options.folder) > kMostReplays) {
     Result<std::string> aside = JournalFolder::moveAside(options.folder);
     if (!aside.ok()) return aside.status();
-    opened.poisoned = std::move(aside).value();
   } else if (!headers.empty()) {
     // Before the journal is opened: that sets aside what is not its own, and says so.
     Result<JournalContents> left = JournalReader::read(options.folder, options.epoch);
     if (left.ok()) opened.left = std::move(left).value();
     keepTorn(options.folder, opened.left, opened.complaints);
+  }
+  // One that an earlier process moved, which ended before it could say so, still has its count.
+  for (const std::string& aside : JournalFolder::movedAside(options.folder)) {
+    const Result<JournalFolder> folder = JournalFolder::open(aside, JournalFolder::IfMissing::Fail);
+    if (folder.ok() && folder->hasAttempts()) opened.poisoned.push_back(aside);
   }
   Result<std::unique_ptr<Journal>> journal = Journal::open(options, &opened.complaints);
   if (!journal.ok()) return journal.status();
@@ -77,9 +81,23 @@ Result<OpenedJournal> openJournal(JournalOptions options, const std::string& mov
   return opened;
 }
 
+void noteReplaySteps(const std::string& path, uint64_t steps) {
+  const Result<JournalFolder> folder = JournalFolder::open(path, JournalFolder::IfMissing::Fail);
+  if (folder.ok()) folder->noteSteps(steps);
+}
+
+void noteReplayAchieved(const std::string& path) {
+  const Result<JournalFolder> folder = JournalFolder::open(path, JournalFolder::IfMissing::Fail);
+  if (folder.ok()) folder->noteAchieved();
+}
+
 void endReplay(const std::string& path) {
   const Result<JournalFolder> folder = JournalFolder::open(path, JournalFolder::IfMissing::Fail);
   if (folder.ok()) folder->clearAttempts();
+}
+
+void told(const std::vector<std::string>& poisoned) {
+  for (const std::string& path : poisoned) endReplay(path);
 }
 
 }  // namespace vx::lnx

@@ -24,14 +24,20 @@ struct OpenedJournal {
   JournalContents left;                 // to be replayed
   std::vector<std::string> complaints;  // what could not be believed
   bool movedStays = false;              // it could not be taken back: its calls run another time
-  std::string poisoned;                 // where one is now whose replays have all failed; or empty
+  // Where journals are now whose replays have all failed, until somebody was told: see told().
+  std::vector<std::string> poisoned;
 };
 
 // Counts a replay of what is there, and opens the journal behind it. What an ending process moved
 // to `moved`, where it had more time, is taken back first. After kMostReplays replays that were
-// begun and not ended (endReplay), the journal is moved aside.
+// begun and not ended (endReplay), and came no further than one before, the journal is moved aside.
 Result<OpenedJournal> openJournal(JournalOptions options, const std::string& moved);
+// How far the replay has come; that something was committed that the next one finds.
+void noteReplaySteps(const std::string& folder, uint64_t steps);
+void noteReplayAchieved(const std::string& folder);
 // What was left has been replayed.
 void endReplay(const std::string& folder);
+// It is known that these are poisoned.
+void told(const std::vector<std::string>& poisoned);
 
 }  // namespace vx::lnx

@@ -15,6 +15,7 @@ namespace {
 constexpr std::chrono::seconds kPatience{5};
 constexpr std::chrono::milliseconds kLookAgain{1};
 constexpr std::chrono::seconds kBackgroundTime{10};
+constexpr uint64_t kRecordsUntilTold = 64;
 
 }  // namespace
 
@@ -49,6 +50,7 @@ RecoveryOutcome Recovery::run(const MakeDelegate& makeDelegate) {
     runRecord(record);
   }
   endOpenConnections();
+  means_.advanced(outcome_.calls + 1);
   (void)append(RecordKind::ServiceBegan, 0);
   delegate_.reset();
   runInteractive();
@@ -101,7 +103,7 @@ void Recovery::runRecord(const Record& record) {
         return;
     }
   }
-  ++outcome_.calls;
+  if (++outcome_.calls % kRecordsUntilTold == 0) means_.advanced(outcome_.calls);
   outcome_.undone += record.done ? 0 : 1;
   runInteractive();
   waitForStore();

@@ -31,6 +31,7 @@ struct RecoveryMeans {
   Journal& journal;
   std::vector<std::string> backends;  // the relay's
   Function<bool()> congested;         // the store has more to write than it should hold
+  Function<void(uint64_t)> advanced;  // so many records were run again; told now and then
 };
 
 struct RecoveryOutcome {

@@ -44,8 +44,8 @@ class LocalStore final : public AnalyticsEventService, public PowerEventLog {
   // What is appended until endReplay() comes from recorded calls: rows of theirs that are there
   // already are not written again, and new ones bear the time of their call. Nothing else may be
   // appended meanwhile. `committed`: told once all of it is, on the writer's thread; never when
-  // that does not happen.
-  void beginReplay(ReplayedCalls calls);
+  // that does not happen. `progressed`: likewise whenever new rows of it are.
+  void beginReplay(ReplayedCalls calls, Function<void()> progressed = nullptr);
   void endReplay(Function<void()> committed);
 
   // A row of the ledger; before start().
@@ -63,10 +63,12 @@ class LocalStore final : public AnalyticsEventService, public PowerEventLog {
 
   // Runs a job on the writer's thread, before anything that waits to be written.
   void runSoon(Function<void()> job) { writer_.queue().runSoon(std::move(job)); }
-  // What waits is committed as soon as it can be.
-  void commitSoon() {
-    FlushHandler nobodyWaits = [](std::optional<Error>) {};
-    (void)writer_.queue().appendFlush(nobodyWaits);
+  // What waits is committed as soon as it can be. `committed`: told then, on the writer's thread.
+  void commitSoon(Function<void()> committed = nullptr) {
+    FlushHandler flushed = [committed = std::move(committed)](const std::optional<Error>& error) {
+      if (!error && committed) committed();
+    };
+    (void)writer_.queue().appendFlush(flushed);
   }
   bool isCongested() const { return writer_.queue().isCongested(); }  // cheap: one atomic load
   // Called on the writer's thread when a congested store has drained to half its bound. Set before

@@ -212,6 +212,7 @@ Result<RowWriter::Written> StoreWriter::write(const StoreBatch& batch, std::size
   notes_.clear();
   ++commits_;
   rowsCommitted_ += written->rows;
+  if (replayFrom_ && written->rows > 0 && progressed_) progressed_();
   writeFailures_ += written->failedBuilders;
   if (open_) open_->retention.noteWritten(written->bytes);
   return written;
