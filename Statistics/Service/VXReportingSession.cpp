@@ -40,6 +40,19 @@ double secondsSince(Date start) {
   return std::round(d * 1000.0) / -1000.0;
 }
 
+// Of a summary file: a stop that is run again writes the same file once more.
+std::string fileDate() {
+  static constexpr std::string_view kDate = "file date";
+  const std::optional<Payload> answer =
+      platform().inputs.once(kDate, []() -> std::optional<Payload> {
+        const std::chrono::duration<double> now = platform().clock.now().time_since_epoch();
+        return PayloadBuilder().set(kDate, PayloadDate{now.count()}).build();
+      });
+  const std::optional<Value> asked = answer ? answer->find(kDate) : std::nullopt;
+  return platform().clock.formatLocal(
+      asked ? dateFromSeconds(asked->asDouble()) : platform().clock.now(), kDateFormat);
+}
+
 }  // namespace
 
 const LogScope* sessionLogScope() { return VXReportingProcessState::current().sessionLogScope(); }
@@ -387,6 +400,7 @@ std::optional<Error> VXReportingSession::checkNested() const {
 
 void VXReportingSession::writeSummaryJson() {
   serviceQueue()->assertIsCurrent();
+  const std::string date = fileDate();  // each stop asks: what comes after it keeps its place
   if (!VXReportingIsInternalBuild()) return;
   if (!received_.isPresent() || received_.nestedSize() == 0) return;
   const Payload information = userInfo_->snapshot();
@@ -398,7 +412,6 @@ void VXReportingSession::writeSummaryJson() {
   }
 
   DiagnosticFiles& files = platform().diagnosticFiles;
-  const std::string date = platform().clock.formatLocal(platform().clock.now(), kDateFormat);
   const std::string directory = files.logsDirectory() + kReportingSubdirectory;
   if (const std::optional<Error> error = files.createDirectory(directory, kDirectoryMode)) {
     VX_LOG(sessionLogScope(), Error, "can't create logging directory at %s: %s", directory.c_str(),
