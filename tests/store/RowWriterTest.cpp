@@ -34,23 +34,34 @@ class RowWriterTest : public StoreTest {
 };
 
 TEST_F(RowWriterTest, EveryColumnIsWhatWasGivenAndOfItsKind) {
-  add(opening(std::make_shared<RelayRow>(), {{kVyrReportingSessionInfoSessionID, int32_t{-1}}},
-              Payload()));
+  const auto alone = std::make_shared<RelayRow>();
+  add(opening(alone, {{kVyrReportingSessionInfoSessionID, int32_t{-1}}}, Payload()));
+  add(RelayMessageRecord{alone, ofLength(100), 1, 1});
+  for (const std::size_t allowance : {50, 101}) {  // both rows or none
+    const auto cut = writer.write(batch, 0, 2, {}, allowance);
+    EXPECT_EQ(cut->last, 1u);
+    EXPECT_EQ(cut->wanted, 102u);
+    EXPECT_EQ(cut->rows, 0u);
+    EXPECT_EQ(query("SELECT count(*) FROM relay_sessions").at(0), "0");
+  }
+  EXPECT_TRUE(write().ok());
+  EXPECT_EQ(written.rows, 2u);
+  query("DELETE FROM relay_messages");
   add(opening(row, sessionInfo(int64_t{1} << 40)), 2);
   add(RelayMessageRecord{row, PayloadBuilder().set("x", 0.5).set("t", true).build(), 65535, 65534},
       2.5);
   add(event("name", numbered(1)), 3);
   add(PowerRecord{28, "Lumo_Haptics", numbered(2)}, 4);
   EXPECT_TRUE(write({{"what", "", 0, "why"}, {"what", "t", 3, "why"}}).ok());
-  EXPECT_EQ(written.rows, 5u);
+  EXPECT_EQ(written.rows, 4u);
   EXPECT_THAT(query("SELECT * FROM relay_sessions"),
               ElementsAre("1|1.5|-1|null|null|||null|null|{}|null|null|null|null|null",
                           "2|2.0|1099511627776|19|2.5|c|s|1|0|{\"clientName\":\"c\","
                           "\"serviceName\":\"s\"}|null|null|null|null|null"));
   EXPECT_THAT(
       query("SELECT * FROM relay_messages"),
-      ElementsAre("1|2.5|2|65535|65534|{\"x\":0.5,\"t\":true}|null|null|null|null|null|null|null"));
-  EXPECT_THAT(query("SELECT * FROM analytics_events"), ElementsAre("2|3.0|name|{\"i\":1}"));
+      ElementsAre("2|2.5|2|65535|65534|{\"x\":0.5,\"t\":true}|null|null|null|null|null|null|null"));
+  EXPECT_THAT(query("SELECT * FROM analytics_events"), ElementsAre("3|3.0|name|{\"i\":1}"));
   EXPECT_THAT(query("SELECT * FROM power_records"),
               ElementsAre("1|4.0|28|Lumo_Haptics|{\"i\":2}|null|null|null"));
   EXPECT_THAT(query("SELECT id, time = 1576800000, event, table_name, rows, detail "

@@ -34,13 +34,17 @@ std::optional<int64_t> flag(const VyrSessionInfo& info, std::string_view key) {
   return value ? std::optional<int64_t>(*value ? 1 : 0) : std::nullopt;
 }
 
-// A client gives its session's identifier with 64 bits, a standalone message with 32.
-constexpr int64_t kStandaloneID = -1;
-
 int64_t sessionIDOf(const VyrSessionInfo& info) {
   constexpr std::string_view kKey = kVyrReportingSessionInfoSessionID;
   if (const auto wide = infoValue<int64_t>(info, kKey)) return *wide;
   return infoValue<int32_t>(info, kKey).value_or(0);
+}
+
+// A client gives its session's identifier with 64 bits, a standalone message with 32.
+bool isStandalone(const RelayRow& session) {
+  return session.information != nullptr &&
+         infoValue<int32_t>(session.information->first, kVyrReportingSessionInfoSessionID)
+             .has_value();
 }
 
 std::string textUnder(const Payload& payload, std::string_view key) {
@@ -66,6 +70,7 @@ RowWriter::RowWriter(sqlite3* database, std::size_t mostText, EndWord endWord, C
       endSession_(database,
                   "UPDATE relay_sessions SET ended_at = ?, ended_how = ? WHERE id = ?"
                   " AND ended_at IS NULL"),
+      removeSession_(database, "DELETE FROM relay_sessions WHERE id = ?"),
       addMark_(database, "INSERT INTO store_marks(call, last_row) VALUES(?, ?)"),
       removeMarks_(database,
                    "DELETE FROM store_marks WHERE id <= (SELECT max(id) FROM store_marks) - ?"),
@@ -125,10 +130,11 @@ int RowWriter::writeTransaction(const StoreRecords& batch, std::size_t first, st
 
 bool RowWriter::take(std::size_t bytes, uint32_t user) {
   if (bytes > allowance_) {
-    written_.wanted = bytes;
+    written_.wanted = taken_ + bytes;
     return false;
   }
   allowance_ -= bytes;
+  taken_ += bytes;
   addTo(written_.bytes, user, static_cast<int64_t>(bytes));
   return true;
 }
@@ -170,6 +176,7 @@ KeyColumns RowWriter::columnsOf(const RowKey& key, uint32_t user) {
 }
 
 int RowWriter::writeRecord(const StoreRecords& batch, const StoreRecord& record) {
+  taken_ = 0;
   if (const auto* message = std::get_if<RelayMessageRecord>(&record.what))
     return writeRelayMessage(batch, record, *message);
   if (std::holds_alternative<AnalyticsRecord>(record.what)) {
@@ -179,7 +186,8 @@ int RowWriter::writeRecord(const StoreRecords& batch, const StoreRecord& record)
   }
   if (const auto* opening = std::get_if<RelayOpenRecord>(&record.what)) {
     noteFirst(record, *opening->row);
-    return writeRelaySession(*opening->row);
+    // A standalone's row is written with its message, or not at all.
+    return isStandalone(*opening->row) ? SQLITE_OK : writeRelaySession(*opening->row);
   }
   if (const auto* end = std::get_if<RelayEndRecord>(&record.what))
     return writeRelayEnd(record, *end);
@@ -206,9 +214,7 @@ int RowWriter::writeRelaySession(RelayRow& session) {
   if (known_) {
     if (const auto row = known_->find(session.key)) {
       session.id = *row;
-      // A standalone's message lies in the queue right behind it.
-      session.hasItsMessage = known_->isEarlier(session.key) && session.information != nullptr &&
-                              sessionIDOf(session.information->first) == kStandaloneID;
+      session.hasItsMessage = known_->isEarlier(session.key) && isStandalone(session);
       return SQLITE_OK;
     }
   }
@@ -251,10 +257,24 @@ int RowWriter::writeRelayEnd(const StoreRecord& record, const RelayEndRecord& en
 
 int RowWriter::writeRelayMessage(const StoreRecords& batch, const StoreRecord& record,
                                  const RelayMessageRecord& message) {
+  const std::size_t begunBefore = begun_.size();
+  const int code = writeMessageRow(batch, record, message);
+  if (code != kDoesNotFit || begun_.size() == begunBefore) return code;
+  RelayRow* const session = begun_.back();
+  begun_.pop_back();
+  --written_.rows;
+  const int removed = removeSession_.bind(std::exchange(session->id, 0)).run();
+  return removed == SQLITE_OK ? code : removed;
+}
+
+int RowWriter::writeMessageRow(const StoreRecords& batch, const StoreRecord& record,
+                               const RelayMessageRecord& message) {
   const StoreRecord* event = record.event == StoreRecord::kNone ? nullptr : &batch[record.event];
-  if (isKnown(record) || message.row->hasItsMessage)
-    return event != nullptr ? writeEvent(*event) : SQLITE_OK;
-  if (const int code = writeRelaySession(*message.row); code != SQLITE_OK) return code;
+  const bool known = isKnown(record);
+  if (!known) {
+    if (const int code = writeRelaySession(*message.row); code != SQLITE_OK) return code;
+  }
+  if (known || message.row->hasItsMessage) return event != nullptr ? writeEvent(*event) : SQLITE_OK;
   json_.clear();
   appendJson(json_, message.payload);
   const std::string_view payload = storable(json_, "relay_messages");

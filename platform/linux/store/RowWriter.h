@@ -67,8 +67,11 @@ class RowWriter {
   int writeRelaySession(RelayRow& session);
   static void noteFirst(const StoreRecord& record, RelayRow& session);
   int writeRelayEnd(const StoreRecord& record, const RelayEndRecord& end);
+  // With the session's row, where that waited for its first message: both or none.
   int writeRelayMessage(const StoreRecords& batch, const StoreRecord& record,
                         const RelayMessageRecord& message);
+  int writeMessageRow(const StoreRecords& batch, const StoreRecord& record,
+                      const RelayMessageRecord& message);
   int writePower(const StoreRecord& record, const PowerRecord& power);
   int writeEvent(const StoreRecord& record);
   // The row of an event whose text is in eventJson_.
@@ -106,6 +109,7 @@ class RowWriter {
   Statement addName_;
   Statement findName_;
   Statement endSession_;
+  Statement removeSession_;
   Statement addMark_;
   Statement removeMarks_;
   const EndWord endWord_;
@@ -114,6 +118,7 @@ class RowWriter {
   std::vector<LedgerNote> leftOut_;  // of the running transaction
   std::vector<RelayRow*> begun_;     // by the running transaction
   std::size_t allowance_ = 0;        // what is left of it
+  std::size_t taken_ = 0;            // of it, by the record that is being written
   std::string json_;
   std::string eventJson_;
   std::optional<KnownRows> known_;
