@@ -3,7 +3,7 @@ import threading
 import time
 
 from harness import CREATE, SEND, SET_TYPE, START, STOP, Client
-from service import PATIENCE, spread
+from service import CONFIGURATION, PATIENCE, spread
 from store_check import Check, stopped
 from traffic import ALARMS, Session, Start, scene
 
@@ -66,7 +66,7 @@ def end_marker_session(service, traffic):
     c.close()
 
 
-def settled(traffic, aside=(), seconds=1):
+def settled(traffic, aside=None, seconds=1):
     """A check while the daemon runs, when nothing lacks or nothing has come for some seconds."""
     check, since = Check(traffic, patient=True, aside=aside), time.monotonic()
     while check.lacks() and time.monotonic() < since + seconds:
@@ -79,15 +79,16 @@ def settled(traffic, aside=(), seconds=1):
 def chain(argument):
     """Rounds in the same folders."""
     seed, rounds, waits, kept_open = argument
-    with scene(seed) as (r, service, traffic):
+    with scene(seed, CONFIGURATION + '[store]\nmax_bytes = "1GiB"\n') as (r, service, traffic):  # nothing goes for its size
         # With slow syncs the store's thread lags: sessions stay in set-up, rows in the queue.
         shim = {"sync_ms": "5,80"} if r.random() < 0.5 else {}
-        twice_killed = set()
+        twice_killed = {}  # rounds whose journal may be moved aside, with the moment
         service.start(**shim)
         for n in range(rounds):
             (kept_open_until_killed if kept_open else loaded_until_killed)(r, service, traffic)
             deaths = r.choice((0, 0, 0, 0, 0, 0, 1, 1, 1, 2))  # of those that recover
-            twice_killed |= {n} if deaths > 1 else set()
+            if deaths > 1:
+                twice_killed[n] = time.monotonic()
             for _ in range(deaths):
                 service.launch(**shim)
                 time.sleep(10 ** r.uniform(-3, -1))
@@ -96,7 +97,7 @@ def chain(argument):
         end_marker_session(service, traffic)
         # A journal whose recovery died twice is moved aside, and the ledger says so.
         moved = sum("moved_aside" in text and "journal" in text for text, _ in service.ledger())
-        aside = twice_killed if moved else set()
+        aside = twice_killed if moved else {}
         if waits:
             time.sleep(max(0, max((m.due for m in traffic.messages.values()), default=0) - time.monotonic()))
         live = settled(traffic, aside)

@@ -14,7 +14,7 @@ def text_of(value):
     return str(int(value)) if isinstance(value, bool) else str(value)
 
 
-def stopped(traffic, name, aside=()):
+def stopped(traffic, name, aside=None):
     """Stops the daemon, which must end well, and checks its store."""
     status = traffic.service.stop()
     traffic.process_ended("service_stopped")
@@ -26,12 +26,12 @@ def stopped(traffic, name, aside=()):
 
 class Check(Outcome):
     """patient: a standalone may still wait for its delay. aside: rounds of which the ledger says that their journal was
-    moved aside."""
+    moved aside, with the moment: it held the standalones of earlier rounds too that were in their delay then."""
     LOSSES = ("missing", "no_end", "files_missing", "summaries_differ", "wrong_end")
 
-    def __init__(self, traffic, name="", patient=False, aside=()):
+    def __init__(self, traffic, name="", patient=False, aside=None):
         super().__init__(name)
-        self.t, self.patient, self.aside = traffic, patient, aside
+        self.t, self.patient, self.aside = traffic, patient, aside or {}
         for figure in ("answered", "stored", "twice", "disorder", "unexpected", "corrupt", *self.LOSSES):
             self.figures[figure] = 0
         try:
@@ -152,7 +152,8 @@ class Check(Outcome):
                 self.count(m, "relayed row", rows.pop(start.row, 0) if start.row else 0, 1, 1)
             else:
                 alone += 1
-                late += s.type == ALARMS and self.patient and time.monotonic() < m.due
+                late += s.type == ALARMS and (self.patient and time.monotonic() < m.due or any(
+                    round_ > m.round and moment < m.due for round_, moment in self.aside.items()))
         for s, start in m.foreign:  # theirs may have stopped, gone or been replaced meanwhile
             surely = s.gone > by
             same = [other for other in self.t.apps.values() if other.id == s.id]

@@ -77,6 +77,7 @@ class Peer(Client):
     def __init__(self, traffic, path):
         super().__init__(path)
         self.traffic, self.waiting, self.sessions, self.unknown, self.highest = traffic, {}, {}, [], 0
+        self.data = b""
 
     def take(self, wait=0):
         """Takes what was answered; False at the end of the stream."""
