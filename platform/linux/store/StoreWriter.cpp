@@ -1,5 +1,6 @@
 #include "platform/linux/store/StoreWriter.h"
 
+#include <sqlite3.h>
 #include <sys/resource.h>
 #include <sys/syscall.h>
 #include <unistd.h>
@@ -76,7 +77,11 @@ void StoreWriter::threadMain() {
   setpriority(PRIO_PROCESS, static_cast<id_t>(syscall(SYS_gettid)), kWriterNiceness);
   runJobs();
   checkDatabase();
-  if (open_) add(open_->retention.apply());
+  if (open_) {
+    add(open_->retention.apply());
+    // The pages that the check has read are of no use to whoever appends.
+    sqlite3_db_release_memory(open_->database.get());
+  }
   StoreBatch batch;
   for (;;) {
     const StoreQueue::Turn turn = queue_.take(batch, pairing_.heldSince());
