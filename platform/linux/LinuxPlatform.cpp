@@ -106,7 +106,7 @@ class HeapPages {
 
   void askForNew() {
     char* const end = heapEnd();
-    if (end > known_) {
+    if (known_ != nullptr && end > known_) {
       char* const begin = known_ - reinterpret_cast<uintptr_t>(known_) % kPage;
       // A hint: a kernel that does not know it brings the pages one by one, as ever.
       (void)madvise(begin, static_cast<std::size_t>(end - begin), MADV_POPULATE_WRITE);
@@ -117,7 +117,7 @@ class HeapPages {
  private:
   static constexpr uintptr_t kPage = 4096;
   static char* heapEnd() { return static_cast<char*>(sbrk(0)); }
-  char* known_ = heapEnd();
+  char* known_ = nullptr;  // before the first pass: what the start has left may stay untouched
 };
 
 class RunningPlatform final : public LinuxPlatform {

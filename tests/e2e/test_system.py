@@ -41,7 +41,6 @@ class SummaryTest(DaemonTest):
         message["a_b"] = message.pop("a b")
         self.assertEqual(second, {"Playback_Start_1": message})
         self.assertEqual(last["Undefined_Unknown_1"]["VX_Session_Summary_Event"], "2")
-        self.assertEqual(os.stat(os.path.dirname(path)).st_mode & 0o777, 0o777)
         self.assertEqual(d.stop(), 0)
         ((category, payload),) = d.rows("SELECT category, payload FROM relay_messages ORDER BY id DESC LIMIT 1")
         self.assertEqual((category, json.loads(payload)), (0xFFFF, last["Undefined_Unknown_1"]))

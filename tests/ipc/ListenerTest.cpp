@@ -107,11 +107,12 @@ TEST_F(ListenerTest, AnybodyMayConnectAndNothingIsLeftBehind) {
   EXPECT_FALSE(std::filesystem::exists(path()));
 }
 
-TEST_F(ListenerTest, ConnectionsOfOneUserAndInAllAreLimited) {
+TEST_F(ListenerTest, ConnectionsOfOneUserAreLimited) {
   options.maxConnectionsPerUser = 2;
   fillUp();
-  std::swap(options.maxConnectionsPerUser, options.maxConnections);
-  clients.clear();
+}
+TEST_F(ListenerTest, ConnectionsInAllAreLimited) {
+  options.maxConnections = 2;
   fillUp();
 }
 

@@ -79,7 +79,6 @@ TEST_F(ThrottleTest, OnlyTheLastOfABurstRunsEachKeyAfterItsOwnDelay) {
   p.threading.at(100ms, [&] { add("late", held(0.25, 4)); });  // waits for the loop, long due
   work(2s);
   EXPECT_THAT(ran, ElementsAre("fast@250", "third@900", "slow@1500", "late@1600"));
-  EXPECT_EQ(throttle->timersInFlight(), 0u);
 }
 
 TEST_F(ThrottleTest, ZeroAndLessRunOnTheNextPassAndKeysMayComeAgain) {

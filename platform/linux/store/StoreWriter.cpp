@@ -1,5 +1,6 @@
 #include "platform/linux/store/StoreWriter.h"
 
+#include <sqlite3.h>
 #include <sys/resource.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
@@ -137,6 +138,8 @@ Status StoreWriter::begin() {
   }
   open_.emplace(std::move(unchecked_.database), *beginning_, options_, endWord_, clock_);
   add(open_->retention.apply());
+  // The pages that the check has read are of no use to whoever appends.
+  sqlite3_db_release_memory(open_->database.get());
   rememberFiles();
   return {};
 }
