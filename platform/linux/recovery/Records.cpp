@@ -26,8 +26,9 @@ T numberAt(std::span<const uint8_t> bytes, std::size_t offset) {
 
 template <class T>
 void put(std::vector<uint8_t>& head, T number) {
-  const auto* const bytes = reinterpret_cast<const uint8_t*>(&number);
-  head.insert(head.end(), bytes, bytes + sizeof number);
+  const std::size_t size = head.size();
+  head.resize(size + sizeof number);
+  std::memcpy(head.data() + size, &number, sizeof number);
 }
 
 void put(std::vector<uint8_t>& head, const Payload& facts) {
