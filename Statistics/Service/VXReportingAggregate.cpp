@@ -78,8 +78,12 @@ Status VXReportingAggregate::restore(const State& state) {
   }
   Result<Contents> rows =
       VXReportingRows::restore(platform().aggregates, state.aggregate, state.bytes);
-  (void)exchange(rows.ok() ? std::move(rows).value() : nullptr, true);
-  return rows.status();
+  if (!rows.ok()) {
+    (void)exchange(nullptr, true);
+    return rows.status();
+  }
+  (void)exchange(std::move(rows).value(), true);
+  return {};
 }
 
 uint64_t VXReportingAggregate::unrecordedBytes() const {

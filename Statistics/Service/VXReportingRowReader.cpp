@@ -73,7 +73,8 @@ bool VXReportingRowReader::nextBlock() {
 
 uint64_t VXReportingRowReader::number() {
   uint64_t number = 0;
-  at_ = Format::readNumber(at_, end_, number);
+  const uint8_t* const after = Format::readNumber(at_, end_, number);
+  at_ = after != nullptr ? after : end_;
   return number;
 }
 

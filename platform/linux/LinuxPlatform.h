@@ -31,8 +31,8 @@ class LinuxPlatform {
 
   // After the listener's resume has returned: drains the relay queues, commits the store and ends
   // all threads, within five seconds of the request to end, or longer while rows are still being
-  // committed. What is not committed then moves to the state folder, as journal, for the next start.
-  // The exit status: 0, or 1 when something accepted is lost.
+  // committed. What is not committed then moves to the state folder, as journal, for the next
+  // start. The exit status: 0, or 1 when something accepted is lost.
   virtual int shutDown() = 0;
 };
 
