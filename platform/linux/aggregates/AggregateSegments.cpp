@@ -31,7 +31,16 @@ std::size_t sizeIndex(std::size_t blockBytes) {
   return static_cast<std::size_t>(std::bit_width((blockBytes - 1) / kSmallest));
 }
 
+// Where names begin, so that no two processes agree.
+uint64_t byChance() {
+  std::random_device random;
+  return uint64_t{random()} << 32 | random();
+}
+
 }  // namespace
+
+AggregateSegments::AggregateSegments(AggregateOptions options)
+    : options_(std::move(options)), named_(byChance()), nextFile_(byChance()) {}
 
 // ---------------------------------------------------------------------------------------------------------------------
 // What an earlier process left
@@ -40,8 +49,7 @@ Status AggregateSegments::open(std::vector<std::string>& complaints) {
   Result<JournalFolder> opened =
       JournalFolder::open(options_.folder, JournalFolder::IfMissing::Create);
   if (!opened.ok()) return opened.status();
-  MutexLock lock(mutex_);
-  folder_ = std::move(opened).value();
+  Segments unused;
   std::error_code error;
   std::vector<std::string> names;
   for (std::filesystem::directory_iterator at(options_.folder, error), end; !error && at != end;
@@ -49,11 +57,16 @@ Status AggregateSegments::open(std::vector<std::string>& complaints) {
     std::string name = at->path().filename();
     if (name.starts_with(kPrefix) && name.ends_with(kSuffix)) names.push_back(std::move(name));
   }
-  for (const std::string& name : names) {
-    if (std::string complaint = adopt(name); !complaint.empty())
-      complaints.push_back(std::move(complaint));
+  {
+    MutexLock lock(mutex_);
+    folder_ = std::move(opened).value();
+    for (const std::string& name : names) {
+      if (std::string complaint = adopt(name); !complaint.empty())
+        complaints.push_back(std::move(complaint));
+    }
+    unused = takeUnused();
   }
-  removeUnused();
+  unmap(std::move(unused));
   return {};
 }
 
@@ -79,7 +92,19 @@ std::string AggregateSegments::adopt(const std::string& name) {
 }
 
 std::vector<AggregateMemory::Block> AggregateSegments::find(uint64_t aggregate, std::size_t bytes) {
-  MutexLock lock(mutex_);
+  std::vector<Block> blocks;
+  Segments unused;
+  {
+    MutexLock lock(mutex_);
+    blocks = takeFound(aggregate, bytes);
+    unused = takeUnused();
+  }
+  unmap(std::move(unused));
+  return blocks;
+}
+
+std::vector<AggregateMemory::Block> AggregateSegments::takeFound(uint64_t aggregate,
+                                                                 std::size_t bytes) {
   const auto found = adopted_.find(aggregate);
   if (found == adopted_.end()) return {};
   std::vector<Place> places = std::move(found->second);
@@ -98,7 +123,6 @@ std::vector<AggregateMemory::Block> AggregateSegments::find(uint64_t aggregate, 
     blocks.push_back({place.segment->contents(place.index), place.segment->capacity(), true});
     have += blocks.back().size;
   }
-  removeUnused();
   return blocks;
 }
 
@@ -110,13 +134,8 @@ void AggregateSegments::setUnrecordedHandler(Function<void(const Status& why)> h
   onUnrecorded_ = std::move(handler);
 }
 
-// By chance where it begins, so that no two processes agree.
 uint64_t AggregateSegments::nameAggregate() {
   MutexLock lock(mutex_);
-  if (named_ == 0) {
-    std::random_device random;
-    named_ = uint64_t{random()} << 32 | random();
-  }
   while (++named_ == 0 || adopted_.contains(named_)) {
   }
   return named_;
@@ -237,33 +256,59 @@ void AggregateSegments::snapshotBegan() {
 }
 
 void AggregateSegments::snapshotCompleted() {
-  MutexLock lock(mutex_);
-  for (const Place& place : cut_) {
-    counters_.waitingBytes -= place.segment->capacity();
-    makeFree(place);
+  Segments unused;
+  {
+    MutexLock lock(mutex_);
+    for (const Place& place : cut_) {
+      counters_.waitingBytes -= place.segment->capacity();
+      makeFree(place);
+    }
+    cut_.clear();
+    if (adoptedCut_) {
+      for (const auto& [aggregate, places] : adopted_)
+        for (const Place& place : places) makeFree(place);
+      adopted_.clear();
+    }
+    unused = takeUnused();
   }
-  cut_.clear();
-  if (adoptedCut_) {
-    for (const auto& [aggregate, places] : adopted_)
-      for (const Place& place : places) makeFree(place);
-    adopted_.clear();
-  }
-  removeUnused();
+  unmap(std::move(unused));
 }
 
-void AggregateSegments::removeUnused() {
+// Their files are gone. Their memory counts until it is.
+AggregateSegments::Segments AggregateSegments::takeUnused() {
   for (std::vector<AggregateSegment*>& available : available_)
     std::erase_if(available, [](const AggregateSegment* segment) { return segment->isUnused(); });
-  std::erase_if(segments_, [this](const auto& entry) REQUIRES(mutex_) {
-    const AggregateSegment& segment = *entry.second;
-    if (!segment.isUnused()) return false;
-    counters_.fileBytes -= segment.bytes();
+  Segments unused;
+  for (auto at = segments_.begin(); at != segments_.end();) {
+    const AggregateSegment& segment = *at->second;
+    if (!segment.isUnused()) {
+      ++at;
+      continue;
+    }
     if (segment.blockBytes() <= kLargest)
       sizeBytes_[sizeIndex(segment.blockBytes())] -= segment.bytes();
     unlink(segment.path().c_str());
-    return true;
-  });
+    unused.push_back(std::move(at->second));
+    at = segments_.erase(at);
+  }
   acquiresUntilGrowth_ = 0;
+  return unused;
+}
+
+void AggregateSegments::unmap(Segments unused) {
+  if (unused.empty()) return;
+  Function<void()> work = [this, unused = std::move(unused)]() mutable {
+    for (std::unique_ptr<AggregateSegment>& segment : unused) {
+      const std::size_t bytes = segment->bytes();
+      segment.reset();
+      MutexLock lock(mutex_);
+      counters_.fileBytes -= bytes;
+    }
+  };
+  if (options_.runElsewhere)
+    options_.runElsewhere(std::move(work));
+  else
+    work();
 }
 
 void AggregateSegments::discard() {

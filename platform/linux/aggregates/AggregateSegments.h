@@ -23,6 +23,9 @@ struct AggregateOptions {
   // The journal's: what is moved with it stays together.
   std::string folder;
   std::size_t maxBytes = std::size_t{192} << 20;  // of files
+  // Runs work soon, on a thread that may be held up: giving memory back to the system takes half a
+  // millisecond for each MiB. Without it that is done at once.
+  Function<void(Function<void()> work)> runElsewhere;
 };
 
 struct AggregateCounters {
@@ -34,10 +37,10 @@ struct AggregateCounters {
 
 // Files of blocks, each of one size. A file whose blocks are all free goes back to the system.
 // Beyond maxBytes, and where the files cannot be had, blocks are of the heap. Owned by the
-// platform; thread-safe. Outlives every block.
+// platform; thread-safe. Outlives every block and the work that runs elsewhere.
 class AggregateSegments final : public AggregateMemory {
  public:
-  explicit AggregateSegments(AggregateOptions options = {}) : options_(std::move(options)) {}
+  explicit AggregateSegments(AggregateOptions options = {});
 
   // Takes over what an earlier process left. Without success, and before it, blocks are of the
   // heap. Files that are not understood are set aside; `complaints` names them.
@@ -57,16 +60,19 @@ class AggregateSegments final : public AggregateMemory {
 
  private:
   using Place = AggregateSegment::Place;
+  using Segments = std::vector<std::unique_ptr<AggregateSegment>>;
   // Of blocks whose segments hold many: 512 bytes to 64 KiB, in powers of two.
   static constexpr std::size_t kSizes = 8;
 
   std::string adopt(const std::string& name) REQUIRES(mutex_);
+  std::vector<Block> takeFound(uint64_t aggregate, std::size_t bytes) REQUIRES(mutex_);
   Result<Place> take(std::size_t bytes) REQUIRES(mutex_);
   Result<AggregateSegment*> grow(std::size_t blockBytes, uint32_t blocks) REQUIRES(mutex_);
   void add(std::unique_ptr<AggregateSegment> segment) REQUIRES(mutex_);
   Place placeOf(const Block& block) REQUIRES(mutex_);
   void makeFree(const Place& place) REQUIRES(mutex_);
-  void removeUnused() REQUIRES(mutex_);
+  Segments takeUnused() REQUIRES(mutex_);
+  void unmap(Segments unused) EXCLUDES(mutex_);
 
   const AggregateOptions options_;
   mutable Mutex mutex_;
@@ -78,8 +84,9 @@ class AggregateSegments final : public AggregateMemory {
   std::vector<Place> released_ GUARDED_BY(mutex_);  // since the newest snapshot was begun
   std::vector<Place> cut_ GUARDED_BY(mutex_);       // before it
   bool adoptedCut_ GUARDED_BY(mutex_) = false;
-  uint64_t named_ GUARDED_BY(mutex_) = 0;
-  uint64_t nextFile_ GUARDED_BY(mutex_) = 1;
+  uint64_t named_ GUARDED_BY(mutex_);
+  // Of the next file. A journal that is moved takes its files along, to where others may be.
+  uint64_t nextFile_ GUARDED_BY(mutex_);
   uint32_t acquiresUntilGrowth_ GUARDED_BY(mutex_) = 0;
   AggregateCounters counters_ GUARDED_BY(mutex_);
   Function<void(const Status&)> onUnrecorded_ GUARDED_BY(mutex_);
