@@ -92,7 +92,7 @@ int replay(const fs::path& journal, const fs::path& into) {
   vx::installPlatform(&platform->services());
   platform->begin();
   platform->recover([] { return vx::VXReportingServiceDelegate::create(); });
-  vx::VXReportingProcessState::current().delayedMessages().sendAllNow();
+  vx::VXReportingProcessState::current().delayedMessages().sendAllFromNow();
   return platform->shutDown();
 }
 

@@ -50,6 +50,7 @@ void VXReportingDelayedMessages::add(VXReportingDelayedMessage message,
       bytes_ += message.message.encoded().size();
       waiting_.emplace(Key{due, next_++}, Waiting{std::move(message), std::move(cause)});
       if (isTooMuch()) overdue = waiting_.begin()->first.first;
+      if (atOnce_) overdue = Monotonic::max();
     }
     wakeAfter(due - now, due);
     if (overdue > now) wakeAfter({}, overdue);
@@ -63,7 +64,13 @@ void VXReportingDelayedMessages::wakeAfter(std::chrono::nanoseconds delay, Monot
   });
 }
 
-void VXReportingDelayedMessages::sendAllNow() { sendDue(Monotonic::max()); }
+void VXReportingDelayedMessages::sendAllFromNow() {
+  {
+    MutexLock lock(mutex_);
+    atOnce_ = true;
+  }
+  sendDue(Monotonic::max());
+}
 
 void VXReportingDelayedMessages::sendDue(Monotonic until) {
   for (;;) {

@@ -39,8 +39,9 @@ class VXReportingDelayedMessages : public std::enable_shared_from_this<VXReporti
   void add(VXReportingDelayedMessage message);
   // For what a message was kept for by an earlier process.
   void add(VXReportingDelayedMessage message, std::unique_ptr<WorkCause> cause);
-  // Sends all, in the order in which they are due, before it returns; waits for nothing.
-  void sendAllNow();
+  // Sends all, in the order in which they are due, before it returns; waits for nothing. Those that
+  // come later, of work that is still queued, do not wait any more: the process is about to end.
+  void sendAllFromNow();
 
   // Has all of them recorded anew, as RecordedInputs::keepDelayed does.
   void keepAgain();
@@ -66,6 +67,7 @@ class VXReportingDelayedMessages : public std::enable_shared_from_this<VXReporti
   std::map<Key, Waiting> waiting_ GUARDED_BY(mutex_);
   std::size_t bytes_ GUARDED_BY(mutex_) = 0;  // of their encodings
   uint64_t next_ GUARDED_BY(mutex_) = 0;
+  bool atOnce_ GUARDED_BY(mutex_) = false;
 };
 
 }  // namespace vx

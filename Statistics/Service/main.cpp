@@ -26,7 +26,7 @@ int main() {
         vx::VXReportingServiceDelegate::create();
     services.serviceListener.setDelegate(delegate);
     services.serviceListener.resume();
-    vx::VXReportingProcessState::current().delayedMessages().sendAllNow();
+    vx::VXReportingProcessState::current().delayedMessages().sendAllFromNow();
   }
   return linuxPlatform->shutDown();
 }

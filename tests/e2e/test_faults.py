@@ -1,4 +1,5 @@
 """Failing surroundings: the other clients notice nothing, and nothing accepted is lost."""
+import glob
 import resource
 
 from harness import *
@@ -52,6 +53,18 @@ class Faults(DaemonTest):
         d.database = path + "/x/telemetry.db"
         d.wait_until(lambda: os.path.exists(d.database) and "written again" in d.log(), "the rows are written")
         self.assertEqual(d.rows("SELECT category FROM relay_messages ORDER BY id"), [(3,), (0xFFFF,)])
+
+    def test_what_is_delayed_goes_out_with_a_stop_that_is_asked_for_twice(self):
+        d = self.daemon()
+        c = d.client()
+        c.call(CREATE, 1)
+        c.call(SET_TYPE, 4, 1)
+        for _ in range(20):  # each up to a minute, to a session that is not started
+            c.call(SEND, {"a": 1}, 3, 1, [1])
+        d.process.send_signal(signal.SIGTERM)
+        self.assertEqual(d.stop(), 0)
+        self.assertEqual(d.rows("SELECT count(*) FROM relay_messages"), [(20,)])
+        self.assertEqual(glob.glob(d.folder + "/*/journal/*"), [])
 
     def test_killed_and_started_again(self):
         d = self.daemon()

@@ -350,7 +350,7 @@ TEST_F(RecoveryTest, AStandaloneWaitsForTheRestOfItsDelay) {
     send(1, 1, {11});
     if (original == Original::Done) service->rows.commit();
     if (rows.empty()) {
-      processState->delayedMessages().sendAllNow();
+      processState->delayedMessages().sendAllFromNow();
       rows = written();
       EXPECT_THAT(rows, SizeIs(2));
       service->rows.commit();
