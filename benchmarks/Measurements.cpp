@@ -297,8 +297,9 @@ void measureIdle(Results& results, const Effort& effort) {
               7, 4.5, false);
   client.create(1);
   client.start(1);
+  // The rows of the start are committed by then.
+  std::this_thread::sleep_for(std::chrono::seconds(6));
   daemon.waitUntilIdle();
-  std::this_thread::sleep_for(std::chrono::seconds(1));
   const uint64_t before = daemon.voluntarySwitches();
   std::this_thread::sleep_for(std::chrono::seconds(effort.idleSeconds));
   const double wakeups = static_cast<double>(daemon.voluntarySwitches() - before) * 60.0 /

@@ -161,7 +161,35 @@ TEST_F(JournalFilesTest, AFileThatIsBlankIsRemovedWithAWord) {
   struct stat info {};
   stat(onlySegment().c_str(), &info);
   EXPECT_EQ(info.st_mode & 0777, 0600u);
-  EXPECT_EQ(static_cast<std::size_t>(info.st_blocks) * 512, kSegmentBytes) << "it has holes";
+}
+
+// Of each file: a write to a page that is not would end the process once the file system is full.
+TEST_F(JournalFilesTest, AllocatesItsFirstSegmentAsItFillsAndTheOthersWhole) {
+  constexpr std::size_t kStep = std::size_t{256} << 10;
+  const auto allocated = [this] {
+    std::vector<std::size_t> bytes;
+    for (const std::string& name : files()) {
+      struct stat info {};
+      stat((options.folder + "/" + name).c_str(), &info);
+      bytes.push_back(static_cast<std::size_t>(info.st_blocks) * 512);
+    }
+    return bytes;
+  };
+  open();
+  const std::size_t space = kStep - kFirstEntry - 2 * sizeof(EntryHeader);
+  appendDone(1);
+  EXPECT_THAT(allocated(), ElementsAre(kStep));
+  open();  // what it finds it does not add to
+  EXPECT_THAT(allocated(), ElementsAre(kStep));
+  journal->discard();
+  open();
+  ASSERT_TRUE(append(2, Payload(), Bytes(space / 2)).ok());
+  ASSERT_TRUE(append(3, Payload(), Bytes(space - padded(space / 2))).ok());
+  EXPECT_THAT(allocated(), ElementsAre(2 * kStep)) << "the next length lies behind the first step";
+  for (int i = 0; i < 5; ++i) ASSERT_TRUE(append(4, Payload(), Bytes(500000)).ok());
+  EXPECT_EQ(allocated().front(), kSegmentBytes - kStep);
+  EXPECT_EQ(allocated().at(1), kSegmentBytes);
+  EXPECT_EQ(readKinds(), "2d 3d 4d 4d 4d 4d 4d");
 }
 
 TEST_F(JournalFilesTest, AFolderOfOthersIsRefused) {

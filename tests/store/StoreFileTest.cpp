@@ -39,9 +39,9 @@ TEST_F(StoreFileTest, CommittedRowsSurviveAPowerCutAndReadersDoNotWait) {
   ASSERT_TRUE(opened.status.ok());
   EXPECT_THAT(query(opened, "PRAGMA journal_mode"), ElementsAre("wal"));
   EXPECT_THAT(query(opened, "PRAGMA synchronous"), ElementsAre("2"));
-  EXPECT_THAT(query(opened, "PRAGMA page_size"), ElementsAre("4096"));
+  EXPECT_THAT(query(opened, "PRAGMA page_size"), ElementsAre("8192"));
   EXPECT_THAT(query(opened, "PRAGMA journal_size_limit"), ElementsAre("4194304"));
-  EXPECT_THAT(query(opened, "PRAGMA wal_autocheckpoint"), ElementsAre("1024"));
+  EXPECT_THAT(query(opened, "PRAGMA wal_autocheckpoint"), ElementsAre("512"));
 }
 
 TEST_F(StoreFileTest, WhatIsNoDatabaseIsDamagedAndWhatCannotBeUsedIsNot) {

@@ -52,8 +52,7 @@ Journal::Journal(JournalOptions options, JournalFolder folder)
 // Takes over a file that is there; what there is to say when it had to be set aside.
 std::string Journal::adopt(const std::string& name) {
   MutexLock lock(mutex_);
-  const Result<JournalFolder::Opened> opened =
-      folder_.openSegment(name, JournalFolder::Access::Write);
+  Result<JournalFolder::Opened> opened = folder_.openSegment(name, JournalFolder::Access::Write);
   const SegmentHeader header = opened.ok() ? opened->header : SegmentHeader{};
   if (opened.ok() && header.state == SegmentHeader::kFree) {
     folder_.remove(name);
@@ -63,7 +62,7 @@ std::string Journal::adopt(const std::string& name) {
   std::string why = opened.ok() ? name + " is of another store" : opened.status().text();
   if (opened.ok() && header.epoch == options_.epoch) {
     next_.goPast(header);
-    Result<JournalSegment::Pointer> segment = JournalSegment::map(opened->fd, name);
+    Result<JournalSegment::Pointer> segment = JournalSegment::map(std::move(opened->fd), name);
     if (segment.ok()) {
       sealed_.push_back(std::move(segment).value());
       return {};
@@ -217,6 +216,13 @@ inline EntryHeader* Journal::reserve(std::size_t length, Use use, Status& status
     status = roll(use);
     if (!status.ok()) return nullptr;
   }
+  // With the length of the next one.
+  const std::size_t end = std::min(offset_ + padded(length) + kEntryAlignment, kSegmentBytes);
+  status = active_->allocate(end);
+  if (!status.ok()) [[unlikely]] {
+    ++counters_.full;
+    return nullptr;
+  }
   return reinterpret_cast<EntryHeader*>(active_->at(offset_));
 }
 
@@ -280,7 +286,7 @@ bool Journal::isWithinShare(Use use) const {
 void Journal::keepSpares() {
   if (!severalNeeded_) return;
   while (free_.size() < kSpares && isWithinShare(Use::Snapshot)) {
-    Result<JournalSegment::Pointer> spare = grow();
+    Result<JournalSegment::Pointer> spare = grow(kSegmentBytes);
     if (!spare.ok()) return;
     free_.push_back(std::move(spare).value());
   }
@@ -302,10 +308,11 @@ bool Journal::lookForCapacity() {
 
 Result<JournalSegment::Pointer> Journal::acquire(Use use) {
   if (discarded_ || !isWithinShare(use)) return full("cannot record a call");
-  if (free_.empty()) return grow();
+  const bool first = active_ == nullptr && sealed_.empty();
+  if (free_.empty()) return grow(first ? JournalSegment::kStep : kSegmentBytes);
   // The last one is a snapshot's.
   if (use != Use::Snapshot && free_.size() == 1 && severalNeeded_) {
-    if (Result<JournalSegment::Pointer> grown = grow(); grown.ok()) return grown;
+    if (Result<JournalSegment::Pointer> grown = grow(kSegmentBytes); grown.ok()) return grown;
     return full("cannot record a call");
   }
   JournalSegment::Pointer segment = std::move(free_.back());
@@ -313,13 +320,13 @@ Result<JournalSegment::Pointer> Journal::acquire(Use use) {
   return segment;
 }
 
-Result<JournalSegment::Pointer> Journal::grow() {
+Result<JournalSegment::Pointer> Journal::grow(std::size_t bytes) {
   if (appendsUntilGrowth_ > 0) {
     --appendsUntilGrowth_;
     return full("cannot enlarge the journal");
   }
   const std::string name = folder_.freshSegment(nextFile_);
-  Result<UniqueFd> fd = folder_.createSegment(name);
+  Result<UniqueFd> fd = folder_.createSegment(name, bytes);
   if (!fd.ok()) {
     appendsUntilGrowth_ = kAppendsBetweenGrowths;
     const int code = fd.status().code();
@@ -327,7 +334,7 @@ Result<JournalSegment::Pointer> Journal::grow() {
       return full("cannot enlarge the journal");
     return fd.status();
   }
-  Result<JournalSegment::Pointer> segment = JournalSegment::map(*fd, name);
+  Result<JournalSegment::Pointer> segment = JournalSegment::map(std::move(fd).value(), name);
   if (!segment.ok()) folder_.remove(name);
   return segment;
 }

@@ -61,6 +61,9 @@ struct JournalCounters {
 // Entries fill one segment after the other. Segments are used again, oldest first, when a later
 // generation's snapshot is complete, every call in them is done, and no payload lies in them.
 //
+// The first is allocated as it fills: most processes need little of it. All others are allocated
+// whole.
+//
 // Bounds: maxBytes of files. Calls and notes may fill three quarters of them, so that there is
 // always space for the snapshot that makes the rest free.
 class Journal {
@@ -122,7 +125,7 @@ class Journal {
   void publish(EntryHeader* entry, std::size_t length) REQUIRES(mutex_);
   Status roll(Use use) REQUIRES(mutex_);
   Result<JournalSegment::Pointer> acquire(Use use) REQUIRES(mutex_);
-  Result<JournalSegment::Pointer> grow() REQUIRES(mutex_);
+  Result<JournalSegment::Pointer> grow(std::size_t bytes) REQUIRES(mutex_);
   void recycle() REQUIRES(mutex_);
   void makeFree(JournalSegment::Pointer segment) REQUIRES(mutex_);
   std::size_t segmentsInUse() const REQUIRES(mutex_);

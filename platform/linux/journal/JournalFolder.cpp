@@ -148,12 +148,13 @@ Result<JournalFolder::Opened> JournalFolder::openSegment(const std::string& name
   return opened;
 }
 
-Result<UniqueFd> JournalFolder::createSegment(const std::string& name) const {
+Result<UniqueFd> JournalFolder::createSegment(const std::string& name, std::size_t bytes) const {
   const std::string path = path_ + "/" + name;
   UniqueFd fd(
       openat(fd_.get(), name.c_str(), O_RDWR | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0600));
   if (!fd) return Status::lastError(quoted("cannot create", path));
-  const int code = posix_fallocate(fd.get(), 0, off_t{kSegmentBytes});
+  int code = ftruncate(fd.get(), off_t{kSegmentBytes}) == 0 ? 0 : errno;
+  if (code == 0) code = posix_fallocate(fd.get(), 0, static_cast<off_t>(bytes));
   if (code == 0) return fd;
   remove(name);
   return Status::posix(quoted("cannot allocate", path), code);

@@ -1,7 +1,10 @@
 #include "platform/linux/journal/JournalSegment.h"
 
+#include <fcntl.h>
 #include <sys/mman.h>
+#include <sys/stat.h>
 
+#include <algorithm>
 #include <utility>
 
 #include "base/Mutex.h"
@@ -37,7 +40,10 @@ void JournalSegment::tellCallsDone() {
   if (done.handler != nullptr) done.handler(done.with);
 }
 
-Result<JournalSegment::Pointer> JournalSegment::map(const UniqueFd& fd, std::string name) {
+Result<JournalSegment::Pointer> JournalSegment::map(UniqueFd fd, std::string name) {
+  struct stat info {};
+  if (fstat(fd.get(), &info) != 0) return Status::lastError("cannot look at " + name);
+  const bool whole = info.st_blocks * 512 >= off_t{kSegmentBytes};
   // Twice the size holds an aligned part of the size; the rest is given back.
   void* const reserved = mmap(nullptr, 2 * kSegmentBytes, PROT_NONE,
                               MAP_PRIVATE | MAP_ANONYMOUS | MAP_NORESERVE, -1, 0);
@@ -45,8 +51,9 @@ Result<JournalSegment::Pointer> JournalSegment::map(const UniqueFd& fd, std::str
   auto* const first = static_cast<uint8_t*>(reserved);
   const std::size_t before = -reinterpret_cast<uintptr_t>(reserved) & (kSegmentBytes - 1);
   uint8_t* const base = first + before;
-  const bool mapped = mmap(base, kSegmentBytes, PROT_READ | PROT_WRITE,
-                           MAP_SHARED | MAP_FIXED | MAP_POPULATE, fd.get(), 0) != MAP_FAILED;
+  const int how = MAP_SHARED | MAP_FIXED | (whole ? MAP_POPULATE : 0);
+  const bool mapped =
+      mmap(base, kSegmentBytes, PROT_READ | PROT_WRITE, how, fd.get(), 0) != MAP_FAILED;
   const Status status = mapped ? Status() : Status::lastError("cannot map " + name);
   if (before > 0) munmap(first, before);
   munmap(base + kSegmentBytes, kSegmentBytes - before);
@@ -54,12 +61,27 @@ Result<JournalSegment::Pointer> JournalSegment::map(const UniqueFd& fd, std::str
     munmap(base, kSegmentBytes);
     return status;
   }
-  return Pointer(new JournalSegment(base, std::move(name)));
+  if (whole) fd.reset();
+  return Pointer(
+      new JournalSegment(base, std::move(name), std::move(fd), whole ? kSegmentBytes : kStep));
 }
 
-JournalSegment::JournalSegment(uint8_t* base, std::string name)
-    : base_(base), name_(std::move(name)) {
+JournalSegment::JournalSegment(uint8_t* base, std::string name, UniqueFd fd, std::size_t allocated)
+    : base_(base), name_(std::move(name)), fd_(std::move(fd)), allocated_(allocated) {
   header().owner = this;
+}
+
+Status JournalSegment::allocateMore(std::size_t end) {
+  const std::size_t most = std::min(kSegmentBytes, (end + kStep - 1) / kStep * kStep);
+  const std::size_t bytes = most - allocated_;
+  const int code =
+      posix_fallocate(fd_.get(), static_cast<off_t>(allocated_), static_cast<off_t>(bytes));
+  if (code != 0) return Status::posix("cannot allocate " + name_, code);
+  (void)madvise(base_ + allocated_, bytes,
+                MADV_POPULATE_WRITE);  // a fault costs more, page by page
+  allocated_ = most;
+  if (allocated_ == kSegmentBytes) fd_.reset();
+  return {};
 }
 
 JournalSegment::~JournalSegment() { munmap(base_, kSegmentBytes); }

@@ -23,8 +23,12 @@ class JournalSegment {
   };
   using Pointer = std::unique_ptr<JournalSegment, LetGo>;
 
-  // A file that is allocated whole.
-  static Result<Pointer> map(const UniqueFd& fd, std::string name);
+  static constexpr std::size_t kStep = std::size_t{256} << 10;
+  // A file whose first kStep bytes are allocated, or all of it.
+  static Result<Pointer> map(UniqueFd fd, std::string name);
+  // What lies before `end` may be written: what was not allocated would be a SIGBUS on a full
+  // tmpfs.
+  Status allocate(std::size_t end) { return end <= allocated_ ? Status() : allocateMore(end); }
   static JournalSegment* of(const void* inside);
 
   // From here on the file counts; what it held before does not. Nobody may wait for it any more.
@@ -69,7 +73,8 @@ class JournalSegment {
   // touch what other threads count down.
   static constexpr uint64_t kWhileOpen = kMaxEntriesPerSegment * (kOneCall + kOnePayload);
 
-  JournalSegment(uint8_t* base, std::string name);
+  JournalSegment(uint8_t* base, std::string name, UniqueFd fd, std::size_t allocated);
+  Status allocateMore(std::size_t end);
   ~JournalSegment();
   static void tellCallsDone();
   SegmentHeader& header() const { return *reinterpret_cast<SegmentHeader*>(base_); }
@@ -79,6 +84,8 @@ class JournalSegment {
 
   uint8_t* const base_;
   const std::string name_;
+  UniqueFd fd_;  // until it is allocated whole
+  std::size_t allocated_;
   std::atomic<uint64_t> uses_{kAttached};
 };
 

@@ -21,7 +21,7 @@ namespace {
 
 // Set before anything is read: page_size holds for a file that is begun now.
 constexpr const char* kPragmas[] = {
-    "PRAGMA page_size = 4096",   "PRAGMA auto_vacuum = INCREMENTAL",    "PRAGMA journal_mode = WAL",
+    "PRAGMA page_size = 8192",   "PRAGMA auto_vacuum = INCREMENTAL",    "PRAGMA journal_mode = WAL",
     "PRAGMA synchronous = FULL", "PRAGMA journal_size_limit = 4194304", "PRAGMA cache_size = -1024",
     "PRAGMA temp_store = MEMORY"};
 
