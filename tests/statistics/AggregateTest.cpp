@@ -73,32 +73,17 @@ class AggregateTest : public PlatformTest {
     for (uint32_t i = below(6); i > 0; --i) {
       const std::string key =
           below(40) == 0 ? "k" + std::to_string(below(5000)) : kKeys[(first + i) % kKeys.size()];
-      switch (below(depth > 1 ? 7 : 9)) {
-        case 0:
-          builder.set(key, static_cast<int64_t>(random_()) >> below(32));
-          break;
-        case 1:
-          builder.set(key, kDoubles[below(kDoubles.size())]);
-          break;
-        case 2:
-          builder.set(key, static_cast<float>(below(100)) / 8);
-          break;
-        case 3:
-          builder.set(key, below(2) == 0);
-          break;
-        case 4:
-          builder.set(key, PayloadDate{below(100000) / 4.0});
-          break;
-        case 5:
-        case 6:
-          builder.set(key, std::string(below(50) == 0 ? 3000 : below(12), "xy\n,"[below(4)]));
-          break;
-        case 7:
-          builder.set(key, ArrayBuilder().add(below(3)).add("y").add(anyDictionary(depth + 1)));
-          break;
-        default:
-          builder.set(key, anyDictionary(depth + 1));
-      }
+      const uint32_t what = below(depth > 1 ? 7 : 9);
+      if (what == 0) builder.set(key, static_cast<int64_t>(random_()) >> below(32));
+      if (what == 1) builder.set(key, kDoubles[below(kDoubles.size())]);
+      if (what == 2) builder.set(key, static_cast<float>(below(100)) / 8);
+      if (what == 3) builder.set(key, below(2) == 0);
+      if (what == 4) builder.set(key, PayloadDate{below(100000) / 4.0});
+      if (what == 5 || what == 6)
+        builder.set(key, std::string(below(50) == 0 ? 3000 : below(12), "xy\n,"[below(4)]));
+      if (what == 7)
+        builder.set(key, ArrayBuilder().add(below(3)).add("y").add(anyDictionary(depth + 1)));
+      if (what == 8) builder.set(key, anyDictionary(depth + 1));
     }
     return builder.build();
   }

@@ -74,6 +74,13 @@ class PlatformTest : public ::testing::Test {
     }
     return lines;
   }
+  // The same lines in one text, after the name of the step that they came of.
+  std::string told(const std::string& step, const std::vector<std::string>& interesting = {}) {
+    run();
+    std::string lines = step + "\n";
+    for (const std::string& line : gained(interesting)) lines += "  " + line + "\n";
+    return lines;
+  }
   static std::string dataFile(const std::string& name) {
     std::ifstream file(VX_TEST_DATA "/" + name);
     return {std::istreambuf_iterator<char>(file), {}};

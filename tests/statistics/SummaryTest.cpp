@@ -62,21 +62,15 @@ TEST_F(SummaryTest, EventThenFileThenFlush) {
   mark();
   s->stop();
   run();
-  const std::string path =
-      "/logs/Audio/Reporting/20261116-061530+0000-sonik-%2E.%2Fa%20b-haptics.json";
-  EXPECT_THAT(gained(), ElementsAre("trace 0x21042830",
-                                    "log vxrr default sending summary event for reporter 42",
-                                    "trace 0x21042838", "mkdir /logs/Audio/Reporting 777",
-                                    "file " + path, "relay 65535 65535", "flush"));
+  std::string seen = told("stop");
   EXPECT_EQ(p.services.files.size(), 1u);
-  EXPECT_EQ(p.services.files[path], dataFile("summary.json"));
+  EXPECT_EQ(p.services.files.begin()->second, dataFile("summary.json"));
   s->start();
   run();
   mark();
   s->stop();
   s->stop();
-  run();
-  EXPECT_THAT(gained(), ElementsAre("trace 0x21042830", "flush")) << "nothing was received";
+  EXPECT_EQ(seen + told("stop without anything received"), dataFile("stopping.txt"));
 }
 
 TEST_F(SummaryTest, FailuresAreLoggedAndTheStopGoesOn) {
