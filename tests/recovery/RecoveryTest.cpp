@@ -44,7 +44,11 @@ class RecoveryTest : public JournalFixture {
     snapshots.emplace(Snapshots::Means{
         .journal = *journal,
         .clock = service->fakes.clock,
-        .save = [this](auto saved) { return service->delegate->saveState(std::move(saved)); },
+        .save =
+            [this](auto saved) {
+              EXPECT_EQ(hooks, "began");
+              return service->delegate->saveState(std::move(saved));
+            },
         .connections =
             [this] {
               std::unordered_map<const ExportedObject*, SocketListener::Recorded> all;
@@ -57,8 +61,8 @@ class RecoveryTest : public JournalFixture {
             },
         .commitSoon = [this] { service->rows.commit(); },
         .freed = [] {},
-        .began = [] {},
-        .completed = [] {},
+        .began = [this] { hooks = "began"; },
+        .completed = [this] { hooks += std::to_string(snapshots->counters().completed); },
     });
   }
   void endLife() {
@@ -187,11 +191,12 @@ class RecoveryTest : public JournalFixture {
     beginSnapshot();
     service->rows.commit();
     snapshots->afterPass();
-    EXPECT_EQ(snapshots->counters().completed, before + 1);
+    EXPECT_EQ(hooks, "began" + std::to_string(before + 1));
   }
 
   std::vector<std::string> written() { return service->rows.texts(); }
 
+  std::string hooks;  // that the snapshots called
   Date wall{std::chrono::hours(24 * 365 * 50)};
   JournalContents left;
   std::vector<std::string> poisoned;
