@@ -105,10 +105,13 @@ class RunningPlatform final : public LinuxPlatform {
  public:
   RunningPlatform(const Directories& directories, const PlatformConfiguration& configuration)
       : configuration_(configuration),
-        aggregates_(
-            {.folder = CrashSafety::Folders::journalIn(directories.runtime),
-             .runElsewhere =
-                 [this](Function<void()> work) { executor_.background().async(std::move(work)); }}),
+        aggregates_({.folder = CrashSafety::Folders::journalIn(directories.runtime),
+                     .runElsewhere =
+                         [this](Function<void()> work) {
+                           // A call that is run again would not do it: it takes no place in one.
+                           executor_.withoutCause(
+                               [&] { executor_.background().async(std::move(work)); });
+                         }}),
         loop_(executor_, clock_),
         listener_(loop_, executor_, clock_, configuration.listener),
         preferences_(directories.configuration + "/preferences"),

@@ -269,7 +269,7 @@ TEST_F(OrientationTest, HandlersComeAndGoInOrderWhereAllThreeConditionsHold) {
   p.services.deviceHandlers.clear();
   p.services.interfaceHandlers.clear();
   p.services.deviceClass = 6;
-  EXPECT_FALSE(s->shouldReportOrientation());
+  EXPECT_FALSE(make(7)->shouldReportOrientation());
 }
 
 TEST_F(OrientationTest, ChangesAreStampedToTheMillisecondInTheFlatAggregateOnly) {
