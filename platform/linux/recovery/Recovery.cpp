@@ -154,8 +154,7 @@ void Recovery::delayed(const Record& record) {
     return;
   }
   if (!delayed_.emplace(record.connection, delay->position.place).second) return;
-  auto cause =
-      std::make_unique<HeldCause>(Cause{*CauseScope::current(), std::move(delay->position)});
+  auto cause = std::make_unique<HeldCause>(Cause{*CauseScope::current(), delay->position});
   if (!delegate_->restoreDelayed(delay->facts, *record.dictionary, std::move(cause)))
     ++outcome_.unreadable;
 }

@@ -111,7 +111,8 @@ class ReplayQueues final : public WorkQueues {
   }
   WorkQueue& background() override { return background_; }
   std::unique_ptr<WorkCause> takeCause() override {
-    return isWritten() ? nullptr : live_.takeCause();
+    if (isWritten()) return nullptr;
+    return live_.takeCause();
   }
   void withoutCause(const Work& work) override { live_.withoutCause(work); }
   void beginBlocking() override { live_.beginBlocking(); }

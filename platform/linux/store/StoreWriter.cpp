@@ -133,8 +133,8 @@ Status StoreWriter::begin() {
   report(std::move(notes));
   if (unchecked_.database == nullptr) return unchecked_.status;
   if (unchecked_.epoch != epoch_) {
-    if (const Status adopted = adoptEpoch(unchecked_.database.get(), epoch_); !adopted.ok())
-      return adopted;
+    Status adopted = adoptEpoch(unchecked_.database.get(), epoch_);
+    if (!adopted.ok()) return adopted;
   }
   open_.emplace(std::move(unchecked_.database), *beginning_, options_, endWord_, clock_);
   add(open_->retention.apply());
