@@ -10,15 +10,20 @@
 #include "platform/linux/execution/CauseScope.h"
 #include "platform/linux/recovery/JournalMove.h"
 #include "platform/linux/recovery/Records.h"
+#include "platform/linux/store/KnownRows.h"
 
 namespace vx::lnx {
 
 namespace {
 
-// More calls than a journal holds: what a store's newest rows may not show of those it has.
-constexpr uint64_t kMostCallsUnseen = 1 << 21;
-// How long clients wait for what was recovered to be committed.
-constexpr std::chrono::seconds kReplayCommit{4};
+// Beyond the highest call that a store shows: what its rows may have had, and a whole journal
+// whose calls made none.
+constexpr uint64_t kMostCallsUnseen = KnownRows::kCallsPerMark + (uint64_t{3} << 20);
+// How long clients wait for what was recovered to be committed: by its size, and where a process
+// before this one has ended in the recovery, which must not happen once more for the disk's sake.
+constexpr std::chrono::seconds kReplayTime{1};
+constexpr uint64_t kReplayedInThat = 100'000;  // entries
+constexpr std::chrono::seconds kReplayTimeAgain{4};
 constexpr std::chrono::milliseconds kLookAgain{20};
 
 bool isInMemory(const std::string& folder) {
@@ -53,6 +58,7 @@ void CrashSafety::use(OpenedJournal opened) {
   left_ = std::move(opened.left);
   poisoned_ = std::move(opened.poisoned);
   movedStays_ = opened.movedStays;
+  attempt_ = opened.attempt;
   complaints_ = std::move(opened.complaints);
   inMemory_ = isInMemory(folders_.journal);
   recorder_.emplace(*journal_, means_.clock);
@@ -125,19 +131,20 @@ void CrashSafety::recover(Platform& live, std::vector<std::string> backends,
     if (movedStays_) (void)journal_->append({static_cast<uint8_t>(RecordKind::ServiceBegan)});
     means_.aggregates.snapshotBegan();
     means_.aggregates.snapshotCompleted();
+    means_.store.yieldToOthers();
     return endReplay(folders_.journal);
   }
   const Monotonic began = means_.clock.monotonic();
+  const Monotonic until = began + kReplayTime * (1 + left_.entries / kReplayedInThat) +
+                          (attempt_ > 1 ? kReplayTimeAgain : std::chrono::seconds(0));
   means_.executor.adoptInteractiveThread();
-  recovery_.emplace(
-      RecoveryMeans{live, means_.executor, *journal_, std::move(backends),
-                    [this] { return means_.store.isCongested(); },
-                    [this](uint64_t records) { noteReplaySteps(folders_.journal, records); }},
-      std::move(left_));
-  means_.store.beginReplay(recovery_->calls(),
-                           [folder = folders_.journal] { noteReplayAchieved(folder); });
+  recovery_.emplace(RecoveryMeans{live, means_.executor, *journal_, std::move(backends),
+                                  [this] { return means_.store.isCongested(); }, until},
+                    std::move(left_));
+  means_.store.beginReplay(recovery_->calls());
   const RecoveryOutcome outcome = recovery_->run(makeDelegate);
-  commitReplay();
+  commitReplay(until);
+  means_.store.yieldToOthers();
   snapshots_->demand();
   if (outcome.unreadable > 0) {
     means_.store.note({"recovery_incomplete", "", 0,
@@ -159,14 +166,13 @@ void CrashSafety::recover(Platform& live, std::vector<std::string> backends,
 }
 
 // A process that dies of a row does so when it is written: until then the replay is not over.
-void CrashSafety::commitReplay() {
+void CrashSafety::commitReplay(Monotonic until) {
   const auto committed = std::make_shared<std::promise<void>>();
   means_.store.endReplay([committed, folder = folders_.journal] {
     endReplay(folder);
     committed->set_value();
   });
   std::future<void> end = committed->get_future();
-  const Monotonic until = means_.clock.monotonic() + kReplayCommit;
   while (end.wait_for(kLookAgain) != std::future_status::ready &&
          means_.clock.monotonic() < until) {
     // Nobody dies of a disk that cannot be written.

@@ -81,7 +81,7 @@ class CrashSafety {
  private:
   void use(OpenedJournal opened);
   void unrecorded(const Status& why);
-  void commitReplay();
+  void commitReplay(Monotonic until);
   void cutJournal();
 
   Means means_;
@@ -91,6 +91,7 @@ class CrashSafety {
   std::vector<std::string> poisoned_;
   JournalContents left_;
   bool movedStays_ = false;
+  uint32_t attempt_ = 0;  // to replay what is left
   bool inMemory_ = false;
   std::unique_ptr<Journal> journal_;
   std::optional<JournalRecorder> recorder_;

@@ -66,12 +66,12 @@ def end_marker_session(service, traffic):
     c.close()
 
 
-def settled(traffic, aside=None, seconds=1):
+def settled(traffic, seconds=1):
     """A check while the daemon runs, when nothing lacks or nothing has come for some seconds."""
-    check, since = Check(traffic, patient=True, aside=aside), time.monotonic()
+    check, since = Check(traffic, patient=True), time.monotonic()
     while check.lacks() and time.monotonic() < since + seconds:
         time.sleep(0.2)
-        before, check = check, Check(traffic, patient=True, aside=aside)
+        before, check = check, Check(traffic, patient=True)
         since = time.monotonic() if check.lacks() != before.lacks() else since
     return check
 
@@ -82,28 +82,22 @@ def chain(argument):
     with scene(seed, CONFIGURATION + '[store]\nmax_bytes = "1GiB"\n') as (r, service, traffic):  # nothing goes for its size
         # With slow syncs the store's thread lags: sessions stay in set-up, rows in the queue.
         shim = {"sync_ms": "5,80"} if r.random() < 0.5 else {}
-        twice_killed = {}  # rounds whose journal may be moved aside, with the moment
         service.start(**shim)
-        for n in range(rounds):
+        for _ in range(rounds):
             (kept_open_until_killed if kept_open else loaded_until_killed)(r, service, traffic)
-            deaths = r.choice((0, 0, 0, 0, 0, 0, 1, 1, 1, 2))  # of those that recover
-            if deaths > 1:
-                twice_killed[n] = time.monotonic()
-            for _ in range(deaths):
+            if r.random() < 0.4:  # one that recovers; after the second in a row the journal is moved aside
                 service.launch(**shim)
                 time.sleep(10 ** r.uniform(-3, -1))
                 service.kill()
             service.start(**shim)
         end_marker_session(service, traffic)
-        # A journal whose recovery died twice is moved aside, and the ledger says so.
-        moved = sum("moved_aside" in text and "journal" in text for text, _ in service.ledger())
-        aside = twice_killed if moved else {}
         if waits:
             time.sleep(max(0, max((m.due for m in traffic.messages.values()), default=0) - time.monotonic()))
-        live = settled(traffic, aside)
-        check = stopped(traffic, argument, aside)
+        live = settled(traffic)
+        check = stopped(traffic, argument)
         check.found("not_before_stop", [*live.findings.values()], live.lacks() - check.lacks())
-        check.found("needlessly_aside", f"{moved} journals", moved - len(twice_killed))
+        aside = [text for text, _ in service.ledger() if "journal_moved" in text]
+        check.found("needlessly_aside", aside, len(aside))
         check.found("slow_start", f"{service.slowest_start:.1f} s", service.slowest_start > LONGEST_START)
         check.figures.update(slowest_start_s=service.slowest_start, rounds=rounds - 1)  # one is added for each chain
         return check

@@ -14,24 +14,23 @@ def text_of(value):
     return str(int(value)) if isinstance(value, bool) else str(value)
 
 
-def stopped(traffic, name, aside=None):
+def stopped(traffic, name):
     """Stops the daemon, which must end well, and checks its store."""
     status = traffic.service.stop()
     traffic.process_ended("service_stopped")
-    check = Check(traffic, name, aside=aside)
+    check = Check(traffic, name)
     check.found("bad_status", status, status != 0)
     check.found("store_moved", "a healthy store was moved aside", len(traffic.service.stores_aside()))
     return check
 
 
 class Check(Outcome):
-    """patient: a standalone may still wait for its delay. aside: rounds of which the ledger says that their journal was
-    moved aside, with the moment: it held the standalones of earlier rounds too that were in their delay then."""
+    """patient: a standalone may still wait for its delay."""
     LOSSES = ("missing", "no_end", "files_missing", "summaries_differ", "wrong_end")
 
-    def __init__(self, traffic, name="", patient=False, aside=None):
+    def __init__(self, traffic, name="", patient=False):
         super().__init__(name)
-        self.t, self.patient, self.aside = traffic, patient, aside or {}
+        self.t, self.patient = traffic, patient
         for figure in ("answered", "stored", "twice", "disorder", "unexpected", "corrupt", *self.LOSSES):
             self.figures[figure] = 0
         try:
@@ -94,7 +93,7 @@ class Check(Outcome):
             index = start.session.starts.index(start)
             runs = self.runs[start.session.app]
             start.row, start.ended = runs[index] if index < len(runs) else (None, None)
-            if start.row is None and start.known < NEVER and start.round not in self.aside:
+            if start.row is None and start.known < NEVER:
                 self.found("missing", f"the row of session {start.session.app}")
         for app, runs in self.runs.items():
             relayed = sum(category == STATISTICS for row, _ in runs for category, _ in self.of_run[row])
@@ -108,7 +107,7 @@ class Check(Outcome):
         for m in self.t.messages.values():
             self.message(m)
         for start in self.t.starts:
-            if start.row is not None and start.round not in self.aside:
+            if start.row is not None:
                 self.session(start)
 
     # Rows of a message: one relayed and one event for each session that it reached, power records.
@@ -138,7 +137,6 @@ class Check(Outcome):
             self.found("unexpected", f"power record of message {m.n}")
 
     def count(self, m, what, there, least, most):
-        least = 0 if m.round in self.aside else least
         self.figures["stored"] += min(there, most)
         self.found("missing", f"{what} of message {m.n} of round {m.round}", least - there)
         self.found("twice", f"{what} of message {m.n} of round {m.round}", there - most)
@@ -152,8 +150,7 @@ class Check(Outcome):
                 self.count(m, "relayed row", rows.pop(start.row, 0) if start.row else 0, 1, 1)
             else:
                 alone += 1
-                late += s.type == ALARMS and (self.patient and time.monotonic() < m.due or any(
-                    round_ > m.round and moment < m.due for round_, moment in self.aside.items()))
+                late += self.patient and s.type == ALARMS and time.monotonic() < m.due
         for s, start in m.foreign:  # theirs may have stopped, gone or been replaced meanwhile
             surely = s.gone > by
             same = [other for other in self.t.apps.values() if other.id == s.id]

@@ -360,5 +360,21 @@ TEST_F(LocalStoreTest, ReplayWritesWhatIsMissingAndNothingTwice) {
               ElementsAre("2|1000|{\"i\":1}|0", "3|1000|{\"i\":2}|1", "null|null|{\"i\":3}|0"));
 }
 
+// Rows bear them, and may be gone when the next process numbers its calls.
+TEST_F(LocalStoreTest, NumbersOfCallsAreRememberedWhenTheirRowsAreGone) {
+  journal = std::move(
+      *Journal::open({.folder = folder + "/journal", .epoch = kEpoch, .first = {.call = 1 << 22}}));
+  const Cause call{recorded(), {}};
+  open();
+  {
+    const CauseScope scope(call);
+    power(1);
+  }
+  EXPECT_TRUE(close());
+  query("DELETE FROM power_records");
+  reopen();
+  EXPECT_EQ(store->lastCall(), uint64_t{1} << 22);
+}
+
 }  // namespace
 }  // namespace vx::lnx

@@ -19,19 +19,11 @@ constexpr std::string_view kSuffix = ".vxj";
 constexpr std::string_view kAside = ".aside-";
 constexpr std::string_view kPart = ".part";
 constexpr std::string_view kCompanion = ".vxa";  // memory that the recorded state refers to
-constexpr char kAttempts[] = "attempts";
+constexpr char kAttempts[] = "attempts";         // a file that holds their number, 4 bytes
 
 std::string quoted(std::string_view verb, const std::string& path) {
   return std::string(verb) + " " + path;
 }
-
-// What a file of that name holds.
-struct Attempts {
-  uint32_t count = 0;
-  uint32_t achieved = 0;  // by the last one
-  uint64_t steps = 0;     // of the last one
-  uint64_t mostSteps = 0;
-};
 
 // The N of every "nameN.aside-N" in a folder whose name begins with `prefix`, with the name.
 struct Aside {
@@ -180,32 +172,13 @@ Result<uint32_t> JournalFolder::beginAttempt() const {
   constexpr int kHow = O_RDWR | O_CREAT | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC;
   UniqueFd fd(openat(fd_.get(), kAttempts, kHow, 0600));
   if (!fd) return Status::lastError(quoted("cannot open", path));
-  Attempts attempts;
-  if (pread(fd.get(), &attempts, sizeof attempts, 0) != ssize_t{sizeof attempts}) attempts = {};
-  if (attempts.count > 0 && (attempts.achieved != 0 || attempts.steps > attempts.mostSteps))
-    attempts.count = 1;
-  attempts = {.count = std::min(attempts.count, UINT32_MAX - 1) + 1,
-              .achieved = 0,
-              .steps = 0,
-              .mostSteps = std::max(attempts.steps, attempts.mostSteps)};
+  uint32_t attempts = 0;
+  if (pread(fd.get(), &attempts, sizeof attempts, 0) != ssize_t{sizeof attempts}) attempts = 0;
+  if (attempts < UINT32_MAX) ++attempts;
   if (pwrite(fd.get(), &attempts, sizeof attempts, 0) != ssize_t{sizeof attempts})
     return Status::lastError(quoted("cannot write", path));
   if (fdatasync(fd.get()) != 0) return Status::lastError(quoted("cannot write", path));
-  return attempts.count;
-}
-
-void JournalFolder::noteSteps(uint64_t steps) const {
-  noteInAttempts(&steps, sizeof steps, offsetof(Attempts, steps));
-}
-
-void JournalFolder::noteAchieved() const {
-  const uint32_t yes = 1;
-  noteInAttempts(&yes, sizeof yes, offsetof(Attempts, achieved));
-}
-
-void JournalFolder::noteInAttempts(const void* value, std::size_t size, off_t at) const {
-  const UniqueFd fd(openat(fd_.get(), kAttempts, O_WRONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
-  if (fd) (void)!pwrite(fd.get(), value, size, at);  // then less is known of it
+  return attempts;
 }
 
 bool JournalFolder::hasAttempts() const {

@@ -46,11 +46,7 @@ class JournalFolder {
   bool copyAside(const std::string& name) const;
 
   // Counts an attempt to replay what is here, before it begins: how many there were with this one.
-  // One that came further than those before it, or achieved something that stays, begins the count
-  // anew, as 1.
   Result<uint32_t> beginAttempt() const;
-  void noteSteps(uint64_t steps) const;  // how far the attempt has come
-  void noteAchieved() const;
   bool hasAttempts() const;
   void clearAttempts() const;
 
@@ -68,7 +64,6 @@ class JournalFolder {
  private:
   JournalFolder(std::string path, UniqueFd fd) : path_(std::move(path)), fd_(std::move(fd)) {}
   std::vector<SegmentHeader> headers() const;
-  void noteInAttempts(const void* value, std::size_t size, off_t at) const;
   Status copyFile(int source, const JournalFolder& to, const std::string& as) const;
   Status copyCompanions(const JournalFolder& to, std::vector<std::string>& copied,
                         const Function<void()>& onFile) const;

@@ -61,7 +61,11 @@ Result<OpenedJournal> openJournal(JournalOptions options, const std::string& mov
   // Of another store they say nothing, and harm nothing.
   for (const SegmentHeader& header : headers) options.first.goPast(header);
   for (const SegmentHeader& header : headersIn(moved)) options.first.goPast(header);
-  if (!headers.empty() && countReplay(options.folder) > kMostReplays) {
+  for (const std::string& aside : JournalFolder::movedAside(options.folder))
+    for (const SegmentHeader& header : headersIn(aside)) options.first.goPast(header);
+  if (!headers.empty()) opened.attempt = countReplay(options.folder);
+  if (opened.attempt > kMostReplays) {
+    opened.attempt = 0;
     Result<std::string> aside = JournalFolder::moveAside(options.folder);
     if (!aside.ok()) return aside.status();
   } else if (!headers.empty()) {
@@ -79,16 +83,6 @@ Result<OpenedJournal> openJournal(JournalOptions options, const std::string& mov
   if (!journal.ok()) return journal.status();
   opened.journal = std::move(journal).value();
   return opened;
-}
-
-void noteReplaySteps(const std::string& path, uint64_t steps) {
-  const Result<JournalFolder> folder = JournalFolder::open(path, JournalFolder::IfMissing::Fail);
-  if (folder.ok()) folder->noteSteps(steps);
-}
-
-void noteReplayAchieved(const std::string& path) {
-  const Result<JournalFolder> folder = JournalFolder::open(path, JournalFolder::IfMissing::Fail);
-  if (folder.ok()) folder->noteAchieved();
 }
 
 void endReplay(const std::string& path) {

@@ -13,6 +13,8 @@
 namespace vx::lnx {
 
 // How many processes may end while they replay a journal, before it is believed to be the cause.
+// How far they came is not asked: where one row ends the process, what is committed before it
+// differs from one attempt to the next.
 inline constexpr uint32_t kMostReplays = 2;
 
 // The store that the calls in a journal belong to, or in one that was moved; none when there are
@@ -24,18 +26,16 @@ struct OpenedJournal {
   JournalContents left;                 // to be replayed
   std::vector<std::string> complaints;  // what could not be believed
   bool movedStays = false;              // it could not be taken back: its calls run another time
+  uint32_t attempt = 0;                 // to replay `left`; 0 when nothing is left
   // Where journals are now whose replays have all failed, until somebody was told: see told().
   std::vector<std::string> poisoned;
 };
 
 // Counts a replay of what is there, and opens the journal behind it. What an ending process moved
 // to `moved`, where it had more time, is taken back first. After kMostReplays replays that were
-// begun and not ended (endReplay), and came no further than one before, the journal is moved aside.
+// begun and not ended (endReplay) the journal is moved aside.
 Result<OpenedJournal> openJournal(JournalOptions options, const std::string& moved);
-// How far the replay has come; that something was committed that the next one finds.
-void noteReplaySteps(const std::string& folder, uint64_t steps);
-void noteReplayAchieved(const std::string& folder);
-// What was left has been replayed.
+// What was left has been replayed, and its rows are committed.
 void endReplay(const std::string& folder);
 // It is known that these are poisoned.
 void told(const std::vector<std::string>& poisoned);

@@ -11,19 +11,15 @@ namespace vx::lnx {
 
 namespace {
 
-// How long a recovery waits for a store that does not keep up: for as long nobody is served.
-constexpr std::chrono::seconds kPatience{5};
 constexpr std::chrono::milliseconds kLookAgain{1};
 constexpr std::chrono::seconds kBackgroundTime{10};
-constexpr uint64_t kRecordsUntilTold = 64;
 
 }  // namespace
 
 Recovery::Recovery(RecoveryMeans means, JournalContents contents)
     : means_(std::move(means)),
       contents_(std::move(contents)),
-      platform_(means_.live, means_.backends, inputs_),
-      patience_(kPatience) {}
+      platform_(means_.live, means_.backends, inputs_) {}
 
 ReplayedCalls Recovery::calls() const {
   ReplayedCalls calls{.first = contents_.next.call, .sessionsFrom = contents_.next.call};
@@ -50,7 +46,6 @@ RecoveryOutcome Recovery::run(const MakeDelegate& makeDelegate) {
     runRecord(record);
   }
   endOpenConnections();
-  means_.advanced(outcome_.calls + 1);
   (void)append(RecordKind::ServiceBegan, 0);
   delegate_.reset();
   runInteractive();
@@ -103,7 +98,7 @@ void Recovery::runRecord(const Record& record) {
         return;
     }
   }
-  if (++outcome_.calls % kRecordsUntilTold == 0) means_.advanced(outcome_.calls);
+  ++outcome_.calls;
   outcome_.undone += record.done ? 0 : 1;
   runInteractive();
   waitForStore();
@@ -263,11 +258,10 @@ void Recovery::runInteractive() {
   }
 }
 
+// One that does not keep up even so holds more than it should: no more than the journal does.
 void Recovery::waitForStore() {
-  while (patience_.count() > 0 && means_.congested()) {
+  while (means_.congested() && means_.live.clock.monotonic() < means_.patience)
     std::this_thread::sleep_for(kLookAgain);
-    patience_ -= kLookAgain;
-  }
 }
 
 }  // namespace vx::lnx

@@ -31,7 +31,7 @@ struct RecoveryMeans {
   Journal& journal;
   std::vector<std::string> backends;  // the relay's
   Function<bool()> congested;         // the store has more to write than it should hold
-  Function<void(uint64_t)> advanced;  // so many records were run again; told now and then
+  Monotonic patience;                 // until then that is waited for
 };
 
 struct RecoveryOutcome {
@@ -97,7 +97,6 @@ class Recovery {
   // The work that waits by itself: its call and place.
   std::set<std::pair<uint64_t, uint32_t>> delayed_;
   double lastTime_ = 0;  // the latest that was recorded
-  std::chrono::nanoseconds patience_;
   RecoveryOutcome outcome_;
 };
 

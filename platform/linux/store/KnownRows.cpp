@@ -28,6 +28,7 @@ constexpr const char* kReads[] = {
 // Rows of calls are written nearly in the calls' order.
 constexpr const char* kLastCall =
     "SELECT ifnull(max(call), 0) FROM ("
+    "SELECT call FROM store_marks UNION ALL "
     "SELECT * FROM (SELECT call FROM relay_sessions ORDER BY id DESC LIMIT 1000) UNION ALL "
     "SELECT * FROM (SELECT call FROM relay_messages ORDER BY id DESC LIMIT 1000) UNION ALL "
     "SELECT * FROM (SELECT call FROM analytics_entries ORDER BY id DESC LIMIT 1000) UNION ALL "

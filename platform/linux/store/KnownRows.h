@@ -26,9 +26,12 @@ struct ReplayedCalls {
 // accepted.
 class KnownRows {
  public:
+  static constexpr uint64_t kCallsPerMark = uint64_t{1} << 20;
+
   // A failure when the database cannot be read.
   static Result<KnownRows> load(sqlite3* database, const ReplayedCalls& calls);
-  // The highest number of a call among the newest rows; 0 when there is none.
+  // The highest number of a call among the newest rows and the marks, 0 when there is none. No row
+  // ever had one that was kCallsPerMark higher.
   static uint64_t lastCall(sqlite3* database);
   // The identifier of the row with this key.
   std::optional<int64_t> find(const RowKey& key) const;

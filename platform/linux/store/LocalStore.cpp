@@ -30,12 +30,10 @@ LocalStore::LocalStore(std::unique_ptr<StoreBeginning> beginning, const StoreOpt
                        Clock& clock)
     : writer_(std::move(beginning), options, clock), backend_(writer_.queue()) {}
 
-void LocalStore::beginReplay(ReplayedCalls calls, Function<void()> progressed) {
+void LocalStore::beginReplay(ReplayedCalls calls) {
   writer_.queue().setReplaying(true);
   writer_.queue().runSoon(
-      [this, calls = std::move(calls), progressed = std::move(progressed)]() mutable {
-        writer_.expectKnownRows(std::move(calls), std::move(progressed));
-      });
+      [this, calls = std::move(calls)]() mutable { writer_.expectKnownRows(std::move(calls)); });
 }
 
 void LocalStore::endReplay(Function<void()> committed) {

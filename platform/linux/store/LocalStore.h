@@ -35,8 +35,7 @@ class LocalStore final : public AnalyticsEventService, public PowerEventLog {
 
   // Within which (call, place) names a row. The same as long as this object lives.
   const JournalEpoch& epoch() const { return writer_.epoch(); }
-  // The highest number that a call has among the newest rows; 0 when there is none, or when the
-  // store cannot be read yet.
+  // See KnownRows; 0 when the store cannot be read yet.
   uint64_t lastCall() const { return writer_.lastCall(); }
   // The word for how a session ended, by the call whose work ended it; before start().
   void setEndWord(EndWord word) { writer_.setEndWord(word); }
@@ -44,8 +43,8 @@ class LocalStore final : public AnalyticsEventService, public PowerEventLog {
   // What is appended until endReplay() comes from recorded calls: rows of theirs that are there
   // already are not written again, and new ones bear the time of their call. Nothing else may be
   // appended meanwhile. `committed`: told once all of it is, on the writer's thread; never when
-  // that does not happen. `progressed`: likewise whenever new rows of it are.
-  void beginReplay(ReplayedCalls calls, Function<void()> progressed = nullptr);
+  // that does not happen.
+  void beginReplay(ReplayedCalls calls);
   void endReplay(Function<void()> committed);
 
   // A row of the ledger; before start().
@@ -54,6 +53,8 @@ class LocalStore final : public AnalyticsEventService, public PowerEventLog {
   void note(LedgerNote note) { writer_.note(std::move(note)); }
   // Starts the writer. Logs, so the platform must be installed; what is appended before is kept.
   void start() { writer_.start(); }
+  // Once clients do not wait for a replay to be committed: the writer lets others go first.
+  void yieldToOthers() { writer_.yieldToOthers(); }
 
   RelayBackend& relayBackend() { return backend_; }
   void sendEventLazy(std::string_view name, Function<Payload()> builder,

@@ -4,6 +4,7 @@
 #include <cmath>
 #include <exception>
 #include <optional>
+#include <tuple>
 #include <utility>
 
 #include "platform/Log.h"
@@ -92,13 +93,13 @@ Result<RowWriter::Written> RowWriter::write(const StoreRecords& batch, std::size
   leftOut_.clear();
   begun_.clear();
   allowance_ = allowance;
-  const int64_t markedBefore = lastMarkedRow_;
+  const auto markedBefore = std::pair(lastMarkedRow_, lastMarkedCall_);
   const int code = writeTransaction(batch, first, last, notes);
   for (std::string* text : {&json_, &eventJson_}) {
     if (text->capacity() > kKeptText) std::string().swap(*text);
   }
   if (code == SQLITE_OK) return written_;
-  lastMarkedRow_ = markedBefore;
+  std::tie(lastMarkedRow_, lastMarkedCall_) = markedBefore;
   for (RelayRow* session : begun_) session->id = 0;
   Status failure = Status::failure(sqlite3_errmsg(database_));
   nameRows_.clear();  // the names that were added are not there
@@ -150,7 +151,7 @@ int RowWriter::prepare() {
   if (!last.row()) return sqlite3_extended_errcode(database_);
   nextRow_ = last.integer(0) + 1;
   lastMarkedRow_ = last.integer(1);
-  highestCall_ = static_cast<uint64_t>(last.integer(2));
+  highestCall_ = lastMarkedCall_ = static_cast<uint64_t>(last.integer(2));
   for (const char* table : {"relay_messages", "analytics_entries"}) {
     Statement highest(database_, std::string("SELECT ifnull(max(call), 0) FROM ") + table +
                                      " WHERE id > " + std::to_string(lastMarkedRow_));
@@ -162,8 +163,10 @@ int RowWriter::prepare() {
 }
 
 int RowWriter::writeMark() {
-  if (nextRow_ - 1 - lastMarkedRow_ < kRowsPerMark) return SQLITE_OK;
+  const bool fewCalls = highestCall_ - lastMarkedCall_ < KnownRows::kCallsPerMark;
+  if (fewCalls && nextRow_ - 1 - lastMarkedRow_ < kRowsPerMark) return SQLITE_OK;
   lastMarkedRow_ = nextRow_ - 1;
+  lastMarkedCall_ = highestCall_;
   const int code = addMark_.bind(static_cast<int64_t>(highestCall_)).bind(lastMarkedRow_).run();
   return code == SQLITE_OK ? removeMarks_.bind(kKeptMarks).run() : code;
 }

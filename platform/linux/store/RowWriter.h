@@ -126,6 +126,7 @@ class RowWriter {
   int64_t nextRow_ = 1;       // of messages and events, which share their numbers
   uint64_t highestCall_ = 0;  // of every row so far
   int64_t lastMarkedRow_ = 0;
+  uint64_t lastMarkedCall_ = 0;
 };
 
 }  // namespace vx::lnx

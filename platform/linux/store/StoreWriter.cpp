@@ -90,8 +90,12 @@ void StoreWriter::note(LedgerNote note) {
   queue_.runSoon([this, note = std::move(note)] { notes_.push_back(note); });
 }
 
+void StoreWriter::yieldToOthers() {
+  queue_.runSoon(
+      [] { setpriority(PRIO_PROCESS, static_cast<id_t>(syscall(SYS_gettid)), kWriterNiceness); });
+}
+
 void StoreWriter::threadMain() {
-  setpriority(PRIO_PROCESS, static_cast<id_t>(syscall(SYS_gettid)), kWriterNiceness);
   runJobs();
   report(std::move(found_));
   (void)begin();  // tried again when there is something to write
@@ -215,7 +219,6 @@ Result<RowWriter::Written> StoreWriter::write(const StoreBatch& batch, std::size
   notes_.clear();
   ++commits_;
   rowsCommitted_ += written->rows;
-  if (replayFrom_ && written->rows > 0 && progressed_) progressed_();
   writeFailures_ += written->failedBuilders;
   if (open_) open_->retention.noteWritten(written->bytes);
   return written;

@@ -50,11 +50,10 @@ class StoreWriter {
   void setDrainedHandler(Function<void()> handler) { drained_ = std::move(handler); }
   void setEndWord(EndWord word) { endWord_ = word; }
   void start();
+  // Nobody waits for it any more: from here on whoever has something to do goes first.
+  void yieldToOthers();
   // On the writer's thread; see LocalStore::beginReplay.
-  void expectKnownRows(ReplayedCalls calls, Function<void()> progressed) {
-    replayFrom_ = std::move(calls);
-    progressed_ = std::move(progressed);
-  }
+  void expectKnownRows(ReplayedCalls calls) { replayFrom_ = std::move(calls); }
 
   StoreQueue& queue() { return queue_; }
   const StoreQueue& queue() const { return queue_; }
@@ -130,7 +129,6 @@ class StoreWriter {
   StoreLoss lost_ = StoreLoss::None;  // of what was open before
   EventPairing pairing_;
   std::optional<ReplayedCalls> replayFrom_;  // until what is replayed is committed
-  Function<void()> progressed_;              // told when rows of it are
   Function<void()> drained_;
   std::vector<LedgerNote> notes_;   // for the next transaction
   std::optional<Error> lossError_;  // why rows were given up
