@@ -17,7 +17,8 @@ namespace {
 constexpr std::string_view kPrefix = "segment-";
 constexpr std::string_view kSuffix = ".vxj";
 constexpr std::string_view kAside = ".aside-";
-constexpr std::string_view kPart = ".part";
+constexpr std::string_view kPart = ".part";      // of a file that is being copied
+constexpr std::string_view kNew = ".new";        // that is being allocated
 constexpr std::string_view kCompanion = ".vxa";  // memory that the recorded state refers to
 constexpr char kAttempts[] = "attempts";         // a file that holds their number, 4 bytes
 
@@ -142,13 +143,16 @@ Result<JournalFolder::Opened> JournalFolder::openSegment(const std::string& name
 
 Result<UniqueFd> JournalFolder::createSegment(const std::string& name, std::size_t bytes) const {
   const std::string path = path_ + "/" + name;
+  const std::string fresh = name + std::string(kNew);
+  remove(fresh);
   UniqueFd fd(
-      openat(fd_.get(), name.c_str(), O_RDWR | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0600));
+      openat(fd_.get(), fresh.c_str(), O_RDWR | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0600));
   if (!fd) return Status::lastError(quoted("cannot create", path));
   int code = ftruncate(fd.get(), off_t{kSegmentBytes}) == 0 ? 0 : errno;
   if (code == 0) code = posix_fallocate(fd.get(), 0, static_cast<off_t>(bytes));
+  if (code == 0 && renameat(fd_.get(), fresh.c_str(), fd_.get(), name.c_str()) != 0) code = errno;
   if (code == 0) return fd;
-  remove(name);
+  remove(fresh);
   return Status::posix(quoted("cannot allocate", path), code);
 }
 
