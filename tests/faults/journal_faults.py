@@ -10,23 +10,16 @@ from traffic import scene
 POISON = "poisoned" * 4  # in a message: the daemon ends when it writes this to the store
 
 
-def change(path, how):
+def write(path, content, at=0):
     with open(path, "r+b") as f:
-        content = bytearray(f.read(1 << 16))
-        how(content)
-        f.seek(0)
+        f.seek(at)
         f.write(content)
 
 
-def flip_bits(r, content):
-    used = [i for i, byte in enumerate(content) if byte] or [0]
+def flip_bits(r, path):
+    used = [i for i, byte in enumerate(content(path)[:1 << 16]) if byte] or [0]
     for i in r.sample(used, min(len(used), 8)):
-        content[i] ^= 1 << r.randrange(8)
-
-
-def replace(path, make):
-    os.remove(path)
-    make(path)
+        write(path, bytes([content(path)[i] ^ 1 << r.randrange(8)]), i)
 
 
 def garbage(r, path):
@@ -41,12 +34,12 @@ def link(r, path):
 
 
 DAMAGES = {
-    "bits": lambda r, path: change(path, lambda content: flip_bits(r, content)),
-    "version": lambda r, path: change(path, lambda content: content.__setitem__(slice(8, 12), b"\x7f\x7f\x7f\x7f")),
+    "bits": flip_bits,
+    "version": lambda r, path: write(path, b"\x7f\x7f\x7f\x7f", 8),
     "cut": lambda r, path: os.truncate(path, r.randrange(os.path.getsize(path))),
     "owner": lambda r, path: os.geteuid() or os.chown(path, 12345, 12345),
-    "fifo": lambda r, path: replace(path, os.mkfifo),
-    "folder": lambda r, path: replace(path, os.mkdir),
+    "fifo": lambda r, path: os.remove(path) or os.mkfifo(path),
+    "folder": lambda r, path: os.remove(path) or os.mkdir(path),
     "garbage": garbage,
     "link": link,
 }
@@ -61,33 +54,27 @@ def content(path):
         return f.read()
 
 
-def damaged(argument):
-    seed, damage = argument
+def damaged(seed, damage):
     with scene(seed) as (r, service, traffic):
         service.start()
         traffic.life(15)
         service.kill()
         traffic.process_ended("crashed")
-        files = [p for p in files_below(service.folder + "/run/journal") if os.path.getsize(p)]
-        if not files:
-            none = Outcome(damage)
-            none.found("no_journal", "there is no file in run/journal after kill -9")
-            return none
-        path, victim = r.choice(files), service.folder + "/victim"
+        path, victim = r.choice([p for p in files_below(service.folder + "/run/journal") if os.path.getsize(p)]), service.folder + "/victim"
         before = content(path)
         DAMAGES[damage](r, path)
         kept = content(path) if os.path.isfile(path) else b""
         service.start()
         said = [line for line in service.life_log().splitlines() if "journal" in line and line[:3] in ("<3>", "<5>")]
         traffic.life(5)
-        check = stopped(traffic, argument)
+        check = stopped(traffic, (seed, damage))
         lost = check.lacks() > 0
         check.forgive()  # what cannot be read goes, with a word
         check.found("silent", "nothing was said of what was lost", lost and not said)
         check.found("loud", said, len(said) > 2)
         check.found("followed", "a link", damage == "link" and content(victim) != before)
-        check.found("not_kept", path, lost and kept not in [b"", *map(content, files_below(
-            service.folder + "/run", service.folder + "/state", victim))])
+        kept_files = files_below(service.folder + "/run", service.folder + "/state", victim)
+        check.found("not_kept", path, lost and kept not in [b"", *map(content, kept_files)])
         return check
 
 
@@ -105,17 +92,15 @@ def poisoned(seed):
             if service.is_ready() and service.stop() == 0:  # which writes everything
                 break
             deaths += 1
-        kept = [p for p in files_below(service.folder + "/run", service.folder + "/state") if "aside" in p]
         outcome = Outcome(f"{seed} poisoned")
-        outcome.found("deaths", f"{deaths} of those that recovered", deaths - 2)
-        outcome.found("not_kept", "no file is aside", not kept)
-        named = any("journal" in text for text, _ in service.ledger())
-        outcome.found("silent", "the ledger does not name a journal", not named)
+        outcome.found("deaths", f"{deaths} of those that recovered", deaths != 2)
+        outcome.found("not_kept", "no file is aside", not glob.glob(service.folder + "/run/journal.aside-*/segment*"))
+        outcome.found("silent", "the ledger does not name a journal", not any("journal" in text for text, _ in service.ledger()))
         return outcome
 
 
 def one(argument):
-    return poisoned(argument[0]) if argument[1] == "poison" else damaged(argument)
+    return poisoned(argument[0]) if argument[1] == "poison" else damaged(*argument)
 
 
 def run(options):

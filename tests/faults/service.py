@@ -3,6 +3,7 @@ import collections
 import concurrent.futures
 import glob
 import os
+import pathlib
 import re
 import select
 import signal
@@ -27,8 +28,7 @@ class Outcome:
     def found(self, figure, text, count=1):
         if count > 0:
             self.figures[figure] += count
-            if len(self.findings[figure]) < 3:
-                self.findings[figure].append(f"{self.name}: {text}")
+            self.findings[figure] = [*self.findings[figure], f"{self.name}: {text}"][:3]
 
     def add(self, other):
         for k, v in other.figures.items():
@@ -61,8 +61,8 @@ class Service(Daemon):
         self.notify = socket.socket(socket.AF_UNIX, socket.SOCK_DGRAM)
         self.notify.bind(folder + "/notify")
         self.slowest_start, self.folder, self.told = 0, folder, ""
-        self.replace_file("drivers/Speaker/underruns", "0")
         super().__init__(configuration, folder=folder, environment={"NOTIFY_SOCKET": folder + "/notify"}, wait=False)
+        self.replace_file("drivers/Speaker/underruns", "0")
 
     def start(self, wait=True, **shim):
         if wait:  # __init__ does not start one
@@ -77,8 +77,8 @@ class Service(Daemon):
         while self.listen(0):
             pass
         self.told = ""
-        self.log_before = os.path.getsize(self.log_path) if os.path.exists(self.log_path) else 0
         with open(self.log_path, "ab") as log:
+            self.log_before = log.tell()
             self.process = subprocess.Popen([self.program], env=dict(self.environment, **variables), stderr=log,
                                             stdin=subprocess.DEVNULL)
         self.started_at = time.monotonic()
@@ -89,29 +89,14 @@ class Service(Daemon):
             self.told += self.notify.recv(4096).decode() + "\n"  # to the service manager
         return bool(there)
 
-    def counter(self, name):
-        """What the daemon says when it is asked for its counters."""
-        at = os.path.getsize(self.log_path)
-        self.process.send_signal(signal.SIGUSR1)
-        end = time.monotonic() + PATIENCE
-        while time.monotonic() < end:
-            with open(self.log_path, encoding="utf-8", errors="replace") as log:
-                log.seek(at)
-                said = re.findall(rf"\b{name}=(\d+)", log.read())
-            if said:
-                return int(said[-1])
-            time.sleep(0.01)
-        raise AssertionError(f"the daemon does not say {name}")
-
     def is_ready(self):
         """Waits until the process is ready (True) or has ended."""
         while "READY=1" not in self.told and self.process.poll() is None:
             assert time.monotonic() < self.started_at + PATIENCE, "it does not become ready:\n" + self.life_log()[-2000:]
             self.listen(0.005)
-        if "READY=1" not in self.told:
-            return False
-        self.slowest_start = max(self.slowest_start, time.monotonic() - self.started_at)
-        return True
+        if ready := "READY=1" in self.told:
+            self.slowest_start = max(self.slowest_start, time.monotonic() - self.started_at)
+        return ready
 
     def kill(self):
         self.process.kill()
@@ -130,13 +115,21 @@ class Service(Daemon):
 
     def life_log(self):
         """What the last process logged."""
-        with open(self.log_path, errors="replace") as f:
-            f.seek(self.log_before)
-            return f.read()
+        return pathlib.Path(self.log_path).read_bytes()[self.log_before:].decode(errors="replace")
+
+    def said(self, name):
+        """A number, as the last process has logged it last; -1 when it has not."""
+        return int(([-1] + re.findall(rf"\b{name}=(\d+)", self.life_log()))[-1])
 
     def rows_lost(self):
-        """As the log has it; -1 when it says nothing."""
-        return int(([-1] + re.findall(r"rows_lost=(\d+)", self.life_log()))[-1])
+        return self.said("rows_lost")
+
+    def counter(self, name):
+        """What the daemon says when it is asked for its counters."""
+        lines = self.life_log().count("counters: ")
+        self.process.send_signal(signal.SIGUSR1)
+        self.wait_until(lambda: self.life_log().count("counters: ") > lines, "it says its counters")
+        return self.said(name)
 
     def ledger(self):
         """Rows: a text and a count."""
@@ -148,8 +141,7 @@ class Service(Daemon):
     def replace_file(self, path, text):
         path = f"{self.folder}/{path}"
         os.makedirs(os.path.dirname(path), exist_ok=True)
-        with open(self.folder + "/.new", "w") as f:
-            f.write(text)
+        pathlib.Path(self.folder + "/.new").write_text(text)
         os.rename(self.folder + "/.new", path)
 
     def clean_up(self):

@@ -31,14 +31,11 @@ def payload(n, kind, size=0):
     return p
 
 
-@dataclasses.dataclass(eq=False)
 class Session:
-    id: int
-    type: int
-    app: str                # its HostApplicationDisplayID; no other session's
-    start: object = None    # the one under way
-    gone: float = NEVER     # when it may have been gone
-    starts: list = dataclasses.field(default_factory=list)
+    def __init__(self, id_, type_, app):
+        self.id, self.type, self.app = id_, type_, app  # the app is its HostApplicationDisplayID; no other session's
+        self.start, self.starts = None, []              # the one under way, and all of them
+        self.gone = NEVER                               # when it may have been gone
 
 
 @dataclasses.dataclass(eq=False)
@@ -120,10 +117,12 @@ class Traffic:
             self.connections += 1
             self.peers.append(Peer(self, self.service.socket_path))
 
+    def take(self):
+        for peer in self.peers:
+            peer.take()
+
     def post(self, peer, what, *call):
-        number = peer.post(*call)
-        if what is not None:
-            peer.waiting[number] = what
+        peer.waiting[peer.post(*call)] = what
 
     def answered(self, peer, f):
         now = self.now()
@@ -143,17 +142,16 @@ class Traffic:
     def create(self, peer, type_=None, start=True):
         self.identifiers += 1
         type_ = self.random.choice(tuple(NAMES)) if type_ is None else type_
-        s = Session(self.identifiers, type_, f"app.{self.identifiers}")
-        self.announce(peer, s)
-        if start:
-            self.start(peer, s)
-        return s
+        return self.announce(peer, Session(self.identifiers, type_, f"app.{self.identifiers}"), start)
 
-    def announce(self, peer, s, before=None):
+    def announce(self, peer, s, start, before=None):
         self.apps[s.app] = peer.sessions[s.id] = s
         self.post(peer, before, CREATE, s.id)
         self.post(peer, None, SET_TYPE, s.type, s.id)
         self.post(peer, None, CONFIGURE, {"HostApplicationDisplayID": s.app, "a b": 1}, s.id)
+        if start:
+            self.start(peer, s)
+        return s
 
     def start(self, peer, s):
         s.start = Start(s, self.round, peer.number + 1, self.now())
@@ -184,9 +182,7 @@ class Traffic:
         if before is not None:
             before.how = PERHAPS_REPLACED
         s.gone = self.now()
-        again = Session(s.id, s.type, f"{s.app}.{s.gone}")
-        self.announce(peer, again, before)
-        self.start(peer, again)
+        self.announce(peer, Session(s.id, s.type, f"{s.app}.{s.gone}"), True, before)
 
     def leave(self, peer):
         for s in peer.sessions.values():
@@ -245,14 +241,13 @@ class Traffic:
         else:
             self.leave(peer)
             self.connect(1)
-        for other in self.peers:
-            other.take()
+        self.take()
 
     def until_answered(self, patience=PATIENCE):
         """Waits for every message's and end's answer; False when some did not come."""
         end = time.monotonic() + patience
         for peer in self.peers:
-            while peer.waiting:
+            while any(peer.waiting.values()):
                 if not peer.take(0.05) or time.monotonic() > end:
                     return False
         return True
