@@ -5,7 +5,6 @@
 #include <filesystem>
 #include <fstream>
 #include <future>
-#include <map>
 
 #include "Statistics/VXReportingProcessState.h"
 #include "platform/linux/recovery/Records.h"
@@ -18,7 +17,6 @@
 namespace vx::lnx {
 namespace {
 
-using testing::StartsWith;
 using wire::Operation;
 
 class RecordingTest : public JournalFixture {
@@ -298,87 +296,6 @@ TEST(Records, ThatCannotBeBelievedAreNoCallsAndNoInputs) {
   for (std::size_t n = 0; n < note.size(); ++n) {
     EXPECT_FALSE(readInput(std::span(note).first(n))) << n;
   }
-}
-
-// Runs recorded calls as a later process would.
-void runAgain(const std::vector<JournalContents::Record>& records, Journal& journal,
-              RecordedService& service) {
-  std::map<uint64_t, std::shared_ptr<fakes::FakeConnection>> connections;
-  for (const JournalContents::Record& record : records) {
-    const auto again =
-        journal.append({record.kind, record.time, record.connection, record.head, std::nullopt});
-    ASSERT_TRUE(again.ok() && again->call == record.call);
-    const Cause cause{again->ticket, {}};
-    const CauseScope scope(cause);
-    std::shared_ptr<fakes::FakeConnection>& connection = connections[connectionOf(record)];
-    if (record.kind == static_cast<uint8_t>(RecordKind::Accepted)) {
-      connection = std::make_shared<fakes::FakeConnection>(readAccepted(record.head)->pid);
-      service.delegate->listener(service.listener, connection);
-    } else if (record.head.empty()) {
-      if (record.kind == static_cast<uint8_t>(RecordKind::EndedInterrupted))
-        connection->interruption();
-      connection->invalidation();
-    } else {
-      RecordedCall call =
-          readCall(record.head, record.dictionary, vxReportingServiceInterface()).value();
-      call.operation->invoke(*connection->object, call.arguments, Reply());
-    }
-    service.runQueues();
-  }
-}
-
-TEST_F(RecordingTest, CallsThatAreRunAgainGiveTheirRowsTheSameNames) {
-  serve();
-  const std::size_t a = connect();
-  const std::size_t b = connect();
-  send(a, 1);  // nobody listens: a standalone
-  for (int64_t id : {1, 2, 3}) create(a, id);
-  for (int64_t id : {4, 5}) create(b, id);
-  create(b, 6, 4);  // alarms: a standalone is due at a time of its own
-  for (int64_t id : {1, 2, 3}) start(a, id);
-  for (int64_t id : {4, 5}) start(b, id);
-  send(a, 2);     // to all five
-  send(a, 3, 6);  // to one that is not started
-  send(b, 4, 1);  // to another client's
-  call(a, Operation::StopReportingSessionForID, 2);
-  call(a, Operation::ReporterID, 1);
-  clients[b]->close();
-  awaitReporters(a, "(1,2,3)");
-  call(a, Operation::DestroyReportingSession, 1);
-  stop();
-  const std::vector<std::string> rows = service->rows.texts();
-  const JournalContents first = read();
-  service.reset();
-
-  std::vector<std::string> names;
-  for (const std::string& row : rows) names.push_back(row.substr(0, row.find(' ')));
-  EXPECT_EQ(std::ranges::adjacent_find(names), names.end()) << "a name of two rows";
-  EXPECT_THAT(rows, SizeIs(34));
-
-  std::filesystem::remove_all(options.folder);
-  open();
-  RecordedService later(journal.get());
-  later.fakes.services.processNames = {{getpid(), "recording"}};
-  runAgain(first.records, *journal, later);
-  EXPECT_EQ(later.rows.texts(), rows);
-  const auto notes = [](const JournalContents& contents) {
-    std::vector<std::string> all;
-    for (const auto& record : contents.records)
-      for (const auto& note : record.notes) {
-        const RecordedInput input = readInput(note.bytes).value();
-        all.push_back(std::to_string(record.call) + ":" + std::to_string(input.place) + " " +
-                      std::string(input.what) + " " + input.answer.text());
-      }
-    return all;
-  };
-  const std::vector<std::string> before = notes(first);
-  EXPECT_THAT(
-      std::vector(before.begin(), before.begin() + 3),
-      ElementsAre(HasSubstr("{process name=recording}"), HasSubstr("{process name=recording}"),
-                  StartsWith("22:256 standalone due {")));
-  EXPECT_THAT(std::vector(before.begin() + 3, before.end()),
-              AllOf(SizeIs(5), Each(HasSubstr(" file date {"))));
-  EXPECT_EQ(notes(read()), before);
 }
 
 }  // namespace
