@@ -60,7 +60,8 @@ def damaged(seed, damage):
         traffic.life(15)
         service.kill()
         traffic.process_ended("crashed")
-        path, victim = r.choice([p for p in files_below(service.folder + "/run/journal") if os.path.getsize(p)]), service.folder + "/victim"
+        path = r.choice([p for p in files_below(service.folder + "/run/journal") if os.path.getsize(p)])
+        victim = service.folder + "/victim"
         before = content(path)
         DAMAGES[damage](r, path)
         kept = content(path) if os.path.isfile(path) else b""

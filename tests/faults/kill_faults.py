@@ -3,7 +3,7 @@ import threading
 import time
 
 from harness import SEND, STOP, Client
-from service import CONFIGURATION, PATIENCE, spread
+from service import CONFIGURATION, spread
 from store_check import Check, stopped
 from traffic import ALARMS, Session, Start, scene
 

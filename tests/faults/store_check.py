@@ -6,7 +6,7 @@ import sqlite3
 import time
 
 from service import Outcome, PATIENCE
-from traffic import ALARMS, KINDS, NAMES, NEVER, PERHAPS_REPLACED, POWER, REPLACED, STATISTICS, SUMMARY, payload
+from traffic import ALARMS, KINDS, NAMES, NEVER, POWER, STATISTICS, SUMMARY, payload
 
 
 def text_of(value):
@@ -31,8 +31,7 @@ class Check(Outcome):
     def __init__(self, traffic, name="", patient=False):
         super().__init__(name)
         self.t, self.patient = traffic, patient
-        for figure in ("answered", "stored", "twice", "disorder", "unexpected", "corrupt", *self.LOSSES):
-            self.figures[figure] = 0
+        self.figures.update(dict.fromkeys(("answered", "stored", "twice", "disorder", "unexpected", "corrupt", *self.LOSSES), 0))
         try:
             self.read()
         except (sqlite3.Error, TypeError, ValueError) as e:
@@ -56,11 +55,9 @@ class Check(Outcome):
     def read(self):
         f = self.t.service.database
         self.database = sqlite3.connect(f"file:{f}?mode=ro", uri=True, timeout=PATIENCE)
-        self.columns = {r[1] for r in self.rows("PRAGMA table_xinfo(relay_sessions)")}
-        how = "ended_how" if "ended_how" in self.columns else "NULL"
         self.runs, self.alone = collections.defaultdict(list), set()  # rows of sessions by application; of standalones
-        for row, number, information, ended in self.rows(
-                f"SELECT id, session_id, user_info, {how} FROM relay_sessions ORDER BY id"):
+        sessions = self.rows("SELECT id, session_id, user_info, ended_how FROM relay_sessions ORDER BY id")
+        for row, number, information, ended in sessions:
             if number == -1:
                 self.alone.add(row)
             else:
@@ -97,13 +94,11 @@ class Check(Outcome):
                 self.found("missing", f"the row of session {start.session.app}")
         for app, runs in self.runs.items():
             relayed = sum(category == STATISTICS for row, _ in runs for category, _ in self.of_run[row])
-            self.found("missing", f"statistics events of {app}", relayed - self.statistics[app])
             starts = self.t.apps[app].starts if app in self.t.apps else []
-            self.found("twice", f"statistics events of {app}", self.statistics[app] - sum(s.statistics[1] for s in starts))
+            self.count(f"statistics events of {app}", self.statistics[app], relayed, sum(s.statistics[1] for s in starts))
             self.found("twice", f"sessions of {app}", len(runs) - len(starts))
         for row in self.alone:
-            self.found("twice", f"messages of standalone {row}", len(self.of_run[row]) - 1)
-            self.found("missing", f"the message of standalone {row}", 1 - len(self.of_run[row]))
+            self.count(f"messages of standalone {row}", len(self.of_run[row]), 1, 1)
         for m in self.t.messages.values():
             self.message(m)
         for start in self.t.starts:
@@ -117,51 +112,42 @@ class Check(Outcome):
         answered = m.answered < NEVER and not m.refused
         self.figures["answered"] += answered
         if m.refused or not (answered or any_row):
-            self.found("unexpected", f"message {m.n}, which was refused", any_row)
+            self.found("unexpected", f"{m}, which was refused", any_row)
             return
         by = min(m.answered, self.t.round_ends[m.round])
         sent = payload(m.n, m.kind, m.size)
         wanted = {k.replace(" ", "_"): v for k, v in sent.items()}
-        self.found("unexpected", f"another text of message {m.n}", sum(body != wanted for _, body in relayed) + sum(
+        self.found("unexpected", f"another text of {m}", sum(body != wanted for _, body in relayed) + sum(
             body != dict(sent, HostApplicationDisplayID=body.get("HostApplicationDisplayID")) for body in events))
         rows = collections.Counter(run if run not in self.alone else -1 for run, _ in relayed)
         apps = collections.Counter(body.get("HostApplicationDisplayID") for body in events)
         if m.targets is None:
             least, most = self.broadcast(m, by, rows)
-            self.count(m, "events", sum(apps.values()), 0 if -1 in rows else least, most)
+            self.count(f"events of {m}", sum(apps.values()), 0 if -1 in rows else least, most)
         else:
-            least, most = self.listed(m, by, rows, apps)
+            self.listed(m, rows, apps)
+            least = most = len(m.targets)
         if KINDS[m.kind][1] == POWER:
-            self.count(m, "power record", power, least, most)
+            self.count(f"power record of {m}", power, least, most)
         elif power:
-            self.found("unexpected", f"power record of message {m.n}")
+            self.found("unexpected", f"power record of {m}")
 
-    def count(self, m, what, there, least, most):
+    def count(self, what, there, least, most):
         self.figures["stored"] += min(there, most)
-        self.found("missing", f"{what} of message {m.n} of round {m.round}", least - there)
-        self.found("twice", f"{what} of message {m.n} of round {m.round}", there - most)
+        self.found("missing", what, least - there)
+        self.found("twice", what, there - most)
 
-    def listed(self, m, by, rows, apps):
+    def listed(self, m, rows, apps):
         alone = late = 0
-        unsure = []
         for s, start in m.targets:
-            self.count(m, "event", apps.pop(s.app, 0), 1, 1)
+            self.count(f"event of {m}", apps.pop(s.app, 0), 1, 1)
             if start is not None:  # without a row it was found missing, or its start did not count
-                self.count(m, "relayed row", rows.pop(start.row, 0) if start.row else 0, 1, 1)
+                self.count(f"relayed row of {m}", rows.pop(start.row, 0) if start.row else 0, 1, 1)
             else:
                 alone += 1
                 late += self.patient and s.type == ALARMS and time.monotonic() < m.due
-        for s, start in m.foreign:  # theirs may have stopped, gone or been replaced meanwhile
-            surely = s.gone > by
-            same = [other for other in self.t.apps.values() if other.id == s.id]
-            events = sum(apps.pop(app, 0) for app in ("Unknown", *(other.app for other in same)))  # made, not yet configured
-            self.count(m, "foreign event", events, surely, 1)
-            there = sum(rows.pop(other.row, 0) for one in same for other in one.starts)
-            self.count(m, "foreign row", there, surely and start.end_posted > by, 1)
-            unsure.append(there == 0)
-        self.count(m, "standalone row", rows.pop(-1, 0), alone - late, alone + sum(unsure))
-        self.found("unexpected", f"rows {dict(rows + apps)} of message {m.n}", sum((rows + apps).values()))
-        return len(m.targets) + sum(s.gone > by for s, _ in m.foreign), len(m.targets) + len(m.foreign)
+        self.count(f"standalone row of {m}", rows.pop(-1, 0), alone - late, alone)
+        self.found("unexpected", f"rows {dict(rows + apps)} of {m}", sum((rows + apps).values()))
 
     def broadcast(self, m, by, rows):
         may = [s for s in self.t.starts if s.round == m.round and s.posted < by and s.end_known > m.posted]
@@ -170,9 +156,9 @@ class Check(Outcome):
         for start in may:
             there = rows.pop(start.row, 0) if start.row else 0
             reached += there > 0
-            self.count(m, f"row in {start.session.app}", there, start in must, 1)
-        self.count(m, "standalone row", rows.get(-1, 0), not reached and not must, not reached)
-        self.found("unexpected", f"rows {dict(rows)} of message {m.n}", sum(rows.values()) - rows.get(-1, 0))
+            self.count(f"row in {start.session.app} of {m}", there, start in must, 1)
+        self.count(f"standalone row of {m}", rows.get(-1, 0), not reached and not must, not reached)
+        self.found("unexpected", f"rows {dict(rows)} of {m}", sum(rows.values()) - rows.get(-1, 0))
         return max(reached, 1), max(len(may), 1)
 
     # A session: the order of its messages, its end, its summary and its file.
@@ -187,15 +173,11 @@ class Check(Outcome):
                 self.found("disorder", f"message {m.n} in {app}")
             last[m.peer], latest = m.n, max(latest, m.posted)
         statistics = sum(category == STATISTICS for category, _ in rows)
-        self.found("missing", f"statistics of {app}", start.statistics[0] - statistics)
-        self.found("twice", f"{statistics} statistics in {app}", statistics - start.statistics[1])
-        if start.how is None or start.how == PERHAPS_REPLACED:
+        self.count(f"statistics in {app}", statistics, *start.statistics)
+        if start.how is None:
             return
         summaries = [i for i, (category, _) in enumerate(rows) if category == SUMMARY]
-        if start.how == REPLACED:
-            self.found("wrong_end", f"{app}, which was replaced", bool(summaries) or start.ended is not None)
-            return
-        if "ended_how" in self.columns and start.ended not in start.how:
+        if start.ended not in start.how:
             self.found("wrong_end", f"{app}: {start.ended}, not {start.how}")
         if not rows:
             return

@@ -17,7 +17,6 @@ KINDS = ((0x08000005, 1), (3, 0), (0x40000007, 5), (0x30000001, 6))
 POWER = 6
 STATISTICS, SUMMARY = 9, 65535
 LONGEST_DELAY = 60  # seconds, of a standalone of an alarms session
-REPLACED, PERHAPS_REPLACED = "replaced", "perhaps replaced"
 TEXT = "What is accepted is kept, whatever ends the process. " * 8
 
 
@@ -35,7 +34,6 @@ class Session:
     def __init__(self, id_, type_, app):
         self.id, self.type, self.app = id_, type_, app  # the app is its HostApplicationDisplayID; no other session's
         self.start, self.starts = None, []              # the one under way, and all of them
-        self.gone = NEVER                               # when it may have been gone
 
 
 @dataclasses.dataclass(eq=False)
@@ -48,7 +46,7 @@ class Start:
     known: float = NEVER         # when an answer told that it had run
     end_posted: float = NEVER
     end_known: float = NEVER
-    how: object = None           # how it may have ended: a set, REPLACED or PERHAPS_REPLACED
+    how: object = None           # how it may have ended: a set
     statistics: tuple = (0, 0)   # at least and at most so many messages of driver statistics
     counted: bool = False        # the counter grew while it was surely started
 
@@ -62,10 +60,12 @@ class Message:
     peer: object
     posted: int
     targets: list                # the client's own sessions and the start under way; None: to all that are started
-    foreign: list                # somebody else's, likewise
     due: float                   # when a standalone's delay has passed
     answered: float = NEVER
     refused: bool = False
+
+    def __str__(self):
+        return f"message {self.n} of round {self.round}"
 
 
 class Peer(Client):
@@ -131,7 +131,7 @@ class Traffic:
             what.answered, what.refused = now, f[2] is not None
         elif isinstance(what, Start) and f[0] == REPLY:  # of the call that ended it
             what.end_known = now
-            what.how = REPLACED if what.how == PERHAPS_REPLACED else what.how - {"crashed"}
+            what.how -= {"crashed"}
             what.statistics = (int(what.counted), what.statistics[1])
         if f[1] > peer.highest:  # calls of one connection run in order
             peer.highest = f[1]
@@ -142,11 +142,9 @@ class Traffic:
     def create(self, peer, type_=None, start=True):
         self.identifiers += 1
         type_ = self.random.choice(tuple(NAMES)) if type_ is None else type_
-        return self.announce(peer, Session(self.identifiers, type_, f"app.{self.identifiers}"), start)
-
-    def announce(self, peer, s, start, before=None):
+        s = Session(self.identifiers, type_, f"app.{self.identifiers}")
         self.apps[s.app] = peer.sessions[s.id] = s
-        self.post(peer, before, CREATE, s.id)
+        self.post(peer, None, CREATE, s.id)
         self.post(peer, None, SET_TYPE, s.type, s.id)
         self.post(peer, None, CONFIGURE, {"HostApplicationDisplayID": s.app, "a b": 1}, s.id)
         if start:
@@ -174,20 +172,10 @@ class Traffic:
     def destroy(self, peer, s):
         self.post(peer, self.end(s, "destroyed", "crashed"), DESTROY, s.id)
         del peer.sessions[s.id]
-        s.gone = self.tick
-
-    def replace(self, peer, s):
-        """The same identifier again: the session before is left as it is and never ended."""
-        before = self.end(s)
-        if before is not None:
-            before.how = PERHAPS_REPLACED
-        s.gone = self.now()
-        self.announce(peer, Session(s.id, s.type, f"{s.app}.{s.gone}"), True, before)
 
     def leave(self, peer):
         for s in peer.sessions.values():
             self.end(s, "disconnected", "crashed")
-            s.gone = self.now()
         if self.random.random() < 0.5:
             peer.raw(frame(GOODBYE))
             while peer.take(PATIENCE):
@@ -197,24 +185,20 @@ class Traffic:
         peer.close()
         self.peers.remove(peer)
 
-    def send(self, peer, ids, kind=None, size=0, targets=(), foreign=()):
+    def send(self, peer, ids, kind=None, size=0, targets=()):
         self.numbers += 1
         kind = self.random.randrange(len(KINDS)) if kind is None else kind
         m = Message(self.numbers, kind, size, self.round, peer, self.now(),
-                    None if ids is None else [(s, s.start) for s in targets], [(s, s.start) for s in foreign],
-                    time.monotonic() + LONGEST_DELAY)
+                    None if ids is None else [(s, s.start) for s in targets], time.monotonic() + LONGEST_DELAY)
         self.messages[m.n] = m
         self.post(peer, m, SEND, payload(m.n, m.kind, size), *KINDS[m.kind], ids)
 
     def burst(self, peer, count, size=0):
-        """Messages to some of the client's own sessions, at times to one of somebody else's."""
+        """Messages to some of the client's own sessions."""
         own = list(peer.sessions.values())
-        strangers = [s for other in self.peers if other is not peer for s in other.sessions.values()
-                     if s.start and s.start.known < NEVER]
         for _ in range(count):
             targets = self.random.sample(own, min(len(own), self.random.choice((1, 1, 1, 2, 3))))
-            foreign = [self.random.choice(strangers)] if strangers and self.random.random() < 0.1 else []
-            self.send(peer, [s.id for s in targets + foreign], size=size, targets=targets, foreign=foreign)
+            self.send(peer, [s.id for s in targets], size=size, targets=targets)
 
     def step(self):
         """One thing that a random client does."""
@@ -231,10 +215,8 @@ class Traffic:
         elif p < 0.94:
             s = r.choice(own)
             self.start(peer, s) if s.start is None else self.stop(peer, s)
-        elif p < 0.96:
-            self.destroy(peer, r.choice(own))
         elif p < 0.97:
-            self.replace(peer, r.choice(own))
+            self.destroy(peer, r.choice(own))
         elif p < 0.985:
             keys = f"disable_reporting = {str(r.random() < 0.3).lower()}\ndevice_name = '{p}'\n"
             self.service.replace_file("etc/preferences/com.quorvel.sonik.toml", keys)
@@ -262,7 +244,6 @@ class Traffic:
             peer.close()
             for s in peer.sessions.values():
                 self.end(s, how)
-                s.gone = self.now()
         now = self.now()
         for start in self.starts:
             if start.end_known == NEVER:

@@ -350,6 +350,13 @@ TEST_F(TornTest, ATailThatWasNotWrittenIsNotBelieved) {
   }
 }
 
+TEST_F(TornTest, ALengthOfNoneBeforeTheEndHidesNothing) {
+  std::fill_n(bytes.begin() + static_cast<std::ptrdiff_t>(second), 4, uint8_t{0});
+  const auto segment = JournalReader::readSegment(bytes);
+  EXPECT_THAT(segment.entries, SizeIs(2));
+  EXPECT_EQ(segment.tornBytes, third - second);
+}
+
 TEST_F(TornTest, AnEntryOfAnotherSegmentOrOutOfOrderIsNotBelieved) {
   Bytes other = bytes;
   ++other[offsetof(SegmentHeader, sequence)];

@@ -93,7 +93,10 @@ JournalReader::Segment JournalReader::readSegment(std::span<const uint8_t> bytes
   while (bytes.size() - at >= sizeof(EntryHeader)) {
     uint32_t length;
     std::memcpy(&length, bytes.data() + at, sizeof length);
-    if (length == 0) return segment;
+    // The end, unless something follows that only this segment can hold.
+    if (length == 0 &&
+        nextEntry(bytes, at + kEntryAlignment, header.sequence, next) == bytes.size())
+      return segment;
     std::optional<Entry> entry = entryAt(bytes.subspan(at), header.sequence);
     const bool note = entry && entry->header.type == EntryType::Note;
     if (!entry || (note ? entry->header.call >= next : entry->header.call < next)) {
