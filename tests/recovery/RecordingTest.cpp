@@ -17,6 +17,8 @@
 namespace vx::lnx {
 namespace {
 
+using testing::Contains;
+using testing::StartsWith;
 using wire::Operation;
 
 class RecordingTest : public JournalFixture {
@@ -191,6 +193,10 @@ TEST_F(RecordingTest, WhatReachesTheServiceIsInTheJournalInItsOrder) {
   const auto contents = read();
   for (const auto& record : contents.records)
     EXPECT_DOUBLE_EQ(record.time, 365 * 50 * 86400.0) << record.call;
+  const auto& notes = contents.records[0].notes;
+  ASSERT_THAT(notes, SizeIs(1)) << "what the service asks of the client belongs to its record";
+  EXPECT_EQ(readInput(notes[0].bytes)->answer.text(), "{process name=recording}");
+  EXPECT_THAT(service->rows.texts(), Contains(StartsWith("10:"))) << "as what an end writes";
   EXPECT_EQ(recorder->preferencesChanged("some.name").call(), 14u);
   EXPECT_EQ(recorded().back(), "14 @0 PreferencesChanged some.name");
   service->fakes.clock.advance(std::chrono::seconds(1));
