@@ -1,4 +1,5 @@
 #include <sys/stat.h>
+#include <unistd.h>
 
 #include "platform/linux/store/StoreFile.h"
 #include "platform/linux/store/StoreSchema.h"
@@ -73,6 +74,33 @@ TEST_F(StoreFileTest, CheckThatCannotReadFindsNoDamage) {
   EXPECT_EQ(faultOfFinding("Page 3: never used"), StoreFault::Damaged);
   EXPECT_EQ(faultOf(SQLITE_IOERR_READ), StoreFault::Unusable);
   EXPECT_EQ(faultOf(SQLITE_CORRUPT_SEQUENCE), StoreFault::Damaged);
+}
+
+int readsLeft = 0;  // until one fails, and all after it
+ssize_t failingRead(int fd, void* data, size_t bytes, off_t at) {
+  errno = EIO;
+  return readsLeft-- > 0 ? pread(fd, data, bytes, at) : -1;
+}
+
+// SQLite says of a page that it cannot read that the file is malformed.
+TEST_F(StoreFileTest, ReadErrorAtNoMomentIsTakenForDamage) {
+  for (int i = 0; i < 50; ++i)
+    query(open(), "INSERT INTO power_records VALUES(NULL, 1, 1, 'n', zeroblob(4000), 1, 1, 1)");
+  sqlite3_vfs* const files = sqlite3_vfs_find(nullptr);
+  const auto fake = reinterpret_cast<sqlite3_syscall_ptr>(failingRead);
+  int refused = 0;
+  StoreFault fault = StoreFault::Unusable;
+  for (int reads = 0; fault != StoreFault::None && reads < 1000; ++reads) {
+    for (const char* name : {"pread", "pread64"}) files->xSetSystemCall(files, name, fake);
+    readsLeft = reads;
+    const OpenedStore opened = open();
+    fault = opened.status.ok() ? quickCheck(opened.database.get()).fault : opened.fault;
+    for (const char* name : {"pread", "pread64"}) files->xSetSystemCall(files, name, nullptr);
+    EXPECT_NE(fault, StoreFault::Damaged) << reads;
+    ++refused;
+  }
+  EXPECT_EQ(fault, StoreFault::None);
+  EXPECT_GT(refused, 20);
 }
 
 TEST_F(StoreFileTest, SecondLockIsRefusedUntilTheFirstIsGone) {

@@ -22,7 +22,9 @@ Recovery::Recovery(RecoveryMeans means, JournalContents contents)
       platform_(means_.live, means_.backends, inputs_) {}
 
 ReplayedCalls Recovery::calls() const {
-  ReplayedCalls calls{.first = contents_.next.call, .sessionsFrom = contents_.next.call};
+  ReplayedCalls calls{.first = contents_.next.call,
+                      .end = contents_.next.call,
+                      .sessionsFrom = contents_.next.call};
   for (const Record& record : contents_.records) {
     const auto kind = static_cast<RecordKind>(record.kind);
     if (kind == RecordKind::RelayState || (kind == RecordKind::DelayedMessage && !record.done))

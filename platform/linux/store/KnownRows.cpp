@@ -13,16 +13,16 @@ namespace {
 // many, are read from there on.
 constexpr const char* kLastMark =
     "SELECT max(after_row, ifnull((SELECT max(last_row) FROM store_marks WHERE call < ?), 0))"
-    " FROM store_info";
+    " FROM store_epochs ORDER BY id DESC LIMIT 1";
 constexpr const char* kReads[] = {
-    "SELECT call, place, id FROM relay_messages WHERE id > ?2 AND call >= ?1",
+    "SELECT call, place, id FROM relay_messages WHERE id > ?2 AND call >= ?1 AND call < ?3",
     "SELECT call, event_place, id FROM relay_messages"
-    " WHERE id > ?2 AND call >= ?1 AND event_place IS NOT NULL",
-    "SELECT call, place, id FROM analytics_entries WHERE id > ?2 AND call >= ?1",
-    "SELECT call, place, id FROM power_records WHERE call >= ?1 AND ?2 >= 0"
-    " AND id > (SELECT after_power FROM store_info)",
-    "SELECT call, place, id FROM relay_sessions WHERE call >= ?1 AND ?2 >= 0"
-    " AND id > (SELECT after_session FROM store_info)",
+    " WHERE id > ?2 AND call >= ?1 AND call < ?3 AND event_place IS NOT NULL",
+    "SELECT call, place, id FROM analytics_entries WHERE id > ?2 AND call >= ?1 AND call < ?3",
+    "SELECT call, place, id FROM power_records WHERE call >= ?1 AND call < ?3 AND ?2 >= 0"
+    " AND id > (SELECT after_power FROM store_epochs ORDER BY id DESC)",
+    "SELECT call, place, id FROM relay_sessions WHERE call >= ?1 AND call < ?3 AND ?2 >= 0"
+    " AND id > (SELECT after_session FROM store_epochs ORDER BY id DESC)",
 };
 
 // Rows of calls are written nearly in the calls' order.
@@ -36,15 +36,17 @@ constexpr const char* kLastCall =
 
 }  // namespace
 
-uint64_t KnownRows::lastCall(sqlite3* database) {
+Result<uint64_t> KnownRows::lastCall(sqlite3* database) {
   Statement last(database, kLastCall);
-  return last.row() ? static_cast<uint64_t>(last.integer(0)) : 0;
+  if (!last.row()) return Status::failure(sqlite3_errmsg(database));
+  return static_cast<uint64_t>(last.integer(0));
 }
 
 Result<KnownRows> KnownRows::load(sqlite3* database, const ReplayedCalls& calls) {
   const uint64_t firstCall = calls.first;
   KnownRows known;
   known.firstCall_ = firstCall;
+  known.endCall_ = calls.end;
   Statement mark(database, kLastMark);
   if (!mark.bind(static_cast<int64_t>(firstCall)).row())
     return Status::failure(sqlite3_errmsg(database));
@@ -66,39 +68,48 @@ int KnownRows::readSessions(sqlite3* database, const ReplayedCalls& calls) {
   for (const uint64_t call : single) lowest = std::min(lowest, call);
   Statement rows(database,
                  "SELECT call, place, id FROM relay_sessions WHERE call >= ? AND call < ?"
-                 " AND id > (SELECT after_session FROM store_info)");
+                 " AND id > (SELECT after_session FROM store_epochs ORDER BY id DESC)");
   rows.bind(static_cast<int64_t>(lowest)).bind(static_cast<int64_t>(calls.first));
   while (rows.row()) {
     const RowKey key{static_cast<uint64_t>(rows.integer(0)),
                      static_cast<uint32_t>(rows.integer(1))};
     if (key.call >= calls.sessionsFrom || single.contains(key.call))
-      rows_.insert_or_assign(key, rows.integer(2));
+      rows_.insert_or_assign(key, Known{rows.integer(2)});
   }
   return rows.code();
 }
 
 int KnownRows::read(sqlite3* database, const char* sql, int64_t after) {
   Statement rows(database, sql);
-  rows.bind(static_cast<int64_t>(firstCall_)).bind(after);
+  rows.bind(static_cast<int64_t>(firstCall_)).bind(after).bind(static_cast<int64_t>(endCall_));
   while (rows.row()) {
     rows_.insert_or_assign(
         RowKey{static_cast<uint64_t>(rows.integer(0)), static_cast<uint32_t>(rows.integer(1))},
-        rows.integer(2));
+        Known{rows.integer(2)});
   }
   return rows.code();
 }
 
-std::optional<int64_t> KnownRows::find(const RowKey& key) const {
+std::optional<int64_t> KnownRows::find(const RowKey& key) {
   if (key.call == 0) return std::nullopt;
   const auto found = rows_.find(key);
-  return found == rows_.end() ? std::nullopt : std::optional<int64_t>(found->second);
+  if (found == rows_.end()) return std::nullopt;
+  found->second.asked = true;
+  return found->second.id;
+}
+
+void KnownRows::keepUnasked() {
+  std::unordered_map<RowKey, Known, Hash> unasked;
+  for (const auto& [key, known] : rows_)
+    if (!known.asked) unasked.emplace(key, known);
+  rows_.swap(unasked);
 }
 
 std::optional<int64_t> KnownRows::sessionOf(sqlite3* database, const RowKey& key) {
   if (key.call == 0) return std::nullopt;
   Statement query(database,
                   "SELECT id FROM relay_sessions WHERE call = ? AND place = ?"
-                  " AND id > (SELECT after_session FROM store_info)");
+                  " AND id > (SELECT after_session FROM store_epochs ORDER BY id DESC)");
   query.bind(static_cast<int64_t>(key.call)).bind(int64_t{key.place});
   return query.row() ? std::optional<int64_t>(query.integer(0)) : std::nullopt;
 }

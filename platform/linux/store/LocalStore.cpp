@@ -1,26 +1,13 @@
 #include "platform/linux/store/LocalStore.h"
 
-#include <sys/random.h>
-
 #include <utility>
 
 namespace vx::lnx {
 
-namespace {
-
-JournalEpoch randomEpoch() {
-  JournalEpoch epoch{};
-  (void)getrandom(epoch.data(), epoch.size(), 0);  // never short for so few
-  return epoch;
-}
-
-}  // namespace
-
 Result<std::unique_ptr<LocalStore>> LocalStore::open(
     const std::string& stateDirectory, const StoreOptions& options, Clock& clock,
-    const std::optional<JournalEpoch>& epochIfNew) {
-  auto beginning =
-      std::make_unique<StoreBeginning>(stateDirectory, epochIfNew ? *epochIfNew : randomEpoch());
+    const std::optional<JournalEpoch>& epochOfJournal) {
+  auto beginning = std::make_unique<StoreBeginning>(stateDirectory, epochOfJournal);
   Status refused;
   if (!beginning->lock(refused)) return refused;
   return std::unique_ptr<LocalStore>(new LocalStore(std::move(beginning), options, clock));

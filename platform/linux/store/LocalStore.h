@@ -28,10 +28,10 @@ class LocalStore final : public AnalyticsEventService, public PowerEventLog {
   // Locks <state>/telemetry.lock and opens or creates <state>/telemetry.db. Fails only when another
   // process has it: whatever else is wrong is tried again before each write, and rows wait. The
   // quick check runs on the writer's thread before its first write, so start-up does not wait for
-  // it. `epochIfNew`: of a store that has none yet; random without one.
+  // it. `epochOfJournal`: see StoreBeginning.
   static Result<std::unique_ptr<LocalStore>> open(
       const std::string& stateDirectory, const StoreOptions& options, Clock& clock,
-      const std::optional<JournalEpoch>& epochIfNew = std::nullopt);
+      const std::optional<JournalEpoch>& epochOfJournal = std::nullopt);
 
   // Within which (call, place) names a row. The same as long as this object lives.
   const JournalEpoch& epoch() const { return writer_.epoch(); }

@@ -85,6 +85,13 @@ Status RowWriter::loadKnownRows(const ReplayedCalls& calls) {
   return {};
 }
 
+void RowWriter::keepKnownRowsOfDelayed() {
+  thread_.assertHere();
+  if (!known_) return;
+  known_->keepUnasked();
+  if (known_->isEmpty()) known_.reset();
+}
+
 Result<RowWriter::Written> RowWriter::write(const StoreRecords& batch, std::size_t first,
                                             std::size_t last, const std::vector<LedgerNote>& notes,
                                             std::size_t allowance) {
@@ -145,7 +152,8 @@ int RowWriter::prepare() {
   Statement last(database_,
                  "SELECT max(ifnull((SELECT max(id) FROM relay_messages), 0),"
                  " ifnull((SELECT max(id) FROM analytics_entries), 0),"
-                 " ifnull((SELECT max(last_row) FROM store_marks), 0)),"
+                 " ifnull((SELECT max(last_row) FROM store_marks), 0),"
+                 " ifnull((SELECT max(after_row) FROM store_epochs), 0)),"
                  " ifnull((SELECT max(last_row) FROM store_marks), 0),"
                  " ifnull((SELECT max(call) FROM store_marks), 0)");
   if (!last.row()) return sqlite3_extended_errcode(database_);

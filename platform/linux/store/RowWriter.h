@@ -42,10 +42,11 @@ class RowWriter {
   RowWriter(const RowWriter&) = delete;
   RowWriter& operator=(const RowWriter&) = delete;
 
-  // Rows that are there already will not be written again, until they are forgotten.
+  // Rows that are there already will not be written again.
   Status loadKnownRows(const ReplayedCalls& calls);
   bool knowsRows() const { return known_.has_value(); }
-  void forgetKnownRows() { known_.reset(); }
+  // The replay is over: what it has not come to may still come.
+  void keepKnownRowsOfDelayed();
 
   // Writes records [first, last) of a batch, the events that share their text, and the notes, in
   // one transaction of at most `allowance` bytes of text; what goes beyond it is left for the next
@@ -80,7 +81,7 @@ class RowWriter {
   // Builds the text of an event in eventJson_; of its tail only, when the rest of it is `message`.
   EventText buildEvent(const AnalyticsRecord& event, const Payload* message);
   int writeLedger(const LedgerNote& note);
-  bool isKnown(const StoreRecord& record) const {
+  bool isKnown(const StoreRecord& record) {
     return known_ && known_->find(record.cause.key()).has_value();
   }
   KeyColumns columnsOf(const RowKey& key, uint32_t user);

@@ -67,6 +67,12 @@ class TableCopy {
   int count_ = 0;
 };
 
+void takeOverEpochs(sqlite3* damaged, sqlite3* fresh) {
+  if (!Statement(damaged, "SELECT epoch FROM store_epochs").row()) return;
+  if (execute(fresh, "DELETE FROM store_epochs") == SQLITE_OK)
+    TableCopy(damaged, fresh, "store_epochs").run();
+}
+
 }  // namespace
 
 int64_t takeOverRows(const std::string& damaged, sqlite3* fresh) {
@@ -78,6 +84,7 @@ int64_t takeOverRows(const std::string& damaged, sqlite3* fresh) {
   if (code != SQLITE_OK) return 0;
   int64_t rows = 0;
   for (const char* table : kTables) rows += TableCopy(opened, fresh, table).run();
+  takeOverEpochs(opened, fresh);
   return rows;
 }
 

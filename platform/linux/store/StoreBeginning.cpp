@@ -1,13 +1,35 @@
 #include "platform/linux/store/StoreBeginning.h"
 
+#include <sys/random.h>
 #include <unistd.h>
 
 #include <utility>
 
+#include "platform/linux/store/KnownRows.h"
 #include "platform/linux/store/Salvage.h"
 #include "platform/linux/store/StoreSchema.h"
 
 namespace vx::lnx {
+
+namespace {
+
+constexpr uint8_t kPromised = 0x80;  // in the first byte of an epoch
+
+JournalEpoch randomEpoch() {
+  JournalEpoch epoch{};
+  (void)getrandom(epoch.data(), epoch.size(), 0);  // never short for so few
+  epoch[0] &= static_cast<uint8_t>(~kPromised);
+  return epoch;
+}
+
+}  // namespace
+
+StoreBeginning::StoreBeginning(std::string directory,
+                               const std::optional<JournalEpoch>& epochOfJournal)
+    : directory_(std::move(directory)),
+      epoch_(epochOfJournal.value_or(randomEpoch())),
+      hasJournal_(epochOfJournal.has_value()),
+      epochStays_((epoch_[0] & kPromised) != 0) {}
 
 bool StoreBeginning::lock(Status& why) {
   if (lock_) return true;
@@ -18,6 +40,22 @@ bool StoreBeginning::lock(Status& why) {
 }
 
 OpenedStore StoreBeginning::open(std::vector<LedgerNote>& notes) {
+  OpenedStore opened = openFile(notes);
+  // Numbers that are not known to be new are of another epoch.
+  if (std::exchange(isFirst_, false) && opened.status.ok()) {
+    Result<uint64_t> last = KnownRows::lastCall(opened.database.get());
+    if (last.ok())
+      lastCall_ = *last;
+    else
+      opened = {nullptr, last.status(), StoreFault::Unusable, {}};
+  }
+  if (opened.status.ok() && !epochStays_) epoch_ = opened.epoch;
+  if (!opened.status.ok() && !epochStays_ && !hasJournal_) epoch_[0] |= kPromised;
+  epochStays_ = true;
+  return opened;
+}
+
+OpenedStore StoreBeginning::openFile(std::vector<LedgerNote>& notes) {
   Status why;
   if (!lock(why) || !lock_) return {nullptr, why, StoreFault::Unusable, {}};
   path_ = directory_ + "/telemetry.db";
@@ -28,9 +66,6 @@ OpenedStore StoreBeginning::open(std::vector<LedgerNote>& notes) {
     opened = openStoreDatabase(path_, epoch_);
   }
   if (opened.fault == StoreFault::Damaged) opened = beginAfresh(opened.status.text(), notes);
-  if (!opened.status.ok()) return opened;
-  if (!hasEpoch_) epoch_ = opened.epoch;
-  hasEpoch_ = true;
   return opened;
 }
 
@@ -65,6 +100,11 @@ OpenedStore StoreBeginning::beginAfresh(const std::string& why, std::vector<Ledg
   OpenedStore fresh = openStoreDatabase(path_, epoch_);
   if (!fresh.status.ok()) return fresh;
   const int64_t taken = takeOverRows(*aside, fresh.database.get());
+  // With the rows came the epochs of their keys, where those could be read.
+  if (epochOf(fresh.database.get()) != epoch_) {
+    if (Status adopted = adoptEpoch(fresh.database.get(), epoch_); !adopted.ok())
+      return {nullptr, std::move(adopted), StoreFault::Unusable, {}};
+  }
   notes.push_back({"moved_aside", "", taken,
                    why + "; now " + *aside + "; rows taken over: " + std::to_string(taken)});
   return fresh;

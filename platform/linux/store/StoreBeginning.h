@@ -3,6 +3,7 @@
 #pragma once
 
 #include <cstdint>
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -20,8 +21,8 @@ namespace vx::lnx {
 // only a file that is no database, or whose check finds something, is moved aside.
 class StoreBeginning {
  public:
-  StoreBeginning(std::string directory, const JournalEpoch& epochIfNew)
-      : directory_(std::move(directory)), epoch_(epochIfNew) {}
+  // `epochOfJournal`: of a journal with calls that are not in the store.
+  StoreBeginning(std::string directory, const std::optional<JournalEpoch>& epochOfJournal);
 
   // False when another process has the store. A lock that cannot be had for another reason is tried
   // again by open().
@@ -39,17 +40,26 @@ class StoreBeginning {
   Status settle(StoreLoss loss, std::vector<LedgerNote>& notes);
 
   const std::string& path() const { return path_; }
+  // That of the first store that was opened. While none could be, calls are recorded under one that
+  // was promised, which is marked: the store adopts it as soon as it can be opened, in whichever
+  // process, and earlier rows keep their own.
   const JournalEpoch& epoch() const { return epoch_; }
+  // The highest number that a call has among the newest rows of what was opened first; 0 for none.
+  uint64_t lastCall() const { return lastCall_; }
   // Changes when the rows that were written are no longer those of the store.
   uint32_t stores() const { return stores_; }
 
  private:
+  OpenedStore openFile(std::vector<LedgerNote>& notes);
   OpenedStore beginAfresh(const std::string& why, std::vector<LedgerNote>& notes);
 
   const std::string directory_;
   std::string path_;
-  JournalEpoch epoch_;  // the first store's that was opened
-  bool hasEpoch_ = false;
+  JournalEpoch epoch_;
+  const bool hasJournal_;
+  bool epochStays_;
+  bool isFirst_ = true;
+  uint64_t lastCall_ = 0;
   uint32_t stores_ = 1;
   UniqueFd lock_;
 };

@@ -10,6 +10,7 @@
 #include <cstdio>
 #include <cstdlib>
 #include <ctime>
+#include <optional>
 #include <string_view>
 #include <utility>
 
@@ -19,11 +20,12 @@ namespace vx::lnx {
 
 namespace {
 
-// Set before anything is read: page_size holds for a file that is begun now.
-constexpr const char* kPragmas[] = {
-    "PRAGMA page_size = 8192",   "PRAGMA auto_vacuum = INCREMENTAL",    "PRAGMA journal_mode = WAL",
-    "PRAGMA synchronous = FULL", "PRAGMA journal_size_limit = 4194304", "PRAGMA cache_size = -1024",
-    "PRAGMA temp_store = MEMORY"};
+// Of a file that is begun now; to one that is there the second would be a write.
+constexpr const char* kPragmasOfNew[] = {"PRAGMA page_size = 8192",
+                                         "PRAGMA auto_vacuum = INCREMENTAL"};
+constexpr const char* kPragmas[] = {"PRAGMA journal_mode = WAL", "PRAGMA synchronous = FULL",
+                                    "PRAGMA journal_size_limit = 4194304",
+                                    "PRAGMA cache_size = -1024", "PRAGMA temp_store = MEMORY"};
 
 // One connection on one thread, and nobody who asks how much memory SQLite uses: it may leave out
 // its locks.
@@ -33,12 +35,19 @@ void configureOnce() {
   (void)configured;
 }
 
+// errno of the last call that failed on the file; 0: none has.
+int systemErrorOf(sqlite3* database) {
+  int error = 0;
+  if (database != nullptr) sqlite3_file_control(database, "main", SQLITE_FCNTL_LAST_ERRNO, &error);
+  return error;
+}
+
 }  // namespace
 
-StoreFault faultOf(int code) {
+StoreFault faultOf(int code, int systemError) {
   const int primary = code & 0xFF;
-  return primary == SQLITE_NOTADB || primary == SQLITE_CORRUPT ? StoreFault::Damaged
-                                                               : StoreFault::Unusable;
+  const bool damaged = primary == SQLITE_NOTADB || primary == SQLITE_CORRUPT;
+  return damaged && systemError == 0 ? StoreFault::Damaged : StoreFault::Unusable;
 }
 
 StoreFault faultOfFinding(const std::string& finding) {
@@ -79,8 +88,10 @@ OpenedStore openStoreDatabase(const std::string& path, const JournalEpoch& epoch
   OpenedStore opened{Database(database), Status(), StoreFault::None, {}};
   auto fail = [&](int failure) {
     const char* why = database != nullptr ? sqlite3_errmsg(database) : sqlite3_errstr(failure);
-    return OpenedStore{
-        nullptr, Status::failure("cannot use " + path + ": " + why), faultOf(failure), {}};
+    return OpenedStore{nullptr,
+                       Status::failure("cannot use " + path + ": " + why),
+                       faultOf(failure, systemErrorOf(database)),
+                       {}};
   };
   if (code != SQLITE_OK) return fail(code);
   sqlite3_busy_timeout(database, 1000);
@@ -96,10 +107,13 @@ OpenedStore openStoreDatabase(const std::string& path, const JournalEpoch& epoch
             StoreFault::Newer,
             {}};
   }
-  for (const char* pragma : kPragmas) {
-    code = execute(database, pragma);
-    if (code != SQLITE_OK) return fail(code);
+  for (const char* pragma : kPragmasOfNew) {
+    if (version == 0 && code == SQLITE_OK) code = execute(database, pragma);
   }
+  for (const char* pragma : kPragmas) {
+    if (code == SQLITE_OK) code = execute(database, pragma);
+  }
+  if (code != SQLITE_OK) return fail(code);
   // A checkpoint at every 4 MiB of log, whatever the size of a page.
   Statement pageSize(database, "PRAGMA page_size");
   if (!pageSize.row()) return fail(sqlite3_extended_errcode(database));
@@ -110,15 +124,16 @@ OpenedStore openStoreDatabase(const std::string& path, const JournalEpoch& epoch
   // What the statement says is not wrong: the tables are not those of its version.
   if (code == SQLITE_ERROR || (code & 0xFF) == SQLITE_CONSTRAINT) {
     OpenedStore failed = fail(code);
-    failed.fault = StoreFault::Damaged;
+    if (systemErrorOf(database) == 0) failed.fault = StoreFault::Damaged;
     return failed;
   }
   if (code != SQLITE_OK) return fail(code);
-  Statement epochQuery(database, "SELECT epoch FROM store_info");
-  if (!epochQuery.row())
-    return fail(epochQuery.code() == SQLITE_DONE ? SQLITE_CORRUPT : epochQuery.code());
-  const std::span<const uint8_t> epoch = epochQuery.blob(0);
-  std::copy_n(epoch.begin(), std::min(epoch.size(), opened.epoch.size()), opened.epoch.begin());
+  const std::optional<JournalEpoch> epoch = epochOf(database);
+  if (!epoch) {
+    code = sqlite3_extended_errcode(database);
+    return fail((code & 0xFF) == SQLITE_DONE || code == SQLITE_OK ? SQLITE_CORRUPT : code);
+  }
+  opened.epoch = *epoch;
   return opened;
 }
 
@@ -135,13 +150,14 @@ StoreCheck checkOnce(sqlite3* database, Function<bool()>& goOn) {
   sqlite3_progress_handler(database, 0, nullptr, nullptr);
   if (!ended && sqlite3_errcode(database) == SQLITE_INTERRUPT)
     return {Status::posix("the check was cut short", ECANCELED), StoreFault::Unusable};
-  if (!ended)
-    return {Status::failure(sqlite3_errmsg(database)), faultOf(sqlite3_extended_errcode(database))};
+  const int error = systemErrorOf(database);
+  if (!ended) {
+    return {Status::failure(sqlite3_errmsg(database)),
+            faultOf(sqlite3_extended_errcode(database), error)};
+  }
   const std::string found = check.text(0);
   if (found == "ok") return {};
   // Not every finding says why a page could not be read.
-  int error = 0;
-  sqlite3_file_control(database, "main", SQLITE_FCNTL_LAST_ERRNO, &error);
   return {Status::failure(found), error != 0 ? StoreFault::Unusable : faultOfFinding(found)};
 }
 

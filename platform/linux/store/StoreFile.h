@@ -47,8 +47,9 @@ struct StoreCheck {
 // Is cut short (ECANCELED) when `goOn`, which is asked every few milliseconds, says no.
 StoreCheck quickCheck(sqlite3* database, Function<bool()> goOn = nullptr);
 
-// What an SQLite error says about the file.
-StoreFault faultOf(int code);
+// What an SQLite error says about the file. `systemError`: errno of the last call that failed on it
+// (SQLITE_FCNTL_LAST_ERRNO), because SQLite says of a read error that the file is malformed.
+StoreFault faultOf(int code, int systemError = 0);
 // The same of what the check found: among that is a page that could not be read.
 StoreFault faultOfFinding(const std::string& finding);
 

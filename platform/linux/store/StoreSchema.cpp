@@ -1,5 +1,7 @@
 #include "platform/linux/store/StoreSchema.h"
 
+#include <algorithm>
+#include <span>
 #include <string>
 #include <vector>
 
@@ -20,10 +22,11 @@ CREATE VIEW session_messages AS
 constexpr const char* kEventNames =
     "CREATE TABLE event_names(id INTEGER PRIMARY KEY, name TEXT NOT NULL UNIQUE);";
 
-// The epoch within which the (call, place) of a row after the given ones is its name; and every so
-// many rows, the highest call so far and the last id of messages and events (see KnownRows).
+// The epochs within which the (call, place) of a row is its name: each of the rows after the given
+// ones, up to those of the next. And every so many rows, the highest call so far and the last id of
+// messages and events (see KnownRows).
 constexpr const char* kBookkeeping = R"sql(
-CREATE TABLE store_info(id INTEGER PRIMARY KEY CHECK (id = 1), epoch BLOB NOT NULL,
+CREATE TABLE store_epochs(id INTEGER PRIMARY KEY, epoch BLOB NOT NULL,
   after_row INTEGER NOT NULL DEFAULT 0, after_power INTEGER NOT NULL DEFAULT 0, after_session INTEGER NOT NULL DEFAULT 0);
 CREATE TABLE store_marks(id INTEGER PRIMARY KEY, call INTEGER NOT NULL, last_row INTEGER NOT NULL);
 )sql";
@@ -94,7 +97,7 @@ ALTER TABLE power_records ADD COLUMN call INTEGER;
 ALTER TABLE power_records ADD COLUMN place INTEGER;
 ALTER TABLE power_records ADD COLUMN uid INTEGER;
 UPDATE analytics_entries SET message = NULL WHERE message IS NOT NULL AND substr(payload, 1, 1) = '{';
-CREATE TABLE store_info(id INTEGER PRIMARY KEY CHECK (id = 1), epoch BLOB NOT NULL,
+CREATE TABLE store_epochs(id INTEGER PRIMARY KEY, epoch BLOB NOT NULL,
   after_row INTEGER NOT NULL DEFAULT 0, after_power INTEGER NOT NULL DEFAULT 0, after_session INTEGER NOT NULL DEFAULT 0);
 CREATE TABLE store_marks(id INTEGER PRIMARY KEY, call INTEGER NOT NULL, last_row INTEGER NOT NULL);
 )sql";
@@ -123,21 +126,30 @@ Script scriptFrom(int64_t version) {
 }
 
 int beginEpoch(sqlite3* database, const JournalEpoch& epoch) {
-  Statement insert(database, "INSERT INTO store_info(id, epoch) VALUES(1, ?)");
+  Statement insert(database, "INSERT INTO store_epochs(epoch) VALUES(?)");
   return insert.bind(std::span<const uint8_t>(epoch)).run();
 }
 
 }  // namespace
 
 Status adoptEpoch(sqlite3* database, const JournalEpoch& epoch) {
-  Statement update(database,
-                   "UPDATE store_info SET epoch = ?, after_row ="
-                   " max(ifnull((SELECT max(id) FROM relay_messages), 0),"
+  Statement insert(database,
+                   "INSERT INTO store_epochs(epoch, after_row, after_power, after_session)"
+                   " SELECT ?, max(ifnull((SELECT max(id) FROM relay_messages), 0),"
                    " ifnull((SELECT max(id) FROM analytics_entries), 0)),"
-                   " after_power = ifnull((SELECT max(id) FROM power_records), 0),"
-                   " after_session = ifnull((SELECT max(id) FROM relay_sessions), 0)");
-  if (update.bind(std::span<const uint8_t>(epoch)).run() == SQLITE_OK) return {};
+                   " ifnull((SELECT max(id) FROM power_records), 0),"
+                   " ifnull((SELECT max(id) FROM relay_sessions), 0)");
+  if (insert.bind(std::span<const uint8_t>(epoch)).run() == SQLITE_OK) return {};
   return Status::failure(sqlite3_errmsg(database));
+}
+
+std::optional<JournalEpoch> epochOf(sqlite3* database) {
+  Statement query(database, "SELECT epoch FROM store_epochs ORDER BY id DESC LIMIT 1");
+  if (!query.row()) return std::nullopt;
+  JournalEpoch epoch{};
+  const std::span<const uint8_t> bytes = query.blob(0);
+  std::copy_n(bytes.begin(), std::min(bytes.size(), epoch.size()), epoch.begin());
+  return epoch;
 }
 
 int findSchema(sqlite3* database) {
@@ -147,7 +159,7 @@ int findSchema(sqlite3* database) {
         kPowerRecords.insertSql(), kStoreLedger.insertSql(),
         std::string("INSERT INTO event_names(id, name) VALUES(?, ?)"),
         std::string("INSERT INTO store_marks(id, call, last_row) VALUES(?, ?, ?)"),
-        std::string("SELECT epoch, after_row, after_power, after_session FROM store_info"),
+        std::string("SELECT epoch, after_row, after_power, after_session FROM store_epochs"),
         std::string("SELECT id, time, name, payload FROM analytics_events"),
         std::string("SELECT payload FROM session_messages")}) {
     if (code == SQLITE_OK) code = Statement(database, sql).code();

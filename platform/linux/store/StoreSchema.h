@@ -4,6 +4,7 @@
 #include <sqlite3.h>
 
 #include <cstdint>
+#include <optional>
 
 #include "base/Status.h"
 #include "platform/linux/journal/JournalFormat.h"
@@ -20,7 +21,10 @@ int bringSchemaUpToDate(sqlite3* database, int64_t version, const JournalEpoch& 
 // SQLITE_ERROR, or why it cannot be told.
 int findSchema(sqlite3* database);
 
-// Makes keys from here on those of another epoch: earlier rows' keys no longer count.
+// Makes the keys of later rows those of another epoch; earlier ones keep theirs.
 Status adoptEpoch(sqlite3* database, const JournalEpoch& epoch);
+
+// The epoch of the rows that are written now; none when that cannot be read.
+std::optional<JournalEpoch> epochOf(sqlite3* database);
 
 }  // namespace vx::lnx

@@ -50,7 +50,7 @@ StoreWriter::StoreWriter(std::unique_ptr<StoreBeginning> beginning, const StoreO
     : options_(options), clock_(clock), queue_(options, clock), beginning_(std::move(beginning)) {
   unchecked_ = beginning_->open(found_);
   epoch_ = beginning_->epoch();
-  if (unchecked_.status.ok()) lastCall_ = KnownRows::lastCall(unchecked_.database.get());
+  lastCall_ = beginning_->lastCall();
 }
 
 StoreWriter::~StoreWriter() {
@@ -272,7 +272,7 @@ void StoreWriter::onCommitted(StoreBatch& batch, std::size_t first, std::size_t 
   for (std::size_t i = first; replayFrom_ && i < last; ++i) {
     if (!std::holds_alternative<ReplayEndRecord>(batch.records[i].what)) continue;
     replayFrom_.reset();
-    open_->rows.forgetKnownRows();
+    open_->rows.keepKnownRowsOfDelayed();
   }
   const std::size_t left = batch.records.size() - first;
   release(batch, last - first == left ? batch.bytes : batch.bytes * (last - first) / left);
