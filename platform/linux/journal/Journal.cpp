@@ -38,8 +38,9 @@ Result<std::unique_ptr<Journal>> Journal::open(JournalOptions options,
   options.maxBytes = std::max(options.maxBytes, kMinSegments * kSegmentBytes);
   std::unique_ptr<Journal> journal(new Journal(std::move(options), std::move(folder).value()));
   for (const std::string& name : journal->folder_.segments()) {
-    std::string complaint = journal->adopt(name);
-    if (!complaint.empty() && complaints != nullptr) complaints->push_back(std::move(complaint));
+    Result<std::string> complaint = journal->adopt(name);
+    if (!complaint.ok()) return complaint.status();
+    if (!complaint->empty() && complaints != nullptr) complaints->push_back(*std::move(complaint));
   }
   journal->sortAdopted();
   (void)journal->lookForCapacity();
@@ -49,8 +50,9 @@ Result<std::unique_ptr<Journal>> Journal::open(JournalOptions options,
 Journal::Journal(JournalOptions options, JournalFolder folder)
     : options_(std::move(options)), folder_(std::move(folder)), next_(options_.first) {}
 
-// Takes over a file that is there; what there is to say when it had to be set aside.
-std::string Journal::adopt(const std::string& name) {
+// Takes over a file that is there; what there is to say when it had to be set aside. A failure when
+// that cannot be told at this moment.
+Result<std::string> Journal::adopt(const std::string& name) {
   MutexLock lock(mutex_);
   Result<JournalFolder::Opened> opened = folder_.openSegment(name, JournalFolder::Access::Write);
   const SegmentHeader header = opened.ok() ? opened->header : SegmentHeader{};
@@ -59,14 +61,16 @@ std::string Journal::adopt(const std::string& name) {
     // The process ended just then, or somebody emptied it.
     return opened->blank ? name + " is blank; removed" : std::string();
   }
+  if (!opened.ok() && isOfTheMoment(opened.status())) return opened.status();
   std::string why = opened.ok() ? name + " is of another store" : opened.status().text();
   if (opened.ok() && header.epoch == options_.epoch) {
     next_.goPast(header);
     Result<JournalSegment::Pointer> segment = JournalSegment::map(std::move(opened->fd), name);
     if (segment.ok()) {
       sealed_.push_back(std::move(segment).value());
-      return {};
+      return std::string();
     }
+    if (isOfTheMoment(segment.status())) return segment.status();
     why = segment.status().text();
   }
   if (!folder_.setAside(name)) return why + "; it could not be set aside";

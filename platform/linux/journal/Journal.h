@@ -116,7 +116,7 @@ class Journal {
  private:
   enum class Use { Calls, Ends, Snapshot };
   Journal(JournalOptions options, JournalFolder folder);
-  std::string adopt(const std::string& name);
+  Result<std::string> adopt(const std::string& name);
   void sortAdopted();
 
   Result<JournalAppended> write(const JournalRecord& record, EntryType type, Use use)

@@ -9,6 +9,7 @@
 #include <charconv>
 #include <cstdio>
 #include <filesystem>
+#include <iterator>
 
 namespace vx::lnx {
 
@@ -90,6 +91,11 @@ Result<JournalFolder> JournalFolder::open(const std::string& path, IfMissing ifM
   const Status owned = checkOwned(fd.get(), path, S_IFDIR);
   if (!owned.ok()) return owned;
   return JournalFolder(path, std::move(fd));
+}
+
+bool isOfTheMoment(const Status& failure) {
+  constexpr int kCodes[] = {EIO, EINTR, EAGAIN, ENOMEM, ENOSPC, EMFILE, ENFILE};
+  return std::ranges::find(kCodes, failure.code()) != std::end(kCodes);
 }
 
 std::vector<std::string> JournalFolder::segments() const {

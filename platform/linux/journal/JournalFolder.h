@@ -12,6 +12,9 @@
 
 namespace vx::lnx {
 
+// Whether the system could not do what was tried just now, which says nothing of the file.
+bool isOfTheMoment(const Status& failure);
+
 // One folder of segments. Trusts nothing in it that is not a regular file of this user which nobody
 // else may open, and follows no links. Immutable, so thread-safe; two processes must not write to
 // the same folder. Keeps at most kMaxAside files, and as many journals, that were set aside: the

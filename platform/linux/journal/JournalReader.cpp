@@ -38,7 +38,9 @@ std::optional<JournalReader::Entry> entryAt(std::span<const uint8_t> bytes, uint
   return entry;
 }
 
+// False: it is shorter, or cannot be read, which errno says.
 bool readWhole(int fd, std::vector<uint8_t>& bytes) {
+  errno = 0;
   bytes.resize(kSegmentBytes);
   std::size_t have = 0;
   while (have < bytes.size()) {
@@ -137,6 +139,7 @@ Result<JournalContents> JournalReader::read(const std::string& path, const Journ
   std::vector<Source> sources;
   for (const std::string& name : folder->segments()) {
     const auto opened = folder->openSegment(name, JournalFolder::Access::Read);
+    if (!opened.ok() && isOfTheMoment(opened.status())) return opened.status();
     if (!opened.ok())
       contents.refused.push_back(opened.status().text());
     else if (opened->header.state != SegmentHeader::kFree && opened->header.epoch != epoch)
@@ -156,6 +159,9 @@ Result<JournalContents> JournalReader::read(const std::string& path, const Journ
     contents.next.goPast(source.header);
     const auto opened = folder->openSegment(source.name, JournalFolder::Access::Read);
     if (!opened.ok() || !readWhole(opened->fd.get(), bytes)) {
+      Status failed =
+          opened.ok() ? Status::lastError("cannot read " + source.name) : opened.status();
+      if (isOfTheMoment(failed)) return failed;
       contents.refused.push_back(source.name + " cannot be read");
       continue;
     }

@@ -48,7 +48,8 @@ struct JournalContents {
 class JournalReader {
  public:
   // The base is the newest generation with a complete snapshot. It is given whole; of the calls
-  // before it those that are not done; snapshots that are older or incomplete are not given.
+  // before it those that are not done; snapshots that are older or incomplete are not given. A
+  // failure when a file cannot be read at this moment.
   static Result<JournalContents> read(const std::string& folder, const JournalEpoch& epoch);
 
   // One segment's bytes, of any length. Views of them.

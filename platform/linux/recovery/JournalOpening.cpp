@@ -71,7 +71,8 @@ Result<OpenedJournal> openJournal(JournalOptions options, const std::string& mov
   } else if (!headers.empty()) {
     // Before the journal is opened: that sets aside what is not its own, and says so.
     Result<JournalContents> left = JournalReader::read(options.folder, options.epoch);
-    if (left.ok()) opened.left = std::move(left).value();
+    if (!left.ok()) return left.status();  // it stays for another process
+    opened.left = std::move(left).value();
     keepTorn(options.folder, opened.left, opened.complaints);
   }
   // One that an earlier process moved, which ended before it could say so, still has its count.

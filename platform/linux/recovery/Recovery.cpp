@@ -151,7 +151,9 @@ void Recovery::delayed(const Record& record) {
     return;
   }
   if (!delayed_.emplace(record.connection, delay->position.place).second) return;
-  auto cause = std::make_unique<HeldCause>(Cause{*CauseScope::current(), delay->position});
+  const JournalTicket* const call = CauseScope::current();
+  if (call == nullptr) return;
+  auto cause = std::make_unique<HeldCause>(Cause{*call, delay->position});
   if (!delegate_->restoreDelayed(delay->facts, *record.dictionary, std::move(cause)))
     ++outcome_.unreadable;
 }
