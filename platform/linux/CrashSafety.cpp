@@ -217,7 +217,7 @@ bool CrashSafety::keepWhatIsLeft(Function<void(std::chrono::milliseconds)> askFo
     return true;
   }
   endReplay(folders_.journal);  // of which this process has not died
-  JournalMove move(folders_.journal, folders_.moved);
+  JournalMove move(folders_.journal, folders_.moved, means_.store.bytesLeft());
   StopDeadline deadline(means_.clock, means_.clock.monotonic(), kMoveLimits, std::move(askForTime));
   std::optional<Status> outcome;
   while (!(outcome = move.waitUntil(deadline.nextLook())) && deadline.goOn(move.progress())) {

@@ -1,6 +1,7 @@
 // What lies in the folder: of another process, another store, another user, another place.
 #include <fcntl.h>
 #include <sys/mount.h>
+#include <sys/resource.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -125,6 +126,23 @@ TEST_F(JournalFilesTest, FilesOfOthersAreSetAsideAndReported) {
   }
 }
 
+TEST_F(JournalFilesTest, FileThatCannotBeMappedAtThisMomentStaysForAnotherProcess) {
+  leaveBehind();
+  const std::string kinds = readKinds();
+  long pages = 0;
+  std::ifstream("/proc/self/statm") >> pages;
+  rlimit before{};
+  getrlimit(RLIMIT_AS, &before);
+  const rlimit little{static_cast<rlim_t>(pages * sysconf(_SC_PAGESIZE)) + (1 << 20),
+                      before.rlim_max};
+  setrlimit(RLIMIT_AS, &little);
+  const auto refused = Journal::open(options, &complaints);
+  setrlimit(RLIMIT_AS, &before);
+  EXPECT_EQ(refused.status().code(), ENOMEM);
+  EXPECT_EQ(readKinds(), kinds);
+  EXPECT_NE(kinds, "");
+}
+
 TEST_F(JournalFilesTest, KeepsTheLastFewThatWereSetAside) {
   for (int i = 0; i < 6; ++i) {
     leaveBehind();
@@ -213,6 +231,9 @@ TEST_F(JournalFilesTest, MovesToAnotherFileSystemAndIsReadThere) {
   const std::string twice = options.folder + "/segment-0000000000000001.vxj";
   fs::copy_file(twice, root + "/twice");
   std::ofstream(options.folder + "/aggregate-1.vxa") << std::string(700000, 'a');
+  EXPECT_FALSE(
+      JournalFolder::moveTo(options.folder, other, nullptr, 2 * kSegmentBytes + 700000 - 1).ok());
+  EXPECT_THAT(JournalReader::read(other, options.epoch)->records, IsEmpty());
   ASSERT_TRUE(JournalFolder::moveTo(options.folder, other).ok());
   EXPECT_THAT(files(), IsEmpty());
   EXPECT_EQ(fs::file_size(other + "/aggregate-1.vxa"), 700000u);

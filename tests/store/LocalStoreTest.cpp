@@ -248,11 +248,14 @@ TEST_F(LocalStoreTest, FileAndLogStayWithinTheSizeAndItsSlack) {
   EXPECT_LE(largest, options.maxBytes + StoreOptions::kSlackBytes);
   EXPECT_EQ(query("SELECT count(*) > 0 FROM store_ledger WHERE event = 'removed_for_size'").at(0),
             "1");
-  options.maxBytes = 6 << 20;
+  // With a journal that an earlier process moved there, and that could not be taken back.
+  std::filesystem::create_directory(folder + "/journal");
+  write("journal/some", std::string(3 << 20, 'x'));
+  options.maxBytes = 9 << 20;
   reopen();
   EXPECT_TRUE(close());
   store.reset();
-  EXPECT_LE(storeBytes(), options.maxBytes);
+  EXPECT_LE(storeBytes(), 6u << 20);
 }
 
 TEST_F(LocalStoreTest, SecondOpenerIsRefused) {

@@ -61,7 +61,7 @@ TEST_F(RowWriterTest, EveryColumnIsWhatWasGivenAndOfItsKind) {
   EXPECT_THAT(
       query("SELECT * FROM relay_messages"),
       ElementsAre("2|2.5|2|65535|65534|{\"x\":0.5,\"t\":true}|null|null|null|null|null|null|null"));
-  EXPECT_THAT(query("SELECT * FROM analytics_events"), ElementsAre("3|3.0|name|{\"i\":1}"));
+  EXPECT_THAT(query("SELECT * FROM analytics_events"), ElementsAre("3|3.0|name|{\"i\":1}|null"));
   EXPECT_THAT(query("SELECT * FROM power_records"),
               ElementsAre("1|4.0|28|Lumo_Haptics|{\"i\":2}|null|null|null"));
   EXPECT_THAT(query("SELECT id, time = 1576800000, event, table_name, rows, detail "
@@ -150,14 +150,16 @@ TEST_F(RowWriterTest, PayloadTooLargeIsLeftOutWithALedgerRow) {
 TEST_F(RowWriterTest, EventHasItsOwnTimeAndIsValidWhateverItsSize) {
   const Payload small = numbered(1);
   const Payload large = PayloadBuilder(small).set("f", std::string(kMostText, 'x')).build();
+  row->id = 4;
+  row->store = 1;
   add(message(small), 2);
   add(event("e", large, small), 1.75);
   const Payload other = numbered(2);
   add(message(other), 3);
   add(event("f", tagged(other), other));
   EXPECT_TRUE(write().ok());
-  EXPECT_THAT(query("SELECT name, time, json_valid(payload) FROM analytics_events"),
-              ElementsAre("f|1.5|1", "e|1.75|1"));
+  EXPECT_THAT(query("SELECT name, time, json_valid(payload), relay_session FROM analytics_events"),
+              ElementsAre("f|1.5|1|4", "e|1.75|1|4"));
   EXPECT_EQ(written.rows, 4u);
 }
 

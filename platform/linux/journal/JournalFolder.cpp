@@ -281,10 +281,23 @@ std::vector<SegmentHeader> JournalFolder::headers() const {
   return headers;
 }
 
+uint64_t JournalFolder::bytesToMove() const {
+  uint64_t bytes = headers().size() * kSegmentBytes;
+  std::error_code error;
+  for (const auto& file : std::filesystem::directory_iterator(path_, error)) {
+    std::error_code unknown;
+    const uintmax_t size = file.path().extension() == kCompanion ? file.file_size(unknown) : 0;
+    bytes += unknown ? 0 : size;
+  }
+  return bytes;
+}
+
 Status JournalFolder::moveTo(const std::string& from, const std::string& to,
-                             const Function<void()>& onSegment) {
+                             const Function<void()>& onSegment, uint64_t mostBytes) {
   Result<JournalFolder> source = open(from, IfMissing::Fail);
   if (!source.ok()) return source.status();
+  if (source->bytesToMove() > mostBytes)
+    return Status::failure("there is no space for it in " + to + " below the store's size");
   Result<JournalFolder> target = open(to, IfMissing::Create);
   if (!target.ok()) return target.status();
   const std::vector<SegmentHeader> there = target->headers();

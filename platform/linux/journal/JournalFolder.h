@@ -1,6 +1,7 @@
 // The files of a journal.
 #pragma once
 
+#include <cstdint>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -61,13 +62,15 @@ class JournalFolder {
   // Moves the segments in use, and the aggregates' files with them, into another folder (made if
   // missing), also of another file system: they are removed here when all of them are durable
   // there. One that is there already (a move was cut short) is not moved again. `onSegment`: told
-  // after each.
+  // after each. Nothing is moved when it is more than `mostBytes`.
   static Status moveTo(const std::string& from, const std::string& to,
-                       const Function<void()>& onSegment = nullptr);
+                       const Function<void()>& onSegment = nullptr,
+                       uint64_t mostBytes = UINT64_MAX);
 
  private:
   JournalFolder(std::string path, UniqueFd fd) : path_(std::move(path)), fd_(std::move(fd)) {}
   std::vector<SegmentHeader> headers() const;
+  uint64_t bytesToMove() const;
   Status copyFile(int source, const JournalFolder& to, const std::string& as) const;
   Status copyCompanions(const JournalFolder& to, std::vector<std::string>& copied,
                         const Function<void()>& onFile) const;

@@ -7,9 +7,10 @@
 
 namespace vx::lnx {
 
-JournalMove::JournalMove(const std::string& from, const std::string& to) {
-  startThread("vx-journal", [shared = shared_, from, to] {
-    const Status moved = JournalFolder::moveTo(from, to, [&] { ++shared->segments; });
+JournalMove::JournalMove(const std::string& from, const std::string& to, uint64_t mostBytes) {
+  startThread("vx-journal", [shared = shared_, from, to, mostBytes] {
+    const Status moved = JournalFolder::moveTo(
+        from, to, [&] { ++shared->segments; }, mostBytes);
     MutexLock lock(shared->mutex);
     shared->outcome = moved;
     shared->changed.notifyAll();

@@ -17,7 +17,8 @@ namespace vx::lnx {
 // which is left behind with the object when it hangs. Used by one thread.
 class JournalMove {
  public:
-  JournalMove(const std::string& from, const std::string& to);
+  // Nothing is moved when it is more than `mostBytes`.
+  JournalMove(const std::string& from, const std::string& to, uint64_t mostBytes);
 
   // How it went; none when that is not known by then.
   std::optional<Status> waitUntil(Monotonic until);

@@ -88,6 +88,8 @@ class LocalStore final : public AnalyticsEventService, public PowerEventLog {
   void stopAccepting() { writer_.stopAccepting(); }
   bool waitUntilEnded(Monotonic until) { return writer_.waitUntilEnded(until); }
   void giveUp() { writer_.giveUp(); }
+  // Of max_bytes and the slack, what the files do not take; once the writer has ended.
+  uint64_t bytesLeft() const { return writer_.bytesLeft(); }
   uint64_t progress() const { return writer_.progress(); }
 
  private:

@@ -321,7 +321,7 @@ int RowWriter::writeMessageRow(const StoreRecords& batch, const StoreRecord& rec
   }
   const int code = insertRelayMessage_.run(row);
   if (code != SQLITE_OK || shares || text == EventText::None) return code;
-  return writeEventRow(*event, built->name);
+  return writeEventRow(*event, built->name, message.row->id);
 }
 
 int RowWriter::writePower(const StoreRecord& record, const PowerRecord& power) {
@@ -360,7 +360,8 @@ RowWriter::EventText RowWriter::buildEvent(const AnalyticsRecord& event, const P
   }
 }
 
-int RowWriter::writeEventRow(const StoreRecord& record, std::string_view eventName) {
+int RowWriter::writeEventRow(const StoreRecord& record, std::string_view eventName,
+                             std::optional<int64_t> relaySession) {
   int64_t name = 0;
   if (const int code = nameRow(eventName, name); code != SQLITE_OK) return code;
   ++written_.rows;
@@ -368,7 +369,8 @@ int RowWriter::writeEventRow(const StoreRecord& record, std::string_view eventNa
                            .time = record.time,
                            .name = name,
                            .payload = storable(eventJson_, "analytics_events"),
-                           .key = keyOf(record)});
+                           .key = keyOf(record),
+                           .relaySession = relaySession});
 }
 
 int RowWriter::writeLedger(const LedgerNote& note) {

@@ -76,7 +76,8 @@ class RowWriter {
   int writePower(const StoreRecord& record, const PowerRecord& power);
   int writeEvent(const StoreRecord& record);
   // The row of an event whose text is in eventJson_.
-  int writeEventRow(const StoreRecord& record, std::string_view name);
+  int writeEventRow(const StoreRecord& record, std::string_view name,
+                    std::optional<int64_t> relaySession = {});
   enum class EventText : uint8_t { None, Whole, Tail };
   // Builds the text of an event in eventJson_; of its tail only, when the rest of it is `message`.
   EventText buildEvent(const AnalyticsRecord& event, const Payload* message);

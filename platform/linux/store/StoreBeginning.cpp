@@ -3,6 +3,8 @@
 #include <sys/random.h>
 #include <unistd.h>
 
+#include <filesystem>
+#include <system_error>
 #include <utility>
 
 #include "platform/linux/store/KnownRows.h"
@@ -77,6 +79,18 @@ OpenedStore StoreBeginning::check(OpenedStore opened, std::vector<LedgerNote>& n
   if (check.fault == StoreFault::Damaged)
     return beginAfresh("failed its check (" + check.status.text() + ")", notes);
   return {nullptr, std::move(check.status), check.fault, {}};
+}
+
+uint64_t StoreBeginning::journalBytes() const {
+  uint64_t bytes = 0;
+  std::error_code error;
+  for (std::filesystem::directory_iterator at(directory_ + "/journal", error), end;
+       !error && at != end; at.increment(error)) {
+    std::error_code unknown;
+    const uintmax_t size = at->file_size(unknown);
+    bytes += unknown ? 0 : size;
+  }
+  return bytes;
 }
 
 Status StoreBeginning::settle(StoreLoss loss, std::vector<LedgerNote>& notes) {

@@ -40,6 +40,8 @@ class StoreBeginning {
   Status settle(StoreLoss loss, std::vector<LedgerNote>& notes);
 
   const std::string& path() const { return path_; }
+  // Of a journal that an earlier process moved into the folder, and that could not be taken back.
+  uint64_t journalBytes() const;
   // That of the first store that was opened. While none could be, calls are recorded under one that
   // was promised, which is marked: the store adopts it as soon as it can be opened, in whichever
   // process, and earlier rows keep their own.

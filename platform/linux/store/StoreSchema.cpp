@@ -38,13 +38,13 @@ constexpr const char* kEventViews = R"sql(
 CREATE VIEW analytics_events AS
   SELECT m.id, m.time + m.event_microseconds / 1e6 AS time,
          (SELECT n.name FROM event_names n WHERE n.id = m.event_name) AS name,
-         substr(m.payload, 1, length(m.payload) - 1) || m.event_tail AS payload
+         substr(m.payload, 1, length(m.payload) - 1) || m.event_tail AS payload, m.relay_session
   FROM relay_messages m WHERE m.event_name IS NOT NULL
   UNION ALL
   SELECT e.id, e.time, (SELECT n.name FROM event_names n WHERE n.id = e.name) AS name,
          CASE WHEN e.message IS NULL THEN e.payload
               ELSE (SELECT substr(m.payload, 1, length(m.payload) - 1) FROM relay_messages m WHERE m.id = e.message)
-                   || e.payload END AS payload
+                   || e.payload END AS payload, e.relay_session
   FROM analytics_entries e;
 CREATE VIEW client_uptimes AS
   SELECT id, datetime(time, 'unixepoch', 'localtime') AS at, json_extract(payload, '$.processName') AS process,
@@ -160,7 +160,7 @@ int findSchema(sqlite3* database) {
         std::string("INSERT INTO event_names(id, name) VALUES(?, ?)"),
         std::string("INSERT INTO store_marks(id, call, last_row) VALUES(?, ?, ?)"),
         std::string("SELECT epoch, after_row, after_power, after_session FROM store_epochs"),
-        std::string("SELECT id, time, name, payload FROM analytics_events"),
+        std::string("SELECT id, time, name, payload, relay_session FROM analytics_events"),
         std::string("SELECT payload FROM session_messages")}) {
     if (code == SQLITE_OK) code = Statement(database, sql).code();
   }

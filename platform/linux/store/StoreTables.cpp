@@ -48,8 +48,7 @@ constexpr Column<EventRow> kEventColumns[] = {
     {"call", "INTEGER", [](Statement& s, const EventRow& r) { s.bind(r.key.call); }},
     {"place", "INTEGER", [](Statement& s, const EventRow& r) { s.bind(r.key.place); }},
     {"uid", "INTEGER", [](Statement& s, const EventRow& r) { s.bind(r.key.user); }},
-    // For the driver counters at a session's end; not known yet.
-    {"relay_session", "INTEGER", [](Statement& s, const EventRow&) { s.bindNull(); }},
+    {"relay_session", "INTEGER", [](Statement& s, const EventRow& r) { s.bind(r.relaySession); }},
 };
 constexpr Column<PowerRow> kPowerColumns[] = {
     {"time", "REAL NOT NULL", [](Statement& s, const PowerRow& r) { s.bind(r.time); }},

@@ -101,6 +101,7 @@ struct EventRow {
   int64_t name = 0;
   std::string_view payload;
   KeyColumns key;
+  std::optional<int64_t> relaySession;  // of the message that it says
 };
 struct PowerRow {
   double time = 0;

@@ -86,6 +86,16 @@ bool StoreWriter::waitUntilEnded(Monotonic until) {
   return true;
 }
 
+uint64_t StoreWriter::bytesLeft() const {
+  uint64_t left = options_.maxBytes + StoreOptions::kSlackBytes;
+  for (const char* suffix : {"", "-wal"}) {
+    struct stat file {};
+    if (stat((beginning_->path() + suffix).c_str(), &file) == 0)
+      left -= std::min(left, static_cast<uint64_t>(file.st_size));
+  }
+  return left;
+}
+
 void StoreWriter::note(LedgerNote note) {
   queue_.runSoon([this, note = std::move(note)] { notes_.push_back(note); });
 }
@@ -140,7 +150,10 @@ Status StoreWriter::begin() {
     Status adopted = adoptEpoch(unchecked_.database.get(), epoch_);
     if (!adopted.ok()) return adopted;
   }
-  open_.emplace(std::move(unchecked_.database), *beginning_, options_, endWord_, clock_);
+  StoreOptions options = options_;
+  options.maxBytes -= std::min(beginning_->journalBytes(), options.maxBytes / 2);
+  maxBytes_ = options.maxBytes;
+  open_.emplace(std::move(unchecked_.database), *beginning_, options, endWord_, clock_);
   add(open_->retention.apply());
   // The pages that the check has read are of no use to whoever appends.
   sqlite3_db_release_memory(open_->database.get());
@@ -259,7 +272,7 @@ void StoreWriter::makeRoomFor(std::size_t bytes) {
   if (both <= StoreOptions::kSlackBytes) return;
   const uint64_t beyond = both - StoreOptions::kSlackBytes;
   add(open_->retention.makeRoom(beyond));
-  open_->retention.shrinkFile(options_.maxBytes - std::min(beyond, options_.maxBytes));
+  open_->retention.shrinkFile(maxBytes_ - std::min(beyond, maxBytes_));
 }
 
 void StoreWriter::onCommitted(StoreBatch& batch, std::size_t first, std::size_t last) {

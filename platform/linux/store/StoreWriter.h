@@ -62,6 +62,7 @@ class StoreWriter {
   void stopAccepting() { queue_.close(Monotonic::max()); }
   bool waitUntilEnded(Monotonic until);
   void giveUp() { queue_.giveUp(); }
+  uint64_t bytesLeft() const;
   uint64_t progress() const { return progress_.load() + commits_.load(); }
   void note(LedgerNote note);
   StoreCounters counters() const;
@@ -122,6 +123,7 @@ class StoreWriter {
   const std::unique_ptr<StoreBeginning> beginning_;
   JournalEpoch epoch_;
   uint64_t lastCall_ = 0;
+  uint64_t maxBytes_ = 0;          // without what lies beside the store
   std::vector<LedgerNote> found_;  // by the constructor
   EndWord endWord_ = nullptr;
   OpenedStore unchecked_;             // until the thread has checked it
