@@ -19,7 +19,7 @@ class JournalFilesTest : public JournalFixture {
   // A journal of a process that has ended with one call undone.
   void leaveBehind(uint8_t kind = 1) {
     open();
-    new JournalTicket(append(kind, dictionary(kind))->ticket);  // its process let go of nothing
+    append(kind, dictionary(kind))->ticket.abandon();
     journal.reset();
   }
   static void patch(const std::string& path, std::size_t at, uint8_t value) {

@@ -347,7 +347,8 @@ TEST_F(LocalStoreTest, ReplayWritesWhatIsMissingAndNothingTwice) {
   };
   // A standalone that was delayed: a replay is over before its time comes again.
   auto delayed = [&] {
-    const CauseScope scope(Cause{calls[1].ticket, {9, 1}});
+    const Cause later{calls[1].ticket, {9, 1}};
+    const CauseScope scope(later);
     store->relayBackend().sendOne({{kVyrReportingSessionInfoSessionID, int32_t{-1}}}, Payload(), 7,
                                   2, numbered(3));
   };

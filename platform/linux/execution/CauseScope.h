@@ -47,6 +47,7 @@ struct Cause {
 class CauseScope {
  public:
   explicit CauseScope(const Cause& cause);
+  explicit CauseScope(Cause&&) = delete;  // it must outlive the scope
   ~CauseScope();
   CauseScope(const CauseScope&) = delete;
   CauseScope& operator=(const CauseScope&) = delete;

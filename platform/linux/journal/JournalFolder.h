@@ -42,8 +42,8 @@ class JournalFolder {
     bool blank = false;  // of no size
   };
   Result<Opened> openSegment(const std::string& name, Access access) const;
-  // With its first `bytes` allocated, before it has its name: a hole in a file system that has become
-  // full is a SIGBUS, and an empty file of that name would say that somebody emptied it.
+  // With its first `bytes` allocated, before it has its name: a hole in a file system that has
+  // become full is a SIGBUS, and an empty file of that name would say that somebody emptied it.
   Result<UniqueFd> createSegment(const std::string& name, std::size_t bytes) const;
   void remove(const std::string& name) const;
   // Renames a file to name.aside-N, or copies it; false when it could not.
