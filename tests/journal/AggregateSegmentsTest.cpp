@@ -158,6 +158,7 @@ TEST_F(AggregateSegmentsTest, FilesThatAreNotItsOwnAreSetAside) {
   chmod(make('f', 0, {}, bytes.size()).c_str(), 0640);
   std::filesystem::create_symlink(good, options.folder + "/aggregate-g.vxa");
   mkfifo((options.folder + "/aggregate-h.vxa").c_str(), 0600);
+  std::ofstream(options.folder + "/aggregate-i.vxa.new") << "of a process that ended just then";
   reopen();
   EXPECT_THAT(complaints, SizeIs(8));
   EXPECT_EQ(memory->counters().aside, 8u);

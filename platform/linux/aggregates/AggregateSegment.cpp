@@ -8,6 +8,7 @@
 #include <atomic>
 #include <bit>
 #include <cerrno>
+#include <cstdio>
 #include <memory>
 
 namespace vx::lnx {
@@ -27,8 +28,10 @@ Status allocate(const UniqueFd& fd, std::size_t bytes, const std::string& path) 
 Result<std::unique_ptr<AggregateSegment>> AggregateSegment::create(const std::string& path,
                                                                    std::size_t blockBytes,
                                                                    uint32_t blocks) {
+  // It gets its name when it is whole: a process may end at any moment.
+  const std::string fresh = path + std::string(kNew);
   const UniqueFd fd(
-      open(path.c_str(), O_RDWR | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, S_IRUSR | S_IWUSR));
+      open(fresh.c_str(), O_RDWR | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, S_IRUSR | S_IWUSR));
   if (!fd) return Status::lastError("cannot create " + path);
   Status status = allocate(fd, fileBytes(blockBytes, blocks), path);
   if (status.ok()) {
@@ -37,11 +40,14 @@ Result<std::unique_ptr<AggregateSegment>> AggregateSegment::create(const std::st
       *reinterpret_cast<FileHeader*>((*made)->base_) = {FileHeader::kMagic, FileHeader::kVersion,
                                                         blocks, blockBytes};
       for (uint32_t index = blocks; index > 0; --index) (*made)->free_.push_back(index - 1);
-      return made;
+      if (renameat2(AT_FDCWD, fresh.c_str(), AT_FDCWD, path.c_str(), RENAME_NOREPLACE) == 0)
+        return made;
+      status = Status::lastError("cannot create " + path);
+    } else {
+      status = made.status();
     }
-    status = made.status();
   }
-  unlink(path.c_str());
+  unlink(fresh.c_str());
   return status;
 }
 

@@ -5,6 +5,7 @@
 #include <cstdint>
 #include <memory>
 #include <string>
+#include <string_view>
 #include <vector>
 
 #include "base/Status.h"
@@ -43,6 +44,8 @@ class AggregateSegment {
     return kFirstBlock + blockBytes * blocks;
   }
 
+  // After the name of a file that is being made.
+  static constexpr std::string_view kNew = ".new";
   // A new file, which is removed again where that fails; its blocks are free.
   static Result<std::unique_ptr<AggregateSegment>> create(const std::string& path,
                                                           std::size_t blockBytes, uint32_t blocks);

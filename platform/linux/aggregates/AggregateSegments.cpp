@@ -55,7 +55,10 @@ Status AggregateSegments::open(std::vector<std::string>& complaints) {
   for (std::filesystem::directory_iterator at(options_.folder, error), end; !error && at != end;
        at.increment(error)) {
     std::string name = at->path().filename();
-    if (name.starts_with(kPrefix) && name.ends_with(kSuffix)) names.push_back(std::move(name));
+    if (name.starts_with(kPrefix) && name.ends_with(AggregateSegment::kNew))
+      std::filesystem::remove(at->path(), error);  // its process ended while it was made
+    else if (name.starts_with(kPrefix) && name.ends_with(kSuffix))
+      names.push_back(std::move(name));
   }
   {
     MutexLock lock(mutex_);
