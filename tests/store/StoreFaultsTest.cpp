@@ -2,37 +2,20 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <fstream>
-#include <future>
-#include <sstream>
-#include <thread>
-
-#include "platform/linux/execution/SystemThreading.h"
-#include "platform/linux/store/LocalStore.h"
 #include "platform/linux/store/LogReaders.h"
-#include "tests/store/StoreTest.h"
+#include "tests/store/LocalStoreTest.h"
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size);
 
 namespace vx::lnx {
 namespace {
 
-class StoreFaultsTest : public StoreTest {
+class StoreFaultsTest : public LocalStoreTest {
  protected:
-  StoreFaultsTest() { options.commit.interval = 1h; }
-  void open() {
-    store = std::move(*LocalStore::open(folder, options, clock));
-    store->start();
-  }
   // What the session says until everything before is committed.
   std::optional<Error> say(int i) {
     relay->send(5, 1, numbered(i));
-    return flush();
-  }
-  std::optional<Error> flush() {
-    auto told = std::make_shared<std::promise<std::optional<Error>>>();
-    relay->flush([told](std::optional<Error> error) { told->set_value(std::move(error)); });
-    return told->get_future().get();
+    return flush().get();
   }
   Rows messages() {
     return query(
@@ -40,17 +23,11 @@ class StoreFaultsTest : public StoreTest {
         " JOIN relay_sessions s ON s.id = m.relay_session ORDER BY m.id");
   }
   Rows ledger() { return query("SELECT event FROM store_ledger ORDER BY id"); }
-  std::string file(const std::string& suffix = "") { return folder + "/telemetry.db" + suffix; }
-
-  SystemClock clock;
-  StoreOptions options;
-  std::unique_ptr<LocalStore> store;
-  std::unique_ptr<RelayBackend::Session> relay;
 };
 
 TEST_F(StoreFaultsTest, LostStoreIsBegunAfreshWithWhatWaitsAndTheSessionsItIsOf) {
   open();
-  relay = store->relayBackend().open(sessionInfo(42), userInfo());
+  relay = session(42);
   EXPECT_EQ(say(1), std::nullopt);
   std::filesystem::remove(file());
   EXPECT_EQ(say(2), std::nullopt);
@@ -72,10 +49,8 @@ TEST_F(StoreFaultsTest, LostStoreIsBegunAfreshWithWhatWaitsAndTheSessionsItIsOf)
 
   for (int i = 0; i < 300; ++i) relay->send(5, 1, numbered(1000 + i));
   EXPECT_EQ(say(6), std::nullopt);
-  store->close(clock.monotonic() + 60s);
-  store.reset();
-  open();  // the log is written back
-  relay = store->relayBackend().open(sessionInfo(43), userInfo());
+  reopen();  // the log is written back
+  relay = session(43);
   EXPECT_EQ(say(7), std::nullopt);
   std::filesystem::resize_file(file(), 3 * 4096);
   EXPECT_EQ(say(8), std::nullopt);
@@ -85,7 +60,7 @@ TEST_F(StoreFaultsTest, LostStoreIsBegunAfreshWithWhatWaitsAndTheSessionsItIsOf)
 
 TEST_F(StoreFaultsTest, DeletedLogIsWrittenBackBeforeAnotherIsBegun) {
   open();
-  relay = store->relayBackend().open(sessionInfo(42), userInfo());
+  relay = session(42);
   EXPECT_EQ(say(1), std::nullopt);
   std::filesystem::remove(file("-wal"));
   EXPECT_EQ(say(2), std::nullopt);
@@ -94,7 +69,7 @@ TEST_F(StoreFaultsTest, DeletedLogIsWrittenBackBeforeAnotherIsBegun) {
   std::filesystem::remove_all(folder);
   EXPECT_EQ(say(3), std::nullopt);
   EXPECT_THAT(messages(), ElementsAre("42|{\"i\":3}"));
-  EXPECT_THAT(LocalStore::open(folder, options, clock).status().text(), HasSubstr("another"));
+  EXPECT_THAT(tryOpen().status().text(), HasSubstr("another"));
 }
 
 // A reader is another process; it begins before there are threads here.
@@ -112,17 +87,15 @@ TEST_F(StoreFaultsTest, WritingPausesWhileAReaderHoldsTheLogAtItsBoundAndSaysWho
     _exit(::read(toReader[0], &word, 1) == 1 ? 0 : 1);  // the kernel lets go of its locks
   }
   open();
-  relay = store->relayBackend().open(sessionInfo(42), userInfo());
-  EXPECT_EQ(flush(), std::nullopt);
+  EXPECT_EQ(flush().get(), std::nullopt);
   char word = 0;
   ASSERT_EQ(::write(toReader[1], "b", 1), 1);
   ASSERT_EQ(::read(fromReader[0], &word, 1), 1);
   const Payload large = PayloadBuilder().set("f", std::string(500000, 'x')).build();
   for (int i = 0; i < 40; ++i) store->logRegisteredEvent(28, "n", large, nullptr);
-  auto flushed = std::async(std::launch::async, [&] { return flush(); });
-  while (store->counters().writeFailures == 0) std::this_thread::yield();
-  EXPECT_LE(std::filesystem::file_size(file()) + std::filesystem::file_size(file("-wal")),
-            StoreOptions::kSlackBytes);
+  auto flushed = flush();
+  waitUntil([&] { return store->counters().writeFailures > 0; });
+  EXPECT_LE(storeBytes(), StoreOptions::kSlackBytes);
   EXPECT_EQ(flushed.wait_for(0s), std::future_status::timeout);
   ASSERT_EQ(::write(toReader[1], "e", 1), 1);
   int status = 1;

@@ -118,14 +118,6 @@ TEST_F(StoreFileTest, SecondLockIsRefusedUntilTheFirstIsGone) {
   EXPECT_THAT(lockStore(folder + "/file").status.text(), HasSubstr("set STATE_DIRECTORY"));
 }
 
-TEST_F(StoreFileTest, NewerSchemaIsRefusedAndLeftAlone) {
-  query(open(), "PRAGMA user_version = 4");
-  const OpenedStore opened = open();
-  EXPECT_EQ(opened.fault, StoreFault::Newer);
-  EXPECT_THAT(opened.status.text(), HasSubstr("newer version of the service (schema 4)"));
-  EXPECT_THAT(StoreTest::query("PRAGMA user_version"), ElementsAre("4"));
-}
-
 // Files as the service of that time made them.
 TEST_F(StoreFileTest, EarlierSchemasAreBroughtUpToDateAndKeepTheirRows) {
   const Rows fresh = query(open(), kColumns);
