@@ -85,35 +85,29 @@ TEST_F(EventPairingTest, YoungEventWaitsOneBatchForItsMessage) {
   EXPECT_EQ(EventPairing::unwrittenRows(batch, 0).lost, 3u);
 }
 
-TEST_F(EventPairingTest, WhatIsWrittenIsNeitherLostNorKept) {
+TEST_F(EventPairingTest, WhatIsWrittenIsNeitherLostNorKeptAndItsCallIsDone) {
   const Payload a = numbered(1);
   const Payload b = numbered(2);
-  addOf(recorded(), event("early", b, b));
-  addOf(batch[0].cause.ticket, message(a));
-  addOf(batch[0].cause.ticket, message(b));
+  addOf(recorded(), power(1));
+  const JournalTicket call = recorded();
+  addOf(call, event("early", b, b));
+  addOf(call, message(a));
+  addOf(call, message(b));
   addOf(recorded(), RelayEndRecord{row});
-  addOf(batch[0].cause.ticket, event("e", a, a));
+  addOf(call, event("e", a, a));
   pairing.pair(batch);
-  EXPECT_EQ(EventPairing::unwrittenRows(batch, 0).recorded, 4u);
-  EXPECT_EQ(EventPairing::markWritten(batch, 0, 2), 0u);
-  EXPECT_EQ(EventPairing::unwrittenRows(batch, 2).recorded, 2u);  // with the early one
-  EXPECT_EQ(std::get<RelayMessageRecord>(batch[1].what).payload.identity(), nullptr);
-  EXPECT_NE(std::get<RelayMessageRecord>(batch[2].what).payload.identity(), nullptr);
-  EXPECT_FALSE(batch[4].cause.ticket);
-  EXPECT_TRUE(batch[0].cause.ticket);  // its message is not
-  EventPairing::abandon(batch, 2);
+  EXPECT_EQ(EventPairing::unwrittenRows(batch, 0).recorded, 5u);
+  EXPECT_EQ(EventPairing::markWritten(batch, 0, 3), 0u);
+  const EventPairing::Unwritten left = EventPairing::unwrittenRows(batch, 3);
+  EXPECT_EQ(left.recorded, 2u);  // with the early one
+  EXPECT_EQ(left.lost, 0u);
+  EXPECT_EQ(std::get<RelayMessageRecord>(batch[2].what).payload.identity(), nullptr);
+  EXPECT_NE(std::get<RelayMessageRecord>(batch[3].what).payload.identity(), nullptr);
+  EXPECT_FALSE(batch[5].cause.ticket);
+  EXPECT_TRUE(batch[1].cause.ticket);  // its message is not
+  EventPairing::abandon(batch, 3);
   batch.clear();
   EXPECT_EQ(undone(), 2);
-}
-
-TEST_F(EventPairingTest, CallOfWhatIsWrittenIsDone) {
-  const Payload a = numbered(1);
-  addOf(recorded(), message(a));
-  addOf(batch[0].cause.ticket, event("e", a, a));
-  addOf(recorded(), power(1));
-  pairing.pair(batch);
-  EventPairing::markWritten(batch, 0, 3);
-  EXPECT_EQ(undone(), 0);
 }
 
 }  // namespace
