@@ -68,10 +68,9 @@ TEST_F(RowWriterTest, EveryColumnIsWhatWasGivenAndOfItsKind) {
                     "FROM store_ledger"),
               ElementsAre("1|1|what|null|0|why", "2|1|what|t|3|why"));
   EXPECT_THAT(query("SELECT typeof(client_version), typeof(batch_event), typeof(service_name), "
-                    "typeof(user_info) FROM relay_sessions WHERE id = 2"),
-              ElementsAre("real|integer|text|text"));
-  EXPECT_THAT(query("SELECT typeof(category), typeof(type), typeof(payload) FROM relay_messages"),
-              ElementsAre("integer|integer|text"));
+                    "typeof(user_info), typeof(category), typeof(type), typeof(payload) "
+                    "FROM relay_sessions s JOIN relay_messages m ON m.relay_session = s.id"),
+              ElementsAre("real|integer|text|text|integer|integer|text"));
 }
 
 TEST_F(RowWriterTest, EventsShareTheTextOfTheirMessages) {
