@@ -4,8 +4,6 @@
 namespace vx::lnx {
 namespace {
 
-using Sharing = StoreRecord::Sharing;
-
 class EventPairingTest : public StoreTest {
  protected:
   void add(StoreRecord::What what, double time = 10) { batch.push_back({time, std::move(what)}); }
@@ -14,7 +12,6 @@ class EventPairingTest : public StoreTest {
   }
   // The place of the event that shares the text of the message in a place.
   uint32_t eventOf(std::size_t place) { return batch[place].event; }
-  static constexpr uint32_t kNone = StoreRecord::kNone;
   void nextBatch() {
     batch.clear();
     pairing.join(batch);
@@ -22,27 +19,6 @@ class EventPairingTest : public StoreTest {
   StoreRecords batch;
   EventPairing pairing;
 };
-
-TEST_F(EventPairingTest, EventsFindTheirMessageInTheirOrder) {
-  const Payload a = numbered(1);
-  const Payload b = numbered(1);  // equal, another one
-  add(event("e", tagged(a), a));
-  add(message(a));
-  add(message(b));
-  add(message(Payload()));
-  add(message(a));  // to a second session
-  add(event("e", tagged(a), a));
-  add(event("e", tagged(b), b));
-  add(event("e", tagged(a), a));  // one too many
-  add(event("e", tagged(Payload()), Payload()));
-  pairing.pair(batch);
-  EXPECT_EQ(eventOf(1), 0u);
-  EXPECT_EQ(eventOf(2), 6u);
-  EXPECT_EQ(eventOf(3), kNone);
-  EXPECT_EQ(eventOf(4), 5u);
-  EXPECT_EQ(batch[7].sharing, Sharing::No);
-  EXPECT_EQ(batch[8].sharing, Sharing::No);
-}
 
 TEST_F(EventPairingTest, EventOfAnotherCallIsNotInTheRow) {
   const Payload a = numbered(1);

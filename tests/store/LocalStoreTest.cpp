@@ -88,11 +88,9 @@ TEST_F(LocalStoreTest, RowsThatCannotBeWrittenByTheDeadlineAreCountedAndTold) {
   EXPECT_EQ(flush().get(), std::nullopt);
   refuse("relay_messages");
   for (int i = 0; i < 5; ++i) relay->send(1, 1, numbered(i));
-  {
-    const Cause cause{recorded(), {}};
-    const CauseScope scope(cause);
+  within({recorded(), {}}, [&] {
     for (int i = 0; i < 2; ++i) relay->send(1, 1, numbered(i));
-  }
+  });
   waitUntil([&] { return store->counters().writeFailures > 0; });
   auto flushed = flush();
   store->stopAccepting();
@@ -230,10 +228,7 @@ TEST_F(LocalStoreTest, ReplayWritesWhatIsMissingAndNothingTwice) {
   const Cause calls[] = {{recorded(1.5), {}}, {recorded(2.5), {}}, {recorded(3.5), {}}};
   const Payload payload = numbered(1);
   auto run = [&](int upTo) {
-    const auto relay = [&] {
-      const CauseScope scope(calls[0]);
-      return session(42);
-    }();
+    const auto relay = within(calls[0], [&] { return session(42); });
     for (int call = 1; call < upTo; ++call) {
       const CauseScope scope(calls[call]);
       relay->send(5, 1, payload);
@@ -242,10 +237,7 @@ TEST_F(LocalStoreTest, ReplayWritesWhatIsMissingAndNothingTwice) {
       power(call);
       relay->send(6, 1, Payload());
     }
-    if (upTo == 3) {
-      const CauseScope scope(calls[2]);
-      relay->flush([](const std::optional<Error>&) {});
-    }
+    if (upTo == 3) within(calls[2], [&] { relay->flush([](const std::optional<Error>&) {}); });
   };
   // A standalone that was delayed: a replay is over before its time comes again.
   auto delayed = [&] {

@@ -78,25 +78,27 @@ TEST_F(RowWriterTest, EventsShareTheTextOfTheirMessages) {
   const Payload messages[] = {numbered(1), numbered(2), numbered(3), Payload(), own};
   add(event("before", tagged(messages[0]), messages[0]));
   for (const Payload& each : messages) add(message(each));
+  add(message(messages[1]));  // to a second session
   add(event("after", tagged(messages[1]), messages[1]));
   add(event("again", tagged(messages[1]), messages[1]));
+  add(event("more", tagged(messages[1]), messages[1]));
   add(event("same", messages[2], messages[2]));
   add(event("empty", tagged(Payload()), Payload()));
   add(event("replaced", tagged(own), own));
   add(event("alone", tagged(numbered(6)), numbered(6)));
   add(AnalyticsRecord{"bad", Payload(), []() -> Payload { throw std::runtime_error("no"); }});
   EXPECT_TRUE(write().ok());
-  EXPECT_EQ(written.rows, 12u);
+  EXPECT_EQ(written.rows, 14u);
   EXPECT_EQ(written.failedBuilders, 1u);
   EXPECT_THAT(
-      query("SELECT name, payload FROM analytics_events ORDER BY name"),
-      ElementsAre("after|{\"i\":2,\"app\":\"x\\\"y\"}", "again|{\"i\":2,\"app\":\"x\\\"y\"}",
-                  "alone|{\"i\":6,\"app\":\"x\\\"y\"}", "before|{\"i\":1,\"app\":\"x\\\"y\"}",
-                  "empty|{\"app\":\"x\\\"y\"}", "replaced|{\"app\":\"x\\\"y\",\"i\":5}",
-                  "same|{\"i\":3}"));
+      query("SELECT id, name, payload FROM analytics_events ORDER BY name"),
+      ElementsAre("2|after|{\"i\":2,\"app\":\"x\\\"y\"}", "7|again|{\"i\":2,\"app\":\"x\\\"y\"}",
+                  "10|alone|{\"i\":6,\"app\":\"x\\\"y\"}", "1|before|{\"i\":1,\"app\":\"x\\\"y\"}",
+                  "9|empty|{\"app\":\"x\\\"y\"}", "8|more|{\"i\":2,\"app\":\"x\\\"y\"}",
+                  "6|replaced|{\"app\":\"x\\\"y\",\"i\":5}", "3|same|{\"i\":3}"));
   EXPECT_THAT(query("SELECT payload, event_tail FROM relay_messages WHERE event_tail IS NOT NULL"),
               ElementsAre("{\"i\":1}|,\"app\":\"x\\\"y\"}", "{\"i\":2}|,\"app\":\"x\\\"y\"}",
-                          "{\"i\":3}|}"));
+                          "{\"i\":3}|}", "{\"i\":2}|,\"app\":\"x\\\"y\"}"));
 }
 
 TEST_F(RowWriterTest, FailedWriteLeavesNothingAndCanBeRepeated) {

@@ -67,7 +67,6 @@ TEST_F(StoreQueueTest, FlushIsDueAtOnceAndKnowsItsPlace) {
   EXPECT_EQ(batch.flushes[0].records, 1u);
   append();
   EXPECT_EQ(take(), Turn::Nothing);  // the hurry is over
-  take();
   EXPECT_TRUE(flush());
   EXPECT_EQ(take(), Turn::Batch);
 }
@@ -112,10 +111,8 @@ TEST_F(StoreQueueTest, RecordKeepsItsCallAndInAReplayItsTime) {
 
 TEST_F(StoreQueueTest, WhatIsRefusedOrNeverTakenLeavesItsCallUndone) {
   for (const bool closed : {false, true}) {
-    const Cause call{recorded(), {}};
-    const CauseScope scope(call);
     if (closed) queue().close({});
-    append();
+    within({recorded(), {}}, [&] { append(); });
     made.reset();
     if (closed) queue();
   }

@@ -48,6 +48,10 @@ class StoreTest : public FolderTest {
       journal = std::move(*Journal::open({.folder = folder + "/journal", .epoch = kEpoch}));
     return journal->append({.kind = kind, .time = time, .user = 1000})->ticket;
   }
+  static auto within(const Cause& cause, const auto& work) {
+    const CauseScope scope(cause);
+    return work();
+  }
   // How many of the recorded calls are not done.
   int undone() {
     journal.reset();
