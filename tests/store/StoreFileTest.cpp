@@ -139,13 +139,16 @@ TEST_F(StoreFileTest, EarlierSchemasAreBroughtUpToDateAndKeepTheirRows) {
   EXPECT_THAT(query(open(), "PRAGMA user_version"), ElementsAre("3"));
 }
 
-TEST_F(StoreFileTest, MigrationThatFailsChangesNothing) {
+TEST_F(StoreFileTest, MigrationThatFailsChangesNothingAndAStoreWithoutItsTablesIsDamaged) {
   StoreTest::query(
       "CREATE TABLE event_names(x); CREATE TABLE analytics_events(x);"
       "CREATE VIEW client_uptimes AS SELECT 1; PRAGMA user_version = 1");
   EXPECT_EQ(open().fault, StoreFault::Damaged);
   EXPECT_THAT(StoreTest::query("SELECT name FROM sqlite_master ORDER BY name"),
               ElementsAre("analytics_events", "client_uptimes", "event_names"));
+  removeStore();
+  query(open(), "DROP TABLE power_records");
+  EXPECT_EQ(open().fault, StoreFault::Damaged);
 }
 
 }  // namespace
