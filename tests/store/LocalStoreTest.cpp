@@ -190,6 +190,8 @@ TEST_F(LocalStoreTest, RowsWaitUntilTheStoreCanBeBegun) {
   store.reset();
   const JournalEpoch other{7};
   EXPECT_EQ((*tryOpen(other))->epoch(), first);
+  const JournalEpoch unwritten{0x80};  // promised by a process that could not begin the store
+  EXPECT_EQ((*tryOpen(unwritten))->epoch(), unwritten);
   std::filesystem::rename(file(), folder + "/kept");
   std::filesystem::create_directory(file());
   const JournalEpoch promised = (*tryOpen())->epoch();
@@ -228,23 +230,23 @@ TEST_F(LocalStoreTest, ReplayWritesWhatIsMissingAndNothingTwice) {
   const Cause calls[] = {{recorded(1.5), {}}, {recorded(2.5), {}}, {recorded(3.5), {}}};
   const Payload payload = numbered(1);
   auto run = [&](int upTo) {
-    const auto relay = within(calls[0], [&] { return session(42); });
+    const auto sender = within(calls[0], [&] { return session(42); });
     for (int call = 1; call < upTo; ++call) {
       const CauseScope scope(calls[call]);
-      relay->send(5, 1, payload);
+      sender->send(5, 1, payload);
       store->sendEventLazy(
           "e", [payload] { return tagged(payload); }, payload);
       power(call);
-      relay->send(6, 1, Payload());
+      sender->send(6, 1, Payload());
     }
-    if (upTo == 3) within(calls[2], [&] { relay->flush([](const std::optional<Error>&) {}); });
+    if (upTo == 3) within(calls[2], [&] { sender->flush([](const std::optional<Error>&) {}); });
   };
   // A standalone that was delayed: a replay is over before its time comes again.
   auto delayed = [&] {
-    const Cause later{calls[1].ticket, {9, 1}};
-    const CauseScope scope(later);
-    store->relayBackend().sendOne({{kVyrReportingSessionInfoSessionID, int32_t{-1}}}, Payload(), 7,
-                                  2, numbered(3));
+    within({calls[1].ticket, {9, 1}}, [&] {
+      store->relayBackend().sendOne({{kVyrReportingSessionInfoSessionID, int32_t{-1}}}, Payload(),
+                                    7, 2, numbered(3));
+    });
   };
   open();
   const JournalEpoch epoch = store->epoch();
