@@ -87,7 +87,9 @@ TEST_F(LocalStoreTest, RowsThatCannotBeWrittenByTheDeadlineAreCountedAndTold) {
   open();
   EXPECT_EQ(flush().get(), std::nullopt);
   refuse("relay_messages");
-  for (int i = 0; i < 5; ++i) relay->send(1, 1, numbered(i));
+  relay->send(1, 1, numbered(0));
+  auto ofTheRow = flush();
+  for (int i = 1; i < 5; ++i) relay->send(1, 1, numbered(i));
   within({recorded(), {}}, [&] {
     for (int i = 0; i < 2; ++i) relay->send(1, 1, numbered(i));
   });
@@ -102,6 +104,7 @@ TEST_F(LocalStoreTest, RowsThatCannotBeWrittenByTheDeadlineAreCountedAndTold) {
   EXPECT_FALSE(store->waitUntilEnded(clock.monotonic()));
   store->giveUp();
   EXPECT_TRUE(store->waitUntilEnded(Monotonic::max()));
+  EXPECT_TRUE(ofTheRow.get());
   EXPECT_TRUE(flushed.get());
   EXPECT_EQ(store->counters().rowsLost, 5u);
   EXPECT_EQ(store->counters().rowsLeft, 2u);
