@@ -44,16 +44,15 @@ void VXReportingDelayedMessages::add(VXReportingDelayedMessage message,
     const Monotonic now = clock.monotonic();
     const Monotonic due =
         now + std::clamp<std::chrono::nanoseconds>(message.due - clock.now(), {}, kLongest);
-    Monotonic overdue = Monotonic::min();
+    bool tooMuch = false;
     {
       MutexLock lock(mutex_);
       bytes_ += message.message.encoded().size();
       waiting_.emplace(Key{due, next_++}, Waiting{std::move(message), std::move(cause)});
-      if (isTooMuch()) overdue = waiting_.begin()->first.first;
-      if (atOnce_) overdue = Monotonic::max();
+      tooMuch = isTooMuch() || atOnce_;
     }
     wakeAfter(due - now, due);
-    if (overdue > now) wakeAfter({}, overdue);
+    if (tooMuch) wakeAfter({}, now);
   });
 }
 
@@ -77,7 +76,8 @@ void VXReportingDelayedMessages::sendDue(Monotonic until) {
     Waiting next;
     {
       MutexLock lock(mutex_);
-      if (waiting_.empty() || waiting_.begin()->first.first > until) return;
+      if (waiting_.empty()) return;
+      if (waiting_.begin()->first.first > until && !isTooMuch() && !atOnce_) return;
       next = std::move(waiting_.begin()->second);
       waiting_.erase(waiting_.begin());
       bytes_ -= next.message.message.encoded().size();

@@ -165,7 +165,8 @@ void CrashSafety::recover(Platform& live, std::vector<std::string> backends,
           std::chrono::round<std::chrono::milliseconds>(means_.clock.monotonic() - began).count()));
 }
 
-// A process that dies of a row does so when it is written: until then the replay is not over.
+// A process that dies of a row does so when it is written: until then the replay is not over,
+// though clients are served when it takes long.
 void CrashSafety::commitReplay(Monotonic until) {
   const auto committed = std::make_shared<std::promise<void>>();
   means_.store.endReplay([committed, folder = folders_.journal] {
@@ -178,6 +179,7 @@ void CrashSafety::commitReplay(Monotonic until) {
     // Nobody dies of a disk that cannot be written.
     if (means_.store.counters().writeFailures > 0) return endReplay(folders_.journal);
   }
+  replayServes(folders_.journal);
 }
 
 void CrashSafety::recordNotification(std::string_view name, const Function<void()>& post) {

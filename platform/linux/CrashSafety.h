@@ -68,7 +68,10 @@ class CrashSafety {
   // Posts a change of the preferences to its handlers, as work that is recorded.
   void recordNotification(std::string_view name, const Function<void()>& post);
 
-  bool isFull() const { return journal_ != nullptr && !journal_->hasCapacity(); }
+  // Calls have to wait until some of those before are done.
+  bool isFull() const {
+    return journal_ != nullptr && !journal_->hasCapacity() && !snapshots_->cannotCut();
+  }
   bool isAllRecorded() const { return recorder_ && recorder_->counters().unrecorded == 0; }
   std::string counters() const;
 

@@ -443,6 +443,19 @@ TEST_F(RecoveryTest, AJournalWhoseReplaysDieIsMovedAsideAndTheServiceServes) {
   beginLife();
   EXPECT_THAT(poisoned, SizeIs(1));  // nobody was told
   told(poisoned);
+  // One that is cut short while clients are served counts as a quarter.
+  endReplay(options.folder);
+  for (int replays = 0; replays < 5; ++replays) {
+    kill();
+    beginLife();
+    EXPECT_THAT(poisoned, IsEmpty());
+    replayServes(options.folder);
+  }
+  kill();
+  beginLife();
+  EXPECT_THAT(poisoned, SizeIs(1));
+  told(poisoned);
+  connect(1, 200);
   // One that ends counts as none.
   for (int replays = 0; replays < 4; ++replays) {
     kill();

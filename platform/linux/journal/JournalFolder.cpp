@@ -21,7 +21,10 @@ constexpr std::string_view kAside = ".aside-";
 constexpr std::string_view kPart = ".part";      // of a file that is being copied
 constexpr std::string_view kNew = ".new";        // that is being allocated
 constexpr std::string_view kCompanion = ".vxa";  // memory that the recorded state refers to
-constexpr char kAttempts[] = "attempts";         // a file that holds their number, 4 bytes
+constexpr char kAttempts[] = "attempts";         // a file that holds what they weigh, 4 bytes
+// Of one attempt that was cut short, and of one that was while clients were served.
+constexpr uint32_t kWeight = 4;
+constexpr uint32_t kWhileServing = 1;
 
 std::string quoted(std::string_view verb, const std::string& path) {
   return std::string(verb) + " " + path;
@@ -182,13 +185,21 @@ Result<uint32_t> JournalFolder::beginAttempt() const {
   constexpr int kHow = O_RDWR | O_CREAT | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC;
   UniqueFd fd(openat(fd_.get(), kAttempts, kHow, 0600));
   if (!fd) return Status::lastError(quoted("cannot open", path));
-  uint32_t attempts = 0;
-  if (pread(fd.get(), &attempts, sizeof attempts, 0) != ssize_t{sizeof attempts}) attempts = 0;
-  if (attempts < UINT32_MAX) ++attempts;
-  if (pwrite(fd.get(), &attempts, sizeof attempts, 0) != ssize_t{sizeof attempts})
+  uint32_t weight = 0;
+  if (pread(fd.get(), &weight, sizeof weight, 0) != ssize_t{sizeof weight}) weight = 0;
+  weight = std::min(weight, UINT32_MAX - 2 * kWeight) + kWeight;
+  if (pwrite(fd.get(), &weight, sizeof weight, 0) != ssize_t{sizeof weight})
     return Status::lastError(quoted("cannot write", path));
   if (fdatasync(fd.get()) != 0) return Status::lastError(quoted("cannot write", path));
-  return attempts;
+  return (weight + kWeight - 1) / kWeight;
+}
+
+void JournalFolder::noteServing() const {
+  const UniqueFd fd(openat(fd_.get(), kAttempts, O_RDWR | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
+  uint32_t weight = 0;
+  if (!fd || pread(fd.get(), &weight, sizeof weight, 0) != ssize_t{sizeof weight}) return;
+  weight -= std::min(weight, kWeight - kWhileServing);
+  (void)!pwrite(fd.get(), &weight, sizeof weight, 0);  // then it weighs more
 }
 
 bool JournalFolder::hasAttempts() const {

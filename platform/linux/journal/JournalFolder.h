@@ -52,6 +52,9 @@ class JournalFolder {
 
   // Counts an attempt to replay what is here, before it begins: how many there were with this one.
   Result<uint32_t> beginAttempt() const;
+  // What was replayed is not committed yet and clients are served all the same: should the process
+  // end now, it is likely to be for another reason, and weighs less (kWhileServing).
+  void noteServing() const;
   bool hasAttempts() const;
   void clearAttempts() const;
 

@@ -91,6 +91,11 @@ void endReplay(const std::string& path) {
   if (folder.ok()) folder->clearAttempts();
 }
 
+void replayServes(const std::string& path) {
+  const Result<JournalFolder> folder = JournalFolder::open(path, JournalFolder::IfMissing::Fail);
+  if (folder.ok()) folder->noteServing();
+}
+
 void told(const std::vector<std::string>& poisoned) {
   for (const std::string& path : poisoned) endReplay(path);
 }

@@ -33,10 +33,13 @@ struct OpenedJournal {
 
 // Counts a replay of what is there, and opens the journal behind it. What an ending process moved
 // to `moved`, where it had more time, is taken back first. After kMostReplays replays that were
-// begun and not ended (endReplay) the journal is moved aside.
+// begun and not ended (endReplay) the journal is moved aside; of those that the service served
+// beside (replayServes), four count as one.
 Result<OpenedJournal> openJournal(JournalOptions options, const std::string& moved);
 // What was left has been replayed, and its rows are committed.
 void endReplay(const std::string& folder);
+// One that is not ended no longer keeps the service from serving: to be cut short weighs less now.
+void replayServes(const std::string& folder);
 // It is known that these are poisoned.
 void told(const std::vector<std::string>& poisoned);
 

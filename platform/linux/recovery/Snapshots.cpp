@@ -116,6 +116,7 @@ void Snapshots::complete() {
   if (!status.ok()) return giveUp();
   parts_.clear();
   state_ = State::Idle;
+  cannotCut_ = false;
   ++counters_.completed;
   seenBytes_ = means_.journal.counters().bytes;
   counters_.bytes = seenBytes_ - before;
@@ -150,6 +151,8 @@ void Snapshots::giveUp() {
   state_ = State::Idle;
   demanded_ = true;
   notBefore_ = means_.clock.monotonic() + kAfterFailure;
+  if (means_.journal.hasCapacity() || std::exchange(cannotCut_, true)) return;
+  means_.freed();
 }
 
 }  // namespace vx::lnx

@@ -41,7 +41,7 @@ class Snapshots {
     // for now.
     Function<std::unordered_map<const ExportedObject*, RecordedConnection>()> connections;
     Function<void()> commitSoon;  // what the store holds: the journal has no capacity
-    Function<void()> freed;       // there may be capacity again
+    Function<void()> freed;       // there may be capacity again; or cannotCut()
     Function<void()> began;       // around what must not be forgotten meanwhile
     Function<void()> completed;
   };
@@ -65,6 +65,9 @@ class Snapshots {
   std::optional<Monotonic> nextDue() const;
   void onDue();
 
+  // There is no capacity, and none that a snapshot could make: what there is to keep is too much.
+  // To wait would be for ever.
+  bool cannotCut() const { return cannotCut_; }
   const Counters& counters() const { return counters_; }
 
  private:
@@ -94,6 +97,7 @@ class Snapshots {
   State state_ = State::Idle;
   bool demanded_ = false;
   bool urged_ = false;
+  bool cannotCut_ = false;
   uint64_t seenBytes_ = 0;  // recorded by the pass before
   uint64_t bytesThen_ = 0;  // of them, before the last snapshot was begun, and its own
   Monotonic lastRecorded_{};
