@@ -445,7 +445,7 @@ TEST_F(RecoveryTest, AJournalWhoseReplaysDieIsMovedAsideAndTheServiceServes) {
   told(poisoned);
   // One that is cut short while clients are served counts as a quarter.
   endReplay(options.folder);
-  for (int replays = 0; replays < 5; ++replays) {
+  for (int replays = 0; replays < 8; ++replays) {
     kill();
     beginLife();
     EXPECT_THAT(poisoned, IsEmpty());

@@ -191,7 +191,7 @@ Result<uint32_t> JournalFolder::beginAttempt() const {
   if (pwrite(fd.get(), &weight, sizeof weight, 0) != ssize_t{sizeof weight})
     return Status::lastError(quoted("cannot write", path));
   if (fdatasync(fd.get()) != 0) return Status::lastError(quoted("cannot write", path));
-  return (weight + kWeight - 1) / kWeight;
+  return weight / kWeight;
 }
 
 void JournalFolder::noteServing() const {
