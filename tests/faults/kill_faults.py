@@ -58,7 +58,10 @@ def end_marker_session(service, traffic):
     c.close()
 
 
-def settled(traffic, seconds=1):
+COMMITTED = 6  # seconds within which what was accepted is in the store: commit_interval_ms is 5 s, and one to be seen
+
+
+def settled(traffic, seconds=COMMITTED):
     """A check while the daemon runs, when nothing lacks or nothing has come for some seconds."""
     check, since = Check(traffic, patient=True), time.monotonic()
     while check.lacks() and time.monotonic() < since + seconds:
