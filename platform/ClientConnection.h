@@ -104,6 +104,12 @@ class CallArguments {
   std::optional<std::vector<int64_t>> optionalInt64Array(std::size_t i) {
     return std::move(std::get<std::optional<std::vector<int64_t>>>(items_[i]));
   }
+  // None where there is no array.
+  std::optional<std::size_t> numbersIn(std::size_t i) const {
+    const auto& numbers = std::get<std::optional<std::vector<int64_t>>>(items_[i]);
+    if (!numbers) return std::nullopt;
+    return numbers->size();
+  }
   void set(std::size_t i, Argument value) { items_[i] = std::move(value); }
 
  private:
@@ -135,6 +141,9 @@ struct OperationDescription {
   // Runs on the connection's own queue. May invoke `reply` before it returns, later, twice or
   // never.
   void (*invoke)(ExportedObject& object, CallArguments& arguments, Reply reply);
+  // Whether its work may be long: then it runs before the peer's next call is looked at. Null:
+  // never.
+  bool (*isHeavy)(const CallArguments& arguments) = nullptr;
 };
 
 // Operations are numbered from 1 in declaration order on the wire. Each has one dictionary at most

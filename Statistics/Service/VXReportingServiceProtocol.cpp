@@ -18,6 +18,14 @@ VXReportingServiceProtocol& service(ExportedObject& object) {
   return static_cast<VXReportingServiceProtocol&>(object);
 }
 
+// Sessions that a message may go to while it counts as one of many.
+constexpr std::size_t kFewSessions = 8;
+
+bool always(const CallArguments&) { return true; }
+bool goesToMany(const CallArguments& arguments) {
+  return arguments.numbersIn(3).value_or(kFewSessions + 1) > kFewSessions;
+}
+
 auto booleanReply(Reply reply) {
   return [reply = std::move(reply)](bool value) { reply(value); };
 }
@@ -58,12 +66,14 @@ constexpr std::array<OperationDescription, 11> kOperations = {{
          [](ExportedObject& object, CallArguments& arguments, Reply reply) {
            service(object).setConfiguration(arguments.optionalDictionary(0), arguments.int64(1),
                                             booleanReply(std::move(reply)));
-         }},
+         },
+     .isHeavy = &always},
     {.name = "startReportingSessionForID",
      .arguments = kReporter,
      .reply = ReplyKind::Boolean,
      .replyMayBeHeld = true,
-     .invoke = &invokeOnReporter<&VXReportingServiceProtocol::startReportingSessionForID>},
+     .invoke = &invokeOnReporter<&VXReportingServiceProtocol::startReportingSessionForID>,
+     .isHeavy = &always},
     {.name = "sendMessage",
      .arguments = kMessage,
      .reply = ReplyKind::OptionalError,
@@ -78,16 +88,19 @@ constexpr std::array<OperationDescription, 11> kOperations = {{
                  else
                    reply(std::monostate());
                });
-         }},
+         },
+     .isHeavy = &goesToMany},
     {.name = "stopReportingSessionForID",
      .arguments = kReporter,
      .reply = ReplyKind::Boolean,
-     .invoke = &invokeOnReporter<&VXReportingServiceProtocol::stopReportingSessionForID>},
+     .invoke = &invokeOnReporter<&VXReportingServiceProtocol::stopReportingSessionForID>,
+     .isHeavy = &always},
     {.name = "destroyReportingSession",
      .arguments = kReporter,
      .reply = ReplyKind::Boolean,
      .resource = ResourceEffect::Release,
-     .invoke = &invokeOnReporter<&VXReportingServiceProtocol::destroyReportingSession>},
+     .invoke = &invokeOnReporter<&VXReportingServiceProtocol::destroyReportingSession>,
+     .isHeavy = &always},
     {.name = "reporterID",
      .arguments = kReporter,
      .reply = ReplyKind::Dictionary,
@@ -108,7 +121,8 @@ constexpr std::array<OperationDescription, 11> kOperations = {{
                [reply = std::move(reply)](const std::vector<ReporterID>& numbers) {
                  reply(numbers);
                });
-         }},
+         },
+     .isHeavy = &always},
     {.name = "killService",
      .arguments = {},
      .reply = ReplyKind::Boolean,

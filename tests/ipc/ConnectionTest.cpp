@@ -18,6 +18,7 @@ const std::string kTestHello =
 class ConnectionTest : public IpcTest, public ConnectionHost {
  protected:
   ConnectionTest() {
+    loop_.addRound([this] { return turns_.runRound(); });
     loop_.addPassEndHook([this] {
       for (const auto& c : std::exchange(toFlush_, {})) c->flush();
     });
@@ -76,6 +77,9 @@ class ConnectionTest : public IpcTest, public ConnectionHost {
   wire::ReadBuffers& readBuffers() override { return buffers_; }
   bool readingPaused() override { return congested; }
   void waitForReading(const std::shared_ptr<SocketConnection>&) override { ++waits; }
+  void readInTurn(uid_t user, std::shared_ptr<TurnTaker> reader) override {
+    turns_.add(user, std::move(reader));
+  }
   void flushAtPassEnd(const std::shared_ptr<SocketConnection>& c) override {
     toFlush_.push_back(c);
   }
@@ -92,6 +96,7 @@ class ConnectionTest : public IpcTest, public ConnectionHost {
   std::vector<std::string> events;
 
  private:
+  ReadTurns turns_{executor(), p.clock};
   wire::ReadBuffers buffers_;
   std::vector<std::shared_ptr<SocketConnection>> toFlush_;
 };
@@ -265,28 +270,28 @@ TEST_F(ConnectionTest, APeerThatReadsNothingMoreIsCut) {
   EXPECT_EQ(closes, 2);
 }
 
-TEST_F(ConnectionTest, RepliesMadeLaterOvershootTheirLimitByOneTurn) {
+TEST_F(ConnectionTest, RepliesMadeLaterOvershootTheirLimitByOneStep) {
   options.maxUnreadReplyBytes = 100;
   connect();
   object->later = executor().makeSerial("later", QualityOfService::UserInteractive);
   object->list.assign(10, 1);
-  for (const auto& [sent, turn] :
-       {std::pair(calls(kEcho, 1, 600), 512U), std::pair(calls(kList, 1, 10), 8U)}) {
+  for (const auto& [sent, step] :
+       {std::pair(calls(kEcho, 1, 60), 16U), std::pair(calls(kList, 1, 10), 6U)}) {
     object->calls.clear();
     peer.write(sent);
     pass();
     pass();
-    EXPECT_EQ(object->calls.size(), turn);
+    EXPECT_EQ(object->calls.size(), step);
     run();
   }
-  EXPECT_THAT(answers(), SizeIs(610));
+  EXPECT_THAT(answers(), SizeIs(70));
 }
 
 TEST_F(ConnectionTest, CongestionHoldsFramesBack) {
   connect();
   congested = true;
   send(calls(kEcho, 1, 2));
-  send(calls(kEcho, 3, 600));  // more than one turn takes
+  send(calls(kEcho, 3, 600));  // more than one step takes
   EXPECT_THAT(object->calls, IsEmpty());
   EXPECT_EQ(waits, 1);
   congested = false;

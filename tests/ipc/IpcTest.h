@@ -65,14 +65,22 @@ inline const InterfaceDescription& testInterface() {
   static constexpr std::array kAll = {UInt16, UInt32, OptionalDictionary, OptionalInt64Array};
   static constexpr std::array kDictionary = {Dictionary};
   static constexpr std::array<OperationDescription, 8> kOperations = {{
-      {"echo", kInteger, ReplyKind::Boolean, false, None, true, Object::runEcho},
-      {"keep", kInteger, ReplyKind::Boolean, false, None, true, Object::runKeep},
-      {"hold", kInteger, ReplyKind::Boolean, true, None, true, Object::runKeep},
-      {"acquire", kInteger, ReplyKind::Boolean, false, Acquire, true, Object::runEcho},
-      {"release", kInteger, ReplyKind::Boolean, false, Release, true, Object::runEcho},
-      {"list", {}, ReplyKind::Int64Array, false, None, true, Object::runList},
-      {"take", kAll, ReplyKind::OptionalError, false, None, true, Object::runTake},
-      {"message", kDictionary, ReplyKind::Dictionary, false, None, true, Object::runMessage},
+      {"echo", kInteger, ReplyKind::Boolean, false, None, true, Object::runEcho, nullptr},
+      {"keep", kInteger, ReplyKind::Boolean, false, None, true, Object::runKeep, nullptr},
+      {"hold", kInteger, ReplyKind::Boolean, true, None, true, Object::runKeep, nullptr},
+      {"acquire", kInteger, ReplyKind::Boolean, false, Acquire, true, Object::runEcho, nullptr},
+      {"release", kInteger, ReplyKind::Boolean, false, Release, true, Object::runEcho, nullptr},
+      {"list",
+       {},
+       ReplyKind::Int64Array,
+       false,
+       None,
+       true,
+       Object::runList,
+       [](const CallArguments&) { return true; }},
+      {"take", kAll, ReplyKind::OptionalError, false, None, true, Object::runTake, nullptr},
+      {"message", kDictionary, ReplyKind::Dictionary, false, None, true, Object::runMessage,
+       nullptr},
   }};
   static constexpr InterfaceDescription kInterface{.name = "Test", .operations = kOperations};
   return kInterface;

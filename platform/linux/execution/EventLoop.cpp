@@ -49,6 +49,8 @@ void EventLoop::addDeadline(Function<std::optional<Monotonic>()> next, Function<
   deadlines_.push_back({std::move(next), std::move(due)});
 }
 
+void EventLoop::addRound(Function<bool()> round) { rounds_.push_back(std::move(round)); }
+
 void EventLoop::addPassEndHook(Function<void()> hook) { passEndHooks_.push_back(std::move(hook)); }
 
 void EventLoop::wake() {
@@ -90,6 +92,7 @@ void EventLoop::runOnce(std::optional<Monotonic> deadline) {
   executor_.assertInteractiveThread();
   runDueDeadlines();
   bool moreWork = executor_.runInteractive(kItemsPerPass);
+  for (const Function<bool()>& round : rounds_) moreWork = round() || moreWork;
   for (const Function<void()>& hook : passEndHooks_) hook();
 
   // Hooks may have queued work, and other threads may have since: prepareToSleep looks again.

@@ -2,9 +2,9 @@
 // passes.
 //
 // One pass waits for descriptors, lets their sources queue work, runs the interactive queues until
-// they are empty, and then calls the pass-end hooks (all replies of a pass leave in one write per
-// connection). Plain epoll rather than sd-event: a lone call costs one epoll_wait, and nothing here
-// needs more than descriptors and a few deadlines.
+// they are empty, then a round of what takes turns, and then calls the pass-end hooks (all replies
+// of a pass leave in one write per connection). Plain epoll rather than sd-event: a lone call costs
+// one epoll_wait, and nothing here needs more than descriptors and a few deadlines.
 #pragma once
 
 #include <sys/epoll.h>
@@ -47,6 +47,8 @@ class EventLoop {
   // Something that wants to run at a time of its own: `next` is asked before each sleep, `due`
   // called once it passed.
   void addDeadline(Function<std::optional<Monotonic>()> next, Function<void()> due);
+  // Run once in each pass; true: there is more for the next one, which then does not wait.
+  void addRound(Function<bool()> round);
   void addPassEndHook(Function<void()> hook);
 
   // Runs until stop(); may be called again afterwards.
@@ -75,6 +77,7 @@ class EventLoop {
   const UniqueFd wakeFd_;
   std::atomic<bool> stopped_{false};
   std::vector<Deadline> deadlines_;
+  std::vector<Function<bool()>> rounds_;
   std::vector<Function<void()>> passEndHooks_;
   std::array<epoll_event, kEventsPerPass> events_{};
   std::size_t eventCount_ = 0;

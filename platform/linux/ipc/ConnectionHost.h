@@ -8,6 +8,7 @@
 #include "platform/linux/ipc/CallRecorder.h"
 #include "platform/linux/ipc/ListenerCounters.h"
 #include "platform/linux/ipc/ListenerOptions.h"
+#include "platform/linux/ipc/ReadTurns.h"
 #include "wire/FrameReader.h"
 
 namespace vx::lnx {
@@ -29,6 +30,8 @@ class ConnectionHost {
   // continueReading().
   virtual bool readingPaused() = 0;
   virtual void waitForReading(const std::shared_ptr<SocketConnection>& connection) = 0;
+  // Something has come that the connection will read in its turn.
+  virtual void readInTurn(uid_t user, std::shared_ptr<TurnTaker> connection) = 0;
   virtual void flushAtPassEnd(const std::shared_ptr<SocketConnection>& connection) = 0;
   // Replies wait because the peer does not read (or no longer do): see stallDeadline().
   virtual void unreadChanged(SocketConnection& connection, bool unread) = 0;

@@ -15,11 +15,9 @@ using wire::FrameKind;
 using wire::FrameReader;
 using WireError = wire::ErrorCode;
 
-// Frames run before the replies they cause get their turn, which bounds how far replies overshoot
-// their limit.
-constexpr int kFramesPerTurn = 512;
-// An operation whose answer may be as large as a frame uses up this much of a turn.
-constexpr int kLargeReplyCost = 64;
+// Frames that run before what they have queued does: by so many calls a turn may be overrun, and
+// replies their limit.
+constexpr int kFramesPerStep = 16;
 
 // None for other kinds.
 std::optional<int64_t> readInteger(const Value& value) {
@@ -82,10 +80,14 @@ void SocketConnection::onReady(uint32_t events) {
 void SocketConnection::scheduleRead() {
   if (readScheduled_ || state_ != State::Open) return;
   readScheduled_ = true;
-  async([self = shared_from_this()] {
-    self->readScheduled_ = false;
-    self->readPass();
-  });
+  host_.readInTurn(uid_, shared_from_this());
+}
+
+void SocketConnection::takeTurn(ReadTurn& turn) {
+  assertInteractive();
+  readScheduled_ = false;
+  const Lane::Current onQueue(queue_.get());
+  readPass(&turn);
 }
 
 bool SocketConnection::mustPause() const {
@@ -106,13 +108,13 @@ void SocketConnection::continueReading() {
   scheduleRead();
 }
 
-void SocketConnection::readPass() {
+void SocketConnection::readPass(ReadTurn* turn) {
   queue_->assertIsCurrent();
   if (state_ != State::Open || waitingForHost_) return;
   // Complete frames left over from the read before come first; only when they are through is more
   // read.
   if (!reader_.hasNext() && !readSocket()) return;
-  runFrames();
+  runFrames(turn);
   if (state_ != State::Open) return;
   reader_.keepRest();
   if (waitingForHost_ || mustPause()) return pauseReading();
@@ -133,9 +135,14 @@ bool SocketConnection::readSocket() {
   return true;
 }
 
-void SocketConnection::runFrames() {
-  turnBudget_ = kFramesPerTurn;
-  while (turnBudget_-- > 0 && state_ == State::Open && reader_.unread() >= wire::kLengthBytes) {
+void SocketConnection::runFrames(ReadTurn* turn) {
+  stepBudget_ = kFramesPerStep;
+  while (state_ == State::Open && reader_.unread() >= wire::kLengthBytes) {
+    if (stepBudget_-- <= 0) {
+      if (turn == nullptr || !turn->goOn()) return;
+      stepBudget_ = kFramesPerStep;
+      continue;
+    }
     if (mustPause()) return;
     if (host_.readingPaused()) {
       waitingForHost_ = true;
@@ -217,7 +224,7 @@ void SocketConnection::runCall(const Frame& frame) {
                      "this connection holds " + std::to_string(resources_.size()) +
                          " sessions already; destroy some first");
   }
-  if (operation.reply == ReplyKind::Int64Array) turnBudget_ -= kLargeReplyCost;
+  if (operation.isHeavy != nullptr && operation.isHeavy(arguments)) stepBudget_ = 0;
   const uint64_t token =
       calls_.open(callNumber, operation.replyMayBeHeld ? CallTable::Answer::MayBeHeld
                                                        : CallTable::Answer::Soon);
@@ -423,7 +430,7 @@ void SocketConnection::shutDown() {
     }
     const std::size_t before = self->reader_.unread();
     const uint64_t calls = self->host_.counters().calls;
-    self->readPass();
+    self->readPass(nullptr);
     if (self->state_ != State::Open) return;
     const bool moved = self->reader_.unread() != before || self->host_.counters().calls != calls;
     if (moved) return self->shutDown();

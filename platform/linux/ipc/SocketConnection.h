@@ -16,6 +16,7 @@
 #include "platform/WorkQueue.h"
 #include "platform/linux/ipc/CallTable.h"
 #include "platform/linux/ipc/ConnectionHost.h"
+#include "platform/linux/ipc/ReadTurns.h"
 #include "platform/linux/ipc/ReplyStream.h"
 #include "wire/FrameReader.h"
 
@@ -28,13 +29,15 @@ namespace vx::lnx {
 //   Draining --all calls settled, all replies written or the peer gone--> Closed
 //
 // Owned by SocketListener until it is closed. Everything but reply() and release() belongs to the
-// interactive thread; handlers and front halves run on its own serial queue there. Stops reading
+// interactive thread; handlers and front halves run on its own serial queue there, or as if they
+// did: it reads when the listener gives it a turn. Stops reading
 // while maxCallsInFlight calls are unanswered, while maxUnreadReplyBytes of replies are unread, and
 // while the service is congested; is cut when unread replies make no progress for
 // stalledClientTimeout. Holds at most maxSessionsPerConnection resources for its peer.
 class SocketConnection final : public ClientConnection,
                                public ReplyTarget,
                                public EventLoop::Source,
+                               public TurnTaker,
                                public std::enable_shared_from_this<SocketConnection> {
  public:
   SocketConnection(ConnectionHost& host, UniqueFd socket, pid_t pid, uid_t uid);
@@ -62,6 +65,7 @@ class SocketConnection final : public ClientConnection,
   void release(uint64_t token) override;
 
   void onReady(uint32_t events) override;
+  void takeTurn(ReadTurn& turn) override;
 
   uid_t user() const { return uid_; }
   uint64_t recordedAs() const { return recordedAs_; }
@@ -93,9 +97,10 @@ class SocketConnection final : public ClientConnection,
   // Later, in a turn of its own, and for no call's sake.
   void async(Work work);
   void scheduleRead();
-  void readPass();
+  // Without a turn a few frames run, and what they queue afterwards.
+  void readPass(ReadTurn* turn);
   bool readSocket();  // false when there is nothing to run
-  void runFrames();
+  void runFrames(ReadTurn* turn);
   bool mustPause() const;
   void pauseReading();
   void runFrame(std::span<const uint8_t> body);
@@ -130,7 +135,7 @@ class SocketConnection final : public ClientConnection,
   bool flushQueued_ = false;
   bool goodbyeSent_ = false;
   uint32_t interest_ = 0;  // what the loop watches for; 0: it does not know the socket
-  int turnBudget_ = 0;     // frames that may still run before the replies they cause get their turn
+  int stepBudget_ = 0;     // of frames that may still run before what they have queued
   const InterfaceDescription* interface_ = nullptr;
   std::shared_ptr<ExportedObject> object_;
   Function<void()> interruption_;

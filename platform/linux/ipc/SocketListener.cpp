@@ -50,7 +50,9 @@ SocketListener::SocketListener(EventLoop& loop, Executor& executor, Clock& clock
       clock_(clock),
       limits_(limits),
       queue_(executor.makeSerial("com.quorvel.sonik.reporting.listener",
-                                 QualityOfService::UserInteractive)) {
+                                 QualityOfService::UserInteractive)),
+      turns_(executor, clock) {
+  loop_.addRound([this] { return turns_.runRound(); });
   loop_.addPassEndHook([this] { runPassEnd(); });
   loop_.addDeadline(
       [this]() -> std::optional<Monotonic> {
@@ -254,6 +256,7 @@ void SocketListener::resume() {
 
   if (hooks_.stopping) hooks_.stopping();
   stopListening();
+  turns_.end();  // the connections read the rest by themselves
   const Monotonic deadline = clock_.monotonic() + kShutdownTime;
   std::vector<std::shared_ptr<SocketConnection>> ending;
   ending.reserve(connections_.size());

@@ -73,6 +73,9 @@ class SocketListener final : public ServiceListener,
   wire::ReadBuffers& readBuffers() override { return readBuffers_; }
   bool readingPaused() override { return hooks_.congested(); }
   void waitForReading(const std::shared_ptr<SocketConnection>& connection) override;
+  void readInTurn(uid_t user, std::shared_ptr<TurnTaker> connection) override {
+    turns_.add(user, std::move(connection));
+  }
   void flushAtPassEnd(const std::shared_ptr<SocketConnection>& connection) override {
     toFlush_.push_back(connection);
   }
@@ -81,7 +84,7 @@ class SocketListener final : public ServiceListener,
 
  private:
   static constexpr std::chrono::seconds kShutdownTime{2};
-  static constexpr int kAcceptsPerPass = 64;
+  static constexpr int kAcceptsPerPass = 16;
 
   void onReady(uint32_t events) override;
   Status adoptActivated(int sockets);
@@ -111,6 +114,7 @@ class SocketListener final : public ServiceListener,
   UniqueFd spare_;  // given up for a moment to turn a client away when descriptors have run out
   bool listening_ = false;
   std::string path_;  // bound here, to be removed at the end; empty for an activated socket
+  ReadTurns turns_;
   wire::ReadBuffers readBuffers_;
   std::unordered_map<SocketConnection*, std::shared_ptr<SocketConnection>> connections_;
   std::unordered_map<uid_t, uint32_t> connectionsOfUser_;

@@ -1,0 +1,62 @@
+#include "platform/linux/ipc/ReadTurns.h"
+
+#include <algorithm>
+#include <utility>
+
+namespace vx::lnx {
+
+bool ReadTurn::goOn() {
+  executor_.runInteractive(kItems);
+  now_ = clock_.monotonic();
+  return now_ < end_;
+}
+
+void ReadTurns::add(uid_t user, std::shared_ptr<TurnTaker> reader) {
+  if (ended_) return;
+  const auto [found, isNew] = byUid_.try_emplace(user);
+  if (isNew) {
+    found->second = users_.emplace(users_.end());
+    found->second->uid = user;
+  }
+  found->second->readers.push_back(std::move(reader));
+}
+
+bool ReadTurns::runRound() {
+  // Who comes while the round runs is in the next one.
+  for (std::size_t left = users_.size(); left > 0 && !users_.empty(); --left) {
+    const auto user = users_.begin();
+    if (users_.size() == 1) user->debt = {};  // nobody else is there to be owed
+    runTurnOf(*user);
+    if (ended_) break;
+    if (user->readers.empty() && user->debt.count() == 0) {
+      byUid_.erase(user->uid);
+      users_.erase(user);
+    } else {
+      users_.splice(users_.end(), users_, user);
+    }
+  }
+  return std::any_of(users_.begin(), users_.end(),
+                     [](const User& user) { return !user.readers.empty(); });
+}
+
+void ReadTurns::runTurnOf(User& user) {
+  const std::chrono::nanoseconds paid = std::min<std::chrono::nanoseconds>(user.debt, kTurn);
+  user.debt -= paid;
+  if (paid == kTurn || user.readers.empty()) return;
+  ReadTurn turn(executor_, clock_, kTurn - paid);
+  // Each of them once: who has more to read is behind those that come meanwhile.
+  for (std::size_t left = user.readers.size(); left > 0 && !user.readers.empty(); --left) {
+    const std::shared_ptr<TurnTaker> reader = std::move(user.readers.front());
+    user.readers.pop_front();
+    reader->takeTurn(turn);
+    if (!turn.goOn() || ended_) break;
+  }
+  user.debt += std::max<std::chrono::nanoseconds>(-turn.left(), {});
+}
+
+void ReadTurns::end() {
+  ended_ = true;
+  for (User& user : users_) user.readers.clear();
+}
+
+}  // namespace vx::lnx
