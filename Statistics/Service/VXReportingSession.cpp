@@ -327,11 +327,11 @@ void VXReportingSession::registerOrientationHandlers() {
   }
   OrientationNotifier& notifier = platform().orientation;
   notifier.registerDeviceOrientationHandler(
-      identifier, [self = shared_from_this()](int64_t orientation) {
+      identifier, this, [self = shared_from_this()](int64_t orientation) {
         self->orientationChanged("device", "device_orientation", orientation);
       });
   notifier.registerInterfaceOrientationHandler(
-      identifier, [self = shared_from_this()](int64_t orientation) {
+      identifier, this, [self = shared_from_this()](int64_t orientation) {
         self->orientationChanged("ui", "ui_orientation", orientation);
       });
 }
@@ -340,8 +340,8 @@ void VXReportingSession::unregisterOrientationHandlers() {
   const std::optional<std::string> identifier = orientationCallbackID();
   if (!identifier) return;
   OrientationNotifier& notifier = platform().orientation;
-  notifier.unregisterDeviceOrientationHandler(*identifier);
-  notifier.unregisterInterfaceOrientationHandler(*identifier);
+  notifier.unregisterDeviceOrientationHandler(*identifier, this);
+  notifier.unregisterInterfaceOrientationHandler(*identifier, this);
   MutexLock lock(fieldsMutex_);
   orientationCallbackID_.reset();
 }

@@ -201,6 +201,7 @@ class RunningPlatform final : public LinuxPlatform {
     const std::size_t left =
         drained || crashSafety_->isAllRecorded() ? 0 : executor_.utilityBacklog();
     executor_.stop(clock_.monotonic() + kThreadTime);
+    const bool oriented = orientation_.stop(clock_.monotonic() + kThreadTime);
     crashSafety_->stop();
     const LocalStore::Counters counters = store_->counters();
     const uint64_t lost = counters.rowsLost + left + (ended ? 0 : counters.unrecordedWaiting);
@@ -216,7 +217,7 @@ class RunningPlatform final : public LinuxPlatform {
     const bool alone = crashSafety_->keepWhatIsLeft(askForTime);
     const int status = lost == 0 ? 0 : 1;
     // A thread that could not be ended must not find the services destroyed.
-    if (!drained || !ended || !alone) std::_Exit(status);
+    if (!drained || !ended || !oriented || !alone) std::_Exit(status);
     return status;
   }
 
@@ -310,11 +311,13 @@ class RunningPlatform final : public LinuxPlatform {
       }
       const LocalStore::Counters counters = store_->counters();
       VX_LOG(nullptr, Error,
-             "counters: %s rows=%llu commits=%llu write_failures=%llu relay_backlog=%zu %s",
+             "counters: %s rows=%llu commits=%llu write_failures=%llu relay_backlog=%zu "
+             "orientation_refused=%llu %s",
              listener_.counters().text().c_str(),
              static_cast<unsigned long long>(counters.rowsCommitted),
              static_cast<unsigned long long>(counters.commits),
              static_cast<unsigned long long>(counters.writeFailures), executor_.utilityBacklog(),
+             static_cast<unsigned long long>(orientation_.refusedHandlers()),
              crashSafety_->counters().c_str());
     }
   }

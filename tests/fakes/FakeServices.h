@@ -180,21 +180,22 @@ class FakeServices final : public AnalyticsEventService,
     notifyHandler = share(std::move(handler));
     return notifyStatus;
   }
-  void registerDeviceOrientationHandler(Name id, Handler handler) override {
+  void registerDeviceOrientationHandler(Name id, const void* registrant, Handler handler) override {
     note(journal_, "register device ", id);
-    deviceHandlers[std::string(id)] = share(std::move(handler));
+    deviceHandlers[{std::string(id), registrant}] = share(std::move(handler));
   }
-  void registerInterfaceOrientationHandler(Name id, Handler handler) override {
+  void registerInterfaceOrientationHandler(Name id, const void* registrant,
+                                           Handler handler) override {
     note(journal_, "register interface ", id);
-    interfaceHandlers[std::string(id)] = share(std::move(handler));
+    interfaceHandlers[{std::string(id), registrant}] = share(std::move(handler));
   }
-  void unregisterDeviceOrientationHandler(Name id) override {
+  void unregisterDeviceOrientationHandler(Name id, const void* registrant) override {
     note(journal_, "unregister device ", id);
-    deviceHandlers.erase(std::string(id));
+    deviceHandlers.erase({std::string(id), registrant});
   }
-  void unregisterInterfaceOrientationHandler(Name id) override {
+  void unregisterInterfaceOrientationHandler(Name id, const void* registrant) override {
     note(journal_, "unregister interface ", id);
-    interfaceHandlers.erase(std::string(id));
+    interfaceHandlers.erase({std::string(id), registrant});
   }
   std::string orientationText(int64_t value) override { return "o" + std::to_string(value); }
   std::string logsDirectory() override { return "/logs"; }
@@ -228,8 +229,9 @@ class FakeServices final : public AnalyticsEventService,
   uint32_t notifyStatus = 0;
   std::shared_ptr<Function<void(int)>> notifyHandler;
   static constexpr int kToken = 77;
-  std::map<std::string, std::shared_ptr<Handler>> deviceHandlers;
-  std::map<std::string, std::shared_ptr<Handler>> interfaceHandlers;
+  using Handlers = std::map<std::pair<std::string, const void*>, std::shared_ptr<Handler>>;
+  Handlers deviceHandlers;
+  Handlers interfaceHandlers;
   Texts files;
   std::optional<Error> directoryError;
   std::optional<Error> writeError;  // of the next piece written, and of no other

@@ -268,6 +268,13 @@ TEST_F(OrientationTest, HandlersComeAndGoInOrderWhereAllThreeConditionsHold) {
   EXPECT_THAT(gained({"register"}), IsEmpty()) << "asked with the type of the moment";
   p.services.deviceHandlers.clear();
   p.services.interfaceHandlers.clear();
+  const auto one = make(7), other = make(7);  // of the same identifier
+  one->start();
+  other->start();
+  one->stop();
+  EXPECT_EQ(p.services.deviceHandlers.size(), 1u);
+  EXPECT_EQ(p.services.interfaceHandlers.size(), 1u);
+  other->stop();
   p.services.deviceClass = 6;
   EXPECT_FALSE(make(7)->shouldReportOrientation());
 }

@@ -1,10 +1,8 @@
 #include "platform/linux/device/InterfaceStateFile.h"
 
-#include <sys/inotify.h>
 #include <unistd.h>
 
-#include <cerrno>
-#include <cstring>
+#include <utility>
 
 #include "base/FileReading.h"
 #include "platform/Log.h"
@@ -13,21 +11,19 @@ namespace vx::lnx {
 
 void InterfaceStateFile::start() {
   thread_.assertHere();
-  if (inotify_) return;
-  const std::filesystem::path folder = path_.parent_path();
-  UniqueFd fd(inotify_init1(IN_NONBLOCK | IN_CLOEXEC));
-  if (!fd ||
-      inotify_add_watch(fd.get(), folder.c_str(), IN_CLOSE_WRITE | IN_MOVED_TO | IN_ONLYDIR) < 0) {
-    const int failure = errno;
-    if (!std::exchange(saidFolderIsMissing_, true)) {
-      VX_LOG(nullptr, Info, "interface orientation is off for now: cannot watch %s (%s)",
-             folder.c_str(), std::strerror(failure));
-    }
-    return;
+  if (inotify_ && folder_.isThere()) return;
+  watch();
+}
+
+void InterfaceStateFile::watch() {
+  if (!inotify_) inotify_.reset(inotify_init1(IN_NONBLOCK | IN_CLOEXEC));
+  const Status watched = inotify_ ? folder_.renew(inotify_.get()) : Status::lastError("inotify");
+  if (watched.ok()) {
+    saidFolderIsMissing_ = false;
+    read();
+  } else if (!std::exchange(saidFolderIsMissing_, true)) {
+    VX_LOG(nullptr, Info, "interface orientation is off for now: %s", watched.text().c_str());
   }
-  saidFolderIsMissing_ = false;
-  inotify_ = std::move(fd);
-  read();
 }
 
 void InterfaceStateFile::stop() {
@@ -41,16 +37,20 @@ void InterfaceStateFile::onReadable() {
   alignas(inotify_event) char buffer[4096];
   const std::string name = path_.filename();
   bool changed = false;
+  bool folderMoved = false;
   ssize_t got = 0;
   while ((got = ::read(inotify_.get(), buffer, sizeof buffer)) > 0) {
     for (char* at = buffer; at < buffer + got;) {
       const auto* event = reinterpret_cast<const inotify_event*>(at);
       at += sizeof(inotify_event) + event->len;
-      changed =
-          changed || (event->mask & IN_Q_OVERFLOW) != 0 || (event->len > 0 && name == event->name);
+      folderMoved = folderMoved || folder_.concerns(*event);
+      changed = changed || (folder_.isOfFolder(*event) && event->len > 0 && name == event->name);
     }
   }
-  if (changed) read();
+  if (folderMoved)
+    watch();  // reads, too
+  else if (changed)
+    read();
 }
 
 void InterfaceStateFile::read() {

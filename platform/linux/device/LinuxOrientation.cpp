@@ -7,9 +7,12 @@
 #include <algorithm>
 #include <chrono>
 #include <optional>
+#include <system_error>
+#include <utility>
 
 #include "base/Mutex.h"
 #include "base/UniqueFd.h"
+#include "platform/Log.h"
 #include "platform/linux/device/InterfaceStateFile.h"
 #include "platform/linux/device/OrientationHandlers.h"
 #include "platform/linux/device/SensorProxyClient.h"
@@ -21,8 +24,9 @@ namespace vx::lnx {
 // handlers.
 class LinuxOrientation::Worker : public std::enable_shared_from_this<Worker> {
  public:
-  explicit Worker(const OrientationOptions& options)
-      : sensor_([this](const std::string& word) { device.report(word); }),
+  Worker(const OrientationOptions& options, StartThread startThread)
+      : startThread_(std::move(startThread)),
+        sensor_([this](const std::string& word) { device.report(word); }),
         stateFile_(options.interfaceStateFile,
                    [this](const std::string& word) { interface.report(word); }) {}
 
@@ -31,6 +35,7 @@ class LinuxOrientation::Worker : public std::enable_shared_from_this<Worker> {
   // After one has gone.
   void wake() const;
   void end();
+  bool waitUntilEnded(Monotonic until);
 
   OrientationWords words;
   OrientationHandlers device{words};
@@ -44,21 +49,25 @@ class LinuxOrientation::Worker : public std::enable_shared_from_this<Worker> {
   bool mayEnd();
   void waitAndDispatch();
 
+  const StartThread startThread_;
   const UniqueFd wakeFd_{eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK)};
   SensorProxyClient sensor_;      // the thread's
   InterfaceStateFile stateFile_;  // the thread's
   Mutex mutex_;
+  CondVar stopped_;
   bool running_ GUARDED_BY(mutex_) = false;
   bool ending_ GUARDED_BY(mutex_) = false;
 };
 
 void LinuxOrientation::Worker::wakeOrStart() {
-  {
-    MutexLock lock(mutex_);
-    if (running_) return wake();
+  MutexLock lock(mutex_);
+  if (running_) return wake();
+  try {
+    startThread_([self = shared_from_this()] { self->run(); }).detach();
     running_ = true;
+  } catch (const std::system_error& failure) {
+    VX_LOG(nullptr, Error, "orientation is off for now: no thread for it (%s)", failure.what());
   }
-  startThread("vx-orientation", [self = shared_from_this()] { self->run(); }).detach();
 }
 
 void LinuxOrientation::Worker::wake() const {
@@ -74,6 +83,16 @@ void LinuxOrientation::Worker::end() {
   device.clear();
   interface.clear();
   wake();
+}
+
+bool LinuxOrientation::Worker::waitUntilEnded(Monotonic until) {
+  MutexLock lock(mutex_);
+  while (running_) {
+    if (!stopped_.waitUntil(
+            mutex_, std::chrono::time_point_cast<std::chrono::steady_clock::duration>(until)))
+      return !running_;
+  }
+  return true;
 }
 
 void LinuxOrientation::Worker::run() {
@@ -106,6 +125,7 @@ bool LinuxOrientation::Worker::mayEnd() {
   device.forgetLast();
   interface.forgetLast();
   running_ = false;
+  stopped_.notifyAll();
   return true;
 }
 
@@ -127,30 +147,49 @@ void LinuxOrientation::Worker::waitAndDispatch() {
 }
 
 LinuxOrientation::LinuxOrientation(const OrientationOptions& options)
-    : options_(options), worker_(std::make_shared<Worker>(options)) {}
+    : LinuxOrientation(options, [](Function<void()> body) {
+        return startThread("vx-orientation", std::move(body));
+      }) {}
+
+LinuxOrientation::LinuxOrientation(const OrientationOptions& options, StartThread startThread)
+    : options_(options), worker_(std::make_shared<Worker>(options, std::move(startThread))) {}
 
 LinuxOrientation::~LinuxOrientation() { worker_->end(); }
 
+bool LinuxOrientation::stop(Monotonic until) {
+  worker_->end();
+  return worker_->waitUntilEnded(until);
+}
+
+void LinuxOrientation::add(OrientationHandlers& handlers, std::string_view identifier,
+                           const void* registrant, Handler handler) {
+  if (handlers.add(identifier, registrant, std::move(handler))) return worker_->wakeOrStart();
+  refused_.fetch_add(1, std::memory_order_relaxed);
+  VX_LOG(nullptr, Error,
+         "no orientation for %s: %zu handlers are registered, and no more are taken",
+         std::string(identifier).c_str(), OrientationHandlers::kMaxHandlers);
+}
+
 void LinuxOrientation::registerDeviceOrientationHandler(std::string_view identifier,
-                                                        Handler handler) {
-  if (!options_.deviceSensor) return;
-  worker_->device.add(identifier, std::move(handler));
-  worker_->wakeOrStart();
+                                                        const void* registrant, Handler handler) {
+  if (options_.deviceSensor) add(worker_->device, identifier, registrant, std::move(handler));
 }
 
 void LinuxOrientation::registerInterfaceOrientationHandler(std::string_view identifier,
+                                                           const void* registrant,
                                                            Handler handler) {
-  if (options_.interfaceStateFile.empty()) return;
-  worker_->interface.add(identifier, std::move(handler));
-  worker_->wakeOrStart();
+  if (!options_.interfaceStateFile.empty())
+    add(worker_->interface, identifier, registrant, std::move(handler));
 }
 
-void LinuxOrientation::unregisterDeviceOrientationHandler(std::string_view identifier) {
-  if (worker_->device.remove(identifier)) worker_->wake();
+void LinuxOrientation::unregisterDeviceOrientationHandler(std::string_view identifier,
+                                                          const void* registrant) {
+  if (worker_->device.remove(identifier, registrant)) worker_->wake();
 }
 
-void LinuxOrientation::unregisterInterfaceOrientationHandler(std::string_view identifier) {
-  if (worker_->interface.remove(identifier)) worker_->wake();
+void LinuxOrientation::unregisterInterfaceOrientationHandler(std::string_view identifier,
+                                                             const void* registrant) {
+  if (worker_->interface.remove(identifier, registrant)) worker_->wake();
 }
 
 std::string LinuxOrientation::orientationText(int64_t orientation) {

@@ -25,19 +25,21 @@ std::string OrientationWords::textOf(int64_t value) {
   return index < words_.size() ? words_[index] : "unknown";
 }
 
-void OrientationHandlers::add(std::string_view identifier, Handler handler) {
+bool OrientationHandlers::add(std::string_view identifier, const void* registrant,
+                              Handler handler) {
   auto added = std::make_shared<Handler>(std::move(handler));  // afterwards the one it replaces
+  const std::pair key(std::string(identifier), registrant);
   MutexLock lock(mutex_);
-  handlers_[std::string(identifier)].swap(added);
+  if (handlers_.size() >= kMaxHandlers && !handlers_.contains(key)) return false;
+  handlers_[key].swap(added);
+  return true;
 }
 
-bool OrientationHandlers::remove(std::string_view identifier) {
+bool OrientationHandlers::remove(std::string_view identifier, const void* registrant) {
   Handlers::node_type removed;  // destroyed after the lock
   MutexLock lock(mutex_);
-  const auto found = handlers_.find(identifier);
-  if (found == handlers_.end()) return false;
-  removed = handlers_.extract(found);
-  return true;
+  removed = handlers_.extract({std::string(identifier), registrant});
+  return !removed.empty();
 }
 
 void OrientationHandlers::clear() {
@@ -58,7 +60,7 @@ void OrientationHandlers::report(const std::string& word) {
     const bool isChange = !last_.empty() && last_ != word;
     last_ = word;
     if (!isChange) return;
-    for (const auto& [identifier, handler] : handlers_) called.push_back(handler);
+    for (const auto& [key, handler] : handlers_) called.push_back(handler);
   }
   const int64_t value = words_.valueOf(word);
   for (const auto& handler : called) (*handler)(value);

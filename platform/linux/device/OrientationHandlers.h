@@ -6,6 +6,7 @@
 #include <memory>
 #include <string>
 #include <string_view>
+#include <utility>
 #include <vector>
 
 #include "base/Mutex.h"
@@ -29,17 +30,18 @@ class OrientationWords {
   std::vector<std::string> words_ GUARDED_BY(mutex_);  // index is the value
 };
 
-// The handlers, and the last word they could know. Thread-safe. As many handlers as there are
-// sessions that track orientation.
+// The handlers, and the last word they could know. Thread-safe; at most kMaxHandlers. A session
+// whose type was changed while it was started leaves its own behind for good.
 class OrientationHandlers {
  public:
   using Handler = OrientationNotifier::Handler;
+  static constexpr std::size_t kMaxHandlers = 4096;
 
   explicit OrientationHandlers(OrientationWords& words) : words_(words) {}
-  // Replaces the one of that name.
-  void add(std::string_view identifier, Handler handler);
-  // False when there is none of that name.
-  bool remove(std::string_view identifier);
+  // Replaces the one of that name and registrant. False: there are too many to take another.
+  bool add(std::string_view identifier, const void* registrant, Handler handler);
+  // False when there is none of that name and registrant.
+  bool remove(std::string_view identifier, const void* registrant);
   void clear();
   bool empty();
   // Calls the handlers, on this thread and without a lock, when the word is another than the last
@@ -49,7 +51,7 @@ class OrientationHandlers {
   void forgetLast();
 
  private:
-  using Handlers = std::map<std::string, std::shared_ptr<Handler>, std::less<>>;
+  using Handlers = std::map<std::pair<std::string, const void*>, std::shared_ptr<Handler>>;
 
   OrientationWords& words_;
   Mutex mutex_;

@@ -270,10 +270,10 @@ class NoChannels final : public ChannelReportService {
 class NoOrientation final : public OrientationNotifier {
  public:
   explicit NoOrientation(OrientationNotifier& live) : live_(live) {}
-  void registerDeviceOrientationHandler(std::string_view, Handler) override {}
-  void registerInterfaceOrientationHandler(std::string_view, Handler) override {}
-  void unregisterDeviceOrientationHandler(std::string_view) override {}
-  void unregisterInterfaceOrientationHandler(std::string_view) override {}
+  void registerDeviceOrientationHandler(std::string_view, const void*, Handler) override {}
+  void registerInterfaceOrientationHandler(std::string_view, const void*, Handler) override {}
+  void unregisterDeviceOrientationHandler(std::string_view, const void*) override {}
+  void unregisterInterfaceOrientationHandler(std::string_view, const void*) override {}
   std::string orientationText(int64_t orientation) override {
     return live_.orientationText(orientation);
   }
