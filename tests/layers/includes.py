@@ -20,7 +20,7 @@ ALLOWED = {  # layer -> prefixes of the headers it may include beside its own; t
     "tools": (*PURE, "client/"),
     **{f"platform/linux/{wing}": (*PURE, "platform/", *others) for wing, others in {
         "execution": (LINUX + "journal/",),
-        "settings": (),
+        "settings": (LINUX + "execution/",),
         "diagnostics": (LINUX + "execution/",),
         "device": (LINUX + "execution/",),
         "journal": (),

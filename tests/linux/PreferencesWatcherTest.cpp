@@ -73,9 +73,32 @@ TEST_F(PreferencesWatcherTest, SettlesBeforeItFires) {
   EXPECT_EQ(pass(100ms), before + 1);
   edit();
   EXPECT_EQ(pass(100ms), before + 2);
+}
+
+TEST_F(PreferencesWatcherTest, APostFiresOnceInWhateverStepsAndAlsoInAFolderThatCameAnew) {
+  start(PreferencesWatcher::openInotify());
   edit("notify/unheard");
+  EXPECT_EQ(pass(1s), 0);
   edit("notify/name");
-  EXPECT_GT(pass(0ms), before + 2);
+  watcher.onReadable();
+  std::filesystem::last_write_time(folder + "/notify/name", {});
+  EXPECT_EQ(pass(100ms), 1);
+  std::filesystem::remove_all(folder + "/notify");
+  EXPECT_EQ(pass(1s), 1);
+  edit("notify/name");  // before the folder is known
+  EXPECT_EQ(pass(100ms), 2);
+  edit("notify/name");
+  EXPECT_EQ(pass(100ms), 3);
+}
+
+TEST_F(PreferencesWatcherTest, WhatComesBesideOrAboveAMissingFolderIsNothingToIt) {
+  start(PreferencesWatcher::openInotify());
+  edit("other.toml");
+  EXPECT_EQ(pass(1s), 0);
+  std::filesystem::create_directory(folder + "/preferences");
+  EXPECT_EQ(pass(1s), 0) << "without the file";
+  edit();
+  EXPECT_EQ(pass(100ms), 1);
 }
 
 TEST_F(PreferencesWatcherTest, FollowsALinkToTheFileBehindIt) {

@@ -1,6 +1,5 @@
 #include "platform/linux/settings/PreferencesWatcher.h"
 
-#include <sys/inotify.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -15,12 +14,9 @@ namespace vx::lnx {
 
 namespace {
 
-constexpr uint32_t kFolderEvents = IN_CREATE | IN_MODIFY | IN_CLOSE_WRITE | IN_ATTRIB |
-                                   IN_MOVED_FROM | IN_MOVED_TO | IN_DELETE | IN_DELETE_SELF |
-                                   IN_MOVE_SELF | IN_ONLYDIR;
-constexpr uint32_t kAncestorEvents =
-    IN_CREATE | IN_MOVED_TO | IN_DELETE_SELF | IN_MOVE_SELF | IN_ONLYDIR;
-constexpr uint32_t kPostEvents = IN_CREATE | IN_ATTRIB | IN_CLOSE_WRITE | IN_MOVED_TO | IN_ONLYDIR;
+constexpr uint32_t kFolderEvents =
+    IN_CREATE | IN_MODIFY | IN_CLOSE_WRITE | IN_ATTRIB | IN_MOVED_FROM | IN_MOVED_TO | IN_DELETE;
+constexpr uint32_t kPostEvents = IN_CREATE | IN_ATTRIB | IN_CLOSE_WRITE | IN_MOVED_TO;
 constexpr std::chrono::seconds kLongestWait{2};  // however long the changes go on
 
 }  // namespace
@@ -31,7 +27,9 @@ PreferencesWatcher::PreferencesWatcher(std::string preferencesFolder, std::strin
     : folder_(std::move(preferencesFolder)),
       postFolder_(std::move(postFolder)),
       options_(options),
-      clock_(clock) {
+      clock_(clock),
+      folderWatch_(folder_, kFolderEvents),
+      postWatch_(postFolder_, kPostEvents) {
   for (Notification& notification : notifications) {
     Watched& watched = watched_.emplace_back();
     watched.notification = std::move(notification);
@@ -50,37 +48,33 @@ void PreferencesWatcher::start(Result<UniqueFd> inotify) {
   if (!inotify.ok()) return startPolling(std::strerror(inotify.status().code()));
   fd_ = std::move(*inotify);
   mkdir(postFolder_.c_str(), 0755);
-  postWatch_ = inotify_add_watch(fd_.get(), postFolder_.c_str(), kPostEvents);
-  if (postWatch_ < 0) {
-    VX_LOG(nullptr, Error, "notifications cannot be posted in %s: %s", postFolder_.c_str(),
-           std::strerror(errno));
-  }
-  watchFolders();
+  if (const Status posts = postWatch_.renew(fd_.get()); !posts.ok())
+    VX_LOG(nullptr, Error, "notifications cannot be posted: %s", posts.text().c_str());
+  watchFolder();
 }
 
-void PreferencesWatcher::watchFolders() {
-  watchFolder();
+void PreferencesWatcher::watchFolder() {
+  if (folderWatch_.renew(fd_.get()).code() == ENOSPC)
+    startPolling("no more watches allowed (fs.inotify.max_user_watches)");
   for (Watched& watched : watched_) followLink(watched);
 }
 
-// Watches the preferences folder, or as long as it is not there, the closest folder above it that
-// is.
-void PreferencesWatcher::watchFolder() {
-  folderWatch_ = inotify_add_watch(fd_.get(), folder_.c_str(), kFolderEvents);
-  if (folderWatch_ < 0 && errno == ENOSPC)
-    return startPolling("no more watches allowed (fs.inotify.max_user_watches)");
-  if (folderWatch_ >= 0) {
-    if (ancestorWatch_ >= 0) inotify_rm_watch(fd_.get(), ancestorWatch_);
-    ancestorWatch_ = -1;
-    return;
+// The folder came, went or was replaced, perhaps with a file in it.
+void PreferencesWatcher::onFolderMoved() {
+  watchFolder();
+  for (Watched& watched : watched_) {
+    if (signatureOf(watched) != watched.signature) changed(watched);
   }
-  std::filesystem::path ancestor = folder_;
-  do {
-    ancestor = ancestor.parent_path();
-    ancestorWatch_ = inotify_add_watch(fd_.get(), ancestor.c_str(), kAncestorEvents);
-  } while (ancestorWatch_ < 0 && ancestor.has_relative_path());
-  // Made between the two looks.
-  folderWatch_ = inotify_add_watch(fd_.get(), folder_.c_str(), kFolderEvents);
+}
+
+// Whoever made the folder anew may have posted there already.
+void PreferencesWatcher::onPostFolderMoved() {
+  if (!postWatch_.renew(fd_.get()).ok()) return;
+  for (Watched& watched : watched_) {
+    std::error_code failure;
+    if (std::filesystem::exists(postFolder_ + "/" + watched.notification.name, failure))
+      changed(watched);
+  }
 }
 
 // Looks again where the file really is.
@@ -91,8 +85,9 @@ void PreferencesWatcher::followLink(Watched& watched) {
   if (std::filesystem::is_symlink(path, failure)) real = std::filesystem::canonical(path, failure);
   int watch = -1;
   if (!real.empty() && !polling_) {
-    watch = inotify_add_watch(fd_.get(), real.parent_path().c_str(), kFolderEvents);
-    if (watch == folderWatch_) watch = -1;
+    watch = inotify_add_watch(fd_.get(), real.parent_path().c_str(),
+                              kFolderEvents | IN_ONLYDIR | IN_MASK_ADD);
+    if (watch == folderWatch_.id()) watch = -1;
   }
   if (watched.targetWatch >= 0 && watched.targetWatch != watch)
     inotify_rm_watch(fd_.get(), watched.targetWatch);
@@ -122,47 +117,32 @@ uint32_t PreferencesWatcher::registerHandler(std::string_view name, int& token,
 void PreferencesWatcher::onReadable() {
   thread_.assertHere();
   alignas(inotify_event) char buffer[4096];
-  bool foldersMoved = false;
+  bool folderMoved = false;
+  bool postFolderMoved = false;
   ssize_t got = 0;
   while ((got = read(fd_.get(), buffer, sizeof buffer)) > 0) {
     for (char* at = buffer; at < buffer + got;) {
       const auto* event = reinterpret_cast<const inotify_event*>(at);
       at += sizeof(inotify_event) + event->len;
-      foldersMoved = onEvent(*event) || foldersMoved;
+      folderMoved = folderMoved || folderWatch_.concerns(*event);
+      postFolderMoved = postFolderMoved || postWatch_.concerns(*event);
+      onEvent(*event);
     }
   }
-  if (!foldersMoved || polling_) return;
-  // The folder came, went or was replaced: its files may all be others now.
-  if (folderWatch_ >= 0) inotify_rm_watch(fd_.get(), folderWatch_);
-  folderWatch_ = -1;
-  watchFolders();
-  for (Watched& watched : watched_) changed(watched);
+  if (postFolderMoved) onPostFolderMoved();
+  if (folderMoved && !polling_) onFolderMoved();
 }
 
-bool PreferencesWatcher::onEvent(const inotify_event& event) {
+void PreferencesWatcher::onEvent(const inotify_event& event) {
   const std::string_view name = event.len > 0 ? event.name : "";
-  if (event.mask & IN_Q_OVERFLOW) {
-    for (Watched& watched : watched_) changed(watched);
-  } else if (event.wd == postWatch_) {
-    const bool known = std::any_of(registrations_.begin(), registrations_.end(),
-                                   [&](const Registration& r) { return r.name == name; });
-    if (known) fire(std::string(name));
-  } else if (event.mask & (IN_DELETE_SELF | IN_MOVE_SELF | IN_IGNORED)) {
-    return event.wd == folderWatch_ || event.wd == ancestorWatch_;
-  } else if (event.wd == folderWatch_) {
-    for (Watched& watched : watched_) {
-      if (name == watched.notification.fileName || (!name.empty() && name == watched.targetName))
-        changed(watched);
-    }
-  } else if (const auto target = std::find_if(
-                 watched_.begin(), watched_.end(),
-                 [&](const Watched& watched) { return watched.targetWatch == event.wd; });
-             target != watched_.end()) {
-    if (name == target->targetName) changed(*target);
-  } else {
-    return event.wd == ancestorWatch_;
+  for (Watched& watched : watched_) {
+    const bool posted = postWatch_.isOfFolder(event) && name == watched.notification.name;
+    const bool edited = folderWatch_.isOfFolder(event) && !name.empty() &&
+                        (name == watched.notification.fileName || name == watched.targetName);
+    const bool targetEdited =
+        event.wd == watched.targetWatch && !name.empty() && name == watched.targetName;
+    if (posted || edited || targetEdited || (event.mask & IN_Q_OVERFLOW) != 0) changed(watched);
   }
-  return false;
 }
 
 void PreferencesWatcher::changed(Watched& watched) {
@@ -206,6 +186,7 @@ void PreferencesWatcher::onDue() {
     if (now < watched.lastChange + options_.settle && now < *watched.firstChange + kLongestWait)
       continue;
     watched.firstChange.reset();
+    watched.signature = signatureOf(watched);
     followLink(watched);
     fire(watched.notification.name);
   }

@@ -13,9 +13,8 @@
 #include "base/ThreadChecker.h"
 #include "base/UniqueFd.h"
 #include "platform/Preferences.h"
+#include "platform/linux/execution/FolderWatch.h"
 #include "platform/linux/settings/PreferencesOptions.h"
-
-struct inotify_event;
 
 namespace vx::lnx {
 
@@ -23,7 +22,8 @@ namespace vx::lnx {
 // it has been left alone for the settle time (at the latest two seconds after the first change), so
 // never on a file that is being written. And it fires when a file of its own name is created or
 // touched in <runtime>/notify, which is how a tool posts it: `touch
-// /run/vxreporting/notify/com.quorvel.sonik.reporting`.
+// /run/vxreporting/notify/com.quorvel.sonik.reporting`. Tools differ in the steps in which they do
+// that, so a post settles as well. Either folder may come and go.
 //
 // Where the file is a symbolic link, the file that it leads to is watched as well.
 //
@@ -69,7 +69,7 @@ class PreferencesWatcher final : public SystemNotify {
     Notification notification;
     std::optional<Monotonic> firstChange;
     Monotonic lastChange{};
-    std::string signature;   // while polling: what the file looked like
+    std::string signature;   // what the file looked like
     int targetWatch = -1;    // the folder of the file that a link leads to, when it is another one
     std::string targetName;  // that file's name; empty while the file is no link
   };
@@ -80,12 +80,12 @@ class PreferencesWatcher final : public SystemNotify {
     std::shared_ptr<Function<void(int)>> handler;
   };
 
-  void watchFolders();
   void watchFolder();
+  void onFolderMoved();
+  void onPostFolderMoved();
   void followLink(Watched& watched);
   void startPolling(const char* why);
-  // True: a folder that is watched has come or gone.
-  bool onEvent(const inotify_event& event);
+  void onEvent(const inotify_event& event);
   void changed(Watched& watched);
   void fire(const std::string& name);
   std::string signatureOf(const Watched& watched) const;
@@ -103,9 +103,8 @@ class PreferencesWatcher final : public SystemNotify {
   std::vector<Registration> registrations_;  // a handful, made at start-up
   int nextToken_ = 1;
   UniqueFd fd_;
-  int folderWatch_ = -1;
-  int ancestorWatch_ = -1;
-  int postWatch_ = -1;
+  FolderWatch folderWatch_;
+  FolderWatch postWatch_;
   bool polling_ = false;
   Monotonic nextPoll_{};
 };
