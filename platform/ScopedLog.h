@@ -33,7 +33,8 @@ class ScopedLog {
                                         std::string_view domain, std::string_view verboseKey,
                                         uint32_t level) = 0;
   // Whether lines of that level are wanted. Level 5 is the verbose one: true while the scope's
-  // verbose preference is. A null scope stands for the default one.
+  // verbose preference is. A null scope stands for the default one, which has none: true where
+  // debug lines are written.
   virtual bool isLogEnabled(int level, const LogScope* scope) = 0;
 
   // Whether a line would be written at all; asked before its text is made. A null scope is the

@@ -3,6 +3,7 @@
 #include <algorithm>
 #include <array>
 #include <chrono>
+#include <map>
 #include <utility>
 
 #include "platform/Log.h"
@@ -37,6 +38,31 @@ std::chrono::nanoseconds nanoseconds(double seconds) {
       std::chrono::duration<double>(seconds));
 }
 
+// As Value::appendText, but dictionaries in the order of their keys: equal values, equal text.
+// Recursion ends with the nesting, which validation bounds.
+void appendKeyText(std::string& key, Value value) {
+  std::string_view separator;
+  if (value.isArray()) {
+    key += '(';
+    for (const Value element : value.asArray()) {
+      key += std::exchange(separator, ",");
+      appendKeyText(key, element);
+    }
+    key += ')';
+  } else if (value.isDictionary()) {
+    std::map<std::string_view, Value> sorted;
+    for (const auto& [name, entry] : value.asDictionary()) sorted.emplace(name, entry);
+    key += '{';
+    for (const auto& [name, entry] : sorted) {
+      ((key += std::exchange(separator, ",")) += name) += '=';
+      appendKeyText(key, entry);
+    }
+    key += '}';
+  } else {
+    value.appendText(key);
+  }
+}
+
 }  // namespace
 
 // ---------------------------------------------------------------------------------------------------------------------
@@ -68,7 +94,7 @@ std::string VXReportingBlockThrottle::buildMessageKey(const Payload& message, Re
     if (std::find(excluded.begin(), excluded.end(), name) != excluded.end())
       key += '^';
     else
-      value.appendText(key);
+      appendKeyText(key, value);
     key += '|';
   }
   key += "reporterID|" + std::to_string(reporter) + "|" + VXReportingCategoryName(category) + "|";
@@ -95,10 +121,9 @@ double VXReportingBlockThrottle::determineSleepTime(const Payload& message) {
 // ---------------------------------------------------------------------------------------------------------------------
 // One pending delivery
 
-void VXReportingBlockThrottleTimerWrapper::setBlock(Block block) {
-  auto shared = std::make_shared<Block>(std::move(block));
+void VXReportingBlockThrottleTimerWrapper::setBlock(std::shared_ptr<Block> block) {
   MutexLock lock(mutex_);
-  block_.swap(shared);  // the old one is destroyed after the lock
+  block_.swap(block);  // the old one is destroyed after the lock
 }
 
 void VXReportingBlockThrottleTimerWrapper::setTimer(std::shared_ptr<OneShotTimer> timer) {
@@ -160,42 +185,58 @@ void VXReportingBlockThrottle::addMessageBlock(Block block, ReporterID reporter,
                                                MessageType type) {
   const std::string key = buildMessageKey(message, reporter, category, type);
   const double delay = determineSleepTime(message);
-  if (const Wrapper duplicate = pending(key)) {
-    if (isVerbose()) VX_LOG(nullptr, Debug, "Dropping duplicate message for %s", key.c_str());
-    duplicate->sleepFor(delay);
-    duplicate->setBlock(std::move(block));
-    return;
+  auto shared = std::make_shared<Block>(std::move(block));
+  Wrapper duplicate = pending(key);
+  if (duplicate == nullptr) {
+    const auto wrapper = std::make_shared<VXReportingBlockThrottleTimerWrapper>();
+    wrapper->setBlock(shared);
+    wrapper->setTimer(platform().threading.makeTimer(
+        nanoseconds(delay),
+        [self = shared_from_this(), wrapper, key] { self->fire(wrapper, key); }));
+    duplicate = addIfAbsent(key, wrapper);
+    if (duplicate == nullptr) return;
+    wrapper->setTimer(nullptr);  // the timer's action holds the wrapper
   }
-  const auto wrapper = std::make_shared<VXReportingBlockThrottleTimerWrapper>();
-  wrapper->setBlock(std::move(block));
-  wrapper->setTimer(platform().threading.makeTimer(
-      nanoseconds(delay), [self = shared_from_this(), wrapper, key] { self->fire(wrapper, key); }));
+  if (isVerbose()) VX_LOG(nullptr, Debug, "Dropping duplicate message for %s", key.c_str());
+  duplicate->sleepFor(delay);
+  duplicate->setBlock(std::move(shared));
+}
+
+// The one that another thread has added meanwhile, if one has.
+VXReportingBlockThrottle::Wrapper VXReportingBlockThrottle::addIfAbsent(const std::string& key,
+                                                                        const Wrapper& wrapper) {
   {
     MutexLock lock(timersMutex_);
-    timersInFlight_[key] = wrapper;
+    const auto [place, added] = timersInFlight_.emplace(key, wrapper);
+    if (!added) return place->second;
   }
   MutexLock lock(unscheduledMutex_);
   unscheduledTimerKeys_.emplace_back(key, wrapper);
+  return nullptr;
 }
 
 void VXReportingBlockThrottle::fire(const Wrapper& wrapper, const std::string& key) {
-  // Whether or not the block throws: the entry goes, and a block that replaced it meanwhile with
-  // it.
-  struct CleanUp {
-    VXReportingBlockThrottle& throttle;
-    const std::string& key;
-    ~CleanUp() {
-      Wrapper removed;
-      MutexLock lock(throttle.timersMutex_);
-      const auto found = throttle.timersInFlight_.find(key);
-      if (found == throttle.timersInFlight_.end()) return;
-      if (const auto timer = found->second->timer()) timer->invalidate();
-      found->second->setTimer(nullptr);  // the timer's action holds the wrapper
-      removed = std::move(found->second);
-      throttle.timersInFlight_.erase(found);
-    }
-  } cleanUp{*this, key};
-  wrapper->runBlock();
+  // Caught, not left to a destructor: where nothing above catches it, an exception ends the process
+  // without unwinding.
+  try {
+    wrapper->runBlock();
+  } catch (...) {
+    removeFired(key);
+    throw;
+  }
+  removeFired(key);
+}
+
+// And with it a block that replaced the one that ran meanwhile.
+void VXReportingBlockThrottle::removeFired(const std::string& key) {
+  Wrapper removed;
+  MutexLock lock(timersMutex_);
+  const auto found = timersInFlight_.find(key);
+  if (found == timersInFlight_.end()) return;
+  if (const auto timer = found->second->timer()) timer->invalidate();
+  found->second->setTimer(nullptr);  // the timer's action holds the wrapper
+  removed = std::move(found->second);
+  timersInFlight_.erase(found);
 }
 
 void VXReportingBlockThrottle::attachUnscheduled(RunLoop& runLoop) {

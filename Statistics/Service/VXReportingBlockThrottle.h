@@ -22,7 +22,7 @@ class VXReportingBlockThrottleTimerWrapper {
  public:
   using Block = Function<void()>;
 
-  void setBlock(Block block);
+  void setBlock(std::shared_ptr<Block> block);
   void setTimer(std::shared_ptr<OneShotTimer> timer);
   std::shared_ptr<OneShotTimer> timer() const;
   // The timer's next fire time becomes now plus `seconds`.
@@ -77,7 +77,9 @@ class VXReportingBlockThrottle : public std::enable_shared_from_this<VXReporting
   VXReportingBlockThrottle() = default;
   void runThread();
   void attachUnscheduled(RunLoop& runLoop);
+  Wrapper addIfAbsent(const std::string& key, const Wrapper& wrapper);
   void fire(const Wrapper& wrapper, const std::string& key);
+  void removeFired(const std::string& key);
   Wrapper pending(const std::string& key) const;
 
   std::atomic<bool> shouldKeepRunning_{true};

@@ -106,6 +106,7 @@ class FakeThreading final : public Threading {
   std::unique_ptr<Condition> makeCondition() override { return std::make_unique<Waiting>(*this); }
   std::shared_ptr<OneShotTimer> makeTimer(std::chrono::nanoseconds delay,
                                           Function<void()> action) override {
+    if (const auto meanwhile = std::exchange(onMakeTimer, nullptr)) meanwhile();
     return std::make_shared<Timer>(clock_.steady + delay, std::move(action));
   }
   std::unique_ptr<RunLoop> makeRunLoop() override { return std::make_unique<Loop>(*this); }
@@ -129,8 +130,9 @@ class FakeThreading final : public Threading {
   void passTimeUntil(Monotonic when) {
     while (passEventBefore(when)) continue;
   }
-  Function<void()> threadBody;    // of the last thread started
-  std::function<void()> onSleep;  // before each sleep of a thread
+  Function<void()> threadBody;        // of the last thread started
+  std::function<void()> onSleep;      // before each sleep of a thread
+  std::function<void()> onMakeTimer;  // what another thread does while a timer is made, once
   std::vector<std::chrono::nanoseconds> sleeps;
   std::size_t freedBytes = 0;
 

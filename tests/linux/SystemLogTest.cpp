@@ -114,3 +114,6 @@ TEST_F(SystemLogTest, ScopesAreAsVerboseAsTheirKeys) {
 
 }  // namespace
 }  // namespace vx::lnx
+  log.configure({.level = LogOptions::Level::Debug});
+  EXPECT_TRUE(log.isLogEnabled(5, nullptr)) << "the default scope has no key";
+  EXPECT_FALSE(log.isLogEnabled(5, b));

@@ -1,5 +1,8 @@
 #include <cmath>
+#include <cstdlib>
+#include <exception>
 #include <stdexcept>
+#include <thread>
 
 #include "Statistics/Service/VXReportingBlockThrottle.h"
 #include "tests/statistics/ServiceFixture.h"
@@ -56,6 +59,11 @@ TEST_F(ThrottleTest, KeysTellMessagesApart) {
   EXPECT_NE(ignoring(levels, 1), key(dictionary("_comparison_field_blacklist", levels)));
   EXPECT_NE(ignoring("level", 1), ignoring("level", 2));
   EXPECT_THAT(ignoring(numbers, 1), HasSubstr("5|1")) << "a number is no key";
+  const auto nested = [&](const Payload& inner) {
+    return key(dictionary("d", dictionary("a", ArrayBuilder().add(inner).add("x"))));
+  };
+  EXPECT_EQ(nested(dictionary("p", 1, "q", 2)), nested(dictionary("q", 2, "p", 1)));
+  EXPECT_THAT(nested(dictionary("q", 2, "p", 1)), HasSubstr("d|{a=({p=1,q=2},x)}|"));
 }
 
 TEST_F(ThrottleTest, DelaysAreReadWithTheirAsymmetries) {
@@ -81,6 +89,16 @@ TEST_F(ThrottleTest, OnlyTheLastOfABurstRunsEachKeyAfterItsOwnDelay) {
   EXPECT_THAT(ran, ElementsAre("fast@250", "third@900", "slow@1500", "late@1600"));
 }
 
+TEST_F(ThrottleTest, OfTwoThatAddOneKeyAtOnceTheLaterRunsOnceAndNothingIsLeft) {
+  const auto held = std::make_shared<int>();
+  p.threading.onMakeTimer = [&] { addBlock([this, held] { ran.push_back("first"); }); };
+  addBlock([this, held] { ran.push_back("later"); });
+  EXPECT_EQ(throttle->unscheduledTimerKeys(), 1u);
+  work(2s);
+  EXPECT_THAT(ran, ElementsAre("later"));
+  EXPECT_EQ(held.use_count(), 1);
+}
+
 TEST_F(ThrottleTest, ZeroAndLessRunOnTheNextPassAndKeysMayComeAgain) {
   work(200ms);  // asleep between passes
   add("now", held(-1));
@@ -98,6 +116,13 @@ TEST_F(ThrottleTest, DuplicateDuringItsOwnBlockIsLostAndWhatItThrowsLeavesThroug
     add("never");
     throw std::runtime_error("block");
   });
+  static VXReportingBlockThrottle* ending;
+  ending = throttle.get();
+  const auto onThread = [this] {
+    std::set_terminate([] { std::_Exit(static_cast<int>(ending->timersInFlight())); });
+    std::thread([this] { work(2s); }).join();
+  };
+  EXPECT_EXIT(onThread(), testing::ExitedWithCode(0), "") << "the key goes before the process";
   EXPECT_THROW(work(2s), std::runtime_error);
   EXPECT_EQ(throttle->timersInFlight(), 0u);
   work(2s);

@@ -139,8 +139,8 @@ const LogScope* SystemLog::registerScope(bool enabled, uint32_t, std::string_vie
 
 bool SystemLog::isLogEnabled(int level, const LogScope* scope) {
   if (level < 5) return true;
-  return scope != nullptr &&
-         static_cast<const Scope*>(scope)->verbose.load(std::memory_order_relaxed);
+  if (scope == nullptr) return threshold_.load(std::memory_order_relaxed) <= rank(LogLevel::Debug);
+  return static_cast<const Scope*>(scope)->verbose.load(std::memory_order_relaxed);
 }
 
 bool SystemLog::wantsLine(const LogScope* scope, LogLevel level, const LogSite& site) {
