@@ -39,13 +39,15 @@ TEST_F(DriverTest, OnlyGrowthOfAtLeastOneIsReported) {
 }
 
 TEST_F(DriverTest, FailuresOfOneDriverLeaveTheOthersAlone) {
-  counters({{"Speaker/s", "broken"}, {"Haptics/Stats/h", "10"}});
+  counters({{"Speaker/s", "1"}, {"Haptics/Stats/h", "10"}});
   const VXReportingDriverUtility utility;
+  drivers.failNext = true;
   auto snapShot = utility.getSnapShot();
   EXPECT_EQ(snapShot->size(), 1u);
   EXPECT_EQ(p.log.lines.back(), "vxrd info sampling driver Haptics-Stats");
-  EXPECT_THAT(p.log.lines, Contains("vxrd error ChannelReportCreateSamples error 22"));
+  EXPECT_THAT(p.log.lines, Contains("vxrd error ChannelReportCreateSamples error 9"));
   drivers.write("Haptics/Stats/h", "12");
+  drivers.failNext = true;
   EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(snapShot)->text(), "{Haptics_Stats_h=2}");
   drivers.write("Speaker/s", "10");
   // Not in the snapshot: absolute values beside the others' differences.

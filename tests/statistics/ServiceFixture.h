@@ -50,13 +50,15 @@ class DriverChannels final : public lnx::Folder, public lnx::CounterChannels {
                                      const ChannelDictionaryRef& subscribed,
                                      std::optional<Error>& error) override {
     if (onSample) onSample();
-    return CounterChannels::createSamples(subscription, subscribed, error);
+    return CounterChannels::createSamples(std::exchange(failNext, false) ? nullptr : subscription,
+                                          subscribed, error);
   }
   std::optional<std::string_view> channelName(const ChannelSample& sample) override {
     return nameless ? std::nullopt : CounterChannels::channelName(sample);
   }
   std::function<void()> onSample;
   bool nameless = false;
+  bool failNext = false;
 };
 
 class PlatformTest : public ::testing::Test {

@@ -5,6 +5,7 @@
 #include <cstdint>
 #include <memory>
 #include <optional>
+#include <set>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -18,7 +19,8 @@ namespace vx::lnx {
 
 // <root>/<group>[/<subgroup>]/<channel>: one file per channel, decimal or 0x, with an optional
 // trailing newline. Mapped sources appear under the group and subgroup they are given.
-// Subscriptions are never taken back. Confined to the thread of the service queue; at most
+// A file that holds no number is left out and named in the log, once. Subscriptions are never taken
+// back. Confined to the thread of the service queue; at most
 // kMaxChannels channels per subscription, the rest are left out with a log line.
 class CounterChannels : public ChannelReportService {
  public:
@@ -50,6 +52,7 @@ class CounterChannels : public ChannelReportService {
   const DriverOptions options_;
   ThreadChecker thread_;
   std::vector<std::unique_ptr<ChannelSubscription>> subscriptions_ GUARDED_BY(thread_);
+  std::set<std::string> complainedOf_ GUARDED_BY(thread_);  // channels, so bounded by theirs
 };
 
 // A counter's text as a number: decimal with an optional sign, or 0x and hexadecimal digits, and at
