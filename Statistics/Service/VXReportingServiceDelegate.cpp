@@ -128,7 +128,8 @@ void VXReportingServiceDelegate::clientInvalidated(
   }
   VX_LOG_AS(kFunction, serverLogScope(), Default,
             "InvalidationHandler: connection exited process=%s uptime_sec=%d",
-            nameOrUnknown.c_str(), static_cast<int32_t>(seconds.value_or(-1)));
+            nameOrUnknown.c_str(),
+            static_cast<int32_t>(std::min<double>(seconds.value_or(-1), INT32_MAX)));
   if (!name) {
     VX_LOG_AS(kFunction, serverLogScope(), Default, "clientProcessName is nil. clientpid=%d", pid);
     return;

@@ -150,6 +150,11 @@ TEST_F(ClientTest, UptimeIsSentOnInvalidationOnlyAndOnce) {
   p.clock.advance(3s);
   connections[1]->invalidation();
   seen += told("nameless");
+  connect();
+  mark();
+  p.clock.advance(std::chrono::seconds(int64_t{1} << 32));
+  connections[2]->invalidation();
+  seen += told("after ages");
   auto unregistered = std::make_shared<fakes::FakeConnection>(200);
   service->listener(p.listener, unregistered);
   unregistered->invalidation();
