@@ -33,7 +33,7 @@ class DiagnosticFilesTest : public FolderTest {
 };
 
 TEST_F(DiagnosticFilesTest, NothingPlantedIsEverOpenedNorAnythingBesideTheLogs) {
-  EXPECT_EQ(modeOf(directory), 0777u);
+  EXPECT_EQ(modeOf(directory), 01777u);
   for (const char* name : {"", ".", "..", "../x", "a/b"}) EXPECT_EQ(create(name), nullptr) << name;
   for (const char* path : {"/log/../x", "/logs", "/log/Audio/../../x", "/elsewhere"})
     EXPECT_TRUE(files.createDirectory(folder + path, 0777)) << path;

@@ -156,6 +156,8 @@ Result<UniqueFd> LinuxDiagnosticFiles::openDirectory(const std::string& path,
 }
 
 std::optional<Error> LinuxDiagnosticFiles::createDirectory(const std::string& path, unsigned mode) {
+  // Where anybody may write, nobody may delete or replace what is another's.
+  if ((mode & S_IWOTH) != 0) mode |= S_ISVTX;
   const Result<UniqueFd> directory = openDirectory(path, static_cast<mode_t>(mode));
   if (!directory.ok()) return directory.status().error();
   removeLeftovers(directory->get(), path);

@@ -14,11 +14,12 @@
 
 namespace vx::lnx {
 
-// Everything below the logs directory is hostile ground: folders of mode 0777, in which anybody may
-// plant links, FIFOs or folders. Each component is opened by itself without following links, files
-// are made under a fresh random name (O_EXCL) and renamed over whatever stands there, so nothing
-// planted is ever opened, written or truncated. What a crash left half-written goes the first time
-// a folder is asked for. Thread-safe.
+// Everything below the logs directory is hostile ground: folders of mode 01777, in which anybody
+// may plant links, FIFOs or folders. Each component is opened by itself without following links,
+// files are made under a fresh random name (O_EXCL) and renamed over whatever stands there, so
+// nothing planted is ever opened, written or truncated. Where the name is another user's already,
+// the sticky bit makes that an error. What a crash left half-written goes the first time a folder
+// is asked for. Thread-safe.
 class LinuxDiagnosticFiles final : public DiagnosticFiles {
  public:
   explicit LinuxDiagnosticFiles(std::string logsDirectory)
