@@ -1,4 +1,6 @@
 #include <fcntl.h>
+#include <sys/socket.h>
+#include <sys/un.h>
 #include <time.h>
 #include <unistd.h>
 
@@ -69,6 +71,32 @@ TEST_F(SystemLogTest, ClientsCannotForgeALineAndAReaderThatStoppedCostsLinesAndN
   EXPECT_EQ(log.droppedLines(), 2u);
 }
 
+TEST_F(SystemLogTest, TheJournalGetsFieldsAndOneThatHangsCostsLinesAndNoTime) {
+  Folder folder;
+  sockaddr_un address{.sun_family = AF_UNIX, .sun_path = {}};
+  const std::string path = folder.folder + "/journal";
+  path.copy(address.sun_path, path.size());
+  const UniqueFd journald(socket(AF_UNIX, SOCK_DGRAM, 0));
+  ASSERT_EQ(bind(journald.get(), reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
+  log.configure({.destination = LogOptions::Destination::Auto, .journalSocket = path});
+  std::string text(1000, '\0');
+  const auto receive = [&] {
+    return text.substr(0, recv(journald.get(), text.data(), text.size(), MSG_DONTWAIT));
+  };
+  log.write(nullptr, LogLevel::Error, site, "a", 0);
+  EXPECT_EQ(receive(),
+            "MESSAGE=a\nPRIORITY=3\nSYSLOG_IDENTIFIER=vxreporting\nVX_SCOPE=default\n"
+            "CODE_FILE=F.cpp\nCODE_LINE=7\nCODE_FUNC=f\n");
+  log.write(nullptr, LogLevel::Error, site, "a\nb", 0);
+  EXPECT_THAT(receive(),
+              testing::StartsWith(std::string("MESSAGE\n\3\0\0\0\0\0\0\0a\nb\nPRI", 23)));
+  EXPECT_EQ(log.droppedLines(), 0u);
+  alarm(30);  // what waits here waits for ever
+  for (int i = 0; i < 2000; ++i) log.write(nullptr, LogLevel::Error, site, "hung", 0);
+  alarm(0);
+  EXPECT_GT(log.droppedLines(), 1000u);
+}
+
 TEST_F(SystemLogTest, LinesOfOneStatementAreLimitedCountedAndAllowedAgainAsSlowlyAsConfigured) {
   limit(3, 0.001);
   EXPECT_EQ(wanted(site, 10), 3);
@@ -105,6 +133,9 @@ TEST_F(SystemLogTest, ScopesAreAsVerboseAsTheirKeys) {
   EXPECT_FALSE(log.isLogEnabled(5, b));
   EXPECT_FALSE(log.isLogEnabled(5, nullptr));
   EXPECT_TRUE(log.isLogEnabled(4, nullptr));
+  log.configure({.level = LogOptions::Level::Debug});
+  EXPECT_TRUE(log.isLogEnabled(5, nullptr)) << "the default scope has no key";
+  EXPECT_FALSE(log.isLogEnabled(5, b));
   EXPECT_EQ(log.registerScope(false, 1, "off", "d", "k", 31), nullptr);
   services.preferences = {{"kb", "true"}};
   log.refreshVerbose();
@@ -114,6 +145,3 @@ TEST_F(SystemLogTest, ScopesAreAsVerboseAsTheirKeys) {
 
 }  // namespace
 }  // namespace vx::lnx
-  log.configure({.level = LogOptions::Level::Debug});
-  EXPECT_TRUE(log.isLogEnabled(5, nullptr)) << "the default scope has no key";
-  EXPECT_FALSE(log.isLogEnabled(5, b));

@@ -2,6 +2,7 @@
 #pragma once
 
 #include <cstdint>
+#include <string>
 
 namespace vx::lnx {
 
@@ -13,6 +14,7 @@ struct LogOptions {
   Level level = Level::Default;
   uint32_t burst = 100;         // lines of one log statement at once; 0: no limit
   double refillPerSecond = 10;  // and how fast its allowance comes back
+  std::string journalSocket = "/run/systemd/journal/socket";
 };
 
 }  // namespace vx::lnx

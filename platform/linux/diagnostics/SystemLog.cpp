@@ -1,17 +1,15 @@
 #include "platform/linux/diagnostics/SystemLog.h"
 
-// The lines bring their own CODE_FILE, CODE_LINE and CODE_FUNC; the header would add its caller's.
-#define SD_JOURNAL_SUPPRESS_LOCATION
-
 #include <poll.h>
-#include <sys/uio.h>
+#include <sys/socket.h>
+#include <sys/un.h>
 #include <syslog.h>
-#include <systemd/sd-journal.h>
 #include <time.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <climits>
+#include <cstring>
 #include <map>
 #include <memory>
 #include <vector>
@@ -22,7 +20,6 @@ namespace {
 
 constexpr std::size_t kMaxLineBytes = 16 << 10;
 constexpr uint32_t kClockWrap = UINT32_MAX - 60'000;
-constexpr const char* kJournalSocket = "/run/systemd/journal/socket";
 
 int rank(LogLevel level) {
   switch (level) {
@@ -74,6 +71,22 @@ void appendOnOneLine(std::string& line, std::string_view text) {
   }
 }
 
+// One field of a journal entry, as systemd's "Native Journal Protocol" has it: NAME=value and a
+// newline, or where the value has newlines NAME, a newline, its size in 64 bits with the lowest
+// byte first, the value and a newline.
+void appendField(std::string& entry, std::string_view name, std::string_view value) {
+  entry += name;
+  if (value.find('\n') == std::string_view::npos) {
+    entry += '=';
+  } else {
+    entry += '\n';
+    for (int shift = 0; shift < 64; shift += 8)
+      entry += static_cast<char>(uint64_t{value.size()} >> shift & 0xFF);
+  }
+  entry += value;
+  entry += '\n';
+}
+
 uint32_t coarseMilliseconds() {
   timespec now{};
   clock_gettime(CLOCK_MONOTONIC_COARSE, &now);
@@ -103,8 +116,11 @@ void SystemLog::configure(const LogOptions& options) {
   threshold_ = static_cast<int>(options.level);
   burst_ = std::min<uint32_t>(options.burst, UINT16_MAX);
   refillPerMs_ = options.refillPerSecond / 1000;
-  journal_ = options.destination == Log::Destination::Journal ||
-             (options.destination == Log::Destination::Auto && access(kJournalSocket, W_OK) == 0);
+  const bool journal = options.destination == Log::Destination::Journal ||
+                       (options.destination == Log::Destination::Auto &&
+                        access(options.journalSocket.c_str(), W_OK) == 0);
+  journalSocket_ = options.journalSocket;
+  journal_.reset(journal ? socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0) : -1);
 }
 
 // Opening a domain may log, and so ask for a scope: not under the lock.
@@ -203,20 +219,29 @@ void SystemLog::write(const LogScope* scope, LogLevel level, const LogSite& site
     }
     text = changed;
   }
-  if (!journal_.load(std::memory_order_relaxed))
-    return writeStderr(priority(level), scopeName, text);
+  if (!journal_) return writeStderr(priority(level), scopeName, text);
 
   // The line stays whole, prefix included: the same words are found wherever it went.
-  const std::string fields[] = {
-      "MESSAGE=" + std::string(text),           "PRIORITY=" + std::to_string(priority(level)),
-      "SYSLOG_IDENTIFIER=vxreporting",          "VX_SCOPE=" + std::string(scopeName),
-      std::string("CODE_FILE=") + site.file,    "CODE_LINE=" + std::to_string(site.line),
-      std::string("CODE_FUNC=") + site.function};
-  iovec parts[std::size(fields)];
-  for (std::size_t i = 0; i < std::size(fields); ++i) {
-    parts[i] = {const_cast<char*>(fields[i].data()), fields[i].size()};
-  }
-  if (sd_journal_sendv(parts, static_cast<int>(std::size(fields))) < 0) ++dropped_;
+  std::string entry;
+  appendField(entry, "MESSAGE", text);
+  appendField(entry, "PRIORITY", std::to_string(priority(level)));
+  appendField(entry, "SYSLOG_IDENTIFIER", "vxreporting");
+  appendField(entry, "VX_SCOPE", scopeName);
+  appendField(entry, "CODE_FILE", site.file);
+  appendField(entry, "CODE_LINE", std::to_string(site.line));
+  appendField(entry, "CODE_FUNC", site.function);
+  if (!sendToJournal(entry)) ++dropped_;
+}
+
+// By name each time, so that a journal that was restarted is found again. Never waits: a journal
+// that hangs leaves its socket full.
+bool SystemLog::sendToJournal(const std::string& entry) const {
+  sockaddr_un address{};
+  address.sun_family = AF_UNIX;
+  if (journalSocket_.size() >= sizeof address.sun_path) return false;
+  std::memcpy(address.sun_path, journalSocket_.data(), journalSocket_.size());
+  return sendto(journal_.get(), entry.data(), entry.size(), MSG_NOSIGNAL | MSG_DONTWAIT,
+                reinterpret_cast<const sockaddr*>(&address), sizeof address) >= 0;
 }
 
 void SystemLog::writeStderr(int linePriority, std::string_view scopeName, std::string_view text) {

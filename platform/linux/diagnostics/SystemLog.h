@@ -6,6 +6,7 @@
 #include <string>
 
 #include "base/Mutex.h"
+#include "base/UniqueFd.h"
 #include "platform/Preferences.h"
 #include "platform/ScopedLog.h"
 #include "platform/linux/diagnostics/LogOptions.h"
@@ -14,12 +15,13 @@ namespace vx::lnx {
 
 // Thread-safe. Owned by the platform. Lines of one statement are limited to a burst and a rate, so
 // that no client can flood the log or make the service pay for text that nobody reads; how many
-// were left out is said with the next line. Never waits for stderr: a line that its reader has no
-// room for is dropped and counted. On stderr control characters appear as \n, \t or \xNN, so that
-// text from a client cannot pass for a line, or a priority, of its own.
+// were left out is said with the next line. Never waits for stderr or the journal: a line that its
+// reader has no room for is dropped and counted. On stderr control characters appear as \n, \t or
+// \xNN, so that text from a client cannot pass for a line, or a priority, of its own.
 class SystemLog final : public ScopedLog {
  public:
   SystemLog();
+  // Before any other thread logs.
   void configure(const LogOptions& options);
   // Where the scopes' verbose preferences are, which are read at registration and by
   // refreshVerbose(). Must outlive this.
@@ -44,12 +46,14 @@ class SystemLog final : public ScopedLog {
     std::string verboseKey;
     std::atomic<bool> verbose{false};
   };
+  bool sendToJournal(const std::string& entry) const;
   void writeStderr(int priority, std::string_view scopeName, std::string_view text);
 
   std::atomic<int> threshold_;  // the lowest rank that is written
   std::atomic<uint32_t> burst_;
   std::atomic<double> refillPerMs_;
-  std::atomic<bool> journal_{false};
+  UniqueFd journal_;  // none: stderr
+  std::string journalSocket_;
   std::atomic<uint64_t> dropped_{0};
   std::atomic<Preferences*> preferences_{nullptr};
   Mutex mutex_;
