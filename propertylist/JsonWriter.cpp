@@ -212,11 +212,21 @@ class Emitter {
   void floating(const cbor::Head& head) {
     const double value = cbor::floatingOf(head);
     if (std::isfinite(value))
-      sink_.wrote(writeNumber(sink_.reserve(kMaxScalarText), head));
+      finite(head);
     else if (nonFinite_ == NonFinite::Refuse)
       sink_.put("null");
     else
       sink_.put(std::isnan(value) ? "\"NaN\"" : value > 0 ? "\"Infinity\"" : "\"-Infinity\"");
+  }
+
+  // Where other programs read it, 3.0 is not 3; people are shown the text of the value.
+  void finite(const cbor::Head& head) {
+    char* const begin = sink_.reserve(kMaxScalarText + 2);
+    char* end = writeNumber(begin, head);
+    const auto isDigit = [](char c) { return c >= '0' && c <= '9'; };
+    if (layout_ == Layout::Compact && std::all_of(begin + (*begin == '-' ? 1 : 0), end, isDigit))
+      end = std::copy_n(".0", 2, end);
+    sink_.wrote(end);
   }
 
   void newLine() {

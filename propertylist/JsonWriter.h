@@ -1,6 +1,6 @@
 // Streams JSON text (RFC 8259) of property lists: compact for the store, pretty for files. Constant
 // memory beyond the caller's buffer. Dates become text ("2026-11-21T03:46:00Z"), booleans true and
-// false, numbers their text as Value::appendText has it; keys are not sorted.
+// false, numbers their text as of Value, compact 3.0 apart from 3; keys are not sorted.
 #pragma once
 
 #include <cstddef>

@@ -26,7 +26,7 @@ TEST(JsonWriter, WritesEveryKind) {
       "b", false, "s", "\xC3\xBC", "t", PayloadDate{1363896240.5}, "a",
       ArrayBuilder().add(1).add("x").add(ArrayBuilder()), "n", dictionary("k", 1), "e", Payload());
   const std::string json =
-      R"({"i":-7,"u":18446744073709551615,"f":0.1,"d":0.1,"whole":100000,"b":false,)"
+      R"({"i":-7,"u":18446744073709551615,"f":0.1,"d":0.1,"whole":100000.0,"b":false,)"
       "\"s\":\"\xC3\xBC\","
       R"("t":"2013-03-21T20:04:00.5Z","a":[1,"x",[]],"n":{"k":1},"e":{}})";
   EXPECT_EQ(compact(payload), json);
