@@ -334,6 +334,17 @@ TEST_F(ConnectionTest, AnAbruptEndIsAnInterruptionAfterTheLastWholeFrame) {
   EXPECT_EQ(counted.abandonedCalls, 0U);
 }
 
+TEST_F(ConnectionTest, APeerThatDiesWhileItsRepliesWaitIsNoticed) {
+  options.maxUnreadReplyBytes = 10 * 8;  // bytes of one
+  connect();
+  peer.write(calls(kEcho, 1, 25));
+  peer.close();
+  run();
+  EXPECT_THAT(object->calls, SizeIs(25)) << "what it sent runs";
+  EXPECT_THAT(events, ElementsAre("interrupted", "invalidated"));
+  EXPECT_EQ(closes, 1);
+}
+
 TEST_F(ConnectionTest, EveryCallIsAnsweredOnceFromAnyThread) {
   options.maxCallsInFlight = 3;
   connect();

@@ -339,11 +339,9 @@ void SocketConnection::flush() {
   if (state_ == State::Closed) return;
   if (!replies_.empty()) {
     const bool wasFull = mustPause();
-    if (replies_.writeTo(socket_.get(), host_.clock()) == ReplyStream::Peer::Gone) {
-      // Whoever reads from it finds out; when nobody reads any more, this was the end.
-      if (state_ == State::Draining) closeNow();
-      return;
-    }
+    const ReplyStream::Peer peer = replies_.writeTo(socket_.get(), host_.clock());
+    if (peer == ReplyStream::Peer::Gone && state_ == State::Draining) return closeNow();
+    // Also of a peer that is gone: what it sent before still runs, and its end is read behind that.
     if (wasFull && !mustPause()) scheduleRead();
   }
   if (state_ == State::Draining && calls_.inFlight() == 0 && replies_.empty()) return closeNow();
