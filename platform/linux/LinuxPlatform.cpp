@@ -145,7 +145,8 @@ class RunningPlatform final : public LinuxPlatform {
     store_->setEndWord(endWordOf);
     crashSafety_.emplace(
         CrashSafety::Means{clock_, executor_, loop_, listener_, *store_, aggregates_}, journals);
-    relay_.emplace(backends(), [this](Function<void()> job) { store_->runSoon(std::move(job)); });
+    relay_.emplace(backends(),
+                   [this](Function<void()> job) { executor_.runPromptly(std::move(job)); });
     services_.emplace(Platform{
         .serviceListener = listener_,
         .workQueues = executor_,

@@ -117,6 +117,10 @@ TEST_F(ExecutorTest, BlockedQueuesDelayNobodyAndLowWaterIsToldWhenTheyGoOn) {
   const Queue other = utility();
   other->async([&] { served.count_down(); });
   served.wait();
+  for (int i = 0; i < 2; ++i) executor.background().async([&] { release.wait(); });
+  std::latch prompt(1);
+  executor.runPromptly([&] { prompt.count_down(); });
+  prompt.wait();  // with every other thread held up
   EXPECT_GE(executor.utilityBacklog(), 200u);
   EXPECT_EQ(done + told, 0);
   release.count_down();

@@ -2,12 +2,15 @@
 
 #include <utility>
 
+#include "platform/linux/execution/WorkItem.h"
+
 namespace vx::lnx {
 
 Executor::Executor()
     : interactive_(std::make_shared<Lane>(LaneOptions{"vx-interactive", 0, 0})),
       utility_(std::make_shared<Lane>(LaneOptions{"vx-utility", 5, 1})),
       background_(std::make_shared<Lane>(LaneOptions{"vx-background", 10, 2})),
+      prompt_(std::make_shared<Lane>(LaneOptions{"vx-prompt", 0, 1})),
       concurrent_(background_, "com.quorvel.sonik.background") {}
 
 const std::shared_ptr<Lane>& Executor::lane(QualityOfService quality) const {
@@ -35,6 +38,11 @@ void Executor::withoutCause(const Work& work) {
   work();
 }
 
+void Executor::runPromptly(Work work) {
+  const NoCause own;
+  prompt_->postConcurrent(new WorkItem(std::move(work)));
+}
+
 void Executor::setInteractiveWaker(Function<void()> wake) {
   interactive_->setWaker(std::move(wake));
 }
@@ -52,6 +60,7 @@ void Executor::stop(Monotonic deadline) {
   utility_->stop(deadline);
   background_->stop(deadline);
   interactive_->stop(deadline);
+  prompt_->stop(deadline);
 }
 
 }  // namespace vx::lnx

@@ -43,6 +43,10 @@ class Executor final : public WorkQueues {
   void beginBlocking() override { Lane::beginBlocking(); }
   void endBlocking() override { Lane::endBlocking(); }
 
+  // Runs short work that a thread waits for a limited time for: on a thread that runs nothing else,
+  // until stop(), and for no call's sake.
+  void runPromptly(Work work);
+
   // --- the interactive lane, for the event loop ---
   // Names the calling thread the interactive one.
   void adoptInteractiveThread() { interactive_->adoptThread(); }
@@ -83,6 +87,7 @@ class Executor final : public WorkQueues {
   const std::shared_ptr<Lane> interactive_;
   const std::shared_ptr<Lane> utility_;
   const std::shared_ptr<Lane> background_;
+  const std::shared_ptr<Lane> prompt_;
   ConcurrentQueue concurrent_;
 };
 

@@ -62,8 +62,6 @@ class LocalStore final : public AnalyticsEventService, public PowerEventLog {
   void logRegisteredEvent(int64_t clientIdentifier, std::string_view eventName,
                           const Payload& record, const Payload* options) override;
 
-  // Runs a job on the writer's thread, before anything that waits to be written.
-  void runSoon(Function<void()> job) { writer_.queue().runSoon(std::move(job)); }
   // What waits is committed as soon as it can be. `committed`: told then, on the writer's thread.
   void commitSoon(Function<void()> committed = nullptr) {
     FlushHandler flushed = [committed = std::move(committed)](const std::optional<Error>& error) {

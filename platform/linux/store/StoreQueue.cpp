@@ -168,17 +168,16 @@ bool StoreQueue::release(std::size_t bytes) {
   return true;
 }
 
-StoreQueue::Retry StoreQueue::waitBeforeRetry(Monotonic until) {
+bool StoreQueue::waitBeforeRetry(Monotonic until) {
   MutexLock lock(mutex_);
   for (;;) {
-    if (!jobs_.empty()) return Retry::JobsFirst;
     const Monotonic time = clock_.monotonic();
     if (closing_) {
-      if (time >= closeDeadline_) return Retry::NoMore;
+      if (time >= closeDeadline_) return false;
       wake_.waitUntil(mutex_, steady(std::min(closeDeadline_, time + kRetryWhileClosing)));
-      return Retry::Now;
+      return true;
     }
-    if (time >= until) return Retry::Now;
+    if (time >= until) return true;
     wake_.waitUntil(mutex_, steady(until));
   }
 }

@@ -78,13 +78,9 @@ class StoreQueue {
   std::vector<Function<void()>> takeJobs();
   // Bytes of a batch that are committed or lost. True: the queue was congested and no longer is.
   bool release(std::size_t bytes);
-  enum class Retry : uint8_t {
-    Now,
-    JobsFirst,  // runSoon() has some; then ask again
-    NoMore,     // closed, and its deadline has passed
-  };
-  // Waits until `until`, or for a shorter while when closed.
-  Retry waitBeforeRetry(Monotonic until);
+  // Waits until `until`, or for a shorter while when closed. False: closed, and its deadline has
+  // passed.
+  bool waitBeforeRetry(Monotonic until);
 
  private:
   void abandonAll();

@@ -137,7 +137,7 @@ Status StoreWriter::begin() {
   }
   if (unchecked_.database == nullptr) unchecked_ = beginning_->open(notes);
   if (unchecked_.status.ok()) {
-    // It may take long: who waits for an answer gets it meanwhile, and a stop need not wait.
+    // It may take long: the writer lets others go first meanwhile, and a stop need not wait.
     unchecked_ = beginning_->check(std::move(unchecked_), notes, [this] {
       ++progress_;
       runJobs();
@@ -195,7 +195,6 @@ void StoreWriter::writeBatch(StoreBatch& batch) {
     if (written.ok()) {
       onCommitted(batch, first, written->last);
       first = written->last;
-      runJobs();
     } else if (!waitBeforeRetry(written.status())) {
       onLost(batch, first, written.status());
       break;
@@ -334,18 +333,7 @@ bool StoreWriter::waitBeforeRetry(const Status& failure) {
            beginning_->path().c_str(), failure.text().c_str());
   }
   backoff_ = std::clamp(backoff_ * 2, kFirstBackoff, kLastBackoff);
-  const Monotonic until = clock_.monotonic() + backoff_;
-  for (;;) {
-    runJobs();
-    switch (queue_.waitBeforeRetry(until)) {
-      case StoreQueue::Retry::Now:
-        return true;
-      case StoreQueue::Retry::NoMore:
-        return false;
-      case StoreQueue::Retry::JobsFirst:
-        break;
-    }
-  }
+  return queue_.waitBeforeRetry(clock_.monotonic() + backoff_);
 }
 
 void StoreWriter::add(std::vector<LedgerNote> notes) {
