@@ -54,6 +54,26 @@ class Service(DaemonTest):
         self.assertEqual((*power[:2], json.loads(power[2])), (
             28, "Lumo_Haptics", {"EngineOnDuration": 3, "ApplicationName": "Unknown", "TimestampEnd": 1.5}))
 
+    def test_what_is_listed_twice_or_named_0_and_a_start_of_a_session_of_others(self):
+        d = self.daemon()
+        owner, other = d.client(), d.client()
+        owner.call(CREATE, 0)
+        owner.call(CREATE, 7)
+        owner.call(CREATE, 9)
+        stopped, left = other.post(START, 7), other.post(START, 9)
+        self.assertEqual(other.call(REPORTERS), [0, 7, 9])
+        self.assertIs(owner.call(START, 0), True)
+        self.assertIs(owner.call(DESTROY, 0), True)
+        self.assertIsNone(other.call(SEND, {"a": 1}, 3, 1, [7, 0, 7]))
+        self.assertIs(owner.call(STOP, 7), True)
+        self.assertEqual(other.answer(stopped)[2], True)
+        self.assertEqual(other.call(REPORTERS), [0, 7, 9])
+        owner.close()
+        self.assertEqual(other.answer(left)[0:3], [ERROR, left, 8])
+        self.assertEqual(other.call(REPORTERS), [])
+        self.assertEqual(d.stop(), 0)
+        self.assertEqual(d.rows("SELECT count(*) FROM relay_messages WHERE category = 3"), [(2,)])
+
     def test_two_hundred_clients_at_once_a_small_queue_and_sessions_open_at_the_end(self):
         clients, messages = 200, 20
         d = self.daemon(config="[store]\nqueue_bytes = 65536\n")  # reading pauses, and nothing is lost

@@ -129,7 +129,8 @@ TEST_F(ConnectionTest, TheFirstFrameIsAHelloOfThisVersion) {
   EXPECT_EQ(counted.unsupportedVersions, 2U);
   EXPECT_EQ(counted.malformedFrames, 2U);
   connect();
-  EXPECT_THAT(ask(frame(0, 1)), IsEmpty()) << "a second hello is ignored";
+  for (const Bytes& second : {frame(0, 1), frame(0, 2), frame(0)})
+    EXPECT_THAT(ask(second + frame(1, 1, kEcho, 1)), ElementsAre("2 1 1")) << "ignored";
 }
 
 TEST_F(ConnectionTest, FramesUpToTheLimit) {
@@ -166,6 +167,7 @@ TEST_F(ConnectionTest, WrongCallsAreAnsweredAndDoNothing) {
       {frame(1, 1, kEcho, 1, 2), "3 1 4"},
       {frame(1, 1, 0, 0), "3 1 3"},
       {frame(1, 1, kMessage + 1, 0), "3 1 3"},
+      {frame(1, 1, Bytes{0x1b, 0x80, 0, 0, 0, 0, 0, 0, 0}, 0), "3 1 3"},
       {frame(1, 1, kMessage, nullptr), "3 1 4"},
       {frame(1, 1, kMessage, entry), "2 1 {a=1}"},
       {frame(1, 1, kAcquire, 1), "2 1 1"},
@@ -180,9 +182,9 @@ TEST_F(ConnectionTest, WrongCallsAreAnsweredAndDoNothing) {
   EXPECT_THAT(object->calls, ElementsAre("take 65535 4294967295 {a=1} { 1, -1 }", "echo 1",
                                          "echo 2", "echo 2", "echo 1", "echo 3"));
   EXPECT_EQ(counted.wrongArguments, 8U);
-  EXPECT_EQ(counted.unknownOperations, 2U);
+  EXPECT_EQ(counted.unknownOperations, 3U);
   EXPECT_EQ(counted.tooManySessions, 1U);
-  EXPECT_EQ(counted.calls, 19U);
+  EXPECT_EQ(counted.calls, 20U);
 }
 
 TEST_F(ConnectionTest, ReadsNoMoreWhileTooManyCallsAreUnanswered) {
@@ -332,6 +334,19 @@ TEST_F(ConnectionTest, AnAbruptEndIsAnInterruptionAfterTheLastWholeFrame) {
   run();
   EXPECT_EQ(closes, 1);
   EXPECT_EQ(counted.abandonedCalls, 0U);
+}
+
+TEST_F(ConnectionTest, APeerThatOnlyReadsGetsItsAnswersAfterTheInterruption) {
+  connect();
+  send(calls(kHold, 1, 1) + calls(kKeep, 2, 2));
+  shutdown(peer.fd(), SHUT_WR);
+  run();
+  EXPECT_THAT(answers(), IsEmpty());
+  EXPECT_THAT(events, ElementsAre("interrupted", "invalidated"));
+  EXPECT_FALSE(peer.ended());
+  answer(1);
+  EXPECT_THAT(answers(), ElementsAre("2 2 1"));
+  EXPECT_TRUE(peer.ended()) << "held answers are not waited for";
 }
 
 TEST_F(ConnectionTest, APeerThatDiesWhileItsRepliesWaitIsNoticed) {

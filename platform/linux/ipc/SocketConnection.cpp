@@ -178,6 +178,7 @@ void SocketConnection::runFrame(std::span<const uint8_t> body) {
 }
 
 void SocketConnection::runHello(const Frame& frame) {
+  if (helloSeen_) return;  // whatever it says
   const std::optional<int64_t> version = frame.size() < 2 ? std::nullopt : readInteger(frame[1]);
   if (version != wire::kProtocolVersion) {
     ++host_.counters().unsupportedVersions;
@@ -185,7 +186,6 @@ void SocketConnection::runHello(const Frame& frame) {
                                                    std::to_string(wire::kProtocolVersion) +
                                                    " of the protocol");
   }
-  if (helloSeen_) return;
   helloSeen_ = true;
   replies_.hello(interface_->name, host_.limits());
   wantFlush();
@@ -201,6 +201,8 @@ void SocketConnection::runCall(const Frame& frame) {
   if (frame.size() >= wire::kCallHead) {
     number = readInteger(frame[1]);
     operationNumber = readInteger(frame[2]);
+    // A number as good as any other, and none of an operation.
+    if (frame[2].kind() == ValueKind::Unsigned) operationNumber = INT64_MAX;
   }
   if (!number || *number < 0 || !operationNumber)
     return failMalformed("a call is [1, number, operation, argument...]");
@@ -209,7 +211,7 @@ void SocketConnection::runCall(const Frame& frame) {
       static_cast<uint64_t>(*operationNumber) > interface_->operations.size()) {
     ++host_.counters().unknownOperations;
     return sendError(callNumber, WireError::UnknownOperation,
-                     "there is no operation " + std::to_string(*operationNumber));
+                     "there is no operation " + frame[2].text());
   }
   const OperationDescription& operation =
       interface_->operations[static_cast<std::size_t>(*operationNumber - 1)];
