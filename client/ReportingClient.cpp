@@ -179,14 +179,20 @@ ClientStatus ReportingClient::getAllReportersAsync(Callback<std::vector<int64_t>
       *connection_, Operation::GetAllReporters, 0, [](CborWriter&) {}, std::move(done));
 }
 
-ClientStatus ReportingClient::killService() {
-  const ClientStatus taken = call(
-      *connection_, Operation::KillService, 0, [](CborWriter&) {}, std::monostate());
-  return taken.ok() ? flush() : taken;
-}
-
 // ---------------------------------------------------------------------------------------------------------------------
 // Blocking
+
+ClientStatus ReportingClient::killService(std::chrono::milliseconds patience) {
+  bool sent = false;
+  const ClientResult<bool> ended = blocking<bool>(*connection_, patience, [&](Callback<bool> done) {
+    const ClientStatus taken = call(
+        *connection_, Operation::KillService, 0, [](CborWriter&) {}, std::move(done));
+    const ClientStatus written = taken.ok() ? flush() : taken;
+    sent = written.ok();
+    return written;
+  });
+  return sent && ended.status.code == Code::Disconnected ? ClientStatus() : ended.status;
+}
 
 ClientResult<bool> ReportingClient::createReportingSession(int64_t reporterID,
                                                            std::chrono::milliseconds patience) {

@@ -130,10 +130,10 @@ class ReportingClient {
   ClientStatus destroyReportingSessionAsync(int64_t reporterID, Callback<bool> done);
   ClientStatus validateReporterAsync(int64_t reporterID, Callback<ReporterValidation> done);
   ClientStatus getAllReportersAsync(Callback<std::vector<int64_t>> done);
-  // Ends the daemon. There is no answer; the connection ends.
-  ClientStatus killService();
 
   // --- blocking, for scripts and tests ---
+  // Ends the daemon, and with it the connection: there is no answer but a refusal.
+  ClientStatus killService(std::chrono::milliseconds patience = kDefaultPatience);
   ClientResult<bool> createReportingSession(int64_t reporterID,
                                             std::chrono::milliseconds patience = kDefaultPatience);
   ClientResult<bool> setServiceType(uint16_t serviceType, int64_t reporterID,

@@ -144,6 +144,8 @@ struct OperationDescription {
   // Whether its work may be long: then it runs before the peer's next call is looked at. Null:
   // never.
   bool (*isHeavy)(const CallArguments& arguments) = nullptr;
+  // For the users whom the connection's configuration names; others get an error.
+  bool privileged = false;
 };
 
 // Operations are numbered from 1 in declaration order on the wire. Each has one dictionary at most

@@ -32,6 +32,7 @@ enum class ErrorCode : uint8_t {
   TooManyConnections = 6,
   UnsupportedVersion = 7,
   Abandoned = 8,
+  NotPermitted = 10,
 };
 
 }  // namespace vx::wire

@@ -128,7 +128,8 @@ constexpr std::array<OperationDescription, 11> kOperations = {{
      .reply = ReplyKind::Boolean,
      .recorded = false,
      .invoke = [](ExportedObject& object, CallArguments&,
-                  Reply reply) { service(object).killService(booleanReply(std::move(reply))); }},
+                  Reply reply) { service(object).killService(booleanReply(std::move(reply))); },
+     .privileged = true},
 }};
 
 }  // namespace

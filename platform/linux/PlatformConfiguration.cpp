@@ -1,5 +1,6 @@
 #include "platform/linux/PlatformConfiguration.h"
 
+#include <pwd.h>
 #include <toml++/toml.h>
 
 #include <algorithm>
@@ -154,6 +155,27 @@ class Section {
         out.push_back(name);
     }
   }
+  // Numbers and names; what is no user is complained of.
+  void users(const char* key, std::vector<uid_t>& out) {
+    const toml::node* node = find(key);
+    if (node == nullptr) return;
+    const toml::array* array = node->as_array();
+    if (array == nullptr) return complain(key, *node, "must be an array of users");
+    out.clear();
+    for (const toml::node& element : *array) {
+      const auto number = element.value_exact<int64_t>();
+      const auto name = element.value_exact<std::string>();
+      const passwd* const user = name ? getpwnam(name->c_str()) : nullptr;
+      if (user != nullptr)
+        out.push_back(user->pw_uid);
+      else if (number && *number >= 0 && *number < UINT32_MAX)
+        out.push_back(static_cast<uid_t>(*number));
+      else
+        complain(key, element,
+                 name ? "there is no user \"" + *name + "\""
+                      : "must hold names and numbers of users only");
+    }
+  }
   const toml::node* find(const char* key) {
     known_.insert(key);
     return table_.get(key);
@@ -212,6 +234,7 @@ class Reader {
       s.integer("max_frame_bytes", l.maxFrameBytes, 1024, ListenerOptions::kLargestFrameBytes);
       s.integer("max_unread_reply_bytes", l.maxUnreadReplyBytes, 4096, 64 << 20);
       s.milliseconds("stalled_client_timeout_ms", l.stalledClientTimeout, 10, 3600000);
+      s.users("kill_allowed_users", l.killAllowedUsers);
     });
     section("drivers", [&](Section& s) {
       s.text("root", c.drivers.root);

@@ -155,8 +155,13 @@ TEST_F(ReportingClientTest, EveryBlockingFormMakesItsCallAndReadsItsAnswer) {
   EXPECT_EQ(refused.wireCode, 5);
   client->startReportingSession(7, nullptr);
   client->sendMessageAsync(Payload(), 1, 1, std::vector<int64_t>{});  // not the same as without
+  service.write(frame(3, 20, 10, "not for you"));
+  EXPECT_EQ(client->killService().text, "not for you");
+  shutdown(service.fd(), SHUT_WR);
   EXPECT_TRUE(client->killService().ok());
-  EXPECT_THAT(service.texts(), ElementsAre("1 17 1 1", "1 18 5 7", "1 19 6 {} 1 1 ()", "1 20 11"));
+  EXPECT_THAT(service.texts(),
+              ElementsAre("1 17 1 1", "1 18 5 7", "1 19 6 {} 1 1 ()", "1 20 11", "1 21 11"));
+  EXPECT_FALSE(client->killService().ok()) << "nobody was told";
 }
 
 TEST_F(ReportingClientTest, CallsUpToTheLimits) {

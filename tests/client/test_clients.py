@@ -49,6 +49,12 @@ class ClientsTest(DaemonTest):
                            '"HostApplicationDisplayID":"org.example.shell"}',)])
 
     def test_vxreport_says_what_is_wrong(self):
+        strict = self.daemon(config="[listener]\nkill_allowed_users = []\n")
+        refused = run(strict, VXREPORT, "kill")
+        self.assertEqual(refused.returncode, 1)
+        self.assertIn("kill_allowed_users", refused.stderr)
+        self.assertEqual(strict.stop(), 0)
+        self.assertIn("not_permitted=1", strict.log())
         daemon = self.daemon()
         self.assertEqual(run(daemon, VXREPORT, "type", "7", "65536").returncode, 2)
         self.assertIn("cannot use: fly 7", run(daemon, VXREPORT, "script", stdin="fly 7\n").stderr)

@@ -166,7 +166,7 @@ TEST_F(ConnectionTest, WrongCallsAreAnsweredAndDoNothing) {
       {frame(1, 1, kTake, 1, 1, empty, Bytes{0x82, 0x61, 'x', 1}), "3 1 4"},
       {frame(1, 1, kEcho, 1, 2), "3 1 4"},
       {frame(1, 1, 0, 0), "3 1 3"},
-      {frame(1, 1, kMessage + 1, 0), "3 1 3"},
+      {frame(1, 1, kEnd + 1, 0), "3 1 3"},
       {frame(1, 1, Bytes{0x1b, 0x80, 0, 0, 0, 0, 0, 0, 0}, 0), "3 1 3"},
       {frame(1, 1, kMessage, nullptr), "3 1 4"},
       {frame(1, 1, kMessage, entry), "2 1 {a=1}"},
@@ -185,6 +185,17 @@ TEST_F(ConnectionTest, WrongCallsAreAnsweredAndDoNothing) {
   EXPECT_EQ(counted.unknownOperations, 3U);
   EXPECT_EQ(counted.tooManySessions, 1U);
   EXPECT_EQ(counted.calls, 20U);
+}
+
+TEST_F(ConnectionTest, WhoMayCallAPrivilegedOperationIsConfigured) {
+  for (const bool allowed : {false, true}) {
+    if (allowed) options.killAllowedUsers.push_back(501);
+    connect();
+    EXPECT_EQ(ask(frame(1, 1, kEnd)).empty(), allowed);
+    EXPECT_EQ(object->calls.size(), allowed ? 1U : 0U);
+    EXPECT_EQ(counted.notPermitted, 1U);
+    object->kept.clear();
+  }
 }
 
 TEST_F(ConnectionTest, ReadsNoMoreWhileTooManyCallsAreUnanswered) {

@@ -16,7 +16,7 @@
 
 namespace vx::lnx {
 
-enum : uint8_t { kEcho = 1, kKeep, kHold, kAcquire, kRelease, kList, kTake, kMessage };
+enum : uint8_t { kEcho = 1, kKeep, kHold, kAcquire, kRelease, kList, kTake, kMessage, kEnd };
 
 struct TestObject final : ExportedObject {
   std::vector<std::string> calls;    // operation and arguments
@@ -64,7 +64,7 @@ inline const InterfaceDescription& testInterface() {
   static constexpr std::array kInteger = {Int64};
   static constexpr std::array kAll = {UInt16, UInt32, OptionalDictionary, OptionalInt64Array};
   static constexpr std::array kDictionary = {Dictionary};
-  static constexpr std::array<OperationDescription, 8> kOperations = {{
+  static constexpr std::array<OperationDescription, 9> kOperations = {{
       {"echo", kInteger, ReplyKind::Boolean, false, None, true, Object::runEcho, nullptr},
       {"keep", kInteger, ReplyKind::Boolean, false, None, true, Object::runKeep, nullptr},
       {"hold", kInteger, ReplyKind::Boolean, true, None, true, Object::runKeep, nullptr},
@@ -81,6 +81,7 @@ inline const InterfaceDescription& testInterface() {
       {"take", kAll, ReplyKind::OptionalError, false, None, true, Object::runTake, nullptr},
       {"message", kDictionary, ReplyKind::Dictionary, false, None, true, Object::runMessage,
        nullptr},
+      {"end", {}, ReplyKind::Boolean, false, None, true, Object::runKeep, nullptr, true},
   }};
   static constexpr InterfaceDescription kInterface{.name = "Test", .operations = kOperations};
   return kInterface;

@@ -30,12 +30,15 @@ TEST_F(ConfigurationTest, ComplaintsNameFileLineAndKeyAndDefaultsStay) {
                            "[store]\nmax_bytes = \"64MiB\"\nqueue_bytes = -1\n"
                            "[log]\nlevel = \"loud\"\nburst = 5\n[typo]\n"
                            "[[drivers.mapped]]\ngroup = \"G\"\npath = \"/p\"\n"
-                           "[relay]\nbackends = [\"cloud\", \"store\", \"store\"]\n"),
+                           "[relay]\nbackends = [\"cloud\", \"store\", \"store\"]\n"
+                           "[listener]\nkill_allowed_users = [7, \"root\", \"x y\", -1]\n"),
               ElementsAre(file + "2: device.internal_build: must be true or false",
                           HasSubstr(file + "8: log.level: must be one of"),
                           AllOf(HasSubstr(file + "15: relay.backends: "), HasSubstr("cloud"),
                                 HasSubstr("\"store\"")),
                           HasSubstr(file + "6: store.queue_bytes: must be"),
+                          file + "17: listener.kill_allowed_users: there is no user \"x y\"",
+                          HasSubstr(file + "17: listener.kill_allowed_users: must hold"),
                           file + "10: typo: unknown key"));
   EXPECT_FALSE(configuration.device.internalBuild);
   EXPECT_EQ(configuration.device.deviceClassNumber, 6);
@@ -43,6 +46,7 @@ TEST_F(ConfigurationTest, ComplaintsNameFileLineAndKeyAndDefaultsStay) {
   EXPECT_EQ(configuration.log.burst, 5u);
   EXPECT_THAT(configuration.drivers.mapped, SizeIs(1));
   EXPECT_THAT(configuration.relay.backends, ElementsAre("store"));
+  EXPECT_THAT(configuration.listener.killAllowedUsers, ElementsAre(7, 0));
   EXPECT_THAT(complaintsOf("a = = 1\n"), ElementsAre(HasSubstr(file + "1:5: ")));
   std::filesystem::remove(folder + "/platform.toml");
   ASSERT_EQ(mkfifo((folder + "/platform.toml").c_str(), 0666), 0);

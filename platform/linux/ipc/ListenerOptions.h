@@ -1,8 +1,12 @@
 // What the service endpoint may be told.
 #pragma once
 
+#include <sys/types.h>
+#include <unistd.h>
+
 #include <chrono>
 #include <cstdint>
+#include <vector>
 
 #include "wire/Protocol.h"
 
@@ -19,6 +23,8 @@ struct ListenerOptions {
   uint32_t maxFrameBytes = kLargestFrameBytes;
   uint32_t maxUnreadReplyBytes = 256u << 10;
   std::chrono::milliseconds stalledClientTimeout{10000};
+  // Who may call privileged operations.
+  std::vector<uid_t> killAllowedUsers{0, geteuid()};
 };
 
 }  // namespace vx::lnx

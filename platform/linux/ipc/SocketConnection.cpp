@@ -2,6 +2,7 @@
 
 #include <sys/socket.h>
 
+#include <algorithm>
 #include <cerrno>
 
 #include "platform/Log.h"
@@ -215,6 +216,12 @@ void SocketConnection::runCall(const Frame& frame) {
   }
   const OperationDescription& operation =
       interface_->operations[static_cast<std::size_t>(*operationNumber - 1)];
+  if (operation.privileged && !isPrivileged()) {
+    ++host_.counters().notPermitted;
+    return sendError(callNumber, WireError::NotPermitted,
+                     std::string(operation.name) + " is not for user " + std::to_string(uid_) +
+                         "; [listener] kill_allowed_users in platform.toml says for whom it is");
+  }
   CallArguments arguments;
   if (const Status read = readArguments(operation, frame, arguments); !read.ok()) {
     ++host_.counters().wrongArguments;
@@ -259,6 +266,11 @@ bool SocketConnection::admitResource(const OperationDescription& operation,
   }
   resources_.insert(arguments.int64(0));
   return true;
+}
+
+bool SocketConnection::isPrivileged() const {
+  const std::vector<uid_t>& users = host_.limits().killAllowedUsers;
+  return std::ranges::find(users, uid_) != users.end();
 }
 
 void SocketConnection::settle(CallTable::Call& call) {

@@ -108,6 +108,7 @@ class SocketConnection final : public ClientConnection,
   void runCall(const Frame& frame);
   Cause recordCall(const OperationDescription& operation, const Frame& frame,
                    CallArguments& arguments);
+  bool isPrivileged() const;
   bool admitResource(const OperationDescription& operation, const CallArguments& arguments);
   void settle(CallTable::Call& call);
 
