@@ -97,6 +97,8 @@ TEST_F(ListenerTest, AnybodyMayConnectAndNothingIsLeftBehind) {
     struct stat info {};
     ASSERT_EQ(stat(path().c_str(), &info), 0);
     EXPECT_EQ(info.st_mode, S_IFSOCK | 0666U);
+    ASSERT_EQ(stat((folder + "/run/service.lock").c_str(), &info), 0);
+    EXPECT_EQ(info.st_mode, S_IFREG | 0600U) << "nobody else can hold it";
     for (const auto& [place, why] : refusals)
       EXPECT_THAT(second.open(folder + place).text(), HasSubstr(why));
     EXPECT_EQ(dial(), kWelcome) << "the first one serves on";
@@ -105,6 +107,9 @@ TEST_F(ListenerTest, AnybodyMayConnectAndNothingIsLeftBehind) {
   EXPECT_EQ(heard(clients[0]), "4");
   EXPECT_TRUE(clients[0].ended());
   EXPECT_FALSE(std::filesystem::exists(path()));
+  if (chown((folder + "/run/service.lock").c_str(), 1, 0) == 0) {
+    EXPECT_THAT(second.open(folder + "/run").text(), HasSubstr("service.lock belongs to user 1"));
+  }
 }
 
 TEST_F(ListenerTest, ConnectionsOfOneUserAreLimited) {

@@ -11,6 +11,7 @@
 #include <cerrno>
 #include <cstring>
 
+#include "base/LockFile.h"
 #include "platform/Log.h"
 #include "wire/FrameWriter.h"
 
@@ -20,11 +21,11 @@ namespace {
 
 Result<UniqueFd> lockDirectory(const std::string& directory) {
   const std::string path = directory + "/service.lock";
-  UniqueFd lock(::open(path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW, 0644));
-  if (!lock) return Status::lastError("cannot open " + path);
-  if (flock(lock.get(), LOCK_EX | LOCK_NB) != 0) {
+  Result<UniqueFd> lock = openLockFile(path);
+  if (!lock.ok()) return lock;
+  if (flock(lock->get(), LOCK_EX | LOCK_NB) != 0) {
     char owner[32] = "";
-    const ssize_t got = pread(lock.get(), owner, sizeof owner - 1, 0);
+    const ssize_t got = pread(lock->get(), owner, sizeof owner - 1, 0);
     std::string pid(owner, got > 0 ? static_cast<std::size_t>(got) : 0);
     while (!pid.empty() && pid.back() == '\n') pid.pop_back();
     return Status::failure("another vxreportingd" + (pid.empty() ? "" : " (pid " + pid + ")") +
@@ -32,7 +33,7 @@ Result<UniqueFd> lockDirectory(const std::string& directory) {
                            "; stop it, or set RUNTIME_DIRECTORY to a folder of its own");
   }
   const std::string pid = std::to_string(getpid()) + "\n";
-  if (ftruncate(lock.get(), 0) != 0 || pwrite(lock.get(), pid.data(), pid.size(), 0) < 0) {
+  if (ftruncate(lock->get(), 0) != 0 || pwrite(lock->get(), pid.data(), pid.size(), 0) < 0) {
     // Only a courtesy to whoever finds the lock taken.
   }
   return lock;

@@ -14,6 +14,7 @@
 #include <string_view>
 #include <utility>
 
+#include "base/LockFile.h"
 #include "platform/linux/store/StoreSchema.h"
 
 namespace vx::lnx {
@@ -66,16 +67,16 @@ StoreLock lockStore(const std::string& directory) {
             Status::lastError("cannot create the state directory " + directory).withHint(kHint)};
   }
   const std::string path = directory + kLockName;
-  UniqueFd lock(::open(path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW, 0640));
-  if (!lock) return {{}, Status::lastError("cannot open " + path).withHint(kHint)};
-  if (flock(lock.get(), LOCK_EX | LOCK_NB) != 0) {
+  Result<UniqueFd> lock = openLockFile(path);
+  if (!lock.ok()) return {{}, lock.status().withHint(kHint)};
+  if (flock(lock->get(), LOCK_EX | LOCK_NB) != 0) {
     if (errno != EWOULDBLOCK) return {{}, Status::lastError("cannot lock " + path)};
     return {{},
             Status::failure("another vxreportingd uses the store in " + directory +
                             "; stop it, or set STATE_DIRECTORY to a folder of its own"),
             true};
   }
-  return {std::move(lock), {}};
+  return {std::move(*lock), {}};
 }
 
 OpenedStore openStoreDatabase(const std::string& path, const JournalEpoch& epochIfNew) {
