@@ -120,7 +120,8 @@ class ReportingClient {
                                      Callback<bool> done);
   // Answered when the session is stopped.
   ClientStatus startReportingSession(int64_t reporterID, Callback<bool> done);
-  // Without identifiers: to every started session of the service. An empty list routes nothing.
+  // Without identifiers: to every started session of the service. An empty list routes nothing;
+  // one longer than the service takes (docs/protocol.md, max_identifiers) is refused.
   ClientStatus sendMessageAsync(const Payload& message, uint32_t category, uint16_t type,
                                 Callback<Done> done = nullptr);
   ClientStatus sendMessageAsync(const Payload& message, uint32_t category, uint16_t type,

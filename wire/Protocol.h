@@ -33,6 +33,7 @@ enum class ErrorCode : uint8_t {
   UnsupportedVersion = 7,
   Abandoned = 8,
   NotPermitted = 10,
+  TooManyIdentifiers = 11,
 };
 
 }  // namespace vx::wire

@@ -230,6 +230,7 @@ class Reader {
       s.integer("max_connections", l.maxConnections, 1, 1000000);
       s.integer("max_connections_per_user", l.maxConnectionsPerUser, 1, 1000000);
       s.integer("max_sessions_per_connection", l.maxSessionsPerConnection, 1, 1000000);
+      s.integer("max_identifiers", l.maxIdentifiers, 1, 1000000);
       s.integer("max_calls_in_flight", l.maxCallsInFlight, 1, 1000000);
       s.integer("max_frame_bytes", l.maxFrameBytes, 1024, ListenerOptions::kLargestFrameBytes);
       s.integer("max_unread_reply_bytes", l.maxUnreadReplyBytes, 4096, 64 << 20);

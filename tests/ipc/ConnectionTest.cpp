@@ -11,7 +11,7 @@ using testing::SizeIs;
 
 const std::string kTestHello =
     "0 1 {interface=Test,max_frame_bytes=1048576,max_calls_in_flight=1024,"
-    "max_unread_reply_bytes=262144,max_sessions=1024}";
+    "max_unread_reply_bytes=262144,max_sessions=1024,max_identifiers=4096}";
 
 // One connection on a real loop, with a host of which the test is the other half. Time is the
 // test's.
@@ -153,11 +153,13 @@ TEST_F(ConnectionTest, FramesUpToTheLimit) {
 
 TEST_F(ConnectionTest, WrongCallsAreAnsweredAndDoNothing) {
   options.maxSessionsPerConnection = 2;
+  options.maxIdentifiers = 2;
   connect();
   const Bytes entry{0xa1, 0x61, 'a', 1};
   const Bytes empty{0xa0};
   const std::pair<Bytes, const char*> cases[] = {
       {frame(1, 1, kTake, 65535, 0xFFFFFFFF, entry, Bytes{0x82, 1, 0x20}), "2 1 null"},
+      {frame(1, 1, kTake, 1, 1, nullptr, Bytes{0x83, 1, 1, 1}), "3 1 11"},
       {frame(1, 1, kTake, 65536, 1, nullptr, nullptr), "3 1 4"},
       {frame(1, 1, kTake, -1, 1, nullptr, nullptr), "3 1 4"},
       {frame(1, 1, kTake, 1, int64_t{1} << 32, nullptr, nullptr), "3 1 4"},
@@ -184,7 +186,8 @@ TEST_F(ConnectionTest, WrongCallsAreAnsweredAndDoNothing) {
   EXPECT_EQ(counted.wrongArguments, 8U);
   EXPECT_EQ(counted.unknownOperations, 3U);
   EXPECT_EQ(counted.tooManySessions, 1U);
-  EXPECT_EQ(counted.calls, 20U);
+  EXPECT_EQ(counted.tooManyIdentifiers, 1U);
+  EXPECT_EQ(counted.calls, 21U);
 }
 
 TEST_F(ConnectionTest, WhoMayCallAPrivilegedOperationIsConfigured) {

@@ -1,5 +1,6 @@
 #include "platform/linux/ipc/ArgumentReading.h"
 
+#include <algorithm>
 #include <optional>
 #include <string>
 #include <utility>
@@ -83,6 +84,17 @@ Status readArguments(const OperationDescription& operation, const Frame& frame,
     }
   }
   return {};
+}
+
+std::size_t longestArray(const OperationDescription& operation, const Frame& frame) {
+  std::size_t longest = 0;
+  for (std::size_t i = 0; i < operation.arguments.size() && kCallHead + i < frame.size(); ++i) {
+    const Value value = frame[kCallHead + i];
+    if (operation.arguments[i] == ArgumentKind::OptionalInt64Array &&
+        value.kind() == ValueKind::Array)
+      longest = std::max(longest, value.asArray().size());
+  }
+  return longest;
 }
 
 std::optional<std::size_t> dictionaryElement(const OperationDescription& operation,

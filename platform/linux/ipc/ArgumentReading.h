@@ -15,6 +15,10 @@ namespace vx::lnx {
 Status readArguments(const OperationDescription& operation, const Frame& frame,
                      CallArguments& arguments);
 
+// How many elements the longest array among a call's arguments has; to be asked before they are
+// read, which copies them.
+std::size_t longestArray(const OperationDescription& operation, const Frame& frame);
+
 // Of a call whose arguments have been read: the element that is its dictionary; none when it has
 // none.
 std::optional<std::size_t> dictionaryElement(const OperationDescription& operation,

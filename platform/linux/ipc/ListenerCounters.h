@@ -17,6 +17,7 @@ namespace vx::lnx {
   X(unknownOperations, "unknown_operations")         \
   X(wrongArguments, "wrong_arguments")               \
   X(tooManySessions, "too_many_sessions")            \
+  X(tooManyIdentifiers, "too_many_identifiers")      \
   X(notPermitted, "not_permitted")                   \
   X(unsupportedVersions, "unsupported_versions")     \
   X(secondReplies, "second_replies")                 \

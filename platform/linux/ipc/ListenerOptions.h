@@ -19,6 +19,7 @@ struct ListenerOptions {
   uint32_t maxConnections = 1024;
   uint32_t maxConnectionsPerUser = 256;
   uint32_t maxSessionsPerConnection = 1024;
+  uint32_t maxIdentifiers = 4096;  // in one call
   uint32_t maxCallsInFlight = 1024;
   uint32_t maxFrameBytes = kLargestFrameBytes;
   uint32_t maxUnreadReplyBytes = 256u << 10;

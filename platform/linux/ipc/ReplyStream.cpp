@@ -47,13 +47,14 @@ void ReplyStream::hello(std::string_view interfaceName, const ListenerOptions& l
     items.string(name);
     items.unsignedInteger(value);
   };
-  items.dictionary(5);
+  items.dictionary(6);
   items.string("interface");
   items.string(interfaceName);
   limit("max_frame_bytes", limits.maxFrameBytes);
   limit("max_calls_in_flight", limits.maxCallsInFlight);
   limit("max_unread_reply_bytes", limits.maxUnreadReplyBytes);
   limit("max_sessions", limits.maxSessionsPerConnection);
+  limit("max_identifiers", limits.maxIdentifiers);
   frame.end();
 }
 

@@ -222,6 +222,13 @@ void SocketConnection::runCall(const Frame& frame) {
                      std::string(operation.name) + " is not for user " + std::to_string(uid_) +
                          "; [listener] kill_allowed_users in platform.toml says for whom it is");
   }
+  const uint32_t mostIdentifiers = host_.limits().maxIdentifiers;
+  if (const std::size_t named = longestArray(operation, frame); named > mostIdentifiers) {
+    ++host_.counters().tooManyIdentifiers;
+    return sendError(callNumber, WireError::TooManyIdentifiers,
+                     "the call names " + std::to_string(named) + " identifiers; the limit is " +
+                         std::to_string(mostIdentifiers) + ", use several calls");
+  }
   CallArguments arguments;
   if (const Status read = readArguments(operation, frame, arguments); !read.ok()) {
     ++host_.counters().wrongArguments;
