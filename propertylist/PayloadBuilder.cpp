@@ -1,7 +1,7 @@
 #include <algorithm>
 #include <cmath>
-#include <random>
 
+#include "base/SeededHash.h"
 #include "propertylist/CborReader.h"
 #include "propertylist/CborWriter.h"
 #include "propertylist/Payload.h"
@@ -18,17 +18,7 @@ constexpr std::size_t kFirstBody = 256;
 // Fewer dead bytes than this are not worth a copy.
 constexpr std::size_t kMinDead = 4096;
 
-// Seeded by chance in each process: keys come from clients, and one that could guess the hashes
-// could make them all fall together.
-uint32_t hashOf(std::string_view key) {
-  static const uint64_t seed = std::random_device()() | uint64_t{std::random_device()()} << 32;
-  uint64_t hash = seed ^ key.size();
-  forEachWord(bytesOf(key), key.size(), [&](uint64_t word) {
-    const auto product = static_cast<unsigned __int128>(hash ^ word) * 0x9E3779B97F4A7C15u;
-    hash = static_cast<uint64_t>(product) ^ static_cast<uint64_t>(product >> 64) ^ seed;
-  });
-  return static_cast<uint32_t>(hash ^ hash >> 32);
-}
+uint32_t hashOf(std::string_view key) { return static_cast<uint32_t>(seededHash(key)); }
 
 bool isNull(const Value& value) { return *value.encoded().data() == cbor::kNull; }
 

@@ -11,6 +11,7 @@
 #include "Statistics/Service/VXReportingRowReader.h"
 #include "Statistics/VXReportingUtility.h"
 #include "base/ChunkList.h"
+#include "base/SeededHash.h"
 
 namespace vx {
 
@@ -36,7 +37,7 @@ class VXReportingSummaryEvent {
   Group& groupFor(std::string_view key);
 
   std::deque<Group> groups_;  // in order of their first values; never moves its elements
-  std::unordered_map<std::string_view, Group*> index_;
+  std::unordered_map<std::string_view, Group*, SeededHash> index_;
   std::vector<std::vector<Group*>> shapes_;  // the groups of a shape's keys
 };
 

@@ -1,5 +1,8 @@
 #include <cmath>
+#include <ctime>
 
+#include "Statistics/Service/VXReportingSummaryEvent.h"
+#include "base/Bytes.h"
 #include "propertylist/JsonWriter.h"
 #include "tests/statistics/ServiceFixture.h"
 
@@ -51,6 +54,44 @@ TEST_F(SummaryTest, LargeSessionsLoseNothing) {
     appendPrettyJson(element, payload, 2);
     EXPECT_TRUE(text.find(element + "\n }") != std::string::npos);
   }
+}
+
+// Sixteen bytes of ASCII each: the standard library's own hash is one for all of them.
+std::vector<std::string> collidingKeys(std::size_t count) {
+  constexpr uint64_t kFactor = 0xc6a4a7935bd1e995u;
+  uint64_t inverse = kFactor;
+  for (int i = 0; i < 6; ++i) inverse *= 2 - kFactor * inverse;
+  const auto mix = [](uint64_t value) { return value ^ value >> 47; };
+  std::vector<std::string> keys;
+  for (uint64_t n = 0; keys.size() < count; ++n) {
+    uint64_t words[2] = {};
+    for (unsigned i = 0; i < 8; ++i) words[0] |= (n >> 7 * i & 127) << 8 * i;
+    const uint64_t first =
+        (0xc70f6907u ^ 16 * kFactor ^ mix(words[0] * kFactor) * kFactor) * kFactor;
+    words[1] = mix((first ^ 1) * inverse) * inverse;
+    if ((words[1] & kHighBits) == 0) keys.emplace_back(reinterpret_cast<char*>(words), 16);
+  }
+  return keys;
+}
+
+TEST_F(SummaryTest, KeysThatWereMadeToCollideTakeNoLongerThanOthers) {
+  const std::vector<std::string> colliding = collidingKeys(10000);
+  const std::hash<std::string_view> hash;
+  ASSERT_EQ(hash(colliding.front()), hash(colliding.back()));
+  const auto secondsFor = [](const auto& keyAt) {
+    PayloadBuilder keys;
+    for (std::size_t i = 0; i < 10000; ++i) keys.set(keyAt(i), 1);
+    VXReportingRow row;
+    row.dictionary = keys.build();
+    const std::clock_t began = std::clock();
+    VXReportingSummaryEvent event(3);
+    event.add(row);
+    EXPECT_GT(event.build().encoded().size(), 10000 * 16u);
+    return static_cast<double>(std::clock() - began) / CLOCKS_PER_SEC;
+  };
+  const double usual =
+      secondsFor([](std::size_t i) { return std::to_string(1000000000000000 + i); });
+  EXPECT_LT(secondsFor([&](std::size_t i) { return colliding[i]; }), 10 * usual + 0.02);
 }
 
 TEST_F(SummaryTest, EventThenFileThenFlush) {
