@@ -198,9 +198,11 @@ class RunningPlatform final : public LinuxPlatform {
       store_->giveUp();
       ended = store_->waitUntilEnded(clock_.monotonic() + kThreadTime);
     }
-    // Of what was not recorded, an item is a row or two.
-    const std::size_t left =
-        drained || crashSafety_->isAllRecorded() ? 0 : executor_.utilityBacklog();
+    // What runs only now tells the store, which counts the rows that nobody has recorded. Of what
+    // is held up even so, an item is a row or two, unless no back end makes any.
+    const bool allRan = drained || executor_.drain(clock_.monotonic() + kThreadTime);
+    const bool mayLose = !allRan && !crashSafety_->isAllRecorded() && !backends().empty();
+    const std::size_t left = mayLose ? executor_.utilityBacklog() : 0;
     executor_.stop(clock_.monotonic() + kThreadTime);
     const bool oriented = orientation_.stop(clock_.monotonic() + kThreadTime);
     crashSafety_->stop();

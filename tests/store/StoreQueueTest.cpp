@@ -81,6 +81,7 @@ TEST_F(StoreQueueTest, HeldEventsAreDueWhenTheyWouldBeInTheQueueAndAtItsClose) {
   append();
   queue().close({});
   EXPECT_FALSE(append());
+  EXPECT_EQ(queue().lostRows(), 1u);
   EXPECT_FALSE(flush());
   for (const std::size_t records : {1, 0}) {  // the second is for the held ones
     EXPECT_EQ(take(), Turn::Batch);
@@ -113,6 +114,7 @@ TEST_F(StoreQueueTest, WhatIsRefusedOrNeverTakenLeavesItsCallUndone) {
   for (const bool closed : {false, true}) {
     if (closed) queue().close({});
     within({recorded(), {}}, [&] { append(); });
+    EXPECT_EQ(queue().lostRows(), 0u);
     made.reset();
     if (closed) queue();
   }

@@ -48,13 +48,15 @@ bool StoreQueue::append(StoreRecord::What what, std::size_t bytes) {
   bool wake = false;
   {
     MutexLock lock(mutex_);
+    StoreRecord record(time, std::move(what), std::move(cause));
+    const bool unrecorded = !record.cause.ticket && !record.makesNoRow();
     if (closing_) {
-      cause.ticket.abandon();
+      if (unrecorded) ++lost_;
+      record.cause.ticket.abandon();
       return false;
     }
     if (pending_.records.empty()) firstPending_ = clock_.monotonic();
-    StoreRecord record(time, std::move(what), std::move(cause));
-    if (!record.cause.ticket && !record.makesNoRow()) [[unlikely]]
+    if (unrecorded) [[unlikely]]
       ++unrecorded_;
     pending_.records.push_back(std::move(record));
     pending_.bytes += size;

@@ -63,6 +63,8 @@ class StoreQueue {
   bool gaveUp() const { return gaveUp_.load(std::memory_order_relaxed); }
   // Rows so far of which no journal knows.
   uint64_t unrecordedRows() const { return unrecorded_.load(std::memory_order_relaxed); }
+  // Such rows that came after the close.
+  uint64_t lostRows() const { return lost_.load(std::memory_order_relaxed); }
 
   enum class Turn : uint8_t {
     Nothing,  // not yet
@@ -107,6 +109,7 @@ class StoreQueue {
   std::atomic<bool> congested_{false};
   std::atomic<bool> gaveUp_{false};
   std::atomic<uint64_t> unrecorded_{0};
+  std::atomic<uint64_t> lost_{0};
 };
 
 }  // namespace vx::lnx

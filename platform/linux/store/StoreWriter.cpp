@@ -68,7 +68,7 @@ StoreCounters StoreWriter::counters() const {
           .commits = commits_.load(),
           .writeFailures = writeFailures_.load(),
           .rowsLeft = rowsLeft_.load(),
-          .rowsLost = rowsLost_.load(),
+          .rowsLost = rowsLost_.load() + queue_.lostRows(),
           .unrecordedWaiting = queue_.unrecordedRows() - unrecordedDone_.load()};
 }
 
