@@ -1,4 +1,5 @@
 #include <poll.h>
+#include <sys/resource.h>
 #include <sys/stat.h>
 #include <sys/un.h>
 
@@ -36,13 +37,16 @@ class ListenerTest : public IpcTest, public ServiceListenerDelegate {
   }
   // One more client, and how it is greeted.
   std::string dial() {
+    connect();
+    return heard(clients.back());
+  }
+  void connect() {
     UniqueFd socket(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
     sockaddr_un address{};
     address.sun_family = AF_UNIX;
     std::strncpy(address.sun_path, path().c_str(), sizeof address.sun_path - 1);
     EXPECT_EQ(::connect(socket.get(), reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
     clients.emplace_back(std::move(socket)).write(frame(0, 1));
-    return heard(clients.back());
   }
   std::string heard(SocketEnd& client) {
     run();
@@ -119,6 +123,22 @@ TEST_F(ListenerTest, ConnectionsOfOneUserAreLimited) {
 TEST_F(ListenerTest, ConnectionsInAllAreLimited) {
   options.maxConnections = 2;
   fillUp();
+}
+
+TEST_F(ListenerTest, WithoutADescriptorToSpareAcceptingWaits) {
+  serve([&] {
+    connect();
+    rlimit before{};
+    ASSERT_EQ(getrlimit(RLIMIT_NOFILE, &before), 0);
+    const rlimit none{3, before.rlim_max};
+    setrlimit(RLIMIT_NOFILE, &none);
+    run();
+    setrlimit(RLIMIT_NOFILE, &before);
+    EXPECT_LE(listener_->counters().descriptorExhaustions, 2U);
+    std::string greeting;
+    runUntil([&] { return !(greeting = heard(clients[0])).empty(); });
+    EXPECT_EQ(greeting, kWelcome);
+  });
 }
 
 TEST_F(ListenerTest, AClientThatReadsNothingIsCut) {

@@ -118,8 +118,11 @@ void SocketListener::onReady(uint32_t) {
 bool SocketListener::acceptOne() {
   UniqueFd peer(accept4(socket_.get(), nullptr, nullptr, SOCK_CLOEXEC));
   if (!peer) {
-    if (errno == EMFILE || errno == ENFILE) return turnAwayForLackOfDescriptors();
-    return errno == ECONNABORTED || errno == EINTR;
+    if (errno == ECONNABORTED || errno == EINTR) return true;
+    if (errno == EAGAIN) return false;
+    if ((errno == EMFILE || errno == ENFILE) && turnAwayForLackOfDescriptors()) return true;
+    pauseAccepting();
+    return false;
   }
   admit(std::move(peer));
   return true;
@@ -159,8 +162,18 @@ void SocketListener::turnAway(const UniqueFd& peer, const std::string& why) {
   (void)send(peer.get(), frame.data(), frame.size(), MSG_DONTWAIT | MSG_NOSIGNAL);
 }
 
+// Whoever cannot be accepted stays in front, and the loop would be told so again at once.
+void SocketListener::pauseAccepting() {
+  loop_.remove(socket_.get(), *this);
+  const NoCause own;
+  queue_->asyncAfter(kAcceptPause, [this] {
+    if (listening_ && !loop_.add(socket_.get(), EPOLLIN, *this).ok()) pauseAccepting();
+  });
+}
+
 bool SocketListener::turnAwayForLackOfDescriptors() {
   ++counters_.descriptorExhaustions;
+  if (!spare_) spare_ = spareDescriptor();  // somebody else was faster the last time
   if (!spare_) return false;
   spare_.reset();
   bool turnedAway = false;

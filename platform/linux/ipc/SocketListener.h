@@ -85,11 +85,13 @@ class SocketListener final : public ServiceListener,
  private:
   static constexpr std::chrono::seconds kShutdownTime{2};
   static constexpr int kAcceptsPerPass = 16;
+  static constexpr std::chrono::milliseconds kAcceptPause{100};
 
   void onReady(uint32_t events) override;
   Status adoptActivated(int sockets);
   Status bindAt(const std::string& path);
   bool acceptOne();  // false when there are none, or not now
+  void pauseAccepting();
   void admit(UniqueFd peer);
   // Accepts and turns away one connection with the descriptor kept for that. False when there is
   // none to spare.
