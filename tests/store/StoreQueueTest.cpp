@@ -34,6 +34,7 @@ class StoreQueueTest : public StoreTest {
 };
 
 TEST_F(StoreQueueTest, BatchIsDueByRowsBytesOrTime) {
+  options.queueBytes = 2000000;
   EXPECT_EQ(take(), Turn::Nothing);
   append();
   append();
@@ -127,6 +128,8 @@ TEST_F(StoreQueueTest, CongestedAboveTheBoundUntilHalfIsReleased) {
   take();
   append(0);
   EXPECT_TRUE(queue().isCongested());
+  EXPECT_EQ(take(), Turn::Batch) << "nobody waits for the interval";
+  EXPECT_TRUE(batch.urgent);
   EXPECT_FALSE(queue().release(11 * kRecord - 1));
   EXPECT_TRUE(queue().isCongested());
   EXPECT_TRUE(queue().release(1));

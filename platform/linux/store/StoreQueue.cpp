@@ -62,7 +62,8 @@ bool StoreQueue::append(StoreRecord::What what, std::size_t bytes) {
     pending_.bytes += size;
     heldBytes_ += size;
     if (heldBytes_ > options_.queueBytes) congested_.store(true, std::memory_order_relaxed);
-    wake = mustWake(options_.commit.isFull(pending_.records.size(), pending_.bytes));
+    wake =
+        mustWake(isCongested() || options_.commit.isFull(pending_.records.size(), pending_.bytes));
   }
   if (wake) wake_.notifyOne();
   return true;
@@ -117,7 +118,7 @@ std::optional<Monotonic> StoreQueue::dueTime(std::optional<Monotonic> heldSince)
 
 bool StoreQueue::isDue(std::optional<Monotonic> heldSince) const {
   const std::optional<Monotonic> due = dueTime(heldSince);
-  return due && (closing_ || pending_.urgent ||
+  return due && (closing_ || pending_.urgent || isCongested() ||
                  options_.commit.isFull(pending_.records.size(), pending_.bytes) ||
                  clock_.monotonic() >= *due);
 }
@@ -129,7 +130,7 @@ StoreQueue::Turn StoreQueue::takeLocked(StoreBatch& batch, std::optional<Monoton
   batch.records.swap(pending_.records);
   batch.flushes.swap(pending_.flushes);
   batch.bytes = std::exchange(pending_.bytes, 0);
-  batch.urgent = std::exchange(pending_.urgent, false) || closing_;
+  batch.urgent = std::exchange(pending_.urgent, false) || closing_ || isCongested();
   return Turn::Batch;
 }
 

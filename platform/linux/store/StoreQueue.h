@@ -38,8 +38,8 @@ struct StoreBatch {
 };
 
 // Owned by the store's writer. Thread-safe; one thread takes. Appending never blocks and never
-// drops: past `queueBytes` the queue is congested, and whoever feeds it is expected to stop until
-// half of that is left (see LocalStore).
+// drops: past `queueBytes` the queue is congested: what waits is due, and whoever feeds it is
+// expected to stop until half of that is left (see LocalStore).
 class StoreQueue {
  public:
   StoreQueue(const StoreOptions& options, Clock& clock) : options_(options), clock_(clock) {}
