@@ -51,16 +51,24 @@ class FakeInputs final : public RecordedInputs {
   bool replaying = false;
 };
 
-// All of them, installed for as long as it lives. Driver channels come from outside, where there
-// are any.
+// What stands in the place of its fake.
+struct RealServices {
+  ServiceListener* listener = nullptr;
+  WorkQueues* queues = nullptr;
+  Threading* threading = nullptr;
+  ChannelReportService* channels = nullptr;
+  RecordedInputs* inputs = nullptr;
+  AggregateMemory* aggregates = nullptr;
+};
+
+// All of them, installed for as long as it lives.
 class FakePlatform {
  public:
-  FakePlatform() : FakePlatform(noChannels()) {}
-  explicit FakePlatform(ChannelReportService& channels)
-      : platform_{.serviceListener = listener,
-                  .workQueues = queues,
+  explicit FakePlatform(const RealServices& real = {})
+      : installed{.serviceListener = either(real.listener, listener),
+                  .workQueues = either(real.queues, queues),
                   .clock = clock,
-                  .threading = threading,
+                  .threading = either(real.threading, threading),
                   .processInfo = services,
                   .processControl = services,
                   .random = services,
@@ -69,21 +77,17 @@ class FakePlatform {
                   .vyrReporting = vyr,
                   .analytics = services,
                   .powerLog = services,
-                  .channelReports = channels,
+                  .channelReports = either(real.channels, channels),
                   .deviceProperties = services,
                   .orientation = services,
                   .log = log,
                   .trace = services,
                   .diagnosticFiles = services,
-                  .inputs = inputs,
-                  .aggregates = aggregates} {
-    installPlatform(&platform_);
+                  .inputs = either(real.inputs, inputs),
+                  .aggregates = either(real.aggregates, aggregates)} {
+    installPlatform(&installed);
   }
   ~FakePlatform() { installPlatform(nullptr); }
-  static ChannelReportService& noChannels() {
-    static lnx::CounterChannels none({"", {}});
-    return none;
-  }
 
   Journal journal;
   FakeClock clock;
@@ -93,11 +97,16 @@ class FakePlatform {
   FakeVyrReporting vyr{journal, threading};
   FakeServices services{journal};
   FakeListener listener;
+  lnx::CounterChannels channels{{"", {}}};  // none
   FakeInputs inputs;
   FakeAggregateMemory aggregates;
+  Platform installed;
 
  private:
-  Platform platform_;
+  template <class Interface, class Fake>
+  static Interface& either(Interface* real, Fake& fake) {
+    return real != nullptr ? *real : fake;
+  }
 };
 
 }  // namespace vx::fakes

@@ -2,6 +2,7 @@
 // in one journal, so that orders of steps can be asserted across services.
 #pragma once
 
+#include <atomic>
 #include <iomanip>
 #include <sstream>
 
@@ -9,10 +10,16 @@
 
 namespace vx::fakes {
 
-using Journal = std::vector<std::string>;
+// Silent where several threads would write to it.
+struct Journal : std::vector<std::string> {
+  bool silent = false;
+};
+// Gets what would become a row in the journal's place, from any thread; true.
+using RowSink = std::function<bool(std::string text, const Payload& payload)>;
 
 template <class... Parts>
 void note(Journal& journal, const Parts&... parts) {
+  if (journal.silent) return;
   std::ostringstream line;
   (line << ... << parts);
   journal.push_back(line.str());
@@ -24,13 +31,14 @@ class FakeLog final : public ScopedLog {
   const LogScope* registerScope(bool enabled, uint32_t code, std::string_view name,
                                 std::string_view domain, std::string_view verboseKey,
                                 uint32_t level) override {
+    if (journal_.silent) return nullptr;
     note(registrations, name, " ", code, " ", domain, " ", verboseKey, " ", level,
          enabled ? "" : " off");
     scopes_.emplace_back().name = name;
     return &scopes_.back();
   }
   bool isLogEnabled(int level, const LogScope*) override { return level < 5 || verbose; }
-  bool wantsLine(const LogScope*, LogLevel, const LogSite&) override { return true; }
+  bool wantsLine(const LogScope*, LogLevel, const LogSite&) override { return !journal_.silent; }
   void write(const LogScope* scope, LogLevel level, const LogSite& site, std::string_view text,
              std::size_t prefixLength) override {
     static constexpr const char* kLevels[] = {"default", "info", "debug", "error"};
@@ -40,9 +48,9 @@ class FakeLog final : public ScopedLog {
     journal_.push_back("log " + lines.back());
   }
   // Lines as "scope level text", for example "vxrs default DESTROYING SERVICE".
-  std::vector<std::string> lines;
+  Journal lines;
   std::vector<std::string> functions;  // of each line
-  std::vector<std::string> registrations;
+  Journal registrations;
   bool verbose = false;
 
  private:
@@ -64,10 +72,14 @@ class FakeVyrReporting final : public VyrReporting {
   class Session final : public VyrReportingSession {
    public:
     Session(FakeVyrReporting& owner, VyrSessionInfo sessionInfo, Payload user)
-        : info(std::move(sessionInfo)), userInfo(std::move(user)), owner_(owner) {}
+        : info(std::move(sessionInfo)),
+          userInfo(std::move(user)),
+          name(std::to_string(std::get<int64_t>(info[2].second))),
+          owner_(owner) {}
     std::string description() const override { return "<relay>"; }
     void startConfigurationWithCompletionHandler(
         Function<void(std::optional<BackendList>)> handler) override {
+      if (owner_.toRows) return handler(owner_.backends);
       if (!owner_.configurationAfter) return;
       owner_.threading_.at(*owner_.configurationAfter,
                            [handler = std::move(handler), backends = owner_.backends]() mutable {
@@ -76,16 +88,19 @@ class FakeVyrReporting final : public VyrReporting {
     }
     bool sendMessageWithCategory(uint16_t category, uint16_t type, const Payload& payload,
                                  std::optional<Error>& error) override {
+      if (owner_.toRows) return owner_.toRows("message " + name + " " + payload.text(), payload);
       if (!owner_.takes("relay ", category, type, error)) return false;
       owner_.sent.push_back({category, payload, {}, {}});
       return true;
     }
     void flushMessagesWithCompletion(Function<void(std::optional<Error>)> handler) override {
       note(owner_.journal_, "flush");
+      if (owner_.toRows) owner_.toRows("flush " + name, {});
       handler(owner_.flushError);
     }
     const VyrSessionInfo info;
     const Payload userInfo;
+    const std::string name;
 
    private:
     FakeVyrReporting& owner_;
@@ -103,11 +118,16 @@ class FakeVyrReporting final : public VyrReporting {
       const VyrSessionInfo& info, const Payload& userInfo,
       const std::vector<std::string>&) override {
     note(journal_, "relay session");
-    return sessions.emplace_back(std::make_shared<Session>(*this, info, userInfo));
+    auto session = std::make_shared<Session>(*this, info, userInfo);
+    if (!toRows) return sessions.emplace_back(std::move(session));
+    toRows("session " + session->name, {});
+    return session;
   }
   bool sendOneMessageWithSessionInfo(const VyrSessionInfo& info, const Payload& userInfo,
                                      uint16_t category, uint16_t type, const Payload& payload,
                                      std::optional<Error>& error) override {
+    if (toRows)
+      return toRows("one-off session", {}) && toRows("one-off " + payload.text(), payload);
     if (!takes("one-off ", category, type, error)) return false;
     oneOffs.push_back({category, payload, info, userInfo});
     return true;
@@ -120,7 +140,8 @@ class FakeVyrReporting final : public VyrReporting {
   std::vector<std::shared_ptr<Session>> sessions;
   std::vector<Sent> sent;
   std::vector<Sent> oneOffs;
-  int tokens = 0;
+  std::atomic<int> tokens = 0;
+  RowSink toRows;
 
  private:
   bool takes(const char* what, uint16_t category, uint16_t type, std::optional<Error>& error) {
@@ -148,10 +169,12 @@ class FakeServices final : public AnalyticsEventService,
   explicit FakeServices(Journal& journal) : journal_(journal) {}
 
   void sendEventLazy(Name name, Function<Payload()> builder, const Payload&) override {
+    if (toRows) return (void)toRows("event " + std::string(name) + " " + builder().text(), {});
     note(journal_, "event ", name);
     events.push_back({std::string(name), share(std::move(builder))});
   }
   void logRegisteredEvent(int64_t, Name name, const Payload& record, const Payload*) override {
+    if (toRows) return (void)toRows("power " + std::string(name), {});
     note(journal_, "power ", name);
     powers.push_back({std::string(name), record});
   }
@@ -235,6 +258,7 @@ class FakeServices final : public AnalyticsEventService,
   Texts files;
   std::optional<Error> directoryError;
   std::optional<Error> writeError;  // of the next piece written, and of no other
+  RowSink toRows;
 
  private:
   template <class F>

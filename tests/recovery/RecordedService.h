@@ -16,30 +16,31 @@
 #include "platform/linux/recovery/JournaledInputs.h"
 #include "tests/fakes/FakePlatform.h"
 #include "tests/wire/SocketEnd.h"
-#include "wire/FrameWriter.h"
 
 namespace vx::lnx {
 
-template <class Write>
-Bytes callFrame(uint64_t number, wire::Operation operation, std::size_t count, const Write& write) {
-  Bytes out;
-  wire::FrameWriter call = wire::FrameWriter::call(out, number, operation, count);
-  write(call.items());
-  call.end();
-  return out;
+// Identifiers as one item of a frame; null without any.
+inline Bytes listOf(const std::vector<int64_t>& ids) {
+  Bytes item;
+  CborWriter writer(item);
+  if (ids.empty()) writer.null();
+  if (!ids.empty()) writer.array(ids.size());
+  for (const int64_t id : ids) writer.integer(id);
+  return item;
 }
 
 // What would be rows, with the causes that the store would keep until they are committed.
-class Rows final : public VyrReporting, public AnalyticsEventService, public PowerEventLog {
+class Rows {
  public:
   struct Row {
     Cause cause;
     std::string text;
     const void* place;
   };
-  void add(std::string text, const Payload& payload = {}) {
+  bool add(std::string text, const Payload& payload) {
     MutexLock lock(mutex_);
     rows_.push_back({Cause::take(), std::move(text), payload.identity()});
+    return true;
   }
   void commit() {
     MutexLock lock(mutex_);
@@ -66,48 +67,6 @@ class Rows final : public VyrReporting, public AnalyticsEventService, public Pow
     return all;
   }
 
-  std::shared_ptr<const VyrSecureHierarchyToken> newSecureHierarchyTokenFromParentToken(
-      const VyrSecureHierarchyToken*) override {
-    return nullptr;
-  }
-  std::shared_ptr<VyrReportingSession> initWithSessionInfo(
-      const VyrSessionInfo& info, const Payload&, const std::vector<std::string>&) override {
-    struct Session final : VyrReportingSession {
-      Session(Rows& all, std::string id) : rows(all), name(std::move(id)) {}
-      std::string description() const override { return name; }
-      void startConfigurationWithCompletionHandler(
-          Function<void(std::optional<BackendList>)> handler) override {
-        handler(BackendList{"test"});
-      }
-      bool sendMessageWithCategory(uint16_t, uint16_t, const Payload& payload,
-                                   std::optional<Error>&) override {
-        rows.add("message " + name + " " + payload.text(), payload);
-        return true;
-      }
-      void flushMessagesWithCompletion(Function<void(std::optional<Error>)> handler) override {
-        rows.add("flush " + name);
-        handler(std::nullopt);
-      }
-      Rows& rows;
-      const std::string name;
-    };
-    const std::string id = std::to_string(std::get<int64_t>(info[2].second));
-    add("session " + id);
-    return std::make_shared<Session>(*this, id);
-  }
-  bool sendOneMessageWithSessionInfo(const VyrSessionInfo&, const Payload&, uint16_t, uint16_t,
-                                     const Payload& payload, std::optional<Error>&) override {
-    add("one-off session");
-    add("one-off " + payload.text(), payload);
-    return true;
-  }
-  void sendEventLazy(std::string_view name, Function<Payload()> builder, const Payload&) override {
-    add("event " + std::string(name) + " " + builder().text());
-  }
-  void logRegisteredEvent(int64_t, std::string_view name, const Payload&, const Payload*) override {
-    add("power " + std::string(name));
-  }
-
  private:
   mutable Mutex mutex_;
   std::vector<Row> rows_ GUARDED_BY(mutex_);
@@ -117,8 +76,14 @@ class Rows final : public VyrReporting, public AnalyticsEventService, public Pow
 class RecordedService {
  public:
   explicit RecordedService(Journal* journal, AggregateMemory* surviving = nullptr)
-      : memory(surviving != nullptr ? *surviving : fakes.aggregates), inputs(journal) {
-    installPlatform(&platform);
+      : fakes({.listener = &listener,
+               .queues = &executor,
+               .threading = &threading,
+               .inputs = &inputs,
+               .aggregates = surviving}),
+        inputs(journal) {
+    fakes.journal.silent = true;  // of use to several threads
+    fakes.services.toRows = fakes.vyr.toRows = std::bind_front(&Rows::add, &rows);
     delegate = VXReportingServiceDelegate::create();
   }
   ~RecordedService() {
@@ -138,45 +103,8 @@ class RecordedService {
   EventLoop loop{executor, steady};
   SocketListener listener{loop, executor, steady, {}};
   SystemThreading threading{executor.background()};
-  AggregateMemory& memory;
   JournaledInputs inputs;
   std::shared_ptr<VXReportingServiceDelegate> delegate;
-
- private:
-  // Of use to several threads.
-  struct Quiet final : ScopedLog, TracePoint {
-    const LogScope* registerScope(bool, uint32_t, std::string_view, std::string_view,
-                                  std::string_view, uint32_t) override {
-      return nullptr;
-    }
-    bool isLogEnabled(int, const LogScope*) override { return false; }
-    bool wantsLine(const LogScope*, LogLevel, const LogSite&) override { return false; }
-    void write(const LogScope*, LogLevel, const LogSite&, std::string_view, std::size_t) override {}
-    void emit(uint32_t, uint64_t, uint64_t, uint64_t, uint64_t) override {}
-  } quiet_;
-  fakes::FakeServices& small_ = fakes.services;
-
- public:
-  Platform platform{.serviceListener = listener,
-                    .workQueues = executor,
-                    .clock = fakes.clock,
-                    .threading = threading,
-                    .processInfo = small_,
-                    .processControl = small_,
-                    .random = small_,
-                    .preferences = small_,
-                    .systemNotify = small_,
-                    .vyrReporting = rows,
-                    .analytics = rows,
-                    .powerLog = rows,
-                    .channelReports = fakes::FakePlatform::noChannels(),
-                    .deviceProperties = small_,
-                    .orientation = small_,
-                    .log = quiet_,
-                    .trace = quiet_,
-                    .diagnosticFiles = small_,
-                    .inputs = inputs,
-                    .aggregates = memory};
 };
 
 }  // namespace vx::lnx

@@ -69,32 +69,19 @@ class RecordingTest : public JournalFixture {
       clients[client]->await();
     }
   }
-  template <class Write>
-  std::string call(std::size_t client, Operation operation, std::size_t count, const Write& write) {
-    clients[client]->write(callFrame(1, operation, count, write));
+  template <class... Arguments>
+  std::string call(std::size_t client, Operation operation, const Arguments&... arguments) {
+    clients[client]->write(frame(1, 1, operation, arguments...));
     return answer(client);
-  }
-  std::string call(std::size_t client, Operation operation, int64_t id) {
-    return call(client, operation, 1, [&](CborWriter& w) { w.integer(id); });
   }
   void create(std::size_t client, int64_t id, uint16_t type = 7) {
     call(client, Operation::CreateReportingSession, id);
-    call(client, Operation::SetServiceType, 2, [&](CborWriter& w) {
-      w.integer(type);
-      w.integer(id);
-    });
+    call(client, Operation::SetServiceType, type, id);
   }
-  // To one session, or with 0 to all that are started.
-  void send(std::size_t client, int64_t number, int64_t id = 0) {
-    EXPECT_EQ(call(client, Operation::SendMessage, 4,
-                   [&](CborWriter& w) {
-                     w.encoded(dictionary(number, 50).encoded());
-                     w.integer(3);
-                     w.integer(4);
-                     if (id == 0) return w.null();
-                     w.array(1);
-                     w.integer(id);
-                   }),
+  // Without identifiers to all that are started.
+  void send(std::size_t client, int64_t number, const std::vector<int64_t>& ids = {}) {
+    const Payload message = dictionary(number, 50);
+    EXPECT_EQ(call(client, Operation::SendMessage, message.encoded(), 3, 4, listOf(ids)),
               "2 1 null");
   }
   // Is answered by the stop.
@@ -104,8 +91,7 @@ class RecordingTest : public JournalFixture {
   }
   // Until the service has let go of what a client held that has left.
   void awaitReporters(std::size_t client, const std::string& reporters) {
-    while (call(client, Operation::GetAllReporters, 0, [](CborWriter&) {}) != "2 1 " + reporters) {
-    }
+    while (call(client, Operation::GetAllReporters) != "2 1 " + reporters) continue;
   }
   bool done(uint64_t number) {
     for (const auto& record : read().records)
@@ -162,13 +148,10 @@ TEST_F(RecordingTest, WhatReachesTheServiceIsInTheJournalInItsOrder) {
   const std::size_t b = connect();
   create(a, 11, 7);
   call(b, Operation::CreateReportingSession, 22);
-  call(a, Operation::ReporterID, 11);                                 // a question
-  call(a, Operation::CreateReportingSession, 0, [](CborWriter&) {});  // refused
-  call(a, Operation::SetConfiguration, 2, [](CborWriter& w) {
-    w.null();
-    w.integer(11);
-  });
-  send(a, 5, 11);
+  call(a, Operation::ReporterID, 11);          // a question
+  call(a, Operation::CreateReportingSession);  // refused
+  call(a, Operation::SetConfiguration, nullptr, 11);
+  send(a, 5, {11});
   call(a, Operation::StopReportingSessionForID, 11);
   call(a, Operation::DestroyReportingSession, 11);
   clients[b]->close();
@@ -254,10 +237,10 @@ TEST_F(RecordingTest, ACallIsDoneWhenItsRowsAreAndNotBefore) {
   const std::size_t a = connect();
   create(a, 1);
   start(a, 1);
-  send(a, 1, 1);    // call 5
+  send(a, 1, {1});  // call 5
   create(a, 2, 4);  // 6, 7: alarms, whose standalone messages wait
   service->fakes.services.random = 59;
-  send(a, 2, 2);  // 8
+  send(a, 2, {2});  // 8
   call(a, Operation::ReporterID, 1);
   ASSERT_TRUE(service->executor.drain(Monotonic::max()));
   EXPECT_TRUE(done(2));
@@ -272,17 +255,24 @@ TEST_F(RecordingTest, ACallIsDoneWhenItsRowsAreAndNotBefore) {
   EXPECT_FALSE(journal->allDone());
 }
 
-TEST_F(RecordingTest, MemoryIsGivenBackForNoCallsSake) {
-  RecordedService own(journal.get());
+TEST_F(RecordingTest, MemoryIsGivenBackForNoCallsSakeAndDroppedWorkLeavesItsCallUndone) {
+  auto own = std::make_unique<RecordedService>(journal.get());
   {
     const Cause cause{append(1, dictionary(1))->ticket, {}};
     const CauseScope scope(cause);
-    own.threading.memoryWasFreed(64 << 20);  // in two seconds
-    own.executor.background().async([] {});
-    ASSERT_TRUE(own.executor.drain(Monotonic::max()));
+    own->threading.memoryWasFreed(64 << 20);  // in two seconds
+    own->executor.background().async([] {});
+    ASSERT_TRUE(own->executor.drain(Monotonic::max()));
     EXPECT_FALSE(journal->allDone());
   }
   EXPECT_TRUE(journal->allDone());
+  {
+    const Cause cause{append(1, dictionary(2))->ticket, {}};
+    const CauseScope scope(cause);
+    own->executor.background().asyncAfter(std::chrono::hours(1), [] {});
+  }
+  own.reset();
+  EXPECT_FALSE(journal->allDone()) << "work that was dropped is not done";
 }
 
 // What a journal of another version, or by somebody else, may hold.

@@ -51,11 +51,10 @@ class RecoveryTest : public JournalFixture {
             },
         .connections =
             [this] {
-              std::unordered_map<const ExportedObject*, SocketListener::Recorded> all;
+              std::unordered_map<const ExportedObject*, RecordedConnection> all;
               for (const auto& [client, known] : connections) {
-                all.emplace(
-                    known.second->object.get(),
-                    SocketListener::Recorded{known.first, known.second->processIdentifier(), 1000});
+                const auto& [number, connection] = known;
+                all[connection->object.get()] = {number, connection->processIdentifier(), 1000};
               }
               return all;
             },
@@ -92,10 +91,13 @@ class RecoveryTest : public JournalFixture {
     wall += later;
     beginLife();
     service->fakes.services.processNames.clear();  // they are dead
-    recovery.emplace(
-        RecoveryMeans{
-            service->platform, service->executor, *journal, {"test"}, [] { return false; }, {}},
-        std::move(left));
+    recovery.emplace(RecoveryMeans{service->fakes.installed,
+                                   service->executor,
+                                   *journal,
+                                   {"test"},
+                                   [] { return false; },
+                                   {}},
+                     std::move(left));
     return recovery->run([] { return VXReportingServiceDelegate::create(); });
   }
 
@@ -113,10 +115,10 @@ class RecoveryTest : public JournalFixture {
     service->delegate->listener(service->listener, connections[client].second);
     service->runQueues();
   }
-  template <class Write>
-  void call(int client, Operation number, std::size_t count, const Write& write) {
+  template <class... Values>
+  void call(int client, Operation number, const Values&... values) {
     tick();
-    const Bytes bytes = callFrame(1, number, count, write);
+    const Bytes bytes = frame(1, 1, number, values...);
     const Frame frame = Frame::decode(std::span(bytes).subspan(wire::kLengthBytes)).value();
     const OperationDescription& operation =
         vxReportingServiceInterface().operations[static_cast<std::size_t>(number) - 1];
@@ -131,32 +133,14 @@ class RecoveryTest : public JournalFixture {
     operation.invoke(*of->object, arguments, Reply());
     service->runQueues();
   }
-  void call(int client, Operation number, int64_t id) {
-    call(client, number, 1, [&](CborWriter& w) { w.integer(id); });
-  }
   void create(int client, int64_t id, uint16_t type) {
     call(client, Operation::CreateReportingSession, id);
-    call(client, Operation::SetServiceType, 2, [&](CborWriter& w) {
-      w.integer(type);
-      w.integer(id);
-    });
-  }
-  void configure(int client, int64_t id, const Payload& with) {
-    call(client, Operation::SetConfiguration, 2, [&](CborWriter& w) {
-      w.encoded(with.encoded());
-      w.integer(id);
-    });
+    call(client, Operation::SetServiceType, type, id);
   }
   void start(int client, int64_t id) { call(client, Operation::StartReportingSessionForID, id); }
-  void send(int client, int64_t number, std::vector<int64_t> ids = {}) {
-    call(client, Operation::SendMessage, 4, [&](CborWriter& w) {
-      w.encoded(dictionary(number).encoded());
-      w.integer(5);
-      w.integer(1);
-      if (ids.empty()) return w.null();
-      w.array(ids.size());
-      for (const int64_t id : ids) w.integer(id);
-    });
+  void send(int client, int64_t number, const std::vector<int64_t>& ids = {}) {
+    const Payload message = dictionary(number);
+    call(client, Operation::SendMessage, message.encoded(), 5, 1, listOf(ids));
   }
   void prefer(const char* name, const char* disabled) {
     tick();
@@ -222,40 +206,39 @@ enum class Cut : uint8_t { No, Begun, Whole };  // of the journal, in the middle
 // Wherever a process is killed, and the next one as well: together they write what one would have
 // that had lost its clients at that moment.
 TEST_F(RecoveryTest, AKilledProcessLosesNothingAndWritesNothingTwice) {
-  const std::vector<Function<void()>> script = [this] {
-    std::vector<Function<void()>> steps;
-    steps.emplace_back([this] { connect(1, 200); });
-    steps.emplace_back([this] { send(1, 1); });  // nobody listens: a standalone
-    steps.emplace_back([this] { create(1, 11, 7); });
-    steps.emplace_back([this] {
-      configure(1, 11, PayloadBuilder().set("HostApplicationDisplayID", "app").build());
-    });
-    steps.emplace_back([this] { start(1, 11); });
-    steps.emplace_back([this] { connect(2, 201); });
-    steps.emplace_back([this] { prefer("first", "false"); });
-    steps.emplace_back([this] { create(2, 22, 3); });  // never started: needs no end
-    steps.emplace_back([this] { send(1, 2); });
-    steps.emplace_back([this] { send(2, 3, {11, 22}); });  // also to another client's
-    steps.emplace_back([this] { create(2, 33, 3), start(2, 33); });
-    steps.emplace_back([this] { send(2, 4); });
-    steps.emplace_back([this] { prefer("second", "true"); });
-    steps.emplace_back([this] { send(2, 5); });  // refused
-    steps.emplace_back([this] { prefer("third", "false"); });
-    steps.emplace_back([this] { call(2, Operation::StopReportingSessionForID, 33); });
-    steps.emplace_back([this] { start(2, 33), send(2, 6); });
-    steps.emplace_back([this] { create(2, 33, 3); });  // replaced without a stop: stays unended
-    steps.emplace_back([this] { call(1, Operation::DestroyReportingSession, 11); });
-    steps.emplace_back([this] { start(2, 33), send(1, 7); });
-    steps.emplace_back([this] { end(2, CallRecorder::End::Interrupted); });
-    return steps;
-  }();
+  const Payload app = PayloadBuilder().set("HostApplicationDisplayID", "app").build();
+  const std::vector<int64_t> both = {11, 22};
+  using End = CallRecorder::End;
+  const std::vector<std::function<void()>> script = {
+      [&] { connect(1, 200); },
+      [&] { send(1, 1); },  // nobody listens: a standalone
+      [&] { create(1, 11, 7); },
+      [&] { call(1, Operation::SetConfiguration, app.encoded(), 11); },
+      [&] { start(1, 11); },
+      [&] { connect(2, 201); },
+      [&] { prefer("first", "false"); },
+      [&] { create(2, 22, 3); },  // never started: needs no end
+      [&] { send(1, 2); },
+      [&] { send(2, 3, both); },  // also to another client's
+      [&] { create(2, 33, 3), start(2, 33); },
+      [&] { send(2, 4); },
+      [&] { prefer("second", "true"); },
+      [&] { send(2, 5); },  // refused
+      [&] { prefer("third", "false"); },
+      [&] { call(2, Operation::StopReportingSessionForID, 33); },
+      [&] { start(2, 33), send(2, 6); },
+      [&] { create(2, 33, 3); },  // replaced without a stop: stays unended
+      [&] { call(1, Operation::DestroyReportingSession, 11); },
+      [&] { start(2, 33), send(1, 7); },
+      [&] { end(2, End::Interrupted); },
+  };
   const Date begin = wall;
   for (std::size_t steps = 1; steps <= script.size(); ++steps) {
     std::filesystem::remove_all(options.folder);
     wall = begin;
     beginLife();
     for (std::size_t i = 0; i < steps; ++i) script[i]();
-    while (!connections.empty()) end(connections.begin()->first, CallRecorder::End::Orderly);
+    while (!connections.empty()) end(connections.begin()->first, End::Orderly);
     std::vector<std::string> names = written();
     const std::vector<std::string> whole = together(names, {});
     for (std::string& name : names) name.erase(name.find(' '));
@@ -301,12 +284,9 @@ TEST_F(RecoveryTest, AKilledProcessLosesNothingAndWritesNothingTwice) {
       EXPECT_EQ(outcome.ended, deaths == 2 ? 0 : open);
       EXPECT_EQ(outcome.unreadable, 0u);
       EXPECT_EQ(together(rows, written()), whole);
-      for (const std::string& row : written())  // a session's row is asked for, for its number
-      {
-        if (std::ranges::count(rows, row) > 0) {
-          EXPECT_THAT(row, HasSubstr(" session "));
-        }
-      }
+      // A session's row is asked for, for its number.
+      for (const std::string& row : written())
+        EXPECT_TRUE(std::ranges::count(rows, row) == 0 || row.find(" session ") != row.npos) << row;
       for (const auto& [name, text] : service->fakes.services.files) filesNow[name] = text;
       EXPECT_EQ(filesNow, files);
       endLife();
@@ -340,19 +320,14 @@ TEST_F(RecoveryTest, WhatALaterProcessAcceptedIsRunAgainAsItFoundThings) {
 
 TEST_F(RecoveryTest, AStandaloneWaitsForTheRestOfItsDelay) {
   std::vector<std::string> rows;  // of one that nothing disturbs
-  enum class Original : uint8_t { Done, Undone };
-  for (const auto& [original, snapshotsTaken] :
-       std::initializer_list<std::pair<Original, int>>{{Original::Done, 0},
-                                                       {Original::Done, 0},
-                                                       {Original::Undone, 0},
-                                                       {Original::Done, 1},
-                                                       {Original::Done, 2}}) {
+  for (const auto& [callDone, snapshotsTaken] :
+       {std::pair(true, 0), {true, 0}, {false, 0}, {true, 1}, {true, 2}}) {
     std::filesystem::remove_all(options.folder);
     beginLife();
     connect(1, 200);
     create(1, 11, 4);
     send(1, 1, {11});
-    if (original == Original::Done) service->rows.commit();
+    if (callDone) service->rows.commit();
     if (rows.empty()) {
       processState->delayedMessages().sendAllFromNow();
       rows = written();
@@ -421,14 +396,18 @@ TEST_F(RecoveryTest, AJournalWhoseReplaysDieIsMovedAsideAndTheServiceServes) {
   beginLife();
   connect(1, 200);
   const uint64_t first = connections[1].first;
-  for (int deaths = 0; deaths < 2; ++deaths) {
+  // So many processes end in their replay, after some of it; then there is another one.
+  const auto replaysEnd = [&](int times, const std::function<void(const std::string&)>& after) {
+    for (; times > 0; --times) {
+      kill();
+      beginLife();
+      EXPECT_THAT(poisoned, IsEmpty());
+      after(options.folder);
+    }
     kill();
     beginLife();
-    EXPECT_THAT(left.records, SizeIs(1));
-    EXPECT_THAT(poisoned, IsEmpty());
-  }
-  kill();
-  beginLife();
+  };
+  replaysEnd(2, [&](const std::string&) { EXPECT_THAT(left.records, SizeIs(1)); });
   EXPECT_THAT(poisoned, ElementsAre(options.folder + ".aside-1"));
   EXPECT_THAT(left.records, IsEmpty());
   EXPECT_EQ(JournalReader::read(poisoned.at(0), kEpoch)->records.size(), 1u);
@@ -443,26 +422,14 @@ TEST_F(RecoveryTest, AJournalWhoseReplaysDieIsMovedAsideAndTheServiceServes) {
   beginLife();
   EXPECT_THAT(poisoned, SizeIs(1));  // nobody was told
   told(poisoned);
-  // One that is cut short while clients are served counts as a quarter.
   endReplay(options.folder);
-  for (int replays = 0; replays < 8; ++replays) {
-    kill();
-    beginLife();
-    EXPECT_THAT(poisoned, IsEmpty());
-    replayServes(options.folder);
-  }
-  kill();
-  beginLife();
+  replaysEnd(8,
+             replayServes);  // one that is cut short while clients are served counts as a quarter
   EXPECT_THAT(poisoned, SizeIs(1));
   told(poisoned);
   connect(1, 200);
-  // One that ends counts as none.
-  for (int replays = 0; replays < 4; ++replays) {
-    kill();
-    beginLife();
-    EXPECT_THAT(poisoned, IsEmpty());
-    endReplay(options.folder);
-  }
+  replaysEnd(4, endReplay);  // one that ends counts as none
+  EXPECT_THAT(poisoned, IsEmpty());
 }
 
 TEST_F(RecoveryTest, WhatIsDamagedIsKeptAndTheRestIsRunAgain) {

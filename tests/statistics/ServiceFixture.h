@@ -89,7 +89,7 @@ class PlatformTest : public ::testing::Test {
   }
 
   DriverChannels drivers;
-  fakes::FakePlatform p{drivers};
+  fakes::FakePlatform p{{.channels = &drivers}};
 
  private:
   std::size_t marked_ = 0;
