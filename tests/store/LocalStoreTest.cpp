@@ -1,7 +1,75 @@
-#include "tests/store/LocalStoreTest.h"
+// The store as a whole, on its own thread and the machine's clock.
+#include <sys/socket.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <future>
+#include <thread>
+
+#include "platform/linux/execution/SystemThreading.h"
+#include "platform/linux/store/LocalStore.h"
+#include "platform/linux/store/LogReaders.h"
+#include "tests/store/StoreTest.h"
+
+extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size);
 
 namespace vx::lnx {
 namespace {
+
+class LocalStoreTest : public StoreTest {
+ protected:
+  LocalStoreTest() { options.commit.interval = 1h; }
+  Result<std::unique_ptr<LocalStore>> tryOpen(const std::optional<JournalEpoch>& epoch = {}) {
+    return LocalStore::open(folder, options, clock, epoch);
+  }
+  void open(const std::optional<JournalEpoch>& epoch = {}) {
+    store = std::move(*tryOpen(epoch));
+    store->setEndWord([](const JournalTicket& call) -> std::string_view {
+      return call.kind() == 1 ? "stopped" : "";
+    });
+    store->start();
+  }
+  bool close(std::chrono::seconds within = 60s) { return store->close(clock.monotonic() + within); }
+  void reopen() {
+    EXPECT_TRUE(close());
+    store.reset();
+    open();
+  }
+  std::unique_ptr<RelayBackend::Session> session(int64_t id = 1) {
+    return store->relayBackend().open(sessionInfo(id), userInfo());
+  }
+  void power(int i, const std::string& name = "n") {
+    store->logRegisteredEvent(28, name, numbered(i), nullptr);
+  }
+  // Told when everything before it is committed, or the error that prevents it.
+  std::future<std::optional<Error>> flush() {
+    auto told = std::make_shared<std::promise<std::optional<Error>>>();
+    if (relay == nullptr) relay = session();
+    relay->flush([told](std::optional<Error> error) { told->set_value(std::move(error)); });
+    return told->get_future();
+  }
+  std::string file(const std::string& suffix = "") { return folder + "/telemetry.db" + suffix; }
+  uintmax_t storeBytes() {
+    std::error_code none;
+    const uintmax_t log = std::filesystem::file_size(file("-wal"), none);
+    return std::filesystem::file_size(file()) + (none ? 0 : log);
+  }
+  // Makes the rows of a table impossible to write, from outside, until refuse() of none.
+  void refuse(const std::string& table) {
+    query("DROP TRIGGER IF EXISTS refuse");
+    if (!table.empty())
+      query("CREATE TRIGGER refuse BEFORE INSERT ON " + table +
+            " BEGIN SELECT RAISE(FAIL, 'no'); END");
+  }
+  static void waitUntil(const std::function<bool()>& condition) {
+    while (!condition()) std::this_thread::yield();
+  }
+
+  SystemClock clock;
+  StoreOptions options;
+  std::unique_ptr<LocalStore> store;
+  std::unique_ptr<RelayBackend::Session> relay;
+};
 
 TEST_F(LocalStoreTest, WhatWasSentIsThereAfterTheClose) {
   open();
@@ -211,20 +279,6 @@ TEST_F(LocalStoreTest, RowsWaitUntilTheStoreCanBeBegun) {
   EXPECT_THAT(query("SELECT id, after_power FROM store_epochs"), ElementsAre("1|0", "2|1"));
 }
 
-TEST_F(LocalStoreTest, FolderThatCannotBeMadeIsNoReasonNotToStart) {
-  write("file", "");
-  const std::string whole = std::exchange(folder, folder + "/file/state");
-  options.commit.interval = 1ms;
-  open();
-  power(1);
-  waitUntil([&] { return store->counters().writeFailures > 0; });
-  std::filesystem::remove(whole + "/file");
-  std::filesystem::create_directory(whole + "/file");
-  waitUntil([&] { return store->counters().rowsCommitted == 1; });
-  EXPECT_THAT(query("SELECT count(*) FROM power_records"), ElementsAre("1"));
-  folder = whole;
-}
-
 // As after a crash: the same calls run again, from the first that is not known to be done.
 TEST_F(LocalStoreTest, ReplayWritesWhatIsMissingAndNothingTwice) {
   const Cause calls[] = {{recorded(1.5), {}}, {recorded(2.5), {}}, {recorded(3.5), {}}};
@@ -289,6 +343,144 @@ TEST_F(LocalStoreTest, NumbersOfCallsAreRememberedWhenTheirRowsAreGone) {
   query("DELETE FROM power_records");
   reopen();
   EXPECT_EQ(store->lastCall(), uint64_t{1} << 22);
+}
+
+// ------------------------------------------------- what others do to its files while it writes
+// them
+
+class StoreFaultsTest : public LocalStoreTest {
+ protected:
+  // What the session says until everything before is committed.
+  std::optional<Error> say(int i) {
+    relay->send(5, 1, numbered(i));
+    return flush().get();
+  }
+  Rows messages() {
+    return query(
+        "SELECT s.session_id, m.payload FROM relay_messages m"
+        " JOIN relay_sessions s ON s.id = m.relay_session ORDER BY m.id");
+  }
+  Rows ledger() { return query("SELECT event FROM store_ledger ORDER BY id"); }
+};
+
+TEST_F(StoreFaultsTest, LostStoreIsBegunAfreshWithWhatWaitsAndTheSessionsItIsOf) {
+  open();
+  relay = session(42);
+  EXPECT_EQ(say(1), std::nullopt);
+  bool there = true;
+  auto lose = [&] {
+    if (std::exchange(there, false)) std::filesystem::remove(file());
+    return numbered(0);
+  };
+  store->sendEventLazy("e", lose, Payload());  // within a transaction
+  EXPECT_EQ(say(2), std::nullopt);
+  EXPECT_THAT(messages(), ElementsAre("42|{\"i\":2}"));
+  EXPECT_THAT(ledger(), ElementsAre("store_lost"));
+  EXPECT_EQ(say(3), std::nullopt);
+  EXPECT_THAT(messages(), ElementsAre("42|{\"i\":2}", "42|{\"i\":3}"));
+
+  write("other", "not ours");
+  std::filesystem::rename(folder + "/other", file());
+  EXPECT_EQ(say(4), std::nullopt);
+  EXPECT_THAT(messages(), ElementsAre("42|{\"i\":4}"));
+  EXPECT_THAT(query("SELECT detail LIKE '%replaced%damaged-%' FROM store_ledger"),
+              ElementsAre("1"));
+
+  std::filesystem::resize_file(file(), 0);
+  EXPECT_EQ(say(5), std::nullopt);
+  EXPECT_EQ(messages().back(), "42|{\"i\":5}");
+
+  for (int i = 0; i < 300; ++i) relay->send(5, 1, numbered(1000 + i));
+  EXPECT_EQ(say(6), std::nullopt);
+  reopen();  // the log is written back
+  relay = session(43);
+  relay->send(5, 1, numbered(7));
+  std::promise<void> cut;
+  relay->flush([&](const std::optional<Error>&) {  // before the files are looked at
+    std::filesystem::resize_file(file(), 12288);
+    cut.set_value();
+  });
+  cut.get_future().get();
+  EXPECT_EQ(say(8), std::nullopt);
+  EXPECT_EQ(messages().back(), "43|{\"i\":8}");
+  EXPECT_EQ(ledger().front(), "store_lost");
+}
+
+TEST_F(StoreFaultsTest, DeletedLogIsWrittenBackBeforeAnotherIsBegun) {
+  open();
+  relay = session(42);
+  EXPECT_EQ(say(1), std::nullopt);
+  std::filesystem::remove(file("-wal"));
+  EXPECT_EQ(say(2), std::nullopt);
+  EXPECT_THAT(messages(), ElementsAre("42|{\"i\":1}", "42|{\"i\":2}"));
+  EXPECT_THAT(ledger(), ElementsAre("log_lost"));
+  std::filesystem::remove_all(folder);
+  EXPECT_EQ(say(3), std::nullopt);
+  EXPECT_THAT(messages(), ElementsAre("42|{\"i\":3}"));
+  EXPECT_THAT(tryOpen().status().text(), HasSubstr("another"));
+}
+
+// A reader is another process; it begins before there are threads here.
+TEST_F(StoreFaultsTest, WritingPausesWhileAReaderHoldsTheLogAtItsBoundAndSaysWhoItIs) {
+  int ends[2];
+  char word = 0;
+  ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM, 0, ends), 0);
+  const pid_t reader = fork();
+  if (reader == 0) {
+    sqlite3* opened = nullptr;
+    if (::read(ends[1], &word, 1) != 1 || sqlite3_open(file().c_str(), &opened) != SQLITE_OK ||
+        execute(opened, "BEGIN; SELECT count(*) FROM power_records") != SQLITE_OK ||
+        ::write(ends[1], "r", 1) != 1)
+      _exit(1);
+    _exit(::read(ends[1], &word, 1) == 1 ? 0 : 1);  // the kernel lets go of its locks
+  }
+  open();
+  EXPECT_EQ(flush().get(), std::nullopt);
+  ASSERT_EQ(::write(ends[0], "b", 1), 1);
+  ASSERT_EQ(::read(ends[0], &word, 1), 1);
+  const Payload large = PayloadBuilder().set("f", std::string(500000, 'x')).build();
+  for (int i = 0; i < 40; ++i) store->logRegisteredEvent(28, "n", large, nullptr);
+  auto flushed = flush();
+  waitUntil([&] { return store->counters().writeFailures > 0; });
+  EXPECT_LE(storeBytes(), StoreOptions::kSlackBytes);
+  EXPECT_EQ(flushed.wait_for(0s), std::future_status::timeout);
+  ASSERT_EQ(::write(ends[0], "e", 1), 1);
+  int status = 1;
+  waitpid(reader, &status, 0);
+  EXPECT_EQ(status, 0);
+  EXPECT_EQ(flushed.get(), std::nullopt);
+  EXPECT_THAT(query("SELECT count(*) FROM power_records"), ElementsAre("40"));
+  EXPECT_THAT(
+      query("SELECT event, detail LIKE '%(pid " + std::to_string(reader) + ")' FROM store_ledger"),
+      ElementsAre("log_held|1"));
+  for (const int end : ends) ::close(end);
+}
+
+TEST_F(StoreFaultsTest, OlderFilesOfTheFuzzerHoldNoSurprise) {
+  int files = 0;
+  for (const auto& entry : std::filesystem::directory_iterator(VX_FUZZ_CORPUS "/store")) {
+    std::ifstream in(entry.path(), std::ios::binary);
+    const std::string bytes((std::istreambuf_iterator<char>(in)), {});
+    files +=
+        LLVMFuzzerTestOneInput(reinterpret_cast<const uint8_t*>(bytes.data()), bytes.size()) + 1;
+  }
+  EXPECT_GE(files, 3);
+}
+
+TEST_F(StoreFaultsTest, ReadersAreThoseWithAReadLockOnTheIndex) {
+  std::istringstream locks(
+      "1: POSIX  ADVISORY  READ 10 fe:01:7 128 128\n"  // has it open, reads nothing
+      "2: POSIX  ADVISORY  READ 11 fe:01:7 124 124\n"
+      "2: -> POSIX  ADVISORY  READ 12 fe:01:7 124 124\n"
+      "3: POSIX  ADVISORY  WRITE 13 fe:01:7 120 120\n"
+      "4: POSIX  ADVISORY  READ 14 fe:01:17 124 124\n"
+      "5: FLOCK  ADVISORY  READ 15 fe:01:7 0 EOF\n"
+      "6: POSIX  ADVISORY  READ 11 fe:01:7 123 123\n"
+      "7: POSIX  ADVISORY  READ " +
+      std::to_string(getpid()) +
+      " fe:01:7 123 127\n"
+      "8: POSIX  ADVISORY  READ 16 fe:01:7 127 127\n");
+  EXPECT_THAT(readersIn(locks, 7), ElementsAre(11, 16));
 }
 
 }  // namespace

@@ -9,6 +9,17 @@ class FakeBackend final : public RelayBackend {
   explicit FakeBackend(std::string_view name) : name_(name) {}
   std::string_view name() const override { return name_; }
   std::unique_ptr<Session> open(const VyrSessionInfo&, const Payload&) override {
+    struct FakeSession final : Session {
+      explicit FakeSession(FakeBackend& owner) : backend(owner) {}
+      std::optional<Error> send(uint16_t category, uint16_t type, const Payload&) override {
+        backend.calls.push_back("send " + std::to_string(category) + " " + std::to_string(type));
+        return backend.refusal;
+      }
+      void flush(Function<void(std::optional<Error>)> handler) override {
+        backend.flushes.push_back(std::move(handler));
+      }
+      FakeBackend& backend;
+    };
     calls.emplace_back("open");
     return std::make_unique<FakeSession>(*this);
   }
@@ -22,17 +33,6 @@ class FakeBackend final : public RelayBackend {
   std::vector<Function<void(std::optional<Error>)>> flushes;
 
  private:
-  struct FakeSession final : Session {
-    explicit FakeSession(FakeBackend& owner) : backend(owner) {}
-    std::optional<Error> send(uint16_t category, uint16_t type, const Payload&) override {
-      backend.calls.push_back("send " + std::to_string(category) + " " + std::to_string(type));
-      return backend.refusal;
-    }
-    void flush(Function<void(std::optional<Error>)> handler) override {
-      backend.flushes.push_back(std::move(handler));
-    }
-    FakeBackend& backend;
-  };
   const std::string_view name_;
 };
 

@@ -7,11 +7,19 @@
 namespace vx::lnx {
 namespace {
 
-class RowWriterTest : public StoreTest {
+class BatchTest : public StoreTest {
+ protected:
+  void add(StoreRecord::What what, double time = 1.5) { batch.push_back({time, std::move(what)}); }
+  void addOf(const JournalTicket& call, StoreRecord::What what) {
+    batch.push_back({1.5, std::move(what), {call, {}}});
+  }
+  StoreRecords batch;
+};
+
+class RowWriterTest : public BatchTest {
  protected:
   static constexpr std::size_t kMostText = 100;
 
-  void add(StoreRecord::What what, double time = 1.5) { batch.push_back({time, std::move(what)}); }
   // Writes what was added and begins the next batch.
   Status write(const std::vector<LedgerNote>& notes = {}) {
     EventPairing().pair(batch);
@@ -29,7 +37,6 @@ class RowWriterTest : public StoreTest {
 
   Database database = openStoreDatabase(":memory:", kEpoch).database;
   RowWriter writer{database.get(), kMostText, nullptr, p.clock};
-  StoreRecords batch;
   RowWriter::Written written;
 };
 
@@ -67,10 +74,6 @@ TEST_F(RowWriterTest, EveryColumnIsWhatWasGivenAndOfItsKind) {
   EXPECT_THAT(query("SELECT id, time = 1576800000, event, table_name, rows, detail "
                     "FROM store_ledger"),
               ElementsAre("1|1|what|null|0|why", "2|1|what|t|3|why"));
-  EXPECT_THAT(query("SELECT typeof(client_version), typeof(batch_event), typeof(service_name), "
-                    "typeof(user_info), typeof(category), typeof(type), typeof(payload) "
-                    "FROM relay_sessions s JOIN relay_messages m ON m.relay_session = s.id"),
-              ElementsAre("real|integer|text|text|integer|integer|text"));
 }
 
 TEST_F(RowWriterTest, EventsShareTheTextOfTheirMessages) {
@@ -162,14 +165,12 @@ TEST_F(RowWriterTest, EventHasItsOwnTimeAndIsValidWhateverItsSize) {
 }
 
 TEST_F(RowWriterTest, EveryFewThousandRowsAreMarkedForTheNextReplay) {
-  for (int i = 0; i < 5000; ++i) {
-    batch.push_back({1, message(Payload()), {i < 2 ? recorded() : JournalTicket(), {}}});
-    if (i == 4095 || i == 4500) {
-      EXPECT_TRUE(write().ok());
-    }
+  for (const int rows : {4096, 405, 500}) {
+    for (int i = 0; i < rows; ++i)
+      addOf(rows == 4096 && i < 2 ? recorded() : JournalTicket(), message(Payload()));
+    if (rows == 500) addOf(recorded(), message(Payload()));
+    EXPECT_TRUE(write().ok());
   }
-  batch.push_back({1, message(Payload()), {recorded(), {}}});
-  EXPECT_TRUE(write().ok());
   EXPECT_THAT(query("SELECT call, last_row FROM store_marks"), ElementsAre("2|4096"));
   auto known = [&](uint64_t first, uint64_t call) {
     return KnownRows::load(database.get(), {.first = first, .sessionsFrom = first})
@@ -179,7 +180,86 @@ TEST_F(RowWriterTest, EveryFewThousandRowsAreMarkedForTheNextReplay) {
   EXPECT_EQ(known(1, 1), 1);
   EXPECT_EQ(known(2, 1), 0);
   EXPECT_EQ(known(2, 2), 2);
-  EXPECT_EQ(known(3, 3), 5001);
+  EXPECT_EQ(known(3, 3), 5002);
+}
+
+// ---------------------------------------------------------------------------------------- pairing
+
+class EventPairingTest : public BatchTest {
+ protected:
+  // The place of the event that shares the text of the message in a place.
+  uint32_t eventOf(std::size_t place) { return batch[place].event; }
+  void nextBatch() {
+    batch.clear();
+    pairing.join(batch);
+  }
+  EventPairing pairing;
+};
+
+TEST_F(EventPairingTest, EventOfAnotherCallIsNotInTheRow) {
+  const Payload a = numbered(1);
+  const JournalTicket first = recorded();
+  addOf(first, message(a));
+  addOf(recorded(), event("e", tagged(a), a));
+  addOf(first, event("e", tagged(a), a));
+  pairing.pair(batch);
+  EXPECT_EQ(eventOf(0), 2u);
+}
+
+TEST_F(EventPairingTest, EachOfManyMessagesIsFound) {
+  std::vector<Payload> payloads;
+  for (int i = 0; i < 700; ++i) payloads.push_back(numbered(i));
+  for (const Payload& payload : payloads) add(message(payload));
+  for (const Payload& payload : payloads) add(event("e", payload, payload));
+  pairing.pair(batch);
+  for (uint32_t i = 0; i < 700; ++i) ASSERT_EQ(eventOf(i), 700 + i);
+}
+
+TEST_F(EventPairingTest, YoungEventWaitsOneBatchForItsMessage) {
+  const Payload late = numbered(1);
+  const Payload never = numbered(2);
+  add(event("old", late, late), 9.9);
+  add(event("late", late, late), 10);
+  add(event("never", never, never), 11);
+  add(event("nobody's", numbered(3)), 11);
+  pairing.pair(batch);
+  EXPECT_EQ(pairing.heldSince(), std::nullopt);
+  pairing.hold(batch, 10, Monotonic(5s));
+  EXPECT_EQ(pairing.heldSince(), Monotonic(5s));
+  EXPECT_EQ(EventPairing::unwrittenRows(batch, 0).lost, 2u);
+  nextBatch();
+  EXPECT_EQ(pairing.heldSince(), std::nullopt);
+  add(message(late));
+  pairing.pair(batch);
+  EXPECT_EQ(eventOf(2), 0u);
+  pairing.hold(batch, 10, Monotonic(6s));
+  EXPECT_EQ(pairing.heldSince(), std::nullopt);  // not twice
+  EXPECT_EQ(EventPairing::unwrittenRows(batch, 0).lost, 3u);
+}
+
+TEST_F(EventPairingTest, WhatIsWrittenIsNeitherLostNorKeptAndItsCallIsDone) {
+  const Payload a = numbered(1);
+  const Payload b = numbered(2);
+  addOf(recorded(), power(1));
+  const JournalTicket call = recorded();
+  addOf(call, event("early", b, b));
+  addOf(call, message(a));
+  addOf(call, message(b));
+  addOf(recorded(), RelayEndRecord{row});
+  addOf(call, event("e", a, a));
+  pairing.pair(batch);
+  EXPECT_EQ(EventPairing::unwrittenRows(batch, 0).recorded, 5u);
+  EXPECT_EQ(EventPairing::markWritten(batch, 0, 3), 0u);
+  const EventPairing::Unwritten left = EventPairing::unwrittenRows(batch, 3);
+  EXPECT_EQ(left.recorded, 2u);  // with the early one
+  EXPECT_EQ(left.lost, 0u);
+  EXPECT_EQ(std::get<RelayMessageRecord>(batch[2].what).payload.identity(), nullptr);
+  EXPECT_NE(std::get<RelayMessageRecord>(batch[3].what).payload.identity(), nullptr);
+  EXPECT_FALSE(batch[5].cause.ticket);
+  EXPECT_TRUE(batch[1].cause.ticket);  // its message is not
+  EventPairing::abandon(batch, 3);
+  batch.clear();
+  EXPECT_EQ(undone(), 2);
 }
 
 }  // namespace

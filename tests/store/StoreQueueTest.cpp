@@ -93,35 +93,6 @@ TEST_F(StoreQueueTest, HeldEventsAreDueWhenTheyWouldBeInTheQueueAndAtItsClose) {
   EXPECT_EQ(take(), Turn::End);
 }
 
-TEST_F(StoreQueueTest, RecordKeepsItsCallAndInAReplayItsTime) {
-  options.commit.rows = 2;
-  const Cause call{recorded(7.5), {0, 1}};
-  for (const bool replaying : {false, true}) {
-    queue().setReplaying(replaying);
-    const CauseScope scope(call);
-    append();
-    append();
-    EXPECT_EQ(take(), Turn::Batch);
-    EXPECT_EQ(batch.records[1].cause.key(), (RowKey{1, 1u << 8}));
-    EXPECT_EQ(batch.records[1].time, replaying ? 7.5 : 1576800000);
-  }
-  append();
-  append();
-  EXPECT_EQ(take(), Turn::Batch);
-  EXPECT_EQ(batch.records[0].time, 1576800000);  // of no call
-}
-
-TEST_F(StoreQueueTest, WhatIsRefusedOrNeverTakenLeavesItsCallUndone) {
-  for (const bool closed : {false, true}) {
-    if (closed) queue().close({});
-    within({recorded(), {}}, [&] { append(); });
-    EXPECT_EQ(queue().lostRows(), 0u);
-    made.reset();
-    if (closed) queue();
-  }
-  EXPECT_EQ(undone(), 2);
-}
-
 TEST_F(StoreQueueTest, CongestedAboveTheBoundUntilHalfIsReleased) {
   append(19 * kRecord);
   EXPECT_FALSE(queue().isCongested());
@@ -148,14 +119,20 @@ TEST_F(StoreQueueTest, JobsComeFirst) {
   EXPECT_EQ(take(), Turn::Batch);
 }
 
+// What is refused then, or was not taken by then, leaves its call undone.
 TEST_F(StoreQueueTest, RetriesEndWithTheDeadlineOfTheClose) {
   const Monotonic now = p.clock.monotonic();
   EXPECT_TRUE(queue().waitBeforeRetry(now));
+  within({recorded(), {}}, [&] { append(); });
   queue().close(now + 1s);
   queue().close(now + 2s);  // the first one counts
+  within({recorded(), {}}, [&] { EXPECT_FALSE(append()); });
+  EXPECT_EQ(queue().lostRows(), 0u);
   EXPECT_TRUE(queue().waitBeforeRetry(now + 1h));
   p.clock.advance(1s);
   EXPECT_FALSE(queue().waitBeforeRetry(now + 1h));
+  made.reset();
+  EXPECT_EQ(undone(), 2);
 }
 
 }  // namespace
