@@ -6,6 +6,7 @@ are checked against each other.
 import contextlib
 import os
 import pathlib
+import select
 import shutil
 import signal
 import socket
@@ -33,11 +34,6 @@ HELLO, CALL, REPLY, ERROR, GOODBYE = range(5)
 def frame(*items):
     body = dumps(items)
     return struct.pack("<I", len(body)) + body
-
-
-def replace(path, text):
-    pathlib.Path(path + ".new").write_text(text)
-    os.rename(path + ".new", path)
 
 
 class Client:
@@ -121,7 +117,9 @@ class Client:
 
 
 class Daemon:
-    def __init__(self, config="", environment=None, folder=None, wait=True, preexec=None, program=DAEMON):
+    """A set of folders, and the daemons that use them one after the other."""
+
+    def __init__(self, config="", environment=None, folder=None, preexec=None, program=DAEMON):
         self.folder = folder or tempfile.mkdtemp(prefix="vx")
         for name in ("run", "state", "etc", "log", "drivers"):
             os.makedirs(f"{self.folder}/{name}", exist_ok=True)
@@ -130,35 +128,48 @@ class Daemon:
         with open(f"{self.folder}/etc/platform.toml", "w") as f:
             f.write(f'[log]\ndestination = "stderr"\nlevel = "info"\nburst = 0\n'
                     f'[drivers]\nroot = "{self.folder}/drivers"\n{sensor}{store}{config}')
+        self.notify = socket.socket(socket.AF_UNIX, socket.SOCK_DGRAM)
+        self.notify.bind(self.folder + "/notify")
         self.environment = dict(
             os.environ, RUNTIME_DIRECTORY=f"{self.folder}/run", STATE_DIRECTORY=f"{self.folder}/state",
-            CONFIGURATION_DIRECTORY=f"{self.folder}/etc", LOGS_DIRECTORY=f"{self.folder}/log", **(environment or {}))
-        for name in ("NOTIFY_SOCKET", "WATCHDOG_USEC", "LISTEN_FDS"):
-            if name not in (environment or {}):
-                self.environment.pop(name, None)
+            CONFIGURATION_DIRECTORY=f"{self.folder}/etc", LOGS_DIRECTORY=f"{self.folder}/log",
+            NOTIFY_SOCKET=self.folder + "/notify", **(environment or {}))
+        for name in {"WATCHDOG_USEC", "LISTEN_FDS"}.difference(environment or {}):
+            self.environment.pop(name, None)
         self.program = program
         self.socket_path = f"{self.folder}/run/service.socket"
         self.database = f"{self.folder}/state/telemetry.db"
         self.log_path = f"{self.folder}/daemon.log"
         self.preexec = preexec
         self.clients = []
-        self.start(wait)
 
-    def start(self, wait=True):
-        before = len(self.log()) if os.path.exists(self.log_path) else 0
+    def launch(self, **variables):
+        """Starts it with these in its environment."""
+        while self.listen(0):
+            pass
+        self.told = ""
         with open(self.log_path, "ab") as log:
-            self.process = subprocess.Popen([self.program], env=self.environment, stderr=log, stdin=subprocess.DEVNULL,
-                                            preexec_fn=self.preexec, close_fds=self.preexec is None)
-        if wait:
-            self.wait_until(self.listening, "the daemon listens")
-            # The probe was a client too; what follows starts from a clean list.
-            self.wait_until(lambda: "dealloc" in self.log()[before:], "the probe is gone")
+            self.log_before = log.tell()
+            self.process = subprocess.Popen([self.program], env=dict(self.environment, **variables), stderr=log,
+                                            stdin=subprocess.DEVNULL, preexec_fn=self.preexec, close_fds=self.preexec is None)
+        self.started_at = time.monotonic()
 
-    def listening(self):
-        if self.process.poll() is not None:
-            raise AssertionError(f"the daemon ended with {self.process.returncode}:\n{self.log()}")
-        with socket.socket(socket.AF_UNIX, socket.SOCK_STREAM) as s:
-            return s.connect_ex(self.socket_path) == 0
+    def start(self, **variables):
+        self.launch(**variables)
+        assert self.is_ready(), f"the daemon ended with {self.process.returncode}:\n{self.life_log()[-2000:]}"
+
+    def listen(self, seconds):
+        there = select.select([self.notify], [], [], seconds)[0]
+        if there:
+            self.told += self.notify.recv(4096).decode() + "\n"  # to the service manager
+        return bool(there)
+
+    def is_ready(self):
+        """Waits until the process is ready (True) or has ended."""
+        while "READY=1" not in self.told and self.process.poll() is None:
+            assert time.monotonic() < self.started_at + PATIENCE, "it does not become ready:\n" + self.life_log()[-2000:]
+            self.listen(0.005)
+        return "READY=1" in self.told
 
     def wait_until(self, condition, what):
         end = time.monotonic() + PATIENCE
@@ -181,20 +192,37 @@ class Daemon:
         folder = f"{self.folder}/log/Audio/Reporting"
         return sorted(f"{folder}/{n}" for n in os.listdir(folder)) if os.path.isdir(folder) else []
 
-    def stop(self):
-        """Ends the daemon in order and returns its exit status."""
+    def life_log(self):
+        """What the last process logged."""
+        return pathlib.Path(self.log_path).read_bytes()[self.log_before:].decode(errors="replace")
+
+    def replace_file(self, path, text):
+        path = f"{self.folder}/{path}"
+        os.makedirs(os.path.dirname(path), exist_ok=True)
+        pathlib.Path(self.folder + "/.new").write_text(text)
+        os.rename(self.folder + "/.new", path)
+
+    def kill(self):
+        self.process.kill()
+        self.process.wait()
+
+    def stop(self, patience=PATIENCE):
+        """Ends the daemon in order; its exit status, -9 when it had to be killed."""
         # It has a few seconds, and threads that give way to everybody: on a busy machine they would run out. Where that
         # is allowed, they come first for once.
         with contextlib.suppress(OSError):
             for task in os.listdir(f"/proc/{self.process.pid}/task"):
                 os.setpriority(os.PRIO_PROCESS, int(task), -10)
         self.process.send_signal(signal.SIGTERM)
-        try:
-            return self.process.wait(PATIENCE)
-        except subprocess.TimeoutExpired:
-            self.process.kill()
-            self.process.wait()
-            raise AssertionError("the daemon did not end:\n" + self.log()[-3000:])
+        began = time.monotonic()
+        while self.process.poll() is None:
+            self.listen(0.01)
+            if time.monotonic() > began + patience:
+                self.kill()
+        self.stopped_in = time.monotonic() - began
+        while self.listen(0):
+            pass
+        return self.process.returncode
 
     def rows(self, query, *arguments):
         with contextlib.closing(sqlite3.connect(f"file:{self.database}?mode=ro", uri=True, timeout=PATIENCE)) as connection:
@@ -207,9 +235,9 @@ class Daemon:
     def clean_up(self):
         for c in self.clients:
             c.close()
-        if self.process.poll() is None:
-            self.process.kill()
-        self.process.wait()
+        self.notify.close()
+        if hasattr(self, "process"):
+            self.kill()
         shutil.rmtree(self.folder, ignore_errors=True)
 
 
@@ -217,6 +245,7 @@ class DaemonTest(unittest.TestCase):
     def daemon(self, *arguments, **options):
         d = Daemon(*arguments, **options)
         self.addCleanup(d.clean_up)
+        d.start()
         return d
 
     def assert_unharmed(self, daemon):

@@ -7,19 +7,18 @@ from harness import *
 class PreferencesTest(DaemonTest):
     def test_edits_reach_messages_sessions_and_the_log(self):
         d = self.daemon(config="[preferences]\nsettle_ms = 20\n")
-        file = f"{d.folder}/etc/preferences/com.quorvel.sonik.toml"
-        os.makedirs(os.path.dirname(file))
+        prefer = lambda text: d.replace_file("etc/preferences/com.quorvel.sonik.toml", text)
         c = d.client()
         sent = lambda: c.call(SEND, {"a": 1}, 3, 1, [])
         c.call(CREATE, 1)
-        replace(file, "device_name = 'Pocket'\ndisable_reporting = true\nreporting_server_verbose = true\n")
+        prefer("device_name = 'Pocket'\ndisable_reporting = true\nreporting_server_verbose = true\n")
         d.wait_until(lambda: sent() == {"domain": "com.quorvel.audio.reporting", "code": 1}, "reporting is off")
         d.wait_until(lambda: c.call(CREATE, 2) and "creating session for reporter 2" in d.log(), "verbose lines appear")
         self.assertNotIn("creating session for reporter 1", d.log())
-        replace(file, "disable_reporting = = false\n")  # a broken file leaves the last good values
+        prefer("disable_reporting = = false\n")  # a broken file leaves the last good values
         d.wait_until(lambda: "com.quorvel.sonik.toml:1:" in d.log(), "the line is logged")
         self.assertIsNotNone(sent())
-        replace(file, "device_name = 'Pocket'\n")
+        prefer("device_name = 'Pocket'\n")
         d.wait_until(lambda: sent() is None, "reporting is on")
         c.post(START, 1)
         c.call(STOP, 1)
@@ -100,13 +99,13 @@ class OrientationTest(DaemonTest):
         return list(json.loads(pathlib.Path(self.d.summaries()[-1]).read_text())[-1].values())[0]
 
     def test_bus_that_comes_late_and_dies_and_sensor_that_wakes_up_and_comes_back(self):
-        replace(f"{self.folder}/run/interface-orientation", "portrait\n")
+        self.d.replace_file("run/interface-orientation", "portrait\n")
         self.c.started(1, 7)
         self.d.wait_until(lambda: "device orientation is off for now" in self.d.log(), "the bus is looked for")
         bus = self.start_bus()
         sensor = self.sensor(refusals=2)
         self.assertEqual(sensor.turn("normal", "left-up"), ["told"] * 2)
-        replace(f"{self.folder}/run/interface-orientation", "landscape-left\n")  # the thread of the sensor's words sees it
+        self.d.replace_file("run/interface-orientation", "landscape-left\n")  # the thread of the sensor's words sees it
         sensor.leave()
         sensor = self.sensor()
         self.assertEqual(sensor.turn("right-up"), ["told"])
