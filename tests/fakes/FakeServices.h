@@ -188,7 +188,10 @@ class FakeServices final : public AnalyticsEventService,
     return found != processNames.end() ? std::optional(found->second) : std::nullopt;
   }
   void exit(int status) override { note(journal_, "exit ", status); }
-  uint32_t below(uint32_t bound) override { return randomBound = bound, random; }
+  uint32_t below(uint32_t bound) override {
+    note(journal_, "random below ", bound);
+    return random;
+  }
   bool boolean(Name name) override { return name == "InternalBuild" && internalBuild; }
   int32_t integer(Name name, int32_t defaultValue) override {
     return name == "DeviceClassNumber" ? deviceClass : defaultValue;
@@ -245,7 +248,6 @@ class FakeServices final : public AnalyticsEventService,
   std::vector<Power> powers;
   std::map<int32_t, std::string> processNames;
   uint32_t random = 0;
-  uint32_t randomBound = 0;
   bool internalBuild = false;
   int32_t deviceClass = 0;
   Texts preferences;  // "true" and "false" read as booleans too

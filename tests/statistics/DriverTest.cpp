@@ -38,51 +38,5 @@ TEST_F(DriverTest, OnlyGrowthOfAtLeastOneIsReported) {
   EXPECT_TRUE(since(snapShot).contains("Speaker_"));
 }
 
-TEST_F(DriverTest, FailuresOfOneDriverLeaveTheOthersAlone) {
-  counters({{"Speaker/s", "1"}, {"Haptics/Stats/h", "10"}});
-  const VXReportingDriverUtility utility;
-  drivers.failNext = true;
-  auto snapShot = utility.getSnapShot();
-  EXPECT_EQ(snapShot->size(), 1u);
-  EXPECT_EQ(p.log.lines.back(), "vxrd info sampling driver Haptics-Stats");
-  EXPECT_THAT(p.log.lines, Contains("vxrd error ChannelReportCreateSamples error 9"));
-  drivers.write("Haptics/Stats/h", "12");
-  drivers.failNext = true;
-  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(snapShot)->text(), "{Haptics_Stats_h=2}");
-  drivers.write("Speaker/s", "10");
-  // Not in the snapshot: absolute values beside the others' differences.
-  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(snapShot)->text(),
-            "{Speaker_s=10,Haptics_Stats_h=2}");
-  EXPECT_THAT(p.log.lines, Contains("vxrd error ChannelReportCreateSamplesDelta error 22"));
-}
-
-TEST_F(ServiceTest, StartTakesItsSnapshotAfterStartingAndHoldsTheReply) {
-  drivers.write("Speaker/x", "1");
-  service = VXReportingServiceDelegate::create();
-  auto& client = connect();
-  create(client, 1);
-  bool startedThen = false;
-  drivers.onSample = [&] {
-    p.journal.push_back("sample");
-    startedThen = session(client, 1)->started();
-  };
-  const std::vector<std::string> steps = {"trace",     "sample",   "reply",
-                                          "event com", "fetching", "default stopping"};
-  start(client, 1);
-  std::string seen = told("start", steps);
-  EXPECT_TRUE(startedThen);
-  start(client, 1);
-  seen += told("start again", steps);
-  drivers.write("Speaker/x", "4");
-  stop(client, 1);
-  seen += told("stop", steps);
-  EXPECT_EQ(session(client, 1)->driverSnapShot(), nullptr);
-  start(client, 1);
-  onQueue([&] { session(client, 1)->stop(); });
-  start(client, 1);  // held over another's stop
-  EXPECT_EQ(seen + told("start after another stop", {"reply"}), dataFile("snapshot.txt"));
-  EXPECT_TRUE(session(client, 1)->hasTransactionCompleteBlock());
-}
-
 }  // namespace
 }  // namespace vx

@@ -14,21 +14,6 @@ class SummaryTest : public SessionTest {
   SummaryTest() { p.services.internalBuild = true; }
 };
 
-TEST_F(SummaryTest, JoinsEveryValueOfAKeyAsText) {
-  const auto s = startedSession();
-  EXPECT_EQ(s->createSummaryEventForSession(), std::nullopt);
-  s->sendMessage(Payload(), 3, 1, nullptr);
-  EXPECT_EQ(s->createSummaryEventForSession()->text(), "{VX_Session_Summary_Event=3}");
-  for (const Payload& sent :
-       {dictionary("a", 1, "b", ""), dictionary("a", 2), dictionary("b", "x", "c", true, "a", 0.5),
-        dictionary("l", ArrayBuilder().add(1).add("y"), "VX_Session_Summary_Event", "mine", "b", "",
-                   "d", message)})
-    s->sendMessage(sent, 3, 1, nullptr);
-  EXPECT_EQ(s->createSummaryEventForSession()->text(),
-            "{VX_Session_Summary_Event=3,mine,a=1,2,0.5,b=,x,,c=1,l=(1,y),d={a=1}}");
-  EXPECT_TRUE(s->createSummaryEventForSession()->find("a")->isString());
-}
-
 // More than any chunk of an aggregate or a text holds, and more than is written at once.
 TEST_F(SummaryTest, LargeSessionsLoseNothing) {
   const auto s = startedSession();
