@@ -64,6 +64,9 @@ class ScriptTest : public ServiceTest, public ::testing::WithParamInterface<cons
     if (name == "session_lines") sessionLines = value != 0;
     if (name == "internal_build") p.services.internalBuild = value != 0;
     if (name == "device_class") p.services.deviceClass = static_cast<int32_t>(value);
+    if (name == "replaying") p.inputs.replaying = value != 0;
+    if (name == "no_answers") p.inputs.answers.clear();
+    if (name == "no_processes") p.services.processNames.clear();
     if (name == "random") p.services.random = static_cast<uint32_t>(value);
     if (name == "send_error") p.vyr.sendError = broken;
     if (name == "flush_error") p.vyr.flushError = broken;
@@ -138,7 +141,11 @@ class ScriptTest : public ServiceTest, public ::testing::WithParamInterface<cons
       connections.at(client)->invalidation();
     } else if (what == "halted") {  // its session, by no call
       words >> value;
-      onQueue([&] { session(*clients.at(client), std::stoll(value))->stop(); });
+      onQueue([&] {
+        clients.at(client)
+            ->findReportingSessionForID(std::stoll(value), Client::Lookup::OwnMap)
+            ->stop();
+      });
     } else if (what == "interrupted") {
       connections.at(client)->interruption();
     } else if (what == "forgotten") {
@@ -210,7 +217,7 @@ TEST_P(ScriptTest, EachStepHasItsOutcome) {
 
 INSTANTIATE_TEST_SUITE_P(, ScriptTest,
                          ::testing::Values("interface", "sessions", "relay", "orientation",
-                                           "drivers", "uptime", "power"),
+                                           "drivers", "uptime", "power", "replay"),
                          [](const auto& script) { return std::string(script.param); });
 
 }  // namespace

@@ -128,48 +128,6 @@ class ServiceTest : public PlatformTest {
     run();
     return *clients.back();
   }
-  using Call = void (Client::*)(ReporterID, Function<void(bool)>);
-  void call(Client& client, ReporterID id, Call operation, const char* name) {
-    mark();
-    (client.*operation)(id, booleans(name));
-    run();
-  }
-  void create(Client& c, ReporterID id) { call(c, id, &Client::createReportingSession, "create"); }
-  void start(Client& c, ReporterID id) {
-    call(c, id, &Client::startReportingSessionForID, "start");
-  }
-  void stop(Client& c, ReporterID id) { call(c, id, &Client::stopReportingSessionForID, "stop"); }
-  void started(Client& client, ReporterID id) {
-    create(client, id);
-    start(client, id);
-  }
-  void configure(Client& client, ReporterID id, std::optional<Payload> with) {
-    client.setConfiguration(std::move(with), id, booleans("configure"));
-    run();
-  }
-  void send(Client& client, const Payload& sent, MessageCategory category, MessageType type,
-            std::optional<std::vector<ReporterID>> ids = std::nullopt, std::string_view skip = "") {
-    mark();
-    client.sendMessage(sent, category, type, std::move(ids),
-                       [this](const std::optional<Error>& error) {
-                         p.journal.push_back(error ? "reply send " + error->domain + " " +
-                                                         std::to_string(error->code)
-                                                   : "reply send");
-                       });
-    p.queues.runAll(skip);
-  }
-  void notify(int token = fakes::FakeServices::kToken) {
-    mark();
-    onQueue([&] { (*p.services.notifyHandler)(token); });
-  }
-  Function<void(bool)> booleans(const std::string& name) {
-    return [this, name](bool value) {
-      p.journal.push_back("reply " + name + (value ? " true" : " false"));
-    };
-  }
-  std::shared_ptr<VXReportingSession> session(Client& client, ReporterID id) {
-    return onQueue([&] { return client.findReportingSessionForID(id, Client::Lookup::OwnMap); });
-  }
 
   const Payload message = dictionary("a", 1);
   VXReportingProcessState processState;
