@@ -139,12 +139,12 @@ class ScriptTest : public ServiceTest, public ::testing::WithParamInterface<cons
       (*(who == "device" ? deviceHandler : interfaceHandler))(std::stoll(what));
     } else if (what == "lost") {
       connections.at(client)->invalidation();
-    } else if (what == "halted") {  // its session, by no call
+    } else if (what == "halted" || what == "unstarted") {  // its session, by no call
       words >> value;
       onQueue([&] {
-        clients.at(client)
-            ->findReportingSessionForID(std::stoll(value), Client::Lookup::OwnMap)
-            ->stop();
+        const auto session = clients.at(client)->findReportingSessionForID(std::stoll(value),
+                                                                           Client::Lookup::OwnMap);
+        what == "halted" ? session->stop() : session->setStarted(false);
       });
     } else if (what == "interrupted") {
       connections.at(client)->interruption();
