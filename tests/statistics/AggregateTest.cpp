@@ -1,9 +1,12 @@
 // The aggregate of a session against a list of payloads, and the summaries against the
 // straightforward way to make them.
+#include <ctime>
 #include <random>
 
 #include "Statistics/Service/VXReportingSummaryEvent.h"
 #include "Statistics/Service/VXReportingSummaryFile.h"
+#include "base/Bytes.h"
+#include "base/ChunkList.h"
 #include "propertylist/JsonWriter.h"
 #include "propertylist/PlacedPayload.h"
 #include "tests/statistics/ServiceFixture.h"
@@ -225,6 +228,70 @@ TEST_F(AggregateTest, WhateverWasLeftIsRefusedOrRead) {
     changed[0] = below(2) == 0 ? 255 : changed[0];
     LLVMFuzzerTestOneInput(changed.data(), changed.size());
   }
+}
+
+// Sixteen bytes of ASCII each: the standard library's own hash is one for all of them.
+std::vector<std::string> collidingKeys(std::size_t count) {
+  constexpr uint64_t kFactor = 0xc6a4a7935bd1e995u;
+  uint64_t inverse = kFactor;
+  for (int i = 0; i < 6; ++i) inverse *= 2 - kFactor * inverse;
+  const auto mix = [](uint64_t value) { return value ^ value >> 47; };
+  std::vector<std::string> keys;
+  for (uint64_t n = 0; keys.size() < count; ++n) {
+    uint64_t words[2] = {};
+    for (unsigned i = 0; i < 8; ++i) words[0] |= (n >> 7 * i & 127) << 8 * i;
+    const uint64_t first =
+        (0xc70f6907u ^ 16 * kFactor ^ mix(words[0] * kFactor) * kFactor) * kFactor;
+    words[1] = mix((first ^ 1) * inverse) * inverse;
+    if ((words[1] & kHighBits) == 0) keys.emplace_back(reinterpret_cast<char*>(words), 16);
+  }
+  return keys;
+}
+
+TEST_F(AggregateTest, KeysThatWereMadeToCollideTakeNoLongerThanOthers) {
+  const std::vector<std::string> colliding = collidingKeys(10000);
+  const std::hash<std::string_view> hash;
+  ASSERT_EQ(hash(colliding.front()), hash(colliding.back()));
+  const auto secondsFor = [](const auto& keyAt) {
+    PayloadBuilder keys;
+    for (std::size_t i = 0; i < 10000; ++i) keys.set(keyAt(i), 1);
+    VXReportingRow row;
+    row.dictionary = keys.build();
+    const std::clock_t began = std::clock();
+    VXReportingSummaryEvent event(3);
+    event.add(row);
+    EXPECT_GT(event.build().encoded().size(), 10000 * 16u);
+    return static_cast<double>(std::clock() - began) / CLOCKS_PER_SEC;
+  };
+  const double usual =
+      secondsFor([](std::size_t i) { return std::to_string(1000000000000000 + i); });
+  EXPECT_LT(secondsFor([&](std::size_t i) { return colliding[i]; }), 10 * usual + 0.02);
+}
+
+// Chunks of 2, 4, 8, 8...: around every end of one, filled one by one and by the run, used again.
+TEST(ChunkList, HoldsWhatAVectorWouldAndNoLonger) {
+  using Element = std::shared_ptr<std::size_t>;
+  const auto token = std::make_shared<std::size_t>();
+  std::vector<std::size_t> numbers(100);
+  ChunkList<Element, 8, 2, 2> list;
+  for (const std::size_t count : {0u, 1u, 2u, 3u, 6u, 7u, 14u, 15u, 22u, 100u, 5u}) {
+    std::vector<Element> expected, held;
+    for (std::size_t i = 0; i < count; ++i) expected.emplace_back(token, &numbers[i]);
+    list.clear();
+    EXPECT_EQ(token.use_count() - 1, static_cast<long>(count));
+    if (count % 2 == 0) list.append(expected);
+    if (count % 2 != 0)
+      for (const Element& element : expected) list.push_back(element);
+    list.shrink(0);
+    auto other = std::move(list);
+    list = std::move(other);
+    list.forEachChunk([&](auto chunk) { held.insert(held.end(), chunk.begin(), chunk.end()); });
+    EXPECT_EQ(held, expected);
+    EXPECT_EQ(list.size(), count);
+    EXPECT_EQ(list.empty(), count == 0);
+  }
+  list = {};
+  EXPECT_EQ(token.use_count(), 1);
 }
 
 }  // namespace

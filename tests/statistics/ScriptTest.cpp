@@ -49,7 +49,7 @@ class ScriptTest : public ServiceTest, public ::testing::WithParamInterface<cons
     for (std::string key, value; words >> std::quoted(key) >> std::quoted(value);) {
       char* end = nullptr;
       const double number = std::strtod(value.c_str(), &end);
-      if (*end != 0)
+      if (value.empty() || *end != 0)
         builder.set(key, value);
       else if (value.find('.') == value.npos)
         builder.set(key, static_cast<int64_t>(number));
@@ -139,12 +139,14 @@ class ScriptTest : public ServiceTest, public ::testing::WithParamInterface<cons
       (*(who == "device" ? deviceHandler : interfaceHandler))(std::stoll(what));
     } else if (what == "lost") {
       connections.at(client)->invalidation();
-    } else if (what == "halted" || what == "unstarted") {  // its session, by no call
+    } else if (what == "halted" || what == "unstarted" || what == "summarised") {
       words >> value;
-      onQueue([&] {
+      onQueue([&] {  // its session, by no call
         const auto session = clients.at(client)->findReportingSessionForID(std::stoll(value),
                                                                            Client::Lookup::OwnMap);
-        what == "halted" ? session->stop() : session->setStarted(false);
+        if (what == "halted") session->stop();
+        if (what == "unstarted") session->setStarted(false);
+        if (what == "summarised") session->writeSummaryJson();
       });
     } else if (what == "interrupted") {
       connections.at(client)->interruption();
@@ -217,7 +219,7 @@ TEST_P(ScriptTest, EachStepHasItsOutcome) {
 
 INSTANTIATE_TEST_SUITE_P(, ScriptTest,
                          ::testing::Values("interface", "sessions", "relay", "orientation",
-                                           "drivers", "uptime", "power", "replay"),
+                                           "drivers", "uptime", "power", "replay", "summary"),
                          [](const auto& script) { return std::string(script.param); });
 
 }  // namespace

@@ -1,3 +1,5 @@
+#include <cmath>
+
 #include "Statistics/VXReportingTallyhubBridge.h"
 #include "Statistics/VXReportingWattmarkUtility.h"
 #include "tests/statistics/ServiceFixture.h"
@@ -56,6 +58,9 @@ TEST_F(SessionTest, RelaySessionCarriesWhatTheSetUpTook) {
             "HostApplicationDisplayID=app,b=2}");
   EXPECT_EQ(relay.info[4].second, VyrSessionInfoValue(s->vyrReportingAgentToken()));
   EXPECT_EQ(s->vyrReportingSession(), p.vyr.sessions.back());
+  s->stop();
+  run();
+  EXPECT_EQ(s->vyrReportingSession(), nullptr);
   EXPECT_EQ(p.queues.blockingScopes, 1);
   EXPECT_THAT(p.queues.made.back(),
               Pair("com.quorvel.sonik.session.vyrreporting", QualityOfService::Utility));
@@ -108,6 +113,29 @@ TEST_F(SessionTest, DelayedSinglesGoOutInTheirOrderWhenSomebodyIsInAHurryAndOnce
   run();
   EXPECT_EQ(sent(), "2 4 1 3 5 ");
   EXPECT_EQ(delayed.size(), 0u);
+}
+
+TEST_F(SessionTest, FailuresOfTheSummaryAreLoggedAndTheStopGoesOn) {
+  p.services.internalBuild = true;
+  const Payload bad = dictionary("bad", std::nan(""));
+  const Payload large = dictionary("a", std::string(70000, 'x'));
+  p.services.directoryError = Error{"posix", 13, "denied"};  // the file is tried all the same
+  for (const auto& [header, sent, fails] :
+       {std::tuple(bad, message, "dataWithJSONObject: "),
+        {message, bad, "dataWithJSONObject: "},
+        {message, large, "jsonOutput writeToURL: full (posix, code 28)"}}) {
+    const auto s = startedSession();
+    s->setConfiguration(header);
+    s->sendMessage(sent, 3, 1, nullptr);
+    p.services.writeError = Error{"posix", 28, "full"};  // of the first piece
+    mark();
+    s->stop();
+    EXPECT_THAT(gained({" error "}),
+                UnorderedElementsAre(HasSubstr(fails), HasSubstr("denied (posix, code 13)")));
+    EXPECT_FALSE(s->started());
+  }
+  EXPECT_THAT(p.services.files, IsEmpty());
+  EXPECT_GT(p.threading.freedBytes, 0u);
 }
 
 }  // namespace

@@ -87,26 +87,20 @@ TEST_F(RelayReportingTest, FlushIsDoneWhenAllAre) {
   for (FakeBackend* each : {&a, &b}) each->flushes.at(1)(std::nullopt);
 }
 
-TEST_F(RelayReportingTest, ConfigurationAnswersTheBackEndsInForceLater) {
+TEST_F(RelayReportingTest, ConfigurationAnswersTheBackEndsInForceLaterAndWithoutAnyNothingIsTaken) {
   std::vector<VyrReportingSession::BackendList> answers;
-  auto answered = [&](std::optional<VyrReportingSession::BackendList> names) {
-    answers.push_back(names.value_or(VyrReportingSession::BackendList{"none"}));
-  };
   for (const std::vector<RelayBackend*>& backends :
        {std::vector<RelayBackend*>{&b, &a}, std::vector<RelayBackend*>{}}) {
     use(backends);
-    session->startConfigurationWithCompletionHandler(answered);
+    session->startConfigurationWithCompletionHandler([&](const auto& names) {
+      answers.push_back(names.value_or(VyrReportingSession::BackendList{"none"}));
+    });
   }
   EXPECT_THAT(answers, IsEmpty());
   for (const auto& job : jobs) job();
   EXPECT_THAT(answers, ElementsAre(ElementsAre("b", "a"), ElementsAre("none")));
-}
-
-TEST_F(RelayReportingTest, WithoutBackEndsNothingIsTaken) {
-  use({});
   EXPECT_FALSE(session->sendMessageWithCategory(5, 6, Payload(), error));
-  EXPECT_THAT(error->reason, HasSubstr("no relay back end"));
-  error.reset();
+  EXPECT_THAT(std::exchange(error, {})->reason, HasSubstr("no relay back end"));
   EXPECT_FALSE(sendOne());
   EXPECT_TRUE(error);
   bool flushed = false;
