@@ -216,12 +216,12 @@ class FakeServices final : public AnalyticsEventService,
     interfaceHandlers[{std::string(id), registrant}] = share(std::move(handler));
   }
   void unregisterDeviceOrientationHandler(Name id, const void* registrant) override {
-    note(journal_, "unregister device ", id);
-    deviceHandlers.erase({std::string(id), registrant});
+    const bool was = deviceHandlers.erase({std::string(id), registrant}) > 0;
+    note(journal_, "unregister device ", id, was ? "" : ", which was not");
   }
   void unregisterInterfaceOrientationHandler(Name id, const void* registrant) override {
-    note(journal_, "unregister interface ", id);
-    interfaceHandlers.erase({std::string(id), registrant});
+    const bool was = interfaceHandlers.erase({std::string(id), registrant}) > 0;
+    note(journal_, "unregister interface ", id, was ? "" : ", which was not");
   }
   std::string orientationText(int64_t value) override { return "o" + std::to_string(value); }
   std::string logsDirectory() override { return "/logs"; }

@@ -67,6 +67,7 @@ class ScriptTest : public ServiceTest, public ::testing::WithParamInterface<cons
     if (name == "replaying") p.inputs.replaying = value != 0;
     if (name == "no_answers") p.inputs.answers.clear();
     if (name == "no_processes") p.services.processNames.clear();
+    if (name == "sample_fails") drivers.failNext = true;
     if (name == "random") p.services.random = static_cast<uint32_t>(value);
     if (name == "send_error") p.vyr.sendError = broken;
     if (name == "flush_error") p.vyr.flushError = broken;
