@@ -143,7 +143,8 @@ void appendToJournal(benchmark::State& state) {
 BENCHMARK(appendToJournal);
 
 void queueAndRunInteractive(benchmark::State& state) {
-  lnx::Executor executor;
+  lnx::UserAccounts accounts;
+  lnx::Executor executor{accounts};
   executor.adoptInteractiveThread();
   const auto queue = executor.makeSerial("bench", QualityOfService::UserInteractive);
   const auto owner = std::make_shared<int>(0);
@@ -156,7 +157,8 @@ void queueAndRunInteractive(benchmark::State& state) {
 BENCHMARK(queueAndRunInteractive);
 
 void queueToUtilityLane(benchmark::State& state) {
-  lnx::Executor executor;
+  lnx::UserAccounts accounts;
+  lnx::Executor executor{accounts};
   const auto queue = executor.makeSerial("bench", QualityOfService::Utility);
   const auto owner = std::make_shared<std::atomic<int>>(0);
   for (auto _ : state) {

@@ -2,6 +2,7 @@
 #pragma once
 
 #include <chrono>
+#include <cstddef>
 #include <cstdint>
 #include <memory>
 #include <optional>
@@ -26,8 +27,9 @@ enum class QualityOfService {
 class CAPABILITY("queue") WorkQueue {
  public:
   virtual ~WorkQueue() = default;
-  // Never runs the work before it returns.
-  virtual void async(Work work) = 0;
+  // Never runs the work before it returns. `holds`: bytes that it keeps alive until it has run,
+  // for the account of whoever caused it.
+  virtual void async(Work work, std::size_t holds = 0) = 0;
   // The work joins the queue once the delay has passed on the monotonic clock.
   virtual void asyncAfter(std::chrono::nanoseconds delay, Work work) = 0;
   virtual bool isCurrent() const = 0;
@@ -56,9 +58,12 @@ class WorkCause {
 class WorkQueues {
  public:
   virtual ~WorkQueues() = default;
-  // What the caller's work goes back to, as asyncAfter would take it along. Null where a call is
-  // run again after a crash whose work was done before it.
-  virtual std::unique_ptr<WorkCause> takeCause() { return std::make_unique<WorkCause>(); }
+  // What the caller's work goes back to, as asyncAfter would take it along, for work that keeps
+  // `holds` bytes alive. Null where a call is run again after a crash whose work was done before
+  // it.
+  virtual std::unique_ptr<WorkCause> takeCause(std::size_t /*holds*/) {
+    return std::make_unique<WorkCause>();
+  }
   // Of the work that the caller runs; none where it goes back to no recorded call.
   virtual std::optional<WorkOrigin> currentOrigin() { return std::nullopt; }
   // Runs `work` before it returns, as work for the service's own sake: what it queues goes back to

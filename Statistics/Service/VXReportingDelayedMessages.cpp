@@ -29,7 +29,8 @@ bool readNumber(const Payload& from, std::string_view key, Number& number) {
 }  // namespace
 
 void VXReportingDelayedMessages::add(VXReportingDelayedMessage message) {
-  std::unique_ptr<WorkCause> cause = platform().workQueues.takeCause();
+  std::unique_ptr<WorkCause> cause =
+      platform().workQueues.takeCause(message.message.encoded().size());
   if (cause == nullptr) return;  // it went out before
   message.message = PayloadBuilder(message.message).build();
   platform().inputs.keepDelayed(facts(message), message.message, *cause);
@@ -44,23 +45,35 @@ void VXReportingDelayedMessages::add(VXReportingDelayedMessage message,
     const Monotonic now = clock.monotonic();
     const Monotonic due =
         now + std::clamp<std::chrono::nanoseconds>(message.due - clock.now(), {}, kLongest);
-    bool tooMuch = false;
+    bool atOnce = false;
     {
       MutexLock lock(mutex_);
       bytes_ += message.message.encoded().size();
       waiting_.emplace(Key{due, next_++}, Waiting{std::move(message), std::move(cause)});
-      tooMuch = isTooMuch() || atOnce_;
+      atOnce = isTooMuch() || atOnce_;
     }
-    wakeAfter(due - now, due);
-    if (tooMuch) wakeAfter({}, now);
+    wakeBy(atOnce ? now : due);
   });
 }
 
-// Wake-ups are not taken back: one that finds nothing due has cost next to nothing.
-void VXReportingDelayedMessages::wakeAfter(std::chrono::nanoseconds delay, Monotonic until) {
-  platform().workQueues.background().asyncAfter(delay, [weak = weak_from_this(), until] {
-    if (const auto self = weak.lock()) self->sendDue(until);
-  });
+// One wake-up leads to the next. They are not taken back, so one that is queued already is left to
+// do: one that finds nothing due has cost next to nothing.
+void VXReportingDelayedMessages::wakeBy(Monotonic due) {
+  {
+    MutexLock lock(mutex_);
+    if (wake_ && *wake_ <= due) return;
+    wake_ = due;
+  }
+  platform().workQueues.background().asyncAfter(due - platform().clock.monotonic(),
+                                                [weak = weak_from_this(), due] {
+                                                  const auto self = weak.lock();
+                                                  if (self == nullptr) return;
+                                                  {
+                                                    MutexLock lock(self->mutex_);
+                                                    if (self->wake_ == due) self->wake_.reset();
+                                                  }
+                                                  self->sendDue(due);
+                                                });
 }
 
 void VXReportingDelayedMessages::sendAllFromNow() {
@@ -74,14 +87,20 @@ void VXReportingDelayedMessages::sendAllFromNow() {
 void VXReportingDelayedMessages::sendDue(Monotonic until) {
   for (;;) {
     Waiting next;
+    std::optional<Monotonic> later;
     {
       MutexLock lock(mutex_);
       if (waiting_.empty()) return;
-      if (waiting_.begin()->first.first > until && !isTooMuch() && !atOnce_) return;
-      next = std::move(waiting_.begin()->second);
-      waiting_.erase(waiting_.begin());
-      bytes_ -= next.message.message.encoded().size();
+      if (const Monotonic due = waiting_.begin()->first.first;
+          due > until && !isTooMuch() && !atOnce_) {
+        later = due;
+      } else {
+        next = std::move(waiting_.begin()->second);
+        waiting_.erase(waiting_.begin());
+        bytes_ -= next.message.message.encoded().size();
+      }
     }
+    if (later) return wakeBy(*later);
     const VXReportingDelayedMessage& message = next.message;
     next.cause->run([&message] {
       VXReportingSession::sendSingleMessageNow(message.message, message.category, message.type,

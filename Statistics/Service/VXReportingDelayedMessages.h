@@ -58,7 +58,7 @@ class VXReportingDelayedMessages : public std::enable_shared_from_this<VXReporti
   using Key = std::pair<Monotonic, uint64_t>;  // when it is due, and its number
 
   void sendDue(Monotonic until);
-  void wakeAfter(std::chrono::nanoseconds delay, Monotonic until);
+  void wakeBy(Monotonic due);
   bool isTooMuch() const REQUIRES(mutex_) {
     return waiting_.size() > kMostMessages || bytes_ > kMostBytes;
   }
@@ -67,6 +67,7 @@ class VXReportingDelayedMessages : public std::enable_shared_from_this<VXReporti
   std::map<Key, Waiting> waiting_ GUARDED_BY(mutex_);
   std::size_t bytes_ GUARDED_BY(mutex_) = 0;  // of their encodings
   uint64_t next_ GUARDED_BY(mutex_) = 0;
+  std::optional<Monotonic> wake_ GUARDED_BY(mutex_);  // the earliest that is queued
   bool atOnce_ GUARDED_BY(mutex_) = false;
 };
 

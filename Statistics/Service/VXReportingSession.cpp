@@ -299,10 +299,13 @@ void VXReportingSession::deliver(const Payload& message, MessageCategory categor
   // What the client sent goes along only where it is another object: a count less to keep.
   std::optional<Payload> asSent;
   if (!normalised.isSameObject(message)) asSent = message;
-  vyrReportingQueue_->async([self = shared_from_this(), normalised = std::move(normalised),
-                             asSent = std::move(asSent), category, type, startedNow = started_] {
-    self->relayMessage(normalised, asSent ? *asSent : normalised, category, type, startedNow);
-  });
+  const std::size_t holds = normalised.encoded().size();
+  vyrReportingQueue_->async(
+      [self = shared_from_this(), normalised = std::move(normalised), asSent = std::move(asSent),
+       category, type, startedNow = started_] {
+        self->relayMessage(normalised, asSent ? *asSent : normalised, category, type, startedNow);
+      },
+      holds);
   if (reply) reply(std::nullopt);
 }
 

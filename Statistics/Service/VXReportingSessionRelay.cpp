@@ -200,7 +200,8 @@ void VXReportingSession::sendSingleMessage(const Payload& message, MessageCatego
   platform().workQueues.background().async(
       [message, reply = std::move(reply), category, serviceType, type] {
         sendSingleMessageNow(message, category, type, serviceType, reply);
-      });
+      },
+      message.encoded().size());
 }
 
 void VXReportingSession::sendSingleMessageNow(const Payload& message, MessageCategory category,

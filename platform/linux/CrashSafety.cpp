@@ -138,8 +138,7 @@ void CrashSafety::recover(Platform& live, std::vector<std::string> backends,
   const Monotonic until = began + kReplayTime * (1 + left_.entries / kReplayedInThat) +
                           (attempt_ > 1 ? kReplayTimeAgain : std::chrono::seconds(0));
   means_.executor.adoptInteractiveThread();
-  recovery_.emplace(RecoveryMeans{live, means_.executor, *journal_, std::move(backends),
-                                  [this] { return means_.store.isCongested(); }, until},
+  recovery_.emplace(RecoveryMeans{live, means_.executor, *journal_, std::move(backends), until},
                     std::move(left_));
   means_.store.beginReplay(recovery_->calls());
   const RecoveryOutcome outcome = recovery_->run(makeDelegate);

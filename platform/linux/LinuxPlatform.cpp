@@ -43,9 +43,6 @@ namespace {
 
 constexpr std::string_view kPreferencesNotification = "com.quorvel.sonik.reporting";
 constexpr std::string_view kPreferencesFile = "com.quorvel.sonik.toml";
-// Relay work that accepted messages may have caused before reading from clients pauses.
-constexpr std::size_t kRelayBacklogHigh = 64 << 10;
-constexpr std::size_t kRelayBacklogLow = 32 << 10;
 // Of a stop, from the signal on; CrashSafety::kMoveLimits follow (docs/configuration.md).
 constexpr StopDeadline::Limits kCommitLimits{.first = std::chrono::seconds(5),
                                              .pause = std::chrono::seconds(5),
@@ -105,6 +102,7 @@ class RunningPlatform final : public LinuxPlatform {
  public:
   RunningPlatform(const Directories& directories, const PlatformConfiguration& configuration)
       : configuration_(configuration),
+        accounts_(configuration.memory),
         aggregates_({.folder = CrashSafety::Folders::journalIn(directories.runtime),
                      .runElsewhere =
                          [this](Function<void()> work) {
@@ -143,6 +141,7 @@ class RunningPlatform final : public LinuxPlatform {
     }
     store_ = std::move(*opened);
     store_->setEndWord(endWordOf);
+    store_->setAccounts(accounts_);
     crashSafety_.emplace(
         CrashSafety::Means{clock_, executor_, loop_, listener_, *store_, aggregates_}, journals);
     relay_.emplace(backends(),
@@ -262,14 +261,9 @@ class RunningPlatform final : public LinuxPlatform {
 
   // Everything that the event loop looks after besides connections.
   void connect() {
-    store_->setDrainedHandler([this] { listener_.congestionEnded(); });
-    executor_.setUtilityLowWater(kRelayBacklogLow, [this] { listener_.congestionEnded(); });
+    accounts_.setResumedHandler([this] { listener_.congestionEnded(); });
     listener_.setHooks({
-        .congested =
-            [this] {
-              return store_->isCongested() || executor_.utilityBacklog() > kRelayBacklogHigh ||
-                     crashSafety_->isFull();
-            },
+        .congested = [this] { return crashSafety_->isFull(); },
         .listening = [] { sd_notify(0, "READY=1"); },
         .stopping =
             [this] {
@@ -315,21 +309,23 @@ class RunningPlatform final : public LinuxPlatform {
       const LocalStore::Counters counters = store_->counters();
       VX_LOG(nullptr, Error,
              "counters: %s rows=%llu commits=%llu write_failures=%llu relay_backlog=%zu "
-             "orientation_refused=%llu %s",
+             "orientation_refused=%llu waiting_bytes=%lld user_pauses=%llu %s",
              listener_.counters().text().c_str(),
              static_cast<unsigned long long>(counters.rowsCommitted),
              static_cast<unsigned long long>(counters.commits),
              static_cast<unsigned long long>(counters.writeFailures), executor_.utilityBacklog(),
              static_cast<unsigned long long>(orientation_.refusedHandlers()),
-             crashSafety_->counters().c_str());
+             static_cast<long long>(accounts_.total(MemoryKind::Waiting)),
+             static_cast<unsigned long long>(accounts_.pauses()), crashSafety_->counters().c_str());
     }
   }
 
   const PlatformConfiguration configuration_;
   SystemClock clock_;
   SystemLog log_;
+  UserAccounts accounts_;
   AggregateSegments aggregates_;  // before the executor, whose work may hold blocks
-  Executor executor_;
+  Executor executor_{accounts_};
   SystemThreading threading_{executor_.background()};
   EventLoop loop_;
   SocketListener listener_;

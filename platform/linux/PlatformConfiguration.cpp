@@ -222,8 +222,11 @@ class Reader {
     section("store", [&](Section& s) {
       s.size("max_bytes", c.store.maxBytes, 1 << 20);
       s.integer("max_age_days", c.store.maxAgeDays, 0, 36500);
-      s.size("queue_bytes", c.store.queueBytes, 64 << 10);
+      s.size("queue_bytes", c.memory.maxWaitingBytes, 64 << 10);
       s.milliseconds("commit_interval_ms", c.store.commit.interval, 1, 60000);
+    });
+    section("memory", [&](Section& s) {
+      s.size("max_user_waiting_bytes", c.memory.maxUserWaitingBytes, 64 << 10);
     });
     section("listener", [&](Section& s) {
       auto& l = c.listener;
@@ -249,6 +252,9 @@ class Reader {
       s.milliseconds("settle_ms", c.preferences.settle, 1, 10000);
       s.milliseconds("poll_interval_ms", c.preferences.pollInterval, 100, 3600000);
     });
+    // Nobody waits for a commit that is not due yet.
+    c.store.commit.bytes = std::min<std::size_t>(
+        c.store.commit.bytes, std::min(c.memory.maxUserWaitingBytes, c.memory.maxWaitingBytes) / 4);
   }
 
  private:

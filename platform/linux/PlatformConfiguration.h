@@ -7,6 +7,7 @@
 
 #include "platform/linux/device/DeviceOptions.h"
 #include "platform/linux/diagnostics/LogOptions.h"
+#include "platform/linux/execution/MemoryLimits.h"
 #include "platform/linux/ipc/ListenerOptions.h"
 #include "platform/linux/settings/PreferencesOptions.h"
 #include "platform/linux/store/StoreOptions.h"
@@ -28,6 +29,7 @@ struct PlatformConfiguration {
   struct Relay {
     std::vector<std::string> backends{"store"};  // of kRelayBackendNames
   } relay;
+  MemoryLimits memory;
   StoreOptions store;
   ListenerOptions listener;
   DriverOptions drivers;

@@ -28,6 +28,31 @@ class Faults(DaemonTest):
         d.wait_until(lambda: f" refused_connections={refused} " in d.log(), "the service accounts for itself")
         self.assert_unharmed(d)
 
+    @unittest.skipUnless(os.geteuid() == 0, "needs a second user")
+    def test_whose_messages_wait_behind_a_set_up_waits_alone_and_goes_on(self):
+        d = self.daemon("[relay]\nbackends = []\n[memory]\nmax_user_waiting_bytes = 65536\n")  # set-ups take 9 s
+        os.chmod(d.folder, 0o755)
+        flood = d.client()
+        flood.started(1)
+        began = time.monotonic()
+        posts = 0
+        flood.socket.settimeout(0.5)
+        with contextlib.suppress(TimeoutError):
+            while time.monotonic() < began + 5:
+                flood.raw(frame(CALL, 1000 + posts, SEND, {"text": "x" * 1000}, 3, 1, [1]))
+                posts += 1
+        self.assertLess(time.monotonic(), began + 5, "the flood is held up")
+        os.seteuid(65534)
+        try:
+            other = d.client()
+        finally:
+            os.seteuid(0)
+        self.assertIs(other.call(CREATE, 2), True)
+        self.assertLess(time.monotonic(), began + 7, "the other user is not")
+        flood.socket.settimeout(PATIENCE)
+        flood.answer(1000 + posts - 1)
+        self.assertGreater(time.monotonic(), began + 8)
+
     def test_what_is_in_use_or_unusable_is_named(self):
         d = self.daemon()
         free = {"RUNTIME_DIRECTORY": d.folder + "/log"}

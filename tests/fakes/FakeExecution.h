@@ -68,6 +68,8 @@ class FakeWorkQueues final : public WorkQueues {
     return first != items_.end() ? std::optional(first->due) : std::nullopt;
   }
 
+  std::size_t waiting() const { return items_.size(); }
+
   int blockingScopes = 0;
   std::vector<std::pair<std::string, QualityOfService>> made;
   const WorkQueue* current = nullptr;
@@ -76,7 +78,7 @@ class FakeWorkQueues final : public WorkQueues {
   class Queue final : public WorkQueue {
    public:
     Queue(FakeWorkQueues& owner, std::string_view label) : owner_(owner), label_(label) {}
-    void async(Work work) override { asyncAfter({}, std::move(work)); }
+    void async(Work work, std::size_t) override { asyncAfter({}, std::move(work)); }
     void asyncAfter(std::chrono::nanoseconds delay, Work work) override {
       owner_.items_.push_back({owner_.clock_.steady + delay, label_, this, std::move(work)});
     }

@@ -34,7 +34,7 @@ class ConnectionTest : public IpcTest, public ConnectionHost {
   void accept() {
     events.clear();
     object = std::make_shared<TestObject>();
-    connection = std::make_shared<SocketConnection>(*this, peer.pair(), 200, 501);
+    connection = std::make_shared<SocketConnection>(*this, peer.pair(), 200, 501, kServiceItself);
     connection->setExportedInterface(testInterface());
     connection->setExportedObject(object);
     connection->setInterruptionHandler([this] { events.emplace_back("interrupted"); });
@@ -75,7 +75,7 @@ class ConnectionTest : public IpcTest, public ConnectionHost {
   ListenerCounters& counters() override { return counted; }
   CallRecorder& recorder() override { return records; }
   wire::ReadBuffers& readBuffers() override { return buffers_; }
-  bool readingPaused() override { return congested; }
+  bool readingPaused(UserIndex) override { return congested; }
   void waitForReading(const std::shared_ptr<SocketConnection>&) override { ++waits; }
   void readInTurn(uid_t user, std::shared_ptr<TurnTaker> reader) override {
     turns_.add(user, std::move(reader));
@@ -438,7 +438,7 @@ TEST_F(ConnectionTest, ShutDownWaitsForAnswersUntilTimeRunsOut) {
   EXPECT_THAT(answers(), ElementsAre("4"));
   EXPECT_THAT(events, ElementsAre("invalidated"));
 
-  connection = std::make_shared<SocketConnection>(*this, peer.pair(), 200, 501);
+  connection = std::make_shared<SocketConnection>(*this, peer.pair(), 200, 501, kServiceItself);
   connection->shutDown();  // before it was let in
   EXPECT_THAT(ask({}), ElementsAre("4"));
 }

@@ -101,7 +101,8 @@ class IpcTest : public FolderTest {
   }
 
   SystemClock clock_;
-  Executor executor_;
+  UserAccounts accounts_;
+  Executor executor_{accounts_};
   EventLoop loop_{executor_, clock_};
   ListenerOptions options;
   bool congested = false;

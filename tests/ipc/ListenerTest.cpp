@@ -162,6 +162,14 @@ TEST_F(ListenerTest, ReadingGoesOnWhenTheCongestionEndsOrTheServiceStops) {
     congested = false;
     listener_->congestionEnded();
     EXPECT_EQ(heard(clients[0]), kWelcome);
+    accounts_.setResumedHandler([this] { listener_->congestionEnded(); });
+    const UserIndex user = accounts_.enter(getuid()).value();
+    const std::size_t tooMuch = MemoryLimits().maxUserWaitingBytes + 1;
+    accounts_.add(user, MemoryKind::Waiting, tooMuch);
+    clients[0].write(frame(1, 3, kEcho, 3));
+    EXPECT_EQ(heard(clients[0]), "");
+    accounts_.remove(user, MemoryKind::Waiting, tooMuch);
+    EXPECT_EQ(heard(clients[0]), "2 3 1");
     congested = true;
     clients[0].write(frame(1, 1, kEcho, 1) + frame(1, 2, kHold, 2));
     EXPECT_EQ(heard(clients[0]), "");

@@ -47,7 +47,8 @@ class ReadTurnsTest : public testing::Test {
   }
 
   fakes::FakeClock clock;
-  Executor executor;
+  UserAccounts accounts;
+  Executor executor{accounts};
   std::shared_ptr<WorkQueue> queue = executor.makeSerial("work", QualityOfService::UserInteractive);
   ReadTurns turns{executor, clock};
   std::vector<std::shared_ptr<Reader>> readers;

@@ -66,13 +66,15 @@ TEST_F(ConfigurationTest, RangesEndWhereTheySay) {
   EXPECT_THAT(complaintsOf("[log]\nburst = 65535\nrefill_per_second = 1\n[listener]\n"
                            "max_frame_bytes = 1048576\n[drivers]\nmapped = []\n"
                            "[relay]\nbackends = []\n[store]\nmax_age_days = 3\n"
-                           "commit_interval_ms = 5\nqueue_bytes = \"64KiB\"\n"),
+                           "commit_interval_ms = 5\nqueue_bytes = \"64KiB\"\n"
+                           "[memory]\nmax_user_waiting_bytes = \"64KiB\"\n"),
               IsEmpty());
   EXPECT_EQ(configuration.log.burst, 65535u);
   EXPECT_THAT(configuration.relay.backends, IsEmpty());
   EXPECT_EQ(configuration.store.maxAgeDays, 3u);
   EXPECT_EQ(configuration.store.commit.interval.count(), 5);
-  EXPECT_EQ(configuration.store.queueBytes, 65536u);
+  EXPECT_EQ(configuration.memory.maxWaitingBytes, 65536u);
+  EXPECT_EQ(configuration.store.commit.bytes, 16384u);
   EXPECT_THAT(
       complaintsOf("[log]\nburst = 65536\nrefill_per_second = nan\n[listener]\n"
                    "max_frame_bytes = 1048577\n[store]\nmax_bytes = \"9999999999GiB\"\n"

@@ -99,7 +99,8 @@ class RecordedService {
   Rows rows;
   fakes::FakePlatform fakes;
   SystemClock steady;
-  Executor executor;
+  UserAccounts accounts;
+  Executor executor{accounts};
   EventLoop loop{executor, steady};
   SocketListener listener{loop, executor, steady, {}};
   SystemThreading threading{executor.background()};

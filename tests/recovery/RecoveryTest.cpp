@@ -91,13 +91,9 @@ class RecoveryTest : public JournalFixture {
     wall += later;
     beginLife();
     service->fakes.services.processNames.clear();  // they are dead
-    recovery.emplace(RecoveryMeans{service->fakes.installed,
-                                   service->executor,
-                                   *journal,
-                                   {"test"},
-                                   [] { return false; },
-                                   {}},
-                     std::move(left));
+    recovery.emplace(
+        RecoveryMeans{service->fakes.installed, service->executor, *journal, {"test"}, {}},
+        std::move(left));
     return recovery->run([] { return VXReportingServiceDelegate::create(); });
   }
 

@@ -96,6 +96,7 @@ TEST_F(SessionTest, DelayedSinglesGoOutInTheirOrderWhenSomebodyIsInAHurryAndOnce
   for (std::size_t i = 0; i < VXReportingDelayedMessages::kMostMessages; ++i) single(0, 20);
   run();
   EXPECT_EQ(sent(), "");
+  EXPECT_EQ(p.queues.waiting(), 1u) << "one wake-up for all";
   p.queues.advance(1s);
   for (int i = 0; i < 3; ++i) single(1, 59);
   run();

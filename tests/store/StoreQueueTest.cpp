@@ -11,7 +11,6 @@ class StoreQueueTest : public StoreTest {
   static constexpr std::size_t kRecord = sizeof(StoreRecord);
   StoreQueueTest() {
     options.commit = {.rows = 3, .bytes = 1000000, .interval = 200ms};
-    options.queueBytes = 20 * kRecord;
     p.clock.steady = Monotonic(1s);  // past for the machine: nothing really waits
   }
   bool append(std::size_t bytes = 0) { return queue().append(power(1), bytes); }
@@ -34,7 +33,6 @@ class StoreQueueTest : public StoreTest {
 };
 
 TEST_F(StoreQueueTest, BatchIsDueByRowsBytesOrTime) {
-  options.queueBytes = 2000000;
   EXPECT_EQ(take(), Turn::Nothing);
   append();
   append();
@@ -93,19 +91,27 @@ TEST_F(StoreQueueTest, HeldEventsAreDueWhenTheyWouldBeInTheQueueAndAtItsClose) {
   EXPECT_EQ(take(), Turn::End);
 }
 
-TEST_F(StoreQueueTest, CongestedAboveTheBoundUntilHalfIsReleased) {
-  append(19 * kRecord);
-  EXPECT_FALSE(queue().isCongested());
+TEST_F(StoreQueueTest, WhatWaitsIsOnTheAccountsOfWhoCausedItUntilItIsReleased) {
+  UserAccounts accounts;
+  queue().setAccounts(accounts);
+  const Cause causes[] = {{}, {.user = accounts.enter(501).value()}};
+  for (const Cause* cause : {&causes[1], &causes[0], &causes[1]}) {
+    const CauseScope scope(*cause);
+    append(kRecord);
+  }
+  const auto waiting = [&] {
+    return std::pair(accounts.bytes(0, MemoryKind::Waiting) / kRecord,
+                     accounts.bytes(causes[1].user, MemoryKind::Waiting) / kRecord);
+  };
   take();
-  append(0);
-  EXPECT_TRUE(queue().isCongested());
-  EXPECT_EQ(take(), Turn::Batch) << "nobody waits for the interval";
-  EXPECT_TRUE(batch.urgent);
-  EXPECT_FALSE(queue().release(11 * kRecord - 1));
-  EXPECT_TRUE(queue().isCongested());
-  EXPECT_TRUE(queue().release(1));
-  EXPECT_FALSE(queue().isCongested());
-  EXPECT_FALSE(queue().release(kRecord));
+  EXPECT_EQ(waiting(), std::pair(2ul, 4ul));
+  queue().release(batch, 1, 2);
+  EXPECT_EQ(waiting(), std::pair(1ul, 2ul));
+  queue().release(batch, 1, 1);
+  EXPECT_EQ(waiting(), std::pair(0ul, 0ul));
+  queue().close({});
+  append();
+  EXPECT_EQ(accounts.total(MemoryKind::Waiting), 0);
 }
 
 TEST_F(StoreQueueTest, JobsComeFirst) {

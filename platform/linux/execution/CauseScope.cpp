@@ -21,12 +21,17 @@ CauseScope::CauseScope(const Cause& cause)
     : ticket_(cause.ticket),
       place_(cause.position.place),
       depth_(cause.position.depth),
+      user_(cause.user),
       outer_(std::exchange(innermost, this)) {}
 
 CauseScope::~CauseScope() { innermost = outer_; }
 
 const JournalTicket* CauseScope::current() {
   return innermost != nullptr && innermost->ticket_ ? &innermost->ticket_ : nullptr;
+}
+
+UserIndex CauseScope::currentUser() {
+  return innermost != nullptr ? innermost->user_ : kServiceItself;
 }
 
 std::optional<WorkOrigin> CauseScope::origin() {
@@ -38,13 +43,15 @@ std::optional<WorkOrigin> CauseScope::origin() {
 
 Cause Cause::take() {
   CauseScope* const scope = innermost;
-  if (scope == nullptr || !scope->ticket_) return {};
+  if (scope == nullptr) return {};
+  if (!scope->ticket_) return {.user = scope->user_};
   const Bits bits = kBits[scope->depth_];
   // More than a call can cause; they would share the last place rather than take another's.
   const uint32_t taken = std::min(scope->taken_++, bits.most);
   return {scope->ticket_,
           {scope->place_ | taken << bits.shift,
-           std::min<uint8_t>(static_cast<uint8_t>(scope->depth_ + 1), kDeepestCause)}};
+           std::min<uint8_t>(static_cast<uint8_t>(scope->depth_ + 1), kDeepestCause)},
+          scope->user_};
 }
 
 void HeldCause::run(const Work& work) {

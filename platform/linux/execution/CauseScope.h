@@ -6,6 +6,7 @@
 #include <utility>
 
 #include "platform/WorkQueue.h"
+#include "platform/linux/execution/UserAccounts.h"
 #include "platform/linux/journal/JournalTicket.h"
 
 namespace vx::lnx {
@@ -33,14 +34,16 @@ struct RowKey {
 
 // What queued work or a row to be written holds on to. Its call is not done before it is gone.
 struct Cause {
-  JournalTicket ticket;
-  CausePosition position;
+  JournalTicket ticket{};
+  [[no_unique_address]] CausePosition position{};
+  UserIndex user = kServiceItself;  // who pays for it, also where nothing is recorded
 
   // For work that the caller queues now, or a row that it appends: takes a place. None outside of
-  // a call.
+  // a call, but for the user.
   static Cause take();
   RowKey key() const { return {ticket.namedCall(), ticket ? position.place : 0}; }
 };
+static_assert(sizeof(Cause) == 16, "one for each item and each row");
 
 // While one lives, the calling thread works because of `cause`. Confined to its thread; scopes
 // nest.
@@ -54,6 +57,7 @@ class CauseScope {
 
   // Of the innermost scope; none outside of one.
   static const JournalTicket* current();
+  static UserIndex currentUser();
   // Names the innermost scope's work; none outside of a call.
   static std::optional<WorkOrigin> origin();
 
@@ -62,15 +66,22 @@ class CauseScope {
   const JournalTicket& ticket_;
   const uint32_t place_;
   const uint8_t depth_;
+  const UserIndex user_;
   uint32_t taken_ = 0;
   CauseScope* const outer_;
 };
 
-// A cause outside of the queues. Each by one thread at a time.
+// A cause outside of the queues, of work that keeps `bytes`. Each by one thread at a time.
 class HeldCause final : public WorkCause {
  public:
-  explicit HeldCause(Cause cause) : cause_(std::move(cause)) {}
-  ~HeldCause() override { cause_.ticket.abandon(); }
+  HeldCause(Cause cause, UserAccounts& accounts, std::size_t bytes)
+      : cause_(std::move(cause)), accounts_(accounts), bytes_(bytes) {
+    accounts_.add(cause_.user, MemoryKind::Delayed, bytes_);
+  }
+  ~HeldCause() override {
+    accounts_.remove(cause_.user, MemoryKind::Delayed, bytes_);
+    cause_.ticket.abandon();
+  }
   void run(const Work& work) override;
   const Cause& cause() const { return cause_; }
   // The work has been recorded anew: it waits for that record from here on.
@@ -78,6 +89,8 @@ class HeldCause final : public WorkCause {
 
  private:
   Cause cause_;
+  UserAccounts& accounts_;
+  const std::size_t bytes_;
 };
 
 // While one lives, the calling thread works because of no call: what is queued for the service's

@@ -11,10 +11,12 @@ ConcurrentQueue::ConcurrentQueue(std::shared_ptr<Lane> lane, std::string_view la
   lane_->setConcurrentQueue(this);
 }
 
-void ConcurrentQueue::async(Work work) { lane_->postConcurrent(new WorkItem(std::move(work))); }
+void ConcurrentQueue::async(Work work, std::size_t holds) {
+  lane_->postConcurrent(new WorkItem(std::move(work)), holds);
+}
 
 void ConcurrentQueue::asyncAfter(std::chrono::nanoseconds delay, Work work) {
-  if (delay.count() <= 0) return async(std::move(work));
+  if (delay.count() <= 0) return async(std::move(work), 0);
   lane_->postDelayed(delay, nullptr, new WorkItem(std::move(work)));
 }
 

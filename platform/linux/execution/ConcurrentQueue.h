@@ -15,7 +15,7 @@ class ConcurrentQueue final : public WorkQueue {
  public:
   // `label` must outlive it. The lane's one concurrent queue.
   ConcurrentQueue(std::shared_ptr<Lane> lane, std::string_view label);
-  void async(Work work) override;
+  void async(Work work, std::size_t holds) override;
   void asyncAfter(std::chrono::nanoseconds delay, Work work) override;
   bool isCurrent() const override;
   std::string_view label() const override { return label_; }

@@ -6,11 +6,12 @@
 
 namespace vx::lnx {
 
-Executor::Executor()
-    : interactive_(std::make_shared<Lane>(LaneOptions{"vx-interactive", 0, 0})),
-      utility_(std::make_shared<Lane>(LaneOptions{"vx-utility", 5, 1})),
-      background_(std::make_shared<Lane>(LaneOptions{"vx-background", 10, 2})),
-      prompt_(std::make_shared<Lane>(LaneOptions{"vx-prompt", 0, 1})),
+Executor::Executor(UserAccounts& accounts)
+    : accounts_(accounts),
+      interactive_(std::make_shared<Lane>(LaneOptions{"vx-interactive", 0, 0}, accounts)),
+      utility_(std::make_shared<Lane>(LaneOptions{"vx-utility", 5, 1}, accounts)),
+      background_(std::make_shared<Lane>(LaneOptions{"vx-background", 10, 2}, accounts)),
+      prompt_(std::make_shared<Lane>(LaneOptions{"vx-prompt", 0, 1}, accounts)),
       concurrent_(background_, "com.quorvel.sonik.background") {}
 
 const std::shared_ptr<Lane>& Executor::lane(QualityOfService quality) const {
@@ -29,8 +30,8 @@ std::shared_ptr<WorkQueue> Executor::makeSerial(std::string_view label, QualityO
   return std::make_shared<SerialQueue>(lane(quality), label);
 }
 
-std::unique_ptr<WorkCause> Executor::takeCause() {
-  return std::make_unique<HeldCause>(Cause::take());
+std::unique_ptr<WorkCause> Executor::takeCause(std::size_t holds) {
+  return std::make_unique<HeldCause>(Cause::take(), accounts_, holds);
 }
 
 void Executor::withoutCause(const Work& work) {
@@ -40,15 +41,11 @@ void Executor::withoutCause(const Work& work) {
 
 void Executor::runPromptly(Work work) {
   const NoCause own;
-  prompt_->postConcurrent(new WorkItem(std::move(work)));
+  prompt_->postConcurrent(new WorkItem(std::move(work)), 0);
 }
 
 void Executor::setInteractiveWaker(Function<void()> wake) {
   interactive_->setWaker(std::move(wake));
-}
-
-void Executor::setUtilityLowWater(std::size_t level, Function<void()> reached) {
-  utility_->setLowWater(level, std::move(reached));
 }
 
 bool Executor::drain(Monotonic deadline) {

@@ -29,7 +29,8 @@ namespace vx::lnx {
 // to the time before there are others.
 class Executor final : public WorkQueues {
  public:
-  Executor();
+  // `accounts` outlives it, and is told of the interactive thread.
+  explicit Executor(UserAccounts& accounts);
   // stop() must have run.
   ~Executor() override = default;
   Executor(const Executor&) = delete;
@@ -37,7 +38,7 @@ class Executor final : public WorkQueues {
 
   std::shared_ptr<WorkQueue> makeSerial(std::string_view label, QualityOfService quality) override;
   WorkQueue& background() override { return concurrent_; }
-  std::unique_ptr<WorkCause> takeCause() override;
+  std::unique_ptr<WorkCause> takeCause(std::size_t holds) override;
   std::optional<WorkOrigin> currentOrigin() override { return CauseScope::origin(); }
   void withoutCause(const Work& work) override;
   void beginBlocking() override { Lane::beginBlocking(); }
@@ -49,7 +50,11 @@ class Executor final : public WorkQueues {
 
   // --- the interactive lane, for the event loop ---
   // Names the calling thread the interactive one.
-  void adoptInteractiveThread() { interactive_->adoptThread(); }
+  void adoptInteractiveThread() {
+    interactive_->adoptThread();
+    accounts_.adoptThread();
+  }
+  UserAccounts& accounts() { return accounts_; }
   bool isInteractiveThread() const { return interactive_->isThread(); }
   // Fails the process on any other thread once there is an interactive one (development builds).
   void assertInteractiveThread() const {
@@ -68,11 +73,8 @@ class Executor final : public WorkQueues {
   bool prepareToSleep() { return interactive_->prepareToSleep(); }
 
   // Items queued or running on the utility lane, delayed ones not counted: the relay work that
-  // accepted messages have caused. Reading from clients pauses while it is too large.
+  // accepted messages have caused.
   std::size_t utilityBacklog() const { return utility_->backlog(); }
-  // Called, on a lane's thread, when the backlog falls below `level` after having been at or above
-  // it.
-  void setUtilityLowWater(std::size_t level, Function<void()> reached);
 
   // Waits until the utility lane and the undelayed background work are idle, at most until the
   // deadline. True: idle.
@@ -84,6 +86,7 @@ class Executor final : public WorkQueues {
  private:
   const std::shared_ptr<Lane>& lane(QualityOfService quality) const;
 
+  UserAccounts& accounts_;
   const std::shared_ptr<Lane> interactive_;
   const std::shared_ptr<Lane> utility_;
   const std::shared_ptr<Lane> background_;

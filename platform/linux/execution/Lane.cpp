@@ -49,9 +49,9 @@ void Lane::post(std::shared_ptr<SerialQueue> queue) {
   if (mustWake) waker_();
 }
 
-void Lane::postConcurrent(WorkItem* item) {
+void Lane::postConcurrent(WorkItem* item, std::size_t holds) {
   std::unique_ptr<WorkItem> dropped;  // after the lock
-  itemQueued();
+  itemQueued(*item, holds);
   MutexLock lock(mutex_);
   if (stopping_) {
     dropped.reset(item);
@@ -79,6 +79,13 @@ void Lane::postDelayed(std::chrono::nanoseconds delay, std::shared_ptr<SerialQue
     mustWake = earliest && arrived();
   }
   if (mustWake) waker_();
+}
+
+void Lane::itemQueued(WorkItem& item, std::size_t holds) {
+  backlog_.fetch_add(1, std::memory_order_relaxed);
+  if (isInteractive()) return;
+  item.charged = static_cast<uint32_t>(std::min<std::size_t>(sizeof(WorkItem) + holds, UINT32_MAX));
+  accounts_.add(item.cause.user, MemoryKind::Waiting, item.charged);
 }
 
 bool Lane::arrived() {
@@ -132,7 +139,7 @@ void Lane::moveDue() {
     Delayed due = std::move(delayed_.back());
     delayed_.pop_back();
     if (due.queue == nullptr) {
-      itemQueued();
+      itemQueued(*due.item, 0);
       concurrent_.push(due.item);
     } else if (due.queue->enqueueDue(due.item)) {
       ready_.push_back(std::move(due.queue));
@@ -161,6 +168,7 @@ std::size_t Lane::runOne(std::size_t maxItems) {
     {
       const Current current(concurrentQueue_);
       item->run();
+      itemRan(*item);
       item.reset();
     }
     itemsDone(1);
@@ -169,17 +177,6 @@ std::size_t Lane::runOne(std::size_t maxItems) {
   }
   --running_;
   return ran;
-}
-
-void Lane::itemsDone(std::size_t count) {
-  const std::size_t before = backlog_.fetch_sub(count, std::memory_order_relaxed);
-  if (lowWaterReached_ && before >= lowWaterLevel_ && before - count < lowWaterLevel_)
-    lowWaterReached_();
-}
-
-void Lane::setLowWater(std::size_t level, Function<void()> reached) {
-  lowWaterLevel_ = level;
-  lowWaterReached_ = std::move(reached);
 }
 
 void Lane::threadMain() {

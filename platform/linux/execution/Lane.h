@@ -26,12 +26,14 @@ struct LaneOptions {
 };
 
 // The queues that have work, and the threads that run it. Thread-safe. Kept alive by its threads
-// and its queues. At most kMaxThreads threads; the items are bounded by who posts them.
+// and its queues. At most kMaxThreads threads; the items are on the accounts of those who caused
+// them.
 class Lane : public std::enable_shared_from_this<Lane> {
  public:
   static constexpr std::size_t kMaxThreads = 1024;
 
-  explicit Lane(const LaneOptions& options) : options_(options) {}
+  Lane(const LaneOptions& options, UserAccounts& accounts)
+      : options_(options), accounts_(accounts) {}
 
   // Whose item the calling thread is running, if any.
   static const WorkQueue* currentQueue();
@@ -51,7 +53,7 @@ class Lane : public std::enable_shared_from_this<Lane> {
   void post(std::shared_ptr<SerialQueue> queue);
   // Both take the item; it is dropped once the lane is stopping. `queue`: null for the concurrent
   // one.
-  void postConcurrent(WorkItem* item);
+  void postConcurrent(WorkItem* item, std::size_t holds);
   void postDelayed(std::chrono::nanoseconds delay, std::shared_ptr<SerialQueue> queue,
                    WorkItem* item);
   // Before any other thread knows the lane.
@@ -74,10 +76,14 @@ class Lane : public std::enable_shared_from_this<Lane> {
   void stop(Monotonic deadline);
 
   // Items of serial queues and concurrent ones that are queued or running.
-  void itemQueued() { backlog_.fetch_add(1, std::memory_order_relaxed); }
-  void itemsDone(std::size_t count);
+  // Those of the interactive lane are on nobody's account: they are run in the pass in which they
+  // come.
+  void itemQueued(WorkItem& item, std::size_t holds);
+  void itemRan(const WorkItem& item) {
+    if (item.charged > 0) accounts_.remove(item.cause.user, MemoryKind::Waiting, item.charged);
+  }
+  void itemsDone(std::size_t count) { backlog_.fetch_sub(count, std::memory_order_relaxed); }
   std::size_t backlog() const { return backlog_.load(std::memory_order_relaxed); }
-  void setLowWater(std::size_t level, Function<void()> reached);
 
  private:
   struct Delayed {
@@ -108,10 +114,9 @@ class Lane : public std::enable_shared_from_this<Lane> {
   void waitForChange(Monotonic deadline) REQUIRES(mutex_);
 
   const LaneOptions options_;
+  UserAccounts& accounts_;  // used by no thread after stop()
   const WorkQueue* concurrentQueue_ = nullptr;
   Function<void()> waker_;
-  std::size_t lowWaterLevel_ = 0;
-  Function<void()> lowWaterReached_;
   std::atomic<std::thread::id> interactiveThread_{};
   std::atomic<std::size_t> backlog_{0};
 

@@ -9,9 +9,9 @@ namespace vx::lnx {
 SerialQueue::SerialQueue(std::shared_ptr<Lane> lane, std::string_view label)
     : lane_(std::move(lane)), label_(label) {}
 
-void SerialQueue::async(Work work) {
+void SerialQueue::async(Work work, std::size_t holds) {
   auto* const item = new WorkItem(std::move(work));
-  lane_->itemQueued();
+  lane_->itemQueued(*item, holds);
   {
     MutexLock lock(mutex_);
     items_.push(item);
@@ -21,14 +21,14 @@ void SerialQueue::async(Work work) {
 }
 
 void SerialQueue::asyncAfter(std::chrono::nanoseconds delay, Work work) {
-  if (delay.count() <= 0) return async(std::move(work));
+  if (delay.count() <= 0) return async(std::move(work), 0);
   lane_->postDelayed(delay, shared_from_this(), new WorkItem(std::move(work)));
 }
 
 bool SerialQueue::isCurrent() const { return Lane::currentQueue() == this; }
 
 bool SerialQueue::enqueueDue(WorkItem* item) {
-  lane_->itemQueued();
+  lane_->itemQueued(*item, 0);
   MutexLock lock(mutex_);
   items_.push(item);
   return !std::exchange(scheduled_, true);
@@ -42,6 +42,7 @@ SerialQueue::Turn SerialQueue::runTurn(std::size_t maxItems) {
     while (!taken.empty() && ran < maxItems) {
       const std::unique_ptr<WorkItem> item(taken.pop());
       item->run();
+      lane_->itemRan(*item);
       ++ran;
     }
   }

@@ -12,14 +12,14 @@ namespace vx::lnx {
 
 class Lane;
 
-// Owned by whoever asked for it, and by its lane while it has work. Thread-safe. Unbounded: whoever
-// posts without end must look at the lane's backlog.
+// Owned by whoever asked for it, and by its lane while it has work. Thread-safe. Unbounded by
+// itself: what waits is on the account of whoever caused it.
 class SerialQueue final : public WorkQueue, public std::enable_shared_from_this<SerialQueue> {
  public:
   // `label` must outlive it.
   SerialQueue(std::shared_ptr<Lane> lane, std::string_view label);
 
-  void async(Work work) override;
+  void async(Work work, std::size_t holds) override;
   void asyncAfter(std::chrono::nanoseconds delay, Work work) override;
   bool isCurrent() const override;
   std::string_view label() const override { return label_; }

@@ -1,6 +1,7 @@
 // Submitted work, and lists of it.
 #pragma once
 
+#include <cstdint>
 #include <utility>
 
 #include "platform/WorkQueue.h"
@@ -23,12 +24,15 @@ struct WorkItem {
   }
   WorkItem* next = nullptr;
   Cause cause;
+  uint32_t charged = 0;  // bytes, to the account of the cause
   Work work;
 #ifndef __SANITIZE_ADDRESS__  // which would not see a use of an item that is done with
   static void* operator new(std::size_t) { return FreeList<WorkItem>::allocate(); }
   static void operator delete(void* place) { FreeList<WorkItem>::release(place); }
 #endif
 };
+
+static_assert(sizeof(WorkItem) == 96, "one for each message");
 
 // Items in order. Owns them until they are popped. Not thread-safe.
 class ItemList {

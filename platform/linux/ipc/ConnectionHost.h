@@ -5,6 +5,7 @@
 
 #include "base/Clock.h"
 #include "platform/linux/execution/EventLoop.h"
+#include "platform/linux/execution/UserAccounts.h"
 #include "platform/linux/ipc/CallRecorder.h"
 #include "platform/linux/ipc/ListenerCounters.h"
 #include "platform/linux/ipc/ListenerOptions.h"
@@ -26,9 +27,9 @@ class ConnectionHost {
   virtual ListenerCounters& counters() = 0;
   virtual CallRecorder& recorder() = 0;
   virtual wire::ReadBuffers& readBuffers() = 0;
-  // True while what has been accepted must drain first. The connection then waits for
-  // continueReading().
-  virtual bool readingPaused() = 0;
+  // True while what has been accepted, of that user or in all, must drain first. The connection
+  // then waits for continueReading().
+  virtual bool readingPaused(UserIndex user) = 0;
   virtual void waitForReading(const std::shared_ptr<SocketConnection>& connection) = 0;
   // Something has come that the connection will read in its turn.
   virtual void readInTurn(uid_t user, std::shared_ptr<TurnTaker> connection) = 0;

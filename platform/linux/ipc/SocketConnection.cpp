@@ -28,11 +28,13 @@ std::optional<int64_t> readInteger(const Value& value) {
 
 }  // namespace
 
-SocketConnection::SocketConnection(ConnectionHost& host, UniqueFd socket, pid_t pid, uid_t uid)
+SocketConnection::SocketConnection(ConnectionHost& host, UniqueFd socket, pid_t pid, uid_t uid,
+                                   UserIndex account)
     : host_(host),
       socket_(std::move(socket)),
       pid_(pid),
       uid_(uid),
+      account_(account),
       queue_(host.executor().makeSerial("com.quorvel.sonik.reporting.connection",
                                         QualityOfService::UserInteractive)),
       reader_(host.readBuffers()) {
@@ -61,7 +63,7 @@ Cause SocketConnection::recordAccepted() {
   assertInteractive();
   CallRecorder::Accepted accepted = host_.recorder().accepted(pid_, uid_);
   recordedAs_ = accepted.connection;
-  return {std::move(accepted.ticket), {}};
+  return {std::move(accepted.ticket), {}, account_};
 }
 
 void SocketConnection::async(Work work) {
@@ -145,7 +147,7 @@ void SocketConnection::runFrames(ReadTurn* turn) {
       continue;
     }
     if (mustPause()) return;
-    if (host_.readingPaused()) {
+    if (host_.readingPaused(account_)) {
       waitingForHost_ = true;
       host_.waitForReading(shared_from_this());
       return;
@@ -260,7 +262,7 @@ Cause SocketConnection::recordCall(const OperationDescription& operation, const 
     if (!called.dictionary) called.dictionary = frame.payload(*element);
     arguments.set(*element - wire::kCallHead, std::move(called.dictionary));
   }
-  return {std::move(called.ticket), {}};
+  return {std::move(called.ticket), {}, account_};
 }
 
 bool SocketConnection::admitResource(const OperationDescription& operation,
@@ -422,7 +424,7 @@ void SocketConnection::finishReading(End end) {
   // In their own turns on this connection's queue: the caller may be inside a front half.
   async([self = shared_from_this(), end] {
     {
-      Cause cause;
+      Cause cause{.user = self->account_};
       if (self->recordedAs_ != CallRecorder::kUnrecorded)
         cause.ticket = self->host_.recorder().ended(self->recordedAs_, end);
       const CauseScope scope(cause);

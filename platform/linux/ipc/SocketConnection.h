@@ -32,7 +32,7 @@ namespace vx::lnx {
 // interactive thread; handlers and front halves run on its own serial queue there, or as if they
 // did: it reads when the listener gives it a turn. Stops reading
 // while maxCallsInFlight calls are unanswered, while maxUnreadReplyBytes of replies are unread, and
-// while the service is congested; is cut when unread replies make no progress for
+// while too much of its user waits in the service; is cut when unread replies make no progress for
 // stalledClientTimeout. Holds at most maxSessionsPerConnection resources for its peer.
 class SocketConnection final : public ClientConnection,
                                public ReplyTarget,
@@ -40,7 +40,8 @@ class SocketConnection final : public ClientConnection,
                                public TurnTaker,
                                public std::enable_shared_from_this<SocketConnection> {
  public:
-  SocketConnection(ConnectionHost& host, UniqueFd socket, pid_t pid, uid_t uid);
+  // `account`: the user's, as long as this is not closed.
+  SocketConnection(ConnectionHost& host, UniqueFd socket, pid_t pid, uid_t uid, UserIndex account);
 
   // ClientConnection
   int32_t processIdentifier() const override { return pid_; }
@@ -68,6 +69,7 @@ class SocketConnection final : public ClientConnection,
   void takeTurn(ReadTurn& turn) override;
 
   uid_t user() const { return uid_; }
+  UserIndex account() const { return account_; }
   uint64_t recordedAs() const { return recordedAs_; }
   // What the service does next belongs to this connection's being accepted.
   Cause recordAccepted();
@@ -127,6 +129,7 @@ class SocketConnection final : public ClientConnection,
   UniqueFd socket_;
   const pid_t pid_;
   const uid_t uid_;
+  const UserIndex account_;
   uint64_t recordedAs_ = CallRecorder::kUnrecorded;
   const std::shared_ptr<WorkQueue> queue_;
   State state_ = State::Accepted;

@@ -8,6 +8,7 @@
 #include <systemd/sd-daemon.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstring>
 
@@ -48,6 +49,7 @@ SocketListener::SocketListener(EventLoop& loop, Executor& executor, Clock& clock
                                const ListenerOptions& limits)
     : loop_(loop),
       executor_(executor),
+      accounts_(executor.accounts()),
       clock_(clock),
       limits_(limits),
       queue_(executor.makeSerial("com.quorvel.sonik.reporting.listener",
@@ -136,14 +138,17 @@ void SocketListener::admit(UniqueFd peer) {
     return turnAway(
         peer, "the service holds " + std::to_string(connections_.size()) + " connections already");
   }
-  uint32_t& ofUser = connectionsOfUser_[who.uid];
-  if (ofUser >= limits_.maxConnectionsPerUser) {
-    return turnAway(peer, "user " + std::to_string(who.uid) + " holds " + std::to_string(ofUser) +
-                              " connections already");
+  const std::optional<UserIndex> account = accounts_.enter(who.uid);
+  if (!account) return turnAway(peer, "the service works for too many users already");
+  if (const uint32_t ofUser = accounts_.connections(*account);
+      ofUser > limits_.maxConnectionsPerUser) {
+    accounts_.leave(*account);
+    return turnAway(peer, "user " + std::to_string(who.uid) + " holds " +
+                              std::to_string(ofUser - 1) + " connections already");
   }
-  ++ofUser;
   ++counters_.accepted;
-  auto connection = std::make_shared<SocketConnection>(*this, std::move(peer), who.pid, who.uid);
+  auto connection =
+      std::make_shared<SocketConnection>(*this, std::move(peer), who.pid, who.uid, *account);
   connections_.emplace(connection.get(), connection);
   queue_->async([this, connection] {
     const std::shared_ptr<ServiceListenerDelegate> delegate = delegate_.lock();
@@ -200,16 +205,16 @@ SocketListener::recordedConnections() const {
 
 void SocketListener::waitForReading(const std::shared_ptr<SocketConnection>& connection) {
   VX_DCHECK(executor_.isInteractiveThread());
-  waiting_.push_back(connection);
+  waiting_.push_back({connection, connection->account()});
 }
 
 void SocketListener::congestionEnded() {
   const NoCause own;
   queue_->async([this] {
-    std::vector<std::weak_ptr<SocketConnection>> waiting = std::move(waiting_);
-    waiting_.clear();
-    for (const auto& weak : waiting) {
-      if (const auto connection = weak.lock()) connection->continueReading();
+    std::vector<Waiting> waiting;
+    waiting.swap(waiting_);
+    for (const Waiting& who : waiting) {
+      if (const auto connection = who.connection.lock()) connection->continueReading();
     }
   });
 }
@@ -226,8 +231,7 @@ void SocketListener::closed(SocketConnection& connection) {
   VX_DCHECK(executor_.isInteractiveThread());
   const auto found = connections_.find(&connection);
   if (found == connections_.end()) return;
-  const auto user = connectionsOfUser_.find(connection.user());
-  if (--user->second == 0) connectionsOfUser_.erase(user);
+  accounts_.leave(connection.account());
   unread_.erase(&connection);
   // Let go in a turn of its own: the caller may be a method of the connection.
   const NoCause own;
@@ -237,7 +241,8 @@ void SocketListener::closed(SocketConnection& connection) {
 
 void SocketListener::runPassEnd() {
   VX_DCHECK(executor_.isInteractiveThread());
-  if (!waiting_.empty() && !readingPaused()) congestionEnded();
+  if (std::ranges::any_of(waiting_, [this](const Waiting& w) { return !readingPaused(w.account); }))
+    congestionEnded();
   for (std::size_t i = 0; i < toFlush_.size(); ++i) toFlush_[i]->flush();
   toFlush_.clear();
 }

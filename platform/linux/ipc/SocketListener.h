@@ -30,7 +30,7 @@ class SocketListener final : public ServiceListener,
   // What lies behind the service: whether it is congested, and how to wait for what it has
   // accepted.
   struct Hooks {
-    Function<bool()> congested;  // cheap; asked before every frame
+    Function<bool()> congested;  // for everybody; cheap; asked before every frame
     Function<void()> listening;  // the endpoint accepts clients now
     Function<void()> stopping;   // it no longer does
   };
@@ -71,7 +71,9 @@ class SocketListener final : public ServiceListener,
   ListenerCounters& counters() override { return counters_; }
   CallRecorder& recorder() override { return *recorder_; }
   wire::ReadBuffers& readBuffers() override { return readBuffers_; }
-  bool readingPaused() override { return hooks_.congested(); }
+  bool readingPaused(UserIndex user) override {
+    return accounts_.isPaused(user) || hooks_.congested();
+  }
   void waitForReading(const std::shared_ptr<SocketConnection>& connection) override;
   void readInTurn(uid_t user, std::shared_ptr<TurnTaker> connection) override {
     turns_.add(user, std::move(connection));
@@ -103,6 +105,7 @@ class SocketListener final : public ServiceListener,
 
   EventLoop& loop_;
   Executor& executor_;
+  UserAccounts& accounts_;
   Clock& clock_;
   const ListenerOptions limits_;
   Hooks hooks_;
@@ -119,9 +122,12 @@ class SocketListener final : public ServiceListener,
   ReadTurns turns_;
   wire::ReadBuffers readBuffers_;
   std::unordered_map<SocketConnection*, std::shared_ptr<SocketConnection>> connections_;
-  std::unordered_map<uid_t, uint32_t> connectionsOfUser_;
   std::vector<std::shared_ptr<SocketConnection>> toFlush_;
-  std::vector<std::weak_ptr<SocketConnection>> waiting_;
+  struct Waiting {
+    std::weak_ptr<SocketConnection> connection;
+    UserIndex account;
+  };
+  std::vector<Waiting> waiting_;
   std::unordered_set<SocketConnection*> unread_;
 };
 

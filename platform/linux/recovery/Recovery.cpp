@@ -153,7 +153,9 @@ void Recovery::delayed(const Record& record) {
   if (!delayed_.emplace(record.connection, delay->position.place).second) return;
   const JournalTicket* const call = CauseScope::current();
   if (call == nullptr) return;
-  auto cause = std::make_unique<HeldCause>(Cause{*call, delay->position});
+  auto cause =
+      std::make_unique<HeldCause>(Cause{*call, delay->position}, means_.executor.accounts(),
+                                  record.dictionary->encoded().size());
   if (!delegate_->restoreDelayed(delay->facts, *record.dictionary, std::move(cause)))
     ++outcome_.unreadable;
 }
@@ -264,7 +266,8 @@ void Recovery::runInteractive() {
 
 // One that does not keep up even so holds more than it should: no more than the journal does.
 void Recovery::waitForStore() {
-  while (means_.congested() && means_.live.clock.monotonic() < means_.patience)
+  while (means_.executor.accounts().isTooMuchWaiting() &&
+         means_.live.clock.monotonic() < means_.patience)
     std::this_thread::sleep_for(kLookAgain);
 }
 

@@ -30,8 +30,7 @@ struct RecoveryMeans {
   Executor& executor;
   Journal& journal;
   std::vector<std::string> backends;  // the relay's
-  Function<bool()> congested;         // the store has more to write than it should hold
-  Monotonic patience;                 // until then that is waited for
+  Monotonic patience;                 // until then it waits for what the store has to write
 };
 
 struct RecoveryOutcome {

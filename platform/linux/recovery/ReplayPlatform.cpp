@@ -80,7 +80,7 @@ class WaitlessThreading final : public Threading {
 class RestOfDelays final : public WorkQueue {
  public:
   RestOfDelays(WorkQueue& live, Clock& clock) : live_(live), clock_(clock) {}
-  void async(Work work) override { asyncAfter({}, std::move(work)); }
+  void async(Work work, std::size_t) override { asyncAfter({}, std::move(work)); }
   void asyncAfter(std::chrono::nanoseconds delay, Work work) override {
     const JournalTicket* const call = currentCall();
     if (isWritten()) return;
@@ -110,9 +110,9 @@ class ReplayQueues final : public WorkQueues {
     return live_.makeSerial(label, QualityOfService::UserInteractive);
   }
   WorkQueue& background() override { return background_; }
-  std::unique_ptr<WorkCause> takeCause() override {
+  std::unique_ptr<WorkCause> takeCause(std::size_t holds) override {
     if (isWritten()) return nullptr;
-    return live_.takeCause();
+    return live_.takeCause(holds);
   }
   void withoutCause(const Work& work) override { live_.withoutCause(work); }
   void beginBlocking() override { live_.beginBlocking(); }

@@ -18,9 +18,8 @@
 
 namespace vx::lnx {
 
-// Thread-safe. Owned by the platform. Appending never blocks and never drops: past its byte bound
-// the store reports itself congested, and the listener stops reading from clients until it has
-// drained.
+// Thread-safe. Owned by the platform. Appending never blocks and never drops: what waits is on the
+// accounts of those who caused it, from whose clients the listener reads no more beyond a bound.
 class LocalStore final : public AnalyticsEventService, public PowerEventLog {
  public:
   using Counters = StoreCounters;
@@ -69,12 +68,8 @@ class LocalStore final : public AnalyticsEventService, public PowerEventLog {
     };
     (void)writer_.queue().appendFlush(flushed);
   }
-  bool isCongested() const { return writer_.queue().isCongested(); }  // cheap: one atomic load
-  // Called on the writer's thread when a congested store has drained to half its bound. Set before
-  // any traffic.
-  void setDrainedHandler(Function<void()> handler) {
-    writer_.setDrainedHandler(std::move(handler));
-  }
+  // Of those who pay for what waits; outlives this. Before any traffic.
+  void setAccounts(UserAccounts& accounts) { writer_.queue().setAccounts(accounts); }
 
   // Commits what is queued and ends the writer. False when rows were lost because the store could
   // not be written by the deadline; counters() and the log say how many.

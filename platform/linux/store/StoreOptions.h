@@ -24,8 +24,7 @@ struct StoreOptions {
   // Of the database file and of a journal that was moved beside it; with the log never more than
   // kSlackBytes beyond it.
   uint64_t maxBytes = 256u << 20;
-  uint32_t maxAgeDays = 30;         // 0: no limit
-  uint64_t queueBytes = 32u << 20;  // not yet committed; reading from clients pauses above it
+  uint32_t maxAgeDays = 30;  // 0: no limit
   CommitWindow commit;
 };
 

@@ -16,9 +16,21 @@ std::chrono::steady_clock::time_point steady(Monotonic time) {
 
 }  // namespace
 
+void StoreBatch::charge(UserIndex user, std::size_t more) {
+  bytes += more;
+  // Few users cause what is written together, and mostly one at a time.
+  auto found = charges.rbegin();
+  while (found != charges.rend() && found->user != user) ++found;
+  if (found == charges.rend())
+    charges.push_back({user, more});
+  else
+    found->bytes += more;
+}
+
 void StoreBatch::clear() {
   records.clear();
   flushes.clear();
+  charges.clear();
   bytes = 0;
   urgent = false;
 }
@@ -45,6 +57,7 @@ bool StoreQueue::append(StoreRecord::What what, std::size_t bytes) {
   const std::size_t size = sizeof(StoreRecord) + bytes;
   Cause cause = Cause::take();
   const double time = timeOf(cause);
+  const UserIndex user = cause.user;
   bool wake = false;
   {
     MutexLock lock(mutex_);
@@ -55,15 +68,14 @@ bool StoreQueue::append(StoreRecord::What what, std::size_t bytes) {
       record.cause.ticket.abandon();
       return false;
     }
+    // Before the taking thread can take it off again.
+    if (accounts_ != nullptr) accounts_->add(user, MemoryKind::Waiting, size);
     if (pending_.records.empty()) firstPending_ = clock_.monotonic();
     if (unrecorded) [[unlikely]]
       ++unrecorded_;
     pending_.records.push_back(std::move(record));
-    pending_.bytes += size;
-    heldBytes_ += size;
-    if (heldBytes_ > options_.queueBytes) congested_.store(true, std::memory_order_relaxed);
-    wake =
-        mustWake(isCongested() || options_.commit.isFull(pending_.records.size(), pending_.bytes));
+    pending_.charge(user, size);
+    wake = mustWake(options_.commit.isFull(pending_.records.size(), pending_.bytes));
   }
   if (wake) wake_.notifyOne();
   return true;
@@ -118,7 +130,7 @@ std::optional<Monotonic> StoreQueue::dueTime(std::optional<Monotonic> heldSince)
 
 bool StoreQueue::isDue(std::optional<Monotonic> heldSince) const {
   const std::optional<Monotonic> due = dueTime(heldSince);
-  return due && (closing_ || pending_.urgent || isCongested() ||
+  return due && (closing_ || pending_.urgent ||
                  options_.commit.isFull(pending_.records.size(), pending_.bytes) ||
                  clock_.monotonic() >= *due);
 }
@@ -129,8 +141,9 @@ StoreQueue::Turn StoreQueue::takeLocked(StoreBatch& batch, std::optional<Monoton
   batch.clear();
   batch.records.swap(pending_.records);
   batch.flushes.swap(pending_.flushes);
+  batch.charges.swap(pending_.charges);
   batch.bytes = std::exchange(pending_.bytes, 0);
-  batch.urgent = std::exchange(pending_.urgent, false) || closing_ || isCongested();
+  batch.urgent = std::exchange(pending_.urgent, false) || closing_;
   return Turn::Batch;
 }
 
@@ -162,13 +175,12 @@ std::vector<Function<void()>> StoreQueue::takeJobs() {
   return std::exchange(jobs_, {});
 }
 
-bool StoreQueue::release(std::size_t bytes) {
-  MutexLock lock(mutex_);
-  heldBytes_ -= bytes;
-  if (!congested_.load(std::memory_order_relaxed) || heldBytes_ > options_.queueBytes / 2)
-    return false;
-  congested_.store(false, std::memory_order_relaxed);
-  return true;
+void StoreQueue::release(StoreBatch& batch, std::size_t done, std::size_t left) {
+  for (StoreBatch::Charge& charge : batch.charges) {
+    const std::size_t part = done == left ? charge.bytes : charge.bytes * done / left;
+    charge.bytes -= part;
+    if (accounts_ != nullptr && part > 0) accounts_->remove(charge.user, MemoryKind::Waiting, part);
+  }
 }
 
 bool StoreQueue::waitBeforeRetry(Monotonic until) {

@@ -13,6 +13,7 @@
 #include "base/Error.h"
 #include "base/Function.h"
 #include "base/Mutex.h"
+#include "platform/linux/execution/UserAccounts.h"
 #include "platform/linux/store/StoreOptions.h"
 #include "platform/linux/store/StoreRecord.h"
 
@@ -29,17 +30,22 @@ struct StoreFlush {
 };
 
 struct StoreBatch {
+  struct Charge {
+    UserIndex user = kServiceItself;
+    std::size_t bytes = 0;
+  };
   StoreRecords records;
   std::vector<StoreFlush> flushes;  // in order
-  std::size_t bytes = 0;            // charged to the queue until release()
+  std::size_t bytes = 0;            // as taken
+  std::vector<Charge> charges;      // on whose accounts they are until release()
   bool urgent = false;              // somebody waits for its end
 
+  void charge(UserIndex user, std::size_t more);
   void clear();
 };
 
 // Owned by the store's writer. Thread-safe; one thread takes. Appending never blocks and never
-// drops: past `queueBytes` the queue is congested: what waits is due, and whoever feeds it is
-// expected to stop until half of that is left (see LocalStore).
+// drops: what waits is on the accounts of those who caused it, which bound it.
 class StoreQueue {
  public:
   StoreQueue(const StoreOptions& options, Clock& clock) : options_(options), clock_(clock) {}
@@ -47,6 +53,8 @@ class StoreQueue {
   StoreQueue(const StoreQueue&) = delete;
   StoreQueue& operator=(const StoreQueue&) = delete;
 
+  // Outlives it. Before any traffic; without, nobody is charged.
+  void setAccounts(UserAccounts& accounts) { accounts_ = &accounts; }
   // Of the calling thread's cause and the time of now. `bytes`: what the record holds besides
   // itself. False once closed: its call is not done.
   bool append(StoreRecord::What what, std::size_t bytes);
@@ -56,7 +64,6 @@ class StoreQueue {
   bool appendFlush(FlushHandler& handler, std::shared_ptr<RelayRow> session = nullptr);
   // Work for the taking thread, before anything that waits to be written.
   void runSoon(Function<void()> job);
-  bool isCongested() const { return congested_.load(std::memory_order_relaxed); }
   // Nothing is accepted any more, and what waits is due. The first deadline counts, and giveUp().
   void close(Monotonic deadline);
   void giveUp();
@@ -78,8 +85,8 @@ class StoreQueue {
   // The same, after waiting for it: never Nothing.
   Turn take(StoreBatch& batch, std::optional<Monotonic> heldSince);
   std::vector<Function<void()>> takeJobs();
-  // Bytes of a batch that are committed or lost. True: the queue was congested and no longer is.
-  bool release(std::size_t bytes);
+  // `done` of the `left` records that a batch has still are committed or lost.
+  void release(StoreBatch& batch, std::size_t done, std::size_t left);
   // Waits until `until`, or for a shorter while when closed. False: closed, and its deadline has
   // passed.
   bool waitBeforeRetry(Monotonic until);
@@ -95,18 +102,17 @@ class StoreQueue {
 
   const StoreOptions options_;
   Clock& clock_;
+  UserAccounts* accounts_ = nullptr;
   std::atomic<bool> replaying_{false};
   Mutex mutex_;
   CondVar wake_;
   StoreBatch pending_ GUARDED_BY(mutex_);
-  std::size_t heldBytes_ GUARDED_BY(mutex_) = 0;  // all that is not released, pending_ included
   Monotonic firstPending_ GUARDED_BY(mutex_);
   std::vector<Function<void()>> jobs_ GUARDED_BY(mutex_);
   enum class Sleep : uint8_t { Awake, UntilCommit, UntilWork };
   Sleep sleep_ GUARDED_BY(mutex_) = Sleep::Awake;
   bool closing_ GUARDED_BY(mutex_) = false;
   Monotonic closeDeadline_ GUARDED_BY(mutex_);
-  std::atomic<bool> congested_{false};
   std::atomic<bool> gaveUp_{false};
   std::atomic<uint64_t> unrecorded_{0};
   std::atomic<uint64_t> lost_{0};

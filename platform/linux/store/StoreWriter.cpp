@@ -287,7 +287,7 @@ void StoreWriter::onCommitted(StoreBatch& batch, std::size_t first, std::size_t 
     open_->rows.keepKnownRowsOfDelayed();
   }
   const std::size_t left = batch.records.size() - first;
-  release(batch, last - first == left ? batch.bytes : batch.bytes * (last - first) / left);
+  queue_.release(batch, last - first, left);
   const auto unanswered =
       std::find_if(batch.flushes.begin(), batch.flushes.end(),
                    [last](const StoreFlush& flush) { return flush.records > last; });
@@ -316,13 +316,8 @@ void StoreWriter::onLost(StoreBatch& batch, std::size_t first, const Status& why
          "are lost",
          why.text().c_str(), static_cast<unsigned long long>(unwritten.recorded),
          static_cast<unsigned long long>(unwritten.lost));
-  release(batch, batch.bytes);
+  queue_.release(batch, 1, 1);
   for (const StoreFlush& flush : batch.flushes) flush.handler(why.error());
-}
-
-void StoreWriter::release(StoreBatch& batch, std::size_t bytes) {
-  batch.bytes -= bytes;
-  if (queue_.release(bytes) && drained_) drained_();
 }
 
 bool StoreWriter::waitBeforeRetry(const Status& failure) {

@@ -44,10 +44,8 @@ class StoreWriter {
   StoreWriter(const StoreWriter&) = delete;
   StoreWriter& operator=(const StoreWriter&) = delete;
 
-  // Before start(): something worth a row in the ledger, and who is told, on the writer's thread,
-  // that a congested queue has drained.
+  // Before start(): something worth a row in the ledger.
   void noteAtStart(LedgerNote note) { notes_.push_back(std::move(note)); }
-  void setDrainedHandler(Function<void()> handler) { drained_ = std::move(handler); }
   void setEndWord(EndWord word) { endWord_ = word; }
   void start();
   // Nobody waits for it any more: from here on whoever has something to do goes first.
@@ -100,7 +98,6 @@ class StoreWriter {
   void makeRoomFor(std::size_t bytes);
   void onCommitted(StoreBatch& batch, std::size_t first, std::size_t last);
   void onLost(StoreBatch& batch, std::size_t first, const Status& why);
-  void release(StoreBatch& batch, std::size_t bytes);
   // False: the store is closing and time is up.
   bool waitBeforeRetry(const Status& failure);
   void add(std::vector<LedgerNote> notes);
@@ -131,9 +128,8 @@ class StoreWriter {
   StoreLoss lost_ = StoreLoss::None;  // of what was open before
   EventPairing pairing_;
   std::optional<ReplayedCalls> replayFrom_;  // until what is replayed is committed
-  Function<void()> drained_;
-  std::vector<LedgerNote> notes_;   // for the next transaction
-  std::optional<Error> lossError_;  // why rows were given up
+  std::vector<LedgerNote> notes_;            // for the next transaction
+  std::optional<Error> lossError_;           // why rows were given up
   bool failing_ = false;
   bool logHeld_ = false;  // by a reader
   std::chrono::milliseconds backoff_{0};
