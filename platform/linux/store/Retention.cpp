@@ -158,13 +158,14 @@ void Retention::measureUsers() {
   bytes_.clear();
   first_.clear();
   for (std::size_t table = 0; table < kSessions; ++table) {
-    Statement users(database_, "SELECT ifnull(uid, " + std::to_string(kNoUser) + "), sum(length(" +
-                                   kTables[table].text + ")), min(id) FROM " + kTables[table].name +
-                                   " GROUP BY 1");
-    while (users.row()) {
-      const auto user = static_cast<uint32_t>(users.integer(0));
-      addTo(bytes_, user, users.integer(1) + 1);
-      first_[{table, user}] = users.integer(2);
+    // Not grouped by the database, which would sort all rows for that, in memory.
+    Statement rows(database_, "SELECT ifnull(uid, " + std::to_string(kNoUser) + "), length(" +
+                                  kTables[table].text + "), id FROM " + kTables[table].name +
+                                  " ORDER BY id");
+    while (rows.row()) {
+      const auto user = static_cast<uint32_t>(rows.integer(0));
+      const bool first = first_.try_emplace({table, user}, rows.integer(2)).second;
+      addTo(bytes_, user, rows.integer(1) + (first ? 1 : 0));
     }
   }
   measured_ = true;
