@@ -20,6 +20,7 @@ struct Measurement {
 constexpr Measurement kMeasurements[] = {
     {"start", measureStart},
     {"roundtrip", measureRoundTrip},
+    {"flood", measureFlood},
     {"accepted", measureAccepted},
     {"sustained", measureSustained},
     {"idle", measureIdle},

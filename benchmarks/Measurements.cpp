@@ -180,6 +180,61 @@ void measureRoundTrip(Results& results, const Effort& effort) {
               2.0, 1.4, false);
 }
 
+// Two users: who connects with another effective user is one to the daemon.
+void measureFlood(Results& results, const Effort& effort) {
+  if (geteuid() != 0) return progress("a flood by another user is left out: only root can be two");
+  progress("round trips while another user floods");
+  constexpr uid_t kFlooder = 65534;
+  constexpr std::size_t kWindow = 256;
+  constexpr auto kPause = std::chrono::microseconds(500);
+  BenchDaemon daemon;
+  const std::filesystem::path folder = std::filesystem::path(daemon.socketPath()).parent_path();
+  std::filesystem::permissions(
+      folder, std::filesystem::perms::group_exec | std::filesystem::perms::others_exec,
+      std::filesystem::perm_options::add);
+  RawClient client(daemon.socketPath());
+  if (seteuid(kFlooder) != 0) throw std::runtime_error("cannot be another user");
+  RawClient other(daemon.socketPath());
+  if (seteuid(0) != 0) throw std::runtime_error("cannot be root again");
+  const int64_t ids[] = {1, 2};
+  client.create(ids[0]);
+  client.start(ids[0]);
+  other.create(ids[1]);
+  other.start(ids[1]);
+  const auto own = workloadFrames(&ids[0]);
+  const auto flood = workloadFrames(&ids[1]);
+  const auto percentile99 = [&] {
+    std::vector<double> times;
+    for (std::size_t i = 0; i < effort.roundTripsPerRound / 10; ++i) {
+      std::this_thread::sleep_for(kPause);
+      times.push_back(timedRoundTrips(client, own, 1).front());
+    }
+    return percentile(times, 0.99);
+  };
+  std::vector<double> quiet, flooded, ratios;
+  for (std::size_t round = 0; round < effort.rounds; ++round) {
+    daemon.waitUntilIdle();
+    quiet.push_back(percentile99());
+    std::atomic<bool> enough{false};
+    std::thread flooder([&] {
+      while (!enough) other.pump(flood, 10000, kWindow);
+    });
+    flooded.push_back(percentile99());
+    enough = true;
+    flooder.join();
+    ratios.push_back(flooded.back() / quiet.back());
+  }
+  results.add({.name = "flood_p99_ratio",
+               .value = median(flooded),
+               .unit = "ns",
+               .floor = median(quiet),
+               .ratio = median(ratios),
+               .reach = {},
+               .what = "a round trip each half millisecond, 99th percentile, beside one connection "
+                       "of another user that sends all it can; over the same without it"},
+              60, 10, false);
+}
+
 void measureAccepted(Results& results, const Effort& effort) {
   progress("bursts of messages into an idle store");
   constexpr std::size_t kWindow = 256;

@@ -21,6 +21,7 @@ struct Effort {
 
 void measureStart(Results& results, const Effort& effort);
 void measureRoundTrip(Results& results, const Effort& effort);
+void measureFlood(Results& results, const Effort& effort);
 void measureAccepted(Results& results, const Effort& effort);
 void measureSustained(Results& results,
                       const Effort& effort);  // stored_per_s, CPU, aggregated memory
