@@ -18,18 +18,12 @@ struct Measurement {
 };
 
 constexpr Measurement kMeasurements[] = {
-    {"start", measureStart},
-    {"roundtrip", measureRoundTrip},
-    {"flood", measureFlood},
-    {"accepted", measureAccepted},
-    {"sustained", measureSustained},
-    {"idle", measureIdle},
-    {"trickle", measureTrickle},
-    {"journal", measureCrashSafety},
-    {"sessions", measureSessions},
-    {"stop", measureStop},
-    {"client", measureClientSend},
-    {"connections", measureConnections},
+    {"start", measureStart},         {"roundtrip", measureRoundTrip},
+    {"flood", measureFlood},         {"accepted", measureAccepted},
+    {"sustained", measureSustained}, {"idle", measureIdle},
+    {"trickle", measureTrickle},     {"journal", measureCrashSafety},
+    {"sessions", measureSessions},   {"stop", measureStop},
+    {"client", measureClientSend},   {"connections", measureConnections},
 };
 
 int run(int argc, char** argv) {
