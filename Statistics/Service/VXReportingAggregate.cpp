@@ -39,20 +39,9 @@ VXReportingRows& VXReportingAggregate::rows() {
   return *rows_;
 }
 
-void VXReportingAggregate::append(std::optional<MessageKind> kind, uint64_t count,
-                                  const Payload& payload, AggregateMemory::Payer payer) {
-  rows().append(kind, count, payload);
-  rows().chargeTo(payer);
-}
-
-// A call that is run again leaves out what it left out before, however much is kept now.
-bool VXReportingAggregate::appendMessage(MessageKind kind, uint64_t count, const Payload& payload) {
-  const AggregateMemory::Account account = platform().aggregates.account();
+void VXReportingAggregate::appendMessage(MessageKind kind, uint64_t count, const Payload& payload) {
   MutexLock lock(mutex_);
-  if (!present_) return true;
-  if (platform().inputs.decide("left out", account.isFull)) return false;
-  append(kind, count, payload, account.payer);
-  return true;
+  if (present_) rows().append(kind, count, payload);
 }
 
 void VXReportingAggregate::appendReference(MessageKind kind, uint64_t count,
@@ -63,7 +52,7 @@ void VXReportingAggregate::appendReference(MessageKind kind, uint64_t count,
 
 void VXReportingAggregate::appendToFlat(const Payload& payload) {
   MutexLock lock(mutex_);
-  if (present_) append(std::nullopt, 0, payload, platform().aggregates.account().payer);
+  if (present_) rows().append(std::nullopt, 0, payload);
 }
 
 void VXReportingAggregate::insertHeader(Payload header) {

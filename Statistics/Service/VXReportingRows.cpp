@@ -3,7 +3,6 @@
 #include <array>
 #include <bit>
 #include <cstring>
-#include <utility>
 
 #include "Statistics/Service/VXReportingRowScan.h"
 #include "base/Bytes.h"
@@ -99,25 +98,6 @@ bool shorten(const uint8_t* item, uint8_t (&out)[VXReportingRowFormat::kShortDou
 }
 
 }  // namespace
-
-VXReportingRows::~VXReportingRows() {
-  for (const Share& share : shares_) memory_.charge(share.payer, -share.bytes);
-  memory_.release(blocks_);
-}
-
-void VXReportingRows::chargeTo(AggregateMemory::Payer payer) {
-  const int64_t more = static_cast<int64_t>(offset() + shapeBytes_) - charged_;
-  charged_ += more;
-  if (shares_.empty() || shares_.back().payer != payer) {
-    const auto found = std::ranges::find(shares_, payer, &Share::payer);
-    if (found == shares_.end())
-      shares_.push_back({payer, 0});
-    else
-      std::swap(*found, shares_.back());
-  }
-  shares_.back().bytes += more;
-  memory_.charge(payer, more);
-}
 
 // ---------------------------------------------------------------------------------------------------------------------
 // Rows
@@ -275,7 +255,6 @@ void VXReportingRows::addShape(std::optional<MessageKind> kind, std::span<const 
     shape.keys.push_back(cbor::text(key.data()));
     shape.keyBytes += key.size();
   }
-  shapeBytes_ += sizeof(Shape) + keys.size() * (sizeof(Column) + sizeof(std::string_view));
 }
 
 // ---------------------------------------------------------------------------------------------------------------------

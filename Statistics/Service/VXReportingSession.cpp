@@ -30,7 +30,6 @@ constexpr std::string_view kSavedStarted = "started";
 constexpr std::string_view kSavedPresent = "present";
 constexpr std::string_view kSavedAggregate = "aggregate";
 constexpr std::string_view kSavedBytes = "bytes";
-constexpr std::string_view kSavedLeftOut = "left out";
 constexpr std::string_view kSavedCounts = "counts";  // kind, count, kind, count...
 // What one client's call may be, and beside it what else a record says.
 constexpr std::size_t kMostPieceBytes = std::size_t{512} << 10;
@@ -166,7 +165,6 @@ void VXReportingSession::stop() {
     deliver(*summary, kCategoryUndefined, kMessageTypeUnknown, Keep::Reference, nullptr);
   }
   writeSummaryJson();
-  tellLeftOut();
   vyrReportingQueue_->async([self = shared_from_this()] { self->flushRelay(); });
   // Letting go of what millions of messages left takes its time: not on the queue that serves
   // everybody.
@@ -197,8 +195,7 @@ SavedSession VXReportingSession::savedState(bool& complete) const {
       .set(kSavedCounts, counts)
       .set(kSavedPresent, received.present)
       .set(kSavedAggregate, received.aggregate)
-      .set(kSavedBytes, received.bytes)
-      .set(kSavedLeftOut, leftOut_);
+      .set(kSavedBytes, received.bytes);
   saved.facts = facts.build();
   if (received_.unrecordedBytes() > 0) complete = false;
   saved.information = userInfo_->pieces(kMostPieceBytes);
@@ -227,7 +224,6 @@ std::shared_ptr<VXReportingSession> VXReportingSession::restored(
   session->serviceType_.store(code, std::memory_order_relaxed);
   session->serviceName_ = VXReportingServiceTypeName(code);
   session->started_ = started->asBool();
-  session->leftOut_ = number(kSavedLeftOut);
   std::optional<uint64_t> kind;
   for (const Value& item : counts->asArray()) {
     if (!kind) {
@@ -280,23 +276,6 @@ Payload VXReportingSession::normalizePayloadKeys(const Payload& payload) {
   return normalised.build();
 }
 
-void VXReportingSession::onLeftOut() {
-  if (leftOut_++ > 0) return;
-  VX_LOG(sessionLogScope(), Error,
-         "reporter %lli: its summary leaves out messages from here on, because whoever sends them "
-         "makes the service hold too much already",
-         static_cast<long long>(reporterID_));
-  platform().aggregates.leftOut(reporterID_, 0);
-}
-
-void VXReportingSession::tellLeftOut() {
-  if (leftOut_ == 0) return;
-  VX_LOG(sessionLogScope(), Error, "reporter %lli: its summary leaves out %llu messages",
-         static_cast<long long>(reporterID_), static_cast<unsigned long long>(leftOut_));
-  platform().aggregates.leftOut(reporterID_, leftOut_);
-  leftOut_ = 0;
-}
-
 void VXReportingSession::sendMessage(const Payload& message, MessageCategory category,
                                      MessageType type, Sync, MessageReply reply) {
   deliver(message, category, type, Keep::Copy, std::move(reply));
@@ -312,11 +291,10 @@ void VXReportingSession::deliver(const Payload& message, MessageCategory categor
   }
   Payload normalised = normalizePayloadKeys(message);
   const KindCount identifier = nextIdentifier(category, type);
-  if (keep == Keep::Copy) {
-    if (!received_.appendMessage(identifier.kind, identifier.count, normalised)) onLeftOut();
-  } else {
+  if (keep == Keep::Copy)
+    received_.appendMessage(identifier.kind, identifier.count, normalised);
+  else
     received_.appendReference(identifier.kind, identifier.count, normalised);
-  }
   platform().trace.emit(kTraceMessage, 0, 0, 0, 0);
   // What the client sent goes along only where it is another object: a count less to keep.
   std::optional<Payload> asSent;

@@ -150,8 +150,6 @@ class VXReportingSession : public std::enable_shared_from_this<VXReportingSessio
   VXReportingSession(ReporterID reporterID, std::vector<int32_t> processIdentifiers);
   void mergeIntoUserInfo(const std::optional<Payload>& entries);
   KindCount nextIdentifier(MessageCategory category, MessageType type);
-  void onLeftOut();
-  void tellLeftOut();
   enum class Keep : uint8_t { Copy, Reference };
   void deliver(const Payload& message, MessageCategory category, MessageType type, Keep keep,
                MessageReply reply);
@@ -188,7 +186,6 @@ class VXReportingSession : public std::enable_shared_from_this<VXReportingSessio
   std::shared_ptr<DriverSnapShot> driverSnapShot_;
   Function<void(bool)> transactionCompleteBlock_;
   VXReportingAggregate received_;             // what aggregatedPayloadData and its nested form show
-  uint64_t leftOut_ = 0;                      // messages that it has not taken
   std::vector<KindCount> messageTypeCounts_;  // bounded by the number of kinds, some hundreds
   std::shared_ptr<WorkQueue> vyrReportingQueue_;
   std::shared_ptr<RelaySetUp> relaySetUp_;  // of the last start

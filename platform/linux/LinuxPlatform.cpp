@@ -109,13 +109,6 @@ class RunningPlatform final : public LinuxPlatform {
                            // A call that is run again would not do it: it takes no place in one.
                            executor_.withoutCause(
                                [&] { executor_.background().async(std::move(work)); });
-                         },
-                     .accounts = &accounts_,
-                     .leftOut =
-                         [this](int64_t reporterID, uint64_t messages) {
-                           store_->note({"aggregate_left_out", "", static_cast<int64_t>(messages),
-                                         "reporter " + std::to_string(reporterID) +
-                                             (messages == 0 ? ": from here on" : "")});
                          }}),
         loop_(executor_, clock_),
         listener_(loop_, executor_, clock_, configuration.listener),

@@ -16,10 +16,7 @@ class UserAccountsTest : public ::testing::Test {
   void done(UserIndex user, std::size_t bytes) {
     std::thread([&] { accounts.remove(user, MemoryKind::Waiting, bytes); }).join();
   }
-  UserAccounts accounts{{.maxUserBytes = 2000,
-                         .maxBytes = 3500,
-                         .maxUserWaitingBytes = 500,
-                         .maxWaitingBytes = 1000}};
+  UserAccounts accounts{{.maxUserWaitingBytes = 500, .maxWaitingBytes = 1000}};
   const UserIndex a = accounts.enter(501).value();
   const UserIndex b = accounts.enter(502).value();
   const UserIndex c = accounts.enter(503).value();
@@ -61,27 +58,6 @@ TEST_F(UserAccountsTest, WhenTooMuchWaitsTheBoundIsAnEqualShare) {
   EXPECT_FALSE(accounts.isPaused(kServiceItself));
   done(a, 235);
   EXPECT_EQ(resumed, 1);
-}
-
-TEST_F(UserAccountsTest, WhoHoldsTooMuchOfAllKindsIsFullUntilHeHoldsLess) {
-  accounts.add(a, MemoryKind::Aggregates, 1500);
-  add(a, 500);
-  EXPECT_FALSE(accounts.isFull(a));
-  accounts.add(b, MemoryKind::Delayed, 1400);
-  add(a, 1);
-  EXPECT_TRUE(accounts.isFull(a));
-  done(a, 1);
-  accounts.add(c, MemoryKind::Aggregates, 99);
-  add(a, 0);
-  EXPECT_TRUE(accounts.isFull(a)) << "nobody looks before something changes";
-  accounts.remove(a, MemoryKind::Aggregates, 1);
-  add(a, 1);
-  EXPECT_FALSE(accounts.isFull(a));
-  accounts.add(kServiceItself, MemoryKind::Aggregates, 2);
-  add(b, 1);
-  EXPECT_TRUE(accounts.isFull(b)) << "a third of all is his";
-  EXPECT_FALSE(accounts.isFull(c));
-  EXPECT_FALSE(accounts.isFull(kServiceItself));
 }
 
 TEST_F(UserAccountsTest, AnAccountIsAnothersOnceItsUserHoldsNothing) {

@@ -70,34 +70,6 @@ TEST_F(SessionTest, RelaySessionCarriesWhatTheSetUpTook) {
             "vxrr 1987605106 com.quorvel.sonik reporting_session_verbose 31");
 }
 
-TEST_F(SessionTest, WhoeverHoldsTooMuchIsLeftOutOfTheAggregateAndOfNothingElse) {
-  const auto s = make();
-  s->start();
-  auto& memory = p.aggregates;
-  const auto send = [&](AggregateMemory::Payer payer, bool full, int64_t n) {
-    memory.payer = payer;
-    memory.full = full;
-    s->sendMessage(dictionary("n", n), 1, 1, nullptr);
-  };
-  send(7, false, 1);
-  send(8, false, 2);
-  for (int i = 0; i < 3; ++i) send(8, true, 3);
-  send(7, false, 4);
-  run();
-  EXPECT_EQ(s->aggregatedPayloadData()->size(), 3u);
-  EXPECT_EQ(s->messageIdForCategory(1, 1), messageIdentifier(messageKind(1, 1), 7));
-  EXPECT_EQ(p.vyr.sent.size(), 6u);
-  EXPECT_GT(memory.charged[7], memory.charged[8]);
-  EXPECT_GT(memory.charged[8], 0);
-  const std::pair<int64_t, uint64_t> begin{s->reporterID(), 0};
-  EXPECT_EQ(memory.told, std::vector{begin});
-  s->stop();
-  run();
-  EXPECT_EQ(memory.told, (std::vector{begin, {begin.first, 3}}));
-  EXPECT_EQ(memory.charged[7], 0);
-  EXPECT_EQ(memory.charged[8], 0);
-}
-
 TEST_F(SessionTest, EventsNeedNeitherAMessageNorASession) {
   VXReportingWattmarkUtility::handleEvent(nullptr, 1, 6, nullptr);
   VXReportingTallyhubBridge::handleEvent(nullptr, 0x10000009, 0xFFFF, nullptr);

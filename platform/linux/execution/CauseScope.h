@@ -58,8 +58,6 @@ class CauseScope {
   // Of the innermost scope; none outside of one.
   static const JournalTicket* current();
   static UserIndex currentUser();
-  // The place that Cause::take() would give next; 0 outside of a call.
-  static uint32_t nextPlace();
   // Names the innermost scope's work; none outside of a call.
   static std::optional<WorkOrigin> origin();
 

@@ -13,10 +13,8 @@ constexpr std::size_t kMostUnseen = 16 << 10;
 
 UserAccounts::UserAccounts(const MemoryLimits& limits)
     : limits_(limits),
-      quantum_(std::min<std::size_t>(kMostUnseen,
-                                     std::min({limits.maxUserWaitingBytes, limits.maxWaitingBytes,
-                                               limits.maxUserBytes, limits.maxBytes}) /
-                                         256)) {
+      quantum_(std::min<std::size_t>(
+          kMostUnseen, std::min(limits.maxUserWaitingBytes, limits.maxWaitingBytes) / 256)) {
   chunks_[0] = new Chunk;
 }
 
@@ -34,13 +32,6 @@ std::optional<UserIndex> UserAccounts::enter(uid_t user) {
 }
 
 void UserAccounts::leave(UserIndex user) { --at(user).connections; }
-
-int64_t UserAccounts::allBytesOf(const Account& account) {
-  int64_t all = 0;
-  for (std::size_t kind = 0; kind < kMemoryKinds; ++kind)
-    all += bytesOf(account, static_cast<MemoryKind>(kind));
-  return all;
-}
 
 bool UserAccounts::isIdle(const Account& account) {
   if (account.connections > 0) return false;
@@ -69,34 +60,28 @@ int64_t UserAccounts::total(MemoryKind kind) const {
   return total;
 }
 
-// Of a user who has so many bytes of some kind: his bound, or his share while all have too many.
-template <class BytesOf>
-int64_t UserAccounts::boundOf(int64_t own, uint64_t ofUser, uint64_t ofAll,
-                              const BytesOf& bytesOf) const {
-  const auto most = static_cast<int64_t>(ofAll);
-  const auto bound = static_cast<int64_t>(ofUser);
+// Of a user who has so much waiting.
+int64_t UserAccounts::waitingBound(int64_t own) const {
+  const auto most = static_cast<int64_t>(limits_.maxWaitingBytes);
+  const auto ofUser = static_cast<int64_t>(limits_.maxUserWaitingBytes);
   // Below the least share that there can be, the others need not be asked.
-  if (own <= most / static_cast<int64_t>(used_)) return bound;
-  int64_t total = bytesOf(at(kServiceItself));
+  if (own <= most / static_cast<int64_t>(used_)) return ofUser;
+  int64_t total = bytesOf(at(kServiceItself), MemoryKind::Waiting);
   int64_t users = 0;
   for (std::size_t i = 1; i < used_; ++i) {
-    const int64_t bytes = bytesOf(at(static_cast<UserIndex>(i)));
-    total += bytes;
-    users += bytes > 0 ? 1 : 0;
+    const int64_t waiting = bytesOf(at(static_cast<UserIndex>(i)), MemoryKind::Waiting);
+    total += waiting;
+    users += waiting > 0 ? 1 : 0;
   }
-  return total <= most ? bound : std::min(bound, most / std::max<int64_t>(users, 1));
+  return total <= most ? ofUser : std::min(ofUser, most / std::max<int64_t>(users, 1));
 }
 
 void UserAccounts::look(Account& account) {
   account.sinceLook = 0;
-  const int64_t all = allBytesOf(account);
-  account.full = all > boundOf(all, limits_.maxUserBytes, limits_.maxBytes, allBytesOf);
   if (account.paused.load()) return;
-  const auto waitingOf = [](const Account& of) { return bytesOf(of, MemoryKind::Waiting); };
-  const int64_t waiting = waitingOf(account);
-  const int64_t bound =
-      boundOf(waiting, limits_.maxUserWaitingBytes, limits_.maxWaitingBytes, waitingOf);
-  if (waiting <= bound) return;
+  const int64_t own = bytesOf(account, MemoryKind::Waiting);
+  const int64_t bound = waitingBound(own);
+  if (own <= bound) return;
   ++pauses_;
   account.resumeAt.store(bound / 2);
   account.paused.store(true);

@@ -24,9 +24,8 @@ inline constexpr UserIndex kServiceItself = 0;
 enum class MemoryKind : uint8_t {
   Waiting,  // work of the relay and standalone queues, and records of the store
   Delayed,  // standalone messages in their delay
-  Aggregates,
 };
-inline constexpr std::size_t kMemoryKinds = 3;
+inline constexpr std::size_t kMemoryKinds = 2;
 
 // The accounts of the users. Owned by the platform, which it outlives nobody of. add() and remove()
 // are for any thread, everything else for the interactive one. Counting takes no lock, and the
@@ -35,8 +34,7 @@ inline constexpr std::size_t kMemoryKinds = 3;
 //
 // A user whose work waits beyond his bound is paused: whoever reads from his clients stops until
 // half of it is done. While all that waits is beyond its bound too, his bound is no more than his
-// share of it, an equal one for each user that has something waiting. In the same way a user is
-// full whose bytes of all kinds are beyond his bound: nothing more is to be kept for him.
+// share of it, an equal one for each user that has something waiting.
 //
 // Bounded: kMostUsers accounts, each for good; those that are not used are used again.
 class UserAccounts {
@@ -83,14 +81,6 @@ class UserAccounts {
       look(account);
     return account.paused.load(std::memory_order_relaxed);
   }
-  // Cheap: asked before something is kept.
-  bool isFull(UserIndex user) {
-    if (user == kServiceItself) return false;
-    Account& account = at(user);
-    if (account.sinceLook >= quantum_) [[unlikely]]
-      look(account);
-    return account.full;
-  }
   // All that waits is beyond its bound.
   bool isTooMuchWaiting() const {
     return total(MemoryKind::Waiting) > static_cast<int64_t>(limits_.maxWaitingBytes);
@@ -107,7 +97,6 @@ class UserAccounts {
     std::size_t sinceLook = 0;              // bytes added
     uint32_t connections = 0;
     uid_t user = 0;
-    bool full = false;
     alignas(kLine) Counts byOthers{};
     alignas(kLine) std::atomic<bool> paused{false};
     std::atomic<int64_t> resumeAt{0};
@@ -123,12 +112,10 @@ class UserAccounts {
     return account.byInteractive[index(kind)].load(std::memory_order_relaxed) +
            account.byOthers[index(kind)].load();
   }
-  static int64_t allBytesOf(const Account& account);
   static bool isIdle(const Account& account);
   UserIndex accountFor(uid_t user);
   void look(Account& account);
-  template <class BytesOf>
-  int64_t boundOf(int64_t own, uint64_t ofUser, uint64_t ofAll, const BytesOf& bytesOf) const;
+  int64_t waitingBound(int64_t own) const;
   void maybeResume(Account& account);
 
   const MemoryLimits limits_;

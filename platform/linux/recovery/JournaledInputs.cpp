@@ -16,13 +16,6 @@ std::optional<Payload> JournaledInputs::once(std::string_view what,
   return answer;
 }
 
-bool JournaledInputs::decide(std::string_view what, bool now) {
-  const JournalTicket* const call = CauseScope::current();
-  if (now && call != nullptr && journal_ != nullptr)
-    (void)journal_->note(*call, kInputNote, writeInput(CauseScope::nextPlace(), what, Payload()));
-  return now;
-}
-
 // Where there is no space the call waits with its work.
 void JournaledInputs::keepDelayed(const Payload& facts, const Payload& content, WorkCause& cause) {
   auto& held = static_cast<HeldCause&>(cause);
