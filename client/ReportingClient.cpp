@@ -187,7 +187,7 @@ ClientStatus ReportingClient::killService(std::chrono::milliseconds patience) {
   const ClientResult<bool> ended = blocking<bool>(*connection_, patience, [&](Callback<bool> done) {
     const ClientStatus taken = call(
         *connection_, Operation::KillService, 0, [](CborWriter&) {}, std::move(done));
-    const ClientStatus written = taken.ok() ? flush() : taken;
+    ClientStatus written = taken.ok() ? flush() : taken;
     sent = written.ok();
     return written;
   });
