@@ -42,7 +42,7 @@ class ReadTurnsTest : public testing::Test {
   // What one round gave to whom.
   std::string round() {
     took.clear();
-    more = turns.runRound();
+    somebodyLeft = turns.runRound();
     return took;
   }
 
@@ -53,7 +53,7 @@ class ReadTurnsTest : public testing::Test {
   ReadTurns turns{executor, clock};
   std::vector<std::shared_ptr<Reader>> readers;
   std::string took;
-  bool more = false;
+  bool somebodyLeft = false;
 };
 
 TEST_F(ReadTurnsTest, ConnectionsDoNotBuyTime) {
@@ -61,7 +61,7 @@ TEST_F(ReadTurnsTest, ConnectionsDoNotBuyTime) {
   add(1, 'b', 10us, 1);
   EXPECT_EQ(round(), "aaab");  // 500 us, and then the other's turn
   EXPECT_EQ(round(), "aab");   // 100 us were too much before
-  EXPECT_TRUE(more);
+  EXPECT_TRUE(somebodyLeft);
 }
 
 TEST_F(ReadTurnsTest, EachConnectionHasItsTurnBeforeOneHasTwo) {
@@ -79,7 +79,7 @@ TEST_F(ReadTurnsTest, WhatWasTakenTooMuchIsOwedWhileOthersWait) {
   EXPECT_EQ(round(), "b");
   EXPECT_EQ(round(), "ab");  // 1100 us are paid for
   EXPECT_EQ(round(), "a");   // who is alone owes nobody
-  EXPECT_TRUE(more);
+  EXPECT_TRUE(somebodyLeft);
 }
 
 TEST_F(ReadTurnsTest, AfterTheEndNobodyReads) {
@@ -87,7 +87,7 @@ TEST_F(ReadTurnsTest, AfterTheEndNobodyReads) {
   turns.end();
   add(1, 'b', 1us, 1);
   EXPECT_EQ(round(), "");
-  EXPECT_FALSE(more);
+  EXPECT_FALSE(somebodyLeft);
 }
 
 }  // namespace
