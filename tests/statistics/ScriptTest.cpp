@@ -2,7 +2,6 @@
 // is traced, logged and answered, what others are handed, and the time that passed by itself.
 #include <cmath>
 #include <iomanip>
-#include <regex>
 #include <sstream>
 
 #include "tests/statistics/ServiceFixture.h"
@@ -178,7 +177,9 @@ class ScriptTest : public ServiceTest, public ::testing::WithParamInterface<cons
     handed(p.services.files, [](const auto& file) {
       const std::string text =
           file.second.substr(0, file.second.size() - 1);  // ends with a newline
-      return std::regex_replace(text, std::regex("\n"), "\n    ");
+      std::string indented;
+      for (const char c : text) indented += c == '\n' ? std::string("\n    ") : std::string(1, c);
+      return indented;
     });
     return seen;
   }
