@@ -126,6 +126,9 @@ TEST_F(ListenerTest, ConnectionsInAllAreLimited) {
 }
 
 TEST_F(ListenerTest, WithoutADescriptorToSpareAcceptingWaits) {
+#ifdef __SANITIZE_ADDRESS__
+  GTEST_SKIP() << "the checks of this build need descriptors themselves";
+#endif
   serve([&] {
     connect();
     rlimit before{};

@@ -99,7 +99,12 @@ class RecordedService {
   Rows rows;
   fakes::FakePlatform fakes;
   SystemClock steady;
-  UserAccounts accounts;
+  // The process state of a test, which may end later, holds delayed messages that are on these.
+  static UserAccounts& sharedAccounts() {
+    static UserAccounts shared{MemoryLimits{}};
+    return shared;
+  }
+  UserAccounts& accounts = sharedAccounts();
   Executor executor{accounts};
   EventLoop loop{executor, steady};
   SocketListener listener{loop, executor, steady, {}};
