@@ -11,6 +11,8 @@ namespace vx {
 
 namespace {
 
+const Payload kNoMessage;
+
 // The event name of a kind, made when the kind is first met and kept for ever.
 std::string_view eventName(MessageKind kind) {
   static std::array<std::atomic<const std::string*>, kMessageKinds> names{};
@@ -31,10 +33,10 @@ void VXReportingTallyhubBridge::handleEvent(const Payload* payload, MessageCateg
   // own dictionary is put together only if and when the service wants it.
   std::optional<Payload> userInfo;
   if (session != nullptr) userInfo = session->userInfo()->snapshot();
-  const Payload message = payload != nullptr ? *payload : Payload();
+  const Payload& message = payload != nullptr ? *payload : kNoMessage;
   platform().analytics.sendEventLazy(
       eventName(messageKind(category, type)),
-      [message, userInfo = std::move(userInfo)] {
+      [message = Payload(message), userInfo = std::move(userInfo)] {
         return VXReportingHostApplicationDisplayID(userInfo).addedTo(message,
                                                                      kHostApplicationDisplayIDKey);
       },

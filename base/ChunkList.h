@@ -45,10 +45,13 @@ class ChunkList {
     return *(first(i / kLargest) + i % kLargest);
   }
 
-  void push_back(T value) {
+  void push_back(T value) { emplace_back(std::move(value)); }
+  template <class... Arguments>
+  T& emplace_back(Arguments&&... arguments) {
     if (at_ == end_) beginChunk();
-    ::new (static_cast<void*>(at_)) T(std::move(value));
+    T* const made = ::new (static_cast<void*>(at_)) T(std::forward<Arguments>(arguments)...);
     ++at_;
+    return *made;
   }
   // Copies all of them to the end; a run may lie in several chunks.
   void append(std::span<const T> values) {

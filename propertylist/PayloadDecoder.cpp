@@ -172,7 +172,7 @@ inline void Validator::endElement(uint64_t next) {
   nonFinite_ = false;
 }
 
-inline bool Validator::readHead(cbor::Head& head) {
+[[gnu::always_inline]] inline bool Validator::readHead(cbor::Head& head) {
   if (at_ == end_) return fail(at_, "ends too early");
   const uint8_t* const start = at_;
   const uint8_t initial = *at_++;
@@ -252,7 +252,7 @@ inline bool Validator::readText(const cbor::Head& head, const uint8_t* at) {
   return true;
 }
 
-inline bool Validator::readValue() {
+[[gnu::always_inline]] inline bool Validator::readValue() {
   const uint8_t* const start = at_;
   cbor::Head head;
   if (!readHead(head)) return false;

@@ -72,6 +72,7 @@ void Lane::postDelayed(std::chrono::nanoseconds delay, std::shared_ptr<SerialQue
       dropped.reset(item);
       return;
     }
+    hasDelayed_.store(true, std::memory_order_relaxed);
     const bool earliest = delayed_.empty() || due < delayed_.front().due;
     delayed_.push_back({due, nextOrder_++, std::move(queue), item});
     std::push_heap(delayed_.begin(), delayed_.end());
@@ -145,6 +146,7 @@ void Lane::moveDue() {
       ready_.push_back(std::move(due.queue));
     }
   }
+  hasDelayed_.store(!delayed_.empty(), std::memory_order_relaxed);
 }
 
 // ---------------------------------------------------------------------------------------------------------------------
@@ -238,6 +240,9 @@ void Lane::endBlocking() {
 // The interactive lane
 
 bool Lane::run(std::size_t maxItems) {
+  // Asked several times a pass, mostly for nothing. What another thread is just about to queue is
+  // seen by prepareToSleep.
+  if (backlog() == 0 && !hasDelayed_.load(std::memory_order_relaxed)) return false;
   MutexLock lock(mutex_);
   moveDue();
   while (maxItems > 0 && hasWork()) {
@@ -255,6 +260,7 @@ bool Lane::prepareToSleep() {
 }
 
 std::optional<Monotonic> Lane::nextDue() {
+  if (!hasDelayed_.load(std::memory_order_relaxed)) return std::nullopt;
   MutexLock lock(mutex_);
   if (delayed_.empty()) return std::nullopt;
   return delayed_.front().due;

@@ -119,6 +119,7 @@ class Lane : public std::enable_shared_from_this<Lane> {
   Function<void()> waker_;
   std::atomic<std::thread::id> interactiveThread_{};
   std::atomic<std::size_t> backlog_{0};
+  std::atomic<bool> hasDelayed_{false};  // delayed_ is not empty; set under the lock
 
   Mutex mutex_;
   CondVar wake_;     // for sleeping threads

@@ -19,9 +19,9 @@ using Wanted = const char*;
 
 Wanted readUnsigned(const Value& value, int64_t most, Wanted otherwise, CallArguments& arguments,
                     std::size_t i) {
-  if (value.kind() != ValueKind::Integer || value.asInt64() < 0 || value.asInt64() > most)
-    return otherwise;
-  arguments.set(i, static_cast<uint64_t>(value.asInt64()));
+  const int64_t number = value.asInt64();
+  if (value.kind() != ValueKind::Integer || number < 0 || number > most) return otherwise;
+  arguments.set(i, static_cast<uint64_t>(number));
   return nullptr;
 }
 

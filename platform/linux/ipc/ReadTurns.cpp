@@ -15,10 +15,20 @@ void ReadTurns::add(uid_t user, std::shared_ptr<TurnTaker> reader) {
   if (ended_) return;
   const auto [found, isNew] = byUid_.try_emplace(user);
   if (isNew) {
-    found->second = users_.emplace(users_.end());
+    found->second = idle_.emplace(idle_.begin());
     found->second->uid = user;
   }
-  found->second->readers.push_back(std::move(reader));
+  User& of = *found->second;
+  if (!std::exchange(of.wantsTurns, true)) users_.splice(users_.end(), idle_, found->second);
+  of.readers.push_back(std::move(reader));
+}
+
+void ReadTurns::becomeIdle(std::list<User>::iterator user) {
+  user->wantsTurns = false;
+  idle_.splice(idle_.begin(), users_, user);
+  if (idle_.size() <= kMostIdle) return;
+  byUid_.erase(idle_.back().uid);
+  idle_.pop_back();
 }
 
 bool ReadTurns::runRound() {
@@ -29,8 +39,7 @@ bool ReadTurns::runRound() {
     runTurnOf(*user);
     if (ended_) break;
     if (user->readers.empty() && user->debt.count() == 0) {
-      byUid_.erase(user->uid);
-      users_.erase(user);
+      becomeIdle(user);
     } else {
       users_.splice(users_.end(), users_, user);
     }

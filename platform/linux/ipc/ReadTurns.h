@@ -74,14 +74,19 @@ class ReadTurns {
     uid_t uid = 0;
     std::deque<std::shared_ptr<TurnTaker>> readers;
     std::chrono::nanoseconds debt{0};
+    bool wantsTurns = false;  // in users_
   };
+  // Who reads no more is remembered for a while: he is likely to come again, and his place is made.
+  static constexpr std::size_t kMostIdle = 16;
 
   void runTurnOf(User& user);
+  void becomeIdle(std::list<User>::iterator user);
 
   Executor& executor_;
   Clock& clock_;
   bool ended_ = false;
   std::list<User> users_;  // in the order of their turns; those with readers or a debt
+  std::list<User> idle_;   // the last to become so first
   std::unordered_map<uid_t, std::list<User>::iterator> byUid_;
 };
 

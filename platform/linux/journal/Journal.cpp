@@ -240,7 +240,7 @@ inline void Journal::publish(EntryHeader* entry, std::size_t length) {
           std::memory_order_relaxed);
   store(entry->length, static_cast<uint32_t>(length), std::memory_order_release);
   ++counters_.appended;
-  counters_.bytes += length;
+  bytesAppended_.store(bytesAppended() + length, std::memory_order_relaxed);
 }
 
 // --------------------------------------------------------------------------------------- segments
@@ -389,6 +389,7 @@ JournalCounters Journal::counters() const {
   MutexLock lock(mutex_);
   JournalCounters counters = counters_;
   counters.segmentsInUse = segmentsInUse();
+  counters.bytes = bytesAppended();
   return counters;
 }
 

@@ -112,6 +112,8 @@ class Journal {
   // Whether every call of this process is done.
   bool allDone() const;
   JournalCounters counters() const;
+  // Of all entries so far. From any thread, without a lock.
+  uint64_t bytesAppended() const { return bytesAppended_.load(std::memory_order_relaxed); }
 
  private:
   enum class Use { Calls, Ends, Snapshot };
@@ -137,6 +139,7 @@ class Journal {
   const JournalOptions options_;
   const JournalFolder folder_;
   std::atomic<bool> full_{false};
+  std::atomic<uint64_t> bytesAppended_{0};
   mutable Mutex mutex_;
   JournalSegment::Pointer active_ GUARDED_BY(mutex_);
   std::size_t offset_ GUARDED_BY(mutex_) = kSegmentBytes;  // of the next entry

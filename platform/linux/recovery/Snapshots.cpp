@@ -14,15 +14,14 @@ constexpr std::chrono::seconds kAfterFailure{5};
 
 }  // namespace
 
-// The counters are asked for once a pass, under a lock that is free.
 void Snapshots::afterPass() {
-  const JournalCounters journal = means_.journal.counters();
-  const bool recorded = journal.bytes != std::exchange(seenBytes_, journal.bytes);
+  const uint64_t bytes = means_.journal.bytesAppended();
+  const bool recorded = bytes != std::exchange(seenBytes_, bytes);
   if (recorded && seenBytes_ - bytesThen_ >= kWorthwhileBytes)
     lastRecorded_ = means_.clock.monotonic();
   const bool full = !means_.journal.hasCapacity();
   if (full != nextLook_.has_value()) watchCapacity();
-  if (state_ == State::Idle && (demanded_ || recorded || full) && isWanted(journal)) begin(journal);
+  if (state_ == State::Idle && (demanded_ || recorded || full) && isWanted()) begin();
   if (state_ != State::Waiting) return;
   if (means_.journal.earlierCallsAreDone()) return complete();
   if (full && !std::exchange(urged_, true)) means_.commitSoon();
@@ -33,10 +32,10 @@ void Snapshots::watchCapacity() {
   if (!means_.journal.hasCapacity()) nextLook_ = means_.clock.monotonic() + kLookAgain;
 }
 
-bool Snapshots::isWanted(const JournalCounters& journal) {
+bool Snapshots::isWanted() {
   if (notBefore_ > Monotonic() && means_.clock.monotonic() < notBefore_) return false;
   return demanded_ || !means_.journal.hasCapacity() ||
-         journal.bytes - bytesThen_ >= std::max(kBytesBetween, 2 * counters_.bytes);
+         seenBytes_ - bytesThen_ >= std::max(kBytesBetween, 2 * counters_.bytes);
 }
 
 std::optional<Monotonic> Snapshots::nextDue() const {
@@ -52,14 +51,14 @@ void Snapshots::onDue() {
     if (means_.journal.lookForCapacity()) means_.freed();
     return watchCapacity();
   }
-  if (state_ == State::Idle) begin(means_.journal.counters());
+  if (state_ == State::Idle) begin();
 }
 
-void Snapshots::begin(const JournalCounters& journal) {
+void Snapshots::begin() {
   demanded_ = false;
   urged_ = false;
   if (const Status began = means_.journal.beginGeneration(); !began.ok()) return giveUp();
-  bytesThen_ = seenBytes_ = journal.bytes;
+  bytesThen_ = seenBytes_ = means_.journal.bytesAppended();
   connections_ = means_.connections();
   means_.began();
   state_ = State::Asked;
@@ -106,7 +105,7 @@ void Snapshots::add(SavedClient& client) {
 
 void Snapshots::complete() {
   const Monotonic began = means_.clock.monotonic();
-  const uint64_t before = means_.journal.counters().bytes;
+  const uint64_t before = means_.journal.bytesAppended();
   Status status;
   for (Part& part : parts_) {
     status = write(part);
@@ -118,7 +117,7 @@ void Snapshots::complete() {
   state_ = State::Idle;
   cannotCut_ = false;
   ++counters_.completed;
-  seenBytes_ = means_.journal.counters().bytes;
+  seenBytes_ = means_.journal.bytesAppended();
   counters_.bytes = seenBytes_ - before;
   bytesThen_ += counters_.bytes;  // they are nothing that another could make free
   counters_.longest = std::max(counters_.longest, means_.clock.monotonic() - began);

@@ -83,8 +83,8 @@ class Snapshots {
   };
 
   void watchCapacity();
-  bool isWanted(const JournalCounters& journal);
-  void begin(const JournalCounters& journal);
+  bool isWanted();
+  void begin();
   void saved(SavedService service);
   void add(SavedClient& client);
   Part& addPart(RecordKind kind, uint64_t connection, std::vector<uint8_t> head);

@@ -61,11 +61,10 @@ bool StoreQueue::append(StoreRecord::What what, std::size_t bytes) {
   bool wake = false;
   {
     MutexLock lock(mutex_);
-    StoreRecord record(time, std::move(what), std::move(cause));
-    const bool unrecorded = !record.cause.ticket && !record.makesNoRow();
+    const bool unrecorded = !cause.ticket && !StoreRecord::makesNoRow(what);
     if (closing_) {
       if (unrecorded) ++lost_;
-      record.cause.ticket.abandon();
+      cause.ticket.abandon();
       return false;
     }
     // Before the taking thread can take it off again.
@@ -73,7 +72,7 @@ bool StoreQueue::append(StoreRecord::What what, std::size_t bytes) {
     if (pending_.records.empty()) firstPending_ = clock_.monotonic();
     if (unrecorded) [[unlikely]]
       ++unrecorded_;
-    pending_.records.push_back(std::move(record));
+    pending_.records.emplace_back(time, std::move(what), std::move(cause));
     pending_.charge(user, size);
     wake = mustWake(options_.commit.isFull(pending_.records.size(), pending_.bytes));
   }

@@ -66,12 +66,13 @@ struct StoreRecord {
   static constexpr uint32_t kNone = UINT32_MAX;
 
   // A place of another record, or something that happened.
-  bool makesNoRow() const {
+  bool makesNoRow() const { return makesNoRow(what); }
+  static bool makesNoRow(const What& what) {
     return std::holds_alternative<std::monostate>(what) ||
            std::holds_alternative<RelayEndRecord>(what) ||
            std::holds_alternative<ReplayEndRecord>(what);
   }
-  StoreRecord(double when, What whatever, Cause because = {})
+  StoreRecord(double when, What&& whatever, Cause because = {})
       : time(when), cause(std::move(because)), what(std::move(whatever)) {}
   uint32_t user() const { return cause.ticket.user(); }  // who caused it, or kNoUser
   double time;                                           // seconds since 1970
