@@ -105,10 +105,13 @@ bool anyKeyHasSpace(const uint8_t* first, uint64_t count) {
 // ------------------------------------------------------------------------------------------ Value
 
 ValueKind Value::kind() const {
-  const cbor::Head head = cbor::head(begin_);
-  switch (head.major()) {
+  constexpr uint8_t kUnsigned64 = 27;  // alone may be above the signed range
+  const uint8_t initial = *begin_;
+  switch (initial >> 5) {
     case cbor::kUnsigned:
-      return head.argument <= kMaxSigned ? ValueKind::Integer : ValueKind::Unsigned;
+      return initial != kUnsigned64 || cbor::head(begin_).argument <= kMaxSigned
+                 ? ValueKind::Integer
+                 : ValueKind::Unsigned;
     case cbor::kNegative:
       return ValueKind::Integer;
     case cbor::kText:
@@ -122,7 +125,7 @@ ValueKind Value::kind() const {
     default:
       break;
   }
-  switch (head.initial) {
+  switch (initial) {
     case cbor::kHalf:
     case cbor::kSingle:
       return ValueKind::Float;
@@ -141,6 +144,7 @@ bool Value::isNumber() const {
 }
 
 int64_t Value::asInt64() const {
+  if (*begin_ < 24) return *begin_;
   const cbor::Head head = numberHead(begin_);
   if (head.major() == cbor::kUnsigned)
     return static_cast<int64_t>(std::min(head.argument, kMaxSigned));

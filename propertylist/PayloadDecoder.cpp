@@ -13,6 +13,27 @@ namespace vx {
 
 namespace {
 
+// Sizes of the items that are valid whatever follows their first byte, if only they are whole; 0
+// for the others.
+constexpr std::array<uint8_t, 256> kPlainItemBytes = [] {
+  std::array<uint8_t, 256> sizes{};
+  for (unsigned initial = 0; initial < 256; ++initial) {
+    const unsigned major = initial >> 5;
+    const unsigned info = initial & 31;
+    const bool integer =
+        info < 28 && (major == cbor::kUnsigned || (major == cbor::kNegative && info < 27));
+    if (integer) sizes[initial] = static_cast<uint8_t>(info < 24 ? 1 : 1 + (1u << (info - 24)));
+  }
+  sizes[cbor::kFalse] = sizes[cbor::kTrue] = 1;
+  return sizes;
+}();
+
+// The head of a string whose length its first byte tells.
+constexpr uint8_t kEmptyText = cbor::kText << 5;
+constexpr bool isShortText(uint8_t initial) {
+  return static_cast<uint8_t>(initial - kEmptyText) < 24;
+}
+
 // A key of a dictionary that is still open. The print is equal for equal keys and nearly always
 // different for different ones.
 struct OpenKey {
@@ -88,6 +109,7 @@ class Validator {
     uint64_t left;  // elements or entries still to come
     uint64_t count;
     std::size_t firstKey;
+    uint64_t prints;  // a bit for each key's; a key that finds its own is compared with the others
     bool dictionary;
   };
 
@@ -104,9 +126,10 @@ class Validator {
   bool readHead(cbor::Head& head);
   bool open(const cbor::Head& head, const uint8_t* at);
   bool close(const Level& level);
-  bool readKey(const Level& level);
+  bool readKey(Level& level);
   bool readText(const cbor::Head& head, const uint8_t* at);
   bool readValue();
+  bool readOtherValue();
   bool readDate(const cbor::Head& tag, const uint8_t* at);
 
   const uint8_t* begin_;
@@ -172,7 +195,7 @@ inline void Validator::endElement(uint64_t next) {
   nonFinite_ = false;
 }
 
-[[gnu::always_inline]] inline bool Validator::readHead(cbor::Head& head) {
+inline bool Validator::readHead(cbor::Head& head) {
   if (at_ == end_) return fail(at_, "ends too early");
   const uint8_t* const start = at_;
   const uint8_t initial = *at_++;
@@ -201,7 +224,7 @@ inline bool Validator::open(const cbor::Head& head, const uint8_t* at) {
   if (depth_ == deepest_)
     return fail(at, "nesting deeper than " + std::to_string(Payload::kMaxNesting));
   ++depth_;
-  levels_[static_cast<std::size_t>(depth_)] = {head.argument, head.argument, keys_.size(),
+  levels_[static_cast<std::size_t>(depth_)] = {head.argument, head.argument, keys_.size(), 0,
                                                dictionary};
   return true;
 }
@@ -217,28 +240,39 @@ bool Validator::close(const Level& level) {
   return true;
 }
 
-inline bool Validator::readKey(const Level& level) {
+inline bool Validator::readKey(Level& level) {
   const uint8_t* const start = at_;
-  cbor::Head head;
-  if (!readHead(head)) return false;
-  if (head.major() != cbor::kText) return fail(start, "key is not a string");
-  if (head.argument > bytesLeft()) return fail(start, "ends too early");
+  uint64_t size;
+  if (at_ != end_ && isShortText(*at_)) {
+    size = *at_++ - kEmptyText;
+  } else {
+    cbor::Head head;
+    if (!readHead(head)) return false;
+    if (head.major() != cbor::kText) return fail(start, "key is not a string");
+    size = head.argument;
+  }
+  if (size > bytesLeft()) return fail(start, "ends too early");
+  const uint8_t* const text = at_;
   uint64_t high = 0;
   uint64_t space = 0;
-  uint64_t print = head.argument;
-  forEachWord(at_, head.argument, [&](uint64_t word) {
+  uint64_t print = size;
+  forEachWord(text, size, [&](uint64_t word) {
     high |= word;
     space |= hasByte(word, ' ');
     print = std::rotl(print, 23) ^ word;
   });
-  if ((high & kHighBits) != 0 && !isUtf8Slowly(at_, at_ + head.argument))
+  if ((high & kHighBits) != 0 && !isUtf8Slowly(text, text + size))
     return fail(start, "invalid UTF-8");
   if (depth_ == (elements_ != nullptr ? 1 : 0)) space_ |= space;
-  const OpenKey key{print, at_, head.argument};
-  at_ += head.argument;
+  const OpenKey key{print, text, size};
+  at_ = text + size;
   if (level.count <= kPairwise) {
-    for (const OpenKey* other = keys_.begin() + level.firstKey; other != keys_.end(); ++other)
-      if (other->print == print && sameKey(*other, key)) return failDuplicate(key);
+    const uint64_t bit = uint64_t{1} << (print * 0x9E3779B97F4A7C15u >> 58);
+    if ((level.prints & bit) != 0) {
+      for (const OpenKey* other = keys_.begin() + level.firstKey; other != keys_.end(); ++other)
+        if (sameKey(*other, key)) return failDuplicate(key);
+    }
+    level.prints |= bit;
   }
   keys_.push(key);
   return true;
@@ -252,7 +286,31 @@ inline bool Validator::readText(const cbor::Head& head, const uint8_t* at) {
   return true;
 }
 
+// Most values are numbers and short texts.
 [[gnu::always_inline]] inline bool Validator::readValue() {
+  if (at_ == end_) return fail(at_, "ends too early");
+  const uint8_t initial = *at_;
+  const std::size_t left = bytesLeft();
+  if (const std::size_t size = kPlainItemBytes[initial]; size != 0 && size <= left) {
+    at_ += size;
+    return true;
+  }
+  if (initial == cbor::kDouble && left > sizeof(double)) {
+    nonFinite_ = nonFinite_ || !std::isfinite(std::bit_cast<double>(cbor::bigEndian(at_ + 1, 27)));
+    at_ += 1 + sizeof(double);
+    return true;
+  }
+  if (isShortText(initial)) {
+    const std::size_t size = initial - kEmptyText;
+    if (size >= left || !isUtf8({reinterpret_cast<const char*>(at_ + 1), size}))
+      return readOtherValue();
+    at_ += 1 + size;
+    return true;
+  }
+  return readOtherValue();
+}
+
+bool Validator::readOtherValue() {
   const uint8_t* const start = at_;
   cbor::Head head;
   if (!readHead(head)) return false;

@@ -69,6 +69,7 @@ std::optional<Monotonic> EventLoop::earliestDeadline() const {
 }
 
 void EventLoop::runDueDeadlines() {
+  if (!earliest_ || *earliest_ > clock_.monotonic()) return;
   for (const Deadline& deadline : deadlines_) {
     const std::optional<Monotonic> next = deadline.next();
     if (next && *next <= clock_.monotonic()) deadline.due();
@@ -97,10 +98,11 @@ void EventLoop::runOnce(std::optional<Monotonic> deadline) {
 
   // Hooks may have queued work, and other threads may have since: prepareToSleep looks again.
   int timeout = 0;
-  if (!moreWork && executor_.prepareToSleep() && !stopped_.load(std::memory_order_acquire)) {
-    std::optional<Monotonic> until = earliestDeadline();
-    if (deadline && (!until || *deadline < *until)) until = deadline;
-    timeout = timeoutMs(until);
+  const bool sleep = !moreWork && executor_.prepareToSleep();
+  earliest_ = earliestDeadline();
+  if (sleep && !stopped_.load(std::memory_order_acquire)) {
+    const bool ours = deadline && (!earliest_ || *deadline < *earliest_);
+    timeout = timeoutMs(ours ? deadline : earliest_);
   }
   const int count =
       epoll_wait(epollFd_.get(), events_.data(), static_cast<int>(events_.size()), timeout);

@@ -77,6 +77,7 @@ class EventLoop {
   const UniqueFd wakeFd_;
   std::atomic<bool> stopped_{false};
   std::vector<Deadline> deadlines_;
+  std::optional<Monotonic> earliest_;  // what is due next, as the last pass left it
   std::vector<Function<bool()>> rounds_;
   std::vector<Function<void()>> passEndHooks_;
   std::array<epoll_event, kEventsPerPass> events_{};
