@@ -1,5 +1,7 @@
 // The aggregate of a session against a list of payloads, and the summaries against the
 // straightforward way to make them.
+#include <bit>
+#include <cmath>
 #include <ctime>
 #include <random>
 
@@ -131,6 +133,24 @@ TEST_F(AggregateTest, IsThereAgainInTheNextProcess) {
 }
 
 // Blocks go back, and payloads are let go of at once.
+// In the short form, whole, inside another value, in a message that has no shape.
+TEST_F(AggregateTest, KnowsInTheNextProcessThatANumberIsNotFinite) {
+  const double notShort = std::bit_cast<double>(0x7FF8000000000001u);
+  Payload manyKeys = dictionary("a", HUGE_VAL);
+  for (int i = 0; i < 300; ++i)
+    manyKeys = PayloadBuilder(manyKeys).set("k" + std::to_string(i), i).build();
+  for (const Payload& message :
+       {dictionary("a", 0.5, "b", -HUGE_VAL), dictionary("a", notShort), manyKeys,
+        PayloadBuilder().set("a", ArrayBuilder().add(HUGE_VAL)).build(), dictionary("a", 0.5)}) {
+    VXReportingAggregate again;
+    appendTo(again, {MessageKind{1}, 1, message});
+    const bool may = again.mayHoldNonFinite();
+    EXPECT_EQ(may, message != dictionary("a", 0.5));
+    ASSERT_TRUE(again.restore(again.state()).ok());
+    EXPECT_EQ(again.mayHoldNonFinite(), may) << message.text().substr(0, 50);
+  }
+}
+
 TEST_F(AggregateTest, KeepsNothingThatItNeedNot) {
   append(500);
   const Payload sent = dictionary("a", 1);
