@@ -59,6 +59,27 @@ void VXReportingServerInstance::setRegistration(Date startDate,
   clientProcessName_ = std::move(processName);
 }
 
+void VXReportingServerInstance::joinIndex(std::shared_ptr<VXReportingReporterIndex> index,
+                                          uint64_t registration) {
+  serviceQueue()->assertIsCurrent();
+  index_ = std::move(index);
+  registration_ = registration;
+}
+
+void VXReportingServerInstance::leaveIndex() {
+  serviceQueue()->assertIsCurrent();
+  const auto index = std::move(index_);
+  if (index == nullptr) return;
+  for (const auto& [reporterID, session] : clientReportingSessionMap_)
+    index->remove(reporterID, registration_);
+}
+
+void VXReportingServerInstance::keepSession(ReporterID reporterID,
+                                            std::shared_ptr<VXReportingSession> session) {
+  clientReportingSessionMap_[reporterID] = std::move(session);
+  if (index_ != nullptr) index_->add(reporterID, registration_, *this);
+}
+
 std::shared_ptr<VXReportingSession> VXReportingServerInstance::findReportingSessionForID(
     ReporterID reporterID, Lookup lookup) {
   serviceQueue()->assertIsCurrent();
@@ -103,7 +124,8 @@ bool VXReportingServerInstance::restoreSession(ReporterID reporterID, const Payl
   if (found == clientReportingSessionMap_.end()) {
     auto session = VXReportingSession::restored(reporterID, {processIdentifier_}, facts, whole);
     if (session == nullptr) return false;
-    found = clientReportingSessionMap_.emplace(reporterID, std::move(session)).first;
+    keepSession(reporterID, std::move(session));
+    found = clientReportingSessionMap_.find(reporterID);
   }
   found->second->restoreInformation(information);
   return whole;
@@ -131,8 +153,7 @@ void VXReportingServerInstance::createReportingSession(ReporterID reporterID, Bo
 void VXReportingServerInstance::createSession(ReporterID reporterID) {
   serviceQueue()->assertIsCurrent();
   // A session that is there already is dropped without being stopped.
-  clientReportingSessionMap_[reporterID] =
-      VXReportingSession::initWithID(reporterID, {processIdentifier_});
+  keepSession(reporterID, VXReportingSession::initWithID(reporterID, {processIdentifier_}));
   VX_LOG_AS("createReportingSession", serverLogScope(), Default,
             "session created for reporter %lli", ll(reporterID));
 }
@@ -210,6 +231,7 @@ void VXReportingServerInstance::destroySession(ReporterID reporterID) {
   if (found != clientReportingSessionMap_.end()) {
     if (found->second->started()) found->second->stop();
     clientReportingSessionMap_.erase(found);
+    if (index_ != nullptr) index_->remove(reporterID, registration_);
   }
   VX_LOG_AS("destroyReportingSession", serverLogScope(), Default, "destroying %lli",
             ll(reporterID));

@@ -89,6 +89,7 @@ bool VXReportingServiceDelegate::listener(ServiceListener&,
     const std::shared_ptr<VXReportingServerInstance> client = weak.lock();
     if (client == nullptr) return;
     self->clients_.push_back(client);
+    client->joinIndex(self->index_, self->registered_++);
     client->setRegistration(platform().clock.now(), processName(pid));
   });
   connection->setInterruptionHandler([weak] {
@@ -156,7 +157,7 @@ const VXReportingServiceDelegate::Clients& VXReportingServiceDelegate::getAllCli
 void VXReportingServiceDelegate::removeClient(
     const std::shared_ptr<VXReportingServerInstance>& client) {
   serviceQueue()->assertIsCurrent();
-  std::erase(clients_, client);
+  if (std::erase(clients_, client) > 0) client->leaveIndex();
 }
 
 std::shared_ptr<VXReportingSession> VXReportingServiceDelegate::findReportingSessionForID(
@@ -165,13 +166,10 @@ std::shared_ptr<VXReportingSession> VXReportingServiceDelegate::findReportingSes
   RecursiveMutexLock lock(monitor_);
   if (reporterID == 0) return nullptr;
   if (!isReportingEnabled()) return nullptr;
-  for (const auto& client : clients_) {
-    const auto& sessions = client->clientReportingSessionMap();
-    const auto found = sessions.find(reporterID);
-    if (found == sessions.end()) continue;
+  if (const VXReportingServerInstance* const client = index_->firstHolder(reporterID)) {
     VX_LOG(serverLogScope(), Info, "found reporting session %lli for client %i",
            static_cast<long long>(reporterID), client->processIdentifier());
-    return found->second;
+    return client->clientReportingSessionMap().at(reporterID);
   }
   VX_LOG(serverLogScope(), Error, "failed to find reporting session %lli",
          static_cast<long long>(reporterID));

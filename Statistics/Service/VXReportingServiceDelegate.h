@@ -10,6 +10,7 @@
 #include <string>
 #include <vector>
 
+#include "Statistics/Service/VXReportingReporterIndex.h"
 #include "Statistics/Service/VXReportingServiceProtocol.h"
 #include "Statistics/Service/VXReportingSession.h"
 #include "Statistics/VXReportingDriverUtility.h"
@@ -97,6 +98,9 @@ class VXReportingServerInstance final
   std::optional<Date> clientStartDate() const;
   std::optional<std::string> clientProcessName() const;
   void setRegistration(Date startDate, std::optional<std::string> processName);
+  // On the service queue, before any session: from here on until leaveIndex() it is found by them.
+  void joinIndex(std::shared_ptr<VXReportingReporterIndex> index, uint64_t registration);
+  void leaveIndex();
 
  private:
   VXReportingServerInstance(int32_t processIdentifier,
@@ -105,6 +109,7 @@ class VXReportingServerInstance final
   void createSession(ReporterID reporterID);
   void startSession(ReporterID reporterID, BooleanReply reply);
   void stopSession(ReporterID reporterID);
+  void keepSession(ReporterID reporterID, std::shared_ptr<VXReportingSession> session);
   void destroySession(ReporterID reporterID);
   void routeMessage(const Payload& message, MessageCategory category, MessageType type,
                     const std::optional<std::vector<ReporterID>>& reportingIDs,
@@ -119,6 +124,8 @@ class VXReportingServerInstance final
   SessionMap clientReportingSessionMap_;
   std::vector<VXReportingSession*> activeSessions_;  // those a message is being routed to
   mutable Mutex registrationMutex_;
+  std::shared_ptr<VXReportingReporterIndex> index_;  // while it is registered
+  uint64_t registration_ = 0;
   std::optional<Date> clientStartDate_ GUARDED_BY(registrationMutex_);
   std::optional<std::string> clientProcessName_ GUARDED_BY(registrationMutex_);
 };
@@ -175,6 +182,8 @@ class VXReportingServiceDelegate final
   Clients clients_;
   std::unique_ptr<VXReportingDriverUtility> driverUtility_;
   std::optional<Payload> defaults_;
+  uint64_t registered_ = 0;  // clients so far
+  std::shared_ptr<VXReportingReporterIndex> index_ = std::make_shared<VXReportingReporterIndex>();
   std::atomic<bool> reportingEnabled_{true};
 };
 
