@@ -7,6 +7,7 @@
 #include <memory>
 #include <optional>
 #include <string_view>
+#include <utility>
 
 #include "base/Check.h"
 #include "base/Function.h"
@@ -32,6 +33,14 @@ class CAPABILITY("queue") WorkQueue {
   virtual void async(Work work, std::size_t holds = 0) = 0;
   // The work joins the queue once the delay has passed on the monotonic clock.
   virtual void asyncAfter(std::chrono::nanoseconds delay, Work work) = 0;
+  // Work that may be long: runs `step` again and again until it answers false. The first step has
+  // its place in the queue; what others ask for may run between any two.
+  virtual void asyncInSteps(Function<bool()> step) {
+    async([step = std::move(step)] {
+      while (step()) {
+      }
+    });
+  }
   virtual bool isCurrent() const = 0;
   virtual std::string_view label() const = 0;
   // Fails the process when the caller is not running on this queue (development builds).

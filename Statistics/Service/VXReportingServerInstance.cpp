@@ -269,20 +269,40 @@ void VXReportingServerInstance::killService(BooleanReply) {
   platform().processControl.exit(kExitStatusOfKill);
 }
 
+// A thousand stops take their time, and others do not wait for all of them. So that nobody sees a
+// client half stopped, or sends to what is left of it, it leaves the list before the first.
 void VXReportingServerInstance::handleConnectionError() {
-  serviceQueue()->async([self = shared_from_this()] {
-    const auto delegate = self->delegate_.lock();
-    if (delegate == nullptr) return;
-    const auto& clients = delegate->getAllClients();
-    if (std::find(clients.begin(), clients.end(), self) == clients.end())
-      return;  // handled already
-    for (const auto& [reporterID, session] : self->clientReportingSessionMap_) {
-      if (session->started()) session->stop();
-    }
-    delegate->removeClient(self);
-    VX_LOG_AS("handleConnectionError", serverLogScope(), Default,
-              "removing %i from the server client list", self->processIdentifier_);
-  });
+  serviceQueue()->asyncInSteps(
+      [self = shared_from_this(), next = std::optional<SessionMap::iterator>()]() mutable {
+        if (!next && !self->leaveClients()) return false;
+        if (!next) next = self->clientReportingSessionMap_.begin();
+        return self->stopNext(*next);
+      });
+}
+
+// False: it has left already.
+bool VXReportingServerInstance::leaveClients() {
+  const auto delegate = delegate_.lock();
+  if (delegate == nullptr) return false;
+  const auto& clients = delegate->getAllClients();
+  if (std::ranges::find(clients, shared_from_this()) == clients.end()) return false;
+  delegate->removeClient(shared_from_this());
+  return true;
+}
+
+// Stops the first started session from there on, in map order; false when there is none left.
+bool VXReportingServerInstance::stopNext(SessionMap::iterator& next) {
+  serviceQueue()->assertIsCurrent();
+  const auto end = clientReportingSessionMap_.end();
+  while (next != end && !next->second->started()) ++next;
+  if (next != end) {
+    const auto session = next++;
+    session->second->stop();
+    return true;
+  }
+  VX_LOG_AS("handleConnectionError", serverLogScope(), Default,
+            "removing %i from the server client list", processIdentifier_);
+  return false;
 }
 
 }  // namespace vx

@@ -82,7 +82,7 @@ class VXReportingServerInstance final
   // lookup does.
   std::shared_ptr<VXReportingSession> findReportingSessionForID(ReporterID reporterID,
                                                                 Lookup lookup);
-  // The connection is gone: stops this client's started sessions and takes it off the list, once.
+  // The connection is gone: takes this client off the list, once, and stops its started sessions.
   void handleConnectionError();
 
   // On the service queue; `complete` becomes false where a session cannot be saved.
@@ -106,10 +106,12 @@ class VXReportingServerInstance final
   VXReportingServerInstance(int32_t processIdentifier,
                             std::weak_ptr<VXReportingServiceDelegateProtocol> delegate);
 
+  bool leaveClients();
+  bool stopNext(SessionMap::iterator& next);
   void createSession(ReporterID reporterID);
+  void keepSession(ReporterID reporterID, std::shared_ptr<VXReportingSession> session);
   void startSession(ReporterID reporterID, BooleanReply reply);
   void stopSession(ReporterID reporterID);
-  void keepSession(ReporterID reporterID, std::shared_ptr<VXReportingSession> session);
   void destroySession(ReporterID reporterID);
   void routeMessage(const Payload& message, MessageCategory category, MessageType type,
                     const std::optional<std::vector<ReporterID>>& reportingIDs,
@@ -122,10 +124,10 @@ class VXReportingServerInstance final
   const int32_t processIdentifier_;
   const std::weak_ptr<VXReportingServiceDelegateProtocol> delegate_;
   SessionMap clientReportingSessionMap_;
-  std::vector<VXReportingSession*> activeSessions_;  // those a message is being routed to
-  mutable Mutex registrationMutex_;
   std::shared_ptr<VXReportingReporterIndex> index_;  // while it is registered
   uint64_t registration_ = 0;
+  std::vector<VXReportingSession*> activeSessions_;  // those a message is being routed to
+  mutable Mutex registrationMutex_;
   std::optional<Date> clientStartDate_ GUARDED_BY(registrationMutex_);
   std::optional<std::string> clientProcessName_ GUARDED_BY(registrationMutex_);
 };
@@ -180,10 +182,10 @@ class VXReportingServiceDelegate final
   // Held for the set-up of a connection and for the lookup across clients; nested lookups re-enter.
   RecursiveMutex monitor_;
   Clients clients_;
-  std::unique_ptr<VXReportingDriverUtility> driverUtility_;
-  std::optional<Payload> defaults_;
   uint64_t registered_ = 0;  // clients so far
   std::shared_ptr<VXReportingReporterIndex> index_ = std::make_shared<VXReportingReporterIndex>();
+  std::unique_ptr<VXReportingDriverUtility> driverUtility_;
+  std::optional<Payload> defaults_;
   std::atomic<bool> reportingEnabled_{true};
 };
 

@@ -23,6 +23,7 @@ class ReadTurnsTest : public testing::Test {
       (void)turn.goOn();
       if (more-- > 0) test.turns.add(user, test.self(*this));
     }
+    void turnsEnded() override { test.told += name; }
     ReadTurnsTest& test;
     uid_t user;
     char name;
@@ -53,6 +54,7 @@ class ReadTurnsTest : public testing::Test {
   ReadTurns turns{executor, clock};
   std::vector<std::shared_ptr<Reader>> readers;
   std::string took;
+  std::string told;
   bool somebodyLeft = false;
 };
 
@@ -88,6 +90,7 @@ TEST_F(ReadTurnsTest, AfterTheEndNobodyReads) {
   add(1, 'b', 1us, 1);
   EXPECT_EQ(round(), "");
   EXPECT_FALSE(somebodyLeft);
+  EXPECT_EQ(told, "a");
 }
 
 }  // namespace

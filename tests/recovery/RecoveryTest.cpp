@@ -6,6 +6,7 @@
 #include <map>
 
 #include "Statistics/VXReportingProcessState.h"
+#include "platform/linux/execution/SteppedWork.h"
 #include "platform/linux/ipc/ArgumentReading.h"
 #include "platform/linux/recovery/JournalOpening.h"
 #include "platform/linux/recovery/Records.h"
@@ -40,6 +41,7 @@ class RecoveryTest : public JournalFixture {
     service->fakes.services.random = 30;
     service->fakes.clock.wall = wall;
     service->fakes.clock.steady = service->steady.monotonic();
+    service->executor.setStepsTaker([this](auto work) { steps.push_back(std::move(work)); });
     recorder.emplace(*journal, service->fakes.clock);
     snapshots.emplace(Snapshots::Means{
         .journal = *journal,
@@ -66,6 +68,7 @@ class RecoveryTest : public JournalFixture {
   }
   void endLife() {
     recovery.reset();
+    steps.clear();
     snapshots.reset();
     connections.clear();
     if (service != nullptr) {  // whose handlers hold sessions
@@ -92,6 +95,7 @@ class RecoveryTest : public JournalFixture {
     beginLife();
     service->fakes.services.processNames.clear();  // they are dead
     recovery.emplace(
+    service->executor.setStepsTaker(nullptr);
         RecoveryMeans{service->fakes.installed, service->executor, *journal, {"test"}, {}},
         std::move(left));
     return recovery->run([] { return VXReportingServiceDelegate::create(); });
@@ -100,6 +104,7 @@ class RecoveryTest : public JournalFixture {
   // --- what clients do ---
   void tick() {
     service->fakes.clock.wall = wall += std::chrono::milliseconds(10);
+    if (!steps.empty() && !steps.front()->runStep()) steps.pop_front();
     recorder->endPass();
   }
   void connect(int client, int pid) {
@@ -171,10 +176,17 @@ class RecoveryTest : public JournalFixture {
     EXPECT_EQ(hooks, "began" + std::to_string(before + 1));
   }
 
-  std::vector<std::string> written() { return service->rows.texts(); }
+  std::vector<std::string> written() {
+    for (; !steps.empty(); steps.pop_front())
+      while (steps.front()->runStep()) continue;
+    service->runQueues();
+    return service->rows.texts();
+  }
 
   std::string hooks;  // that the snapshots called
   Date wall{std::chrono::hours(24 * 365 * 50)};
+  bool crowded = false;
+  std::deque<std::unique_ptr<SteppedWork>> steps;  // one is done with each tick
   JournalContents left;
   std::vector<std::string> poisoned;
   fakes::FakeAggregateMemory memory;  // of all lives
@@ -215,7 +227,11 @@ TEST_F(RecoveryTest, AKilledProcessLosesNothingAndWritesNothingTwice) {
       [&] { prefer("first", "false"); },
       [&] { create(2, 22, 3); },  // never started: needs no end
       [&] { send(1, 2); },
-      [&] { send(2, 3, both); },  // also to another client's
+      [&] { connect(3, 202); },
+      [&] { create(3, 44, 3), create(3, 55, 3), create(3, 66, 7); },
+      [&] { start(3, 44), start(3, 55), start(3, 66); },
+      [&] { end(3, End::Orderly); },  // one session after the other, while others are served
+      [&] { send(2, 3, both); },      // also to another client's
       [&] { create(2, 33, 3), start(2, 33); },
       [&] { send(2, 4); },
       [&] { prefer("second", "true"); },

@@ -17,11 +17,12 @@ thread_local CauseScope* innermost = nullptr;
 
 }  // namespace
 
-CauseScope::CauseScope(const Cause& cause)
+CauseScope::CauseScope(const Cause& cause, uint32_t taken)
     : ticket_(cause.ticket),
       place_(cause.position.place),
       depth_(cause.position.depth),
       user_(cause.user),
+      taken_(taken),
       outer_(std::exchange(innermost, this)) {}
 
 CauseScope::~CauseScope() { innermost = outer_; }
@@ -33,6 +34,14 @@ const JournalTicket* CauseScope::current() {
 UserIndex CauseScope::currentUser() {
   return innermost != nullptr ? innermost->user_ : kServiceItself;
 }
+
+Cause CauseScope::share() {
+  const CauseScope* const scope = innermost;
+  if (scope == nullptr) return {};
+  return {scope->ticket_, {scope->place_, scope->depth_}, scope->user_};
+}
+
+uint32_t CauseScope::taken() { return innermost != nullptr ? innermost->taken_ : 0; }
 
 std::optional<WorkOrigin> CauseScope::origin() {
   const CauseScope* const scope = innermost;

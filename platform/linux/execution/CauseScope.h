@@ -49,8 +49,9 @@ static_assert(sizeof(Cause) == 16, "one for each item and each row");
 // nest.
 class CauseScope {
  public:
-  explicit CauseScope(const Cause& cause);
-  explicit CauseScope(Cause&&) = delete;  // it must outlive the scope
+  // `taken`: the places that earlier scopes of the same work have taken.
+  explicit CauseScope(const Cause& cause, uint32_t taken = 0);
+  explicit CauseScope(Cause&&, uint32_t taken = 0) = delete;  // it must outlive the scope
   ~CauseScope();
   CauseScope(const CauseScope&) = delete;
   CauseScope& operator=(const CauseScope&) = delete;
@@ -58,6 +59,9 @@ class CauseScope {
   // Of the innermost scope; none outside of one.
   static const JournalTicket* current();
   static UserIndex currentUser();
+  // The innermost scope's own cause, for work that goes on later as the same work: with taken().
+  static Cause share();
+  static uint32_t taken();
   // Names the innermost scope's work; none outside of a call.
   static std::optional<WorkOrigin> origin();
 
@@ -67,7 +71,7 @@ class CauseScope {
   const uint32_t place_;
   const uint8_t depth_;
   const UserIndex user_;
-  uint32_t taken_ = 0;
+  uint32_t taken_;
   CauseScope* const outer_;
 };
 

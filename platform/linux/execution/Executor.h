@@ -73,6 +73,8 @@ class Executor final : public WorkQueues {
   bool prepareToSleep() { return interactive_->prepareToSleep(); }
 
   // Items queued or running on the utility lane, delayed ones not counted: the relay work that
+  // Who runs the rest of work in steps that has begun: in the turns of whoever caused it.
+  void setStepsTaker(Lane::StepsTaker taker) { interactive_->setStepsTaker(std::move(taker)); }
   // accepted messages have caused.
   std::size_t utilityBacklog() const { return utility_->backlog(); }
 

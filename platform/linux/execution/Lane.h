@@ -19,6 +19,8 @@
 
 namespace vx::lnx {
 
+class SteppedWork;
+
 struct LaneOptions {
   const char* threadName;
   int niceness;
@@ -70,6 +72,10 @@ class Lane : public std::enable_shared_from_this<Lane> {
   void setWaker(Function<void()> wake) { waker_ = std::move(wake); }
   bool run(std::size_t maxItems);
   bool prepareToSleep();
+  // On its thread. Null: steps follow one another without anything in between.
+  using StepsTaker = Function<void(std::unique_ptr<SteppedWork>)>;
+  void setStepsTaker(StepsTaker taker) { stepsTaker_ = std::move(taker); }
+  const StepsTaker& stepsTaker() const { return stepsTaker_; }
   std::optional<Monotonic> nextDue();
 
   bool drain(Monotonic deadline);
@@ -121,6 +127,7 @@ class Lane : public std::enable_shared_from_this<Lane> {
   std::atomic<std::size_t> backlog_{0};
   std::atomic<bool> hasDelayed_{false};  // delayed_ is not empty; set under the lock
 
+  StepsTaker stepsTaker_;  // the interactive thread's
   Mutex mutex_;
   CondVar wake_;     // for sleeping threads
   CondVar changed_;  // for drain and stop

@@ -3,6 +3,7 @@
 #include <utility>
 
 #include "platform/linux/execution/Lane.h"
+#include "platform/linux/execution/SteppedWork.h"
 
 namespace vx::lnx {
 
@@ -23,6 +24,18 @@ void SerialQueue::async(Work work, std::size_t holds) {
 void SerialQueue::asyncAfter(std::chrono::nanoseconds delay, Work work) {
   if (delay.count() <= 0) return async(std::move(work), 0);
   lane_->postDelayed(delay, shared_from_this(), new WorkItem(std::move(work)));
+}
+
+void SerialQueue::asyncInSteps(Function<bool()> step) {
+  async(
+      [this, step = std::move(step)]() mutable {
+        if (!step()) return;
+        if (const Lane::StepsTaker& taker = lane_->stepsTaker())
+          return taker(std::make_unique<SteppedWork>(shared_from_this(), std::move(step)));
+        while (step()) {
+        }
+      },
+      0);
 }
 
 bool SerialQueue::isCurrent() const { return Lane::currentQueue() == this; }

@@ -21,6 +21,8 @@ class SerialQueue final : public WorkQueue, public std::enable_shared_from_this<
 
   void async(Work work, std::size_t holds) override;
   void asyncAfter(std::chrono::nanoseconds delay, Work work) override;
+  // In one item, but for the interactive lane while somebody takes its steps.
+  void asyncInSteps(Function<bool()> step) override;
   bool isCurrent() const override;
   std::string_view label() const override { return label_; }
 

@@ -54,6 +54,9 @@ class UserAccounts {
   // A connection of the user; none when there are too many users.
   std::optional<UserIndex> enter(uid_t user);
   void leave(UserIndex user);
+  // One more connection's worth of a user who is known, until leave().
+  void stay(UserIndex user) { ++at(user).connections; }
+  uid_t uidOf(UserIndex user) const { return at(user).user; }
   uint32_t connections(UserIndex user) const { return at(user).connections; }
 
   void add(UserIndex user, MemoryKind kind, std::size_t bytes) {

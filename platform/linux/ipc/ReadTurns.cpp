@@ -65,7 +65,10 @@ void ReadTurns::runTurnOf(User& user) {
 
 void ReadTurns::end() {
   ended_ = true;
-  for (User& user : users_) user.readers.clear();
+  for (User& user : users_) {
+    const std::deque<std::shared_ptr<TurnTaker>> readers = std::move(user.readers);
+    for (const std::shared_ptr<TurnTaker>& reader : readers) reader->turnsEnded();
+  }
 }
 
 }  // namespace vx::lnx

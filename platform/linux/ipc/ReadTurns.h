@@ -41,12 +41,14 @@ class ReadTurn {
   Monotonic now_ = began_;
 };
 
-// What is read in turns.
+// What is read, or done, in turns.
 class TurnTaker {
  public:
   virtual ~TurnTaker() = default;
   // Is out of the list then, and may add itself again.
   virtual void takeTurn(ReadTurn& turn) = 0;
+  // There are no turns any more.
+  virtual void turnsEnded() {}
 };
 
 // A round gives each user who has something to read the same time, whatever he does with it, and
@@ -66,7 +68,7 @@ class ReadTurns {
   void add(uid_t user, std::shared_ptr<TurnTaker> reader);
   // True: somebody still has something to read.
   bool runRound();
-  // From here on nobody gets a turn.
+  // From here on nobody gets a turn; those who wait for one are told.
   void end();
 
  private:

@@ -14,6 +14,7 @@
 
 #include "base/LockFile.h"
 #include "platform/Log.h"
+#include "platform/linux/execution/SteppedWork.h"
 #include "wire/FrameWriter.h"
 
 namespace vx::lnx {
@@ -39,6 +40,38 @@ Result<UniqueFd> lockDirectory(const std::string& directory) {
   }
   return lock;
 }
+
+// Steps of a user's work take turns with what his connections read, and take a connection's place
+// among them, although that is over.
+class StepsInTurn final : public TurnTaker, public std::enable_shared_from_this<StepsInTurn> {
+ public:
+  StepsInTurn(ReadTurns& turns, UserAccounts& accounts, std::unique_ptr<SteppedWork> work)
+      : turns_(turns),
+        accounts_(accounts),
+        account_(work->user()),
+        user_(accounts.uidOf(account_)),
+        work_(std::move(work)) {
+    accounts_.stay(account_);
+  }
+  ~StepsInTurn() override { accounts_.leave(account_); }
+  uid_t user() const { return user_; }
+  void takeTurn(ReadTurn& turn) override {
+    while (work_->runStep()) {
+      if (!turn.goOn()) return turns_.add(user_, shared_from_this());
+    }
+  }
+  void turnsEnded() override {
+    while (work_->runStep()) {
+    }
+  }
+
+ private:
+  ReadTurns& turns_;
+  UserAccounts& accounts_;
+  const UserIndex account_;
+  const uid_t user_;
+  const std::unique_ptr<SteppedWork> work_;
+};
 
 // Given up to turn a client away when descriptors have run out.
 UniqueFd spareDescriptor() { return UniqueFd(::open("/dev/null", O_RDONLY | O_CLOEXEC)); }
@@ -267,6 +300,10 @@ void SocketListener::stopListening() {
 
 void SocketListener::resume() {
   executor_.adoptInteractiveThread();
+  executor_.setStepsTaker([this](std::unique_ptr<SteppedWork> work) {
+    const auto steps = std::make_shared<StepsInTurn>(turns_, accounts_, std::move(work));
+    turns_.add(steps->user(), steps);
+  });
   const Status added = loop_.add(socket_.get(), EPOLLIN, *this);
   listening_ = added.ok();
   if (!listening_) VX_LOG(nullptr, Error, "no client can connect: %s", added.text().c_str());
@@ -275,6 +312,7 @@ void SocketListener::resume() {
 
   if (hooks_.stopping) hooks_.stopping();
   stopListening();
+  executor_.setStepsTaker(nullptr);
   turns_.end();  // the connections read the rest by themselves
   const Monotonic deadline = clock_.monotonic() + kShutdownTime;
   std::vector<std::shared_ptr<SocketConnection>> ending;
