@@ -299,6 +299,11 @@ void VXReportingSession::deliver(const Payload& message, MessageCategory categor
   // What the client sent goes along only where it is another object: a count less to keep.
   std::optional<Payload> asSent;
   if (!normalised.isSameObject(message)) asSent = message;
+  // Behind a set-up it may wait for long; where the call was recorded it must not.
+  if (keep == Keep::Copy && relaySetUp_ != nullptr && !relaySetUp_->isOver) {
+    normalised = PayloadBuilder(normalised).build();
+    if (asSent) asSent = PayloadBuilder(*asSent).build();
+  }
   const std::size_t holds = normalised.encoded().size();
   vyrReportingQueue_->async(
       [self = shared_from_this(), normalised = std::move(normalised), asSent = std::move(asSent),

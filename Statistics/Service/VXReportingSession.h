@@ -162,6 +162,7 @@ class VXReportingSession : public std::enable_shared_from_this<VXReportingSessio
 
   // What one set-up has come to. Written by its work, read when that is over.
   struct RelaySetUp {
+    std::atomic<bool> isOver{false};
     Mutex mutex;
     std::optional<WorkOrigin> origin GUARDED_BY(mutex);  // of the relay session that is there
   };

@@ -91,6 +91,7 @@ void VXReportingSession::setUpRelay(std::string_view serviceName, ServiceType se
     relayOrigin_ = platform().workQueues.currentOrigin();
     configureRelay(openRelay(serviceName, serviceTypeThen), configurationDone);
   }
+  setUp->isOver = true;
   MutexLock lock(setUp->mutex);
   if (vyrReportingSession() != nullptr) setUp->origin = relayOrigin_;
 }

@@ -144,6 +144,7 @@ class RunningPlatform final : public LinuxPlatform {
     store_->setAccounts(accounts_);
     crashSafety_.emplace(
         CrashSafety::Means{clock_, executor_, loop_, listener_, *store_, aggregates_}, journals);
+    if (backends().empty()) executor_.setRelayUnrecorded();
     relay_.emplace(backends(),
                    [this](Function<void()> job) { executor_.runPromptly(std::move(job)); });
     services_.emplace(Platform{

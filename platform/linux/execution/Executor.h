@@ -48,6 +48,10 @@ class Executor final : public WorkQueues {
   // until stop(), and for no call's sake.
   void runPromptly(Work work);
 
+  // There is nobody to whom relay work could give anything: calls do not wait for it, not even for
+  // a set-up that waits itself. Before there are other threads.
+  void setRelayUnrecorded() { utility_->setUnrecorded(); }
+
   // --- the interactive lane, for the event loop ---
   // Names the calling thread the interactive one.
   void adoptInteractiveThread() {
@@ -69,12 +73,12 @@ class Executor final : public WorkQueues {
   // Called, on the producer's thread, when interactive work is queued from another thread while the
   // loop may be asleep: once until the next prepareToSleep(). Set before any other thread exists.
   void setInteractiveWaker(Function<void()> wake);
+  // Who runs the rest of work in steps that has begun: in the turns of whoever caused it.
+  void setStepsTaker(Lane::StepsTaker taker) { interactive_->setStepsTaker(std::move(taker)); }
   // The loop says that it is about to sleep. False: there is ready work after all, do not.
   bool prepareToSleep() { return interactive_->prepareToSleep(); }
 
   // Items queued or running on the utility lane, delayed ones not counted: the relay work that
-  // Who runs the rest of work in steps that has begun: in the turns of whoever caused it.
-  void setStepsTaker(Lane::StepsTaker taker) { interactive_->setStepsTaker(std::move(taker)); }
   // accepted messages have caused.
   std::size_t utilityBacklog() const { return utility_->backlog(); }
 

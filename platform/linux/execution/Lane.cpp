@@ -84,6 +84,7 @@ void Lane::postDelayed(std::chrono::nanoseconds delay, std::shared_ptr<SerialQue
 
 void Lane::itemQueued(WorkItem& item, std::size_t holds) {
   backlog_.fetch_add(1, std::memory_order_relaxed);
+  if (unrecorded_) item.cause.ticket = {};
   if (isInteractive()) return;
   item.charged = static_cast<uint32_t>(std::min<std::size_t>(sizeof(WorkItem) + holds, UINT32_MAX));
   accounts_.add(item.cause.user, MemoryKind::Waiting, item.charged);

@@ -58,7 +58,9 @@ class Lane : public std::enable_shared_from_this<Lane> {
   void postConcurrent(WorkItem* item, std::size_t holds);
   void postDelayed(std::chrono::nanoseconds delay, std::shared_ptr<SerialQueue> queue,
                    WorkItem* item);
-  // Before any other thread knows the lane.
+  // Both before any other thread knows the lane.
+  // Nothing that its items do would be missed after a crash: no call waits for them.
+  void setUnrecorded() { unrecorded_ = true; }
   void setConcurrentQueue(const WorkQueue* queue) { concurrentQueue_ = queue; }
 
   // Around a wait on the calling thread, which may be none of a lane's: then without effect.
@@ -70,12 +72,12 @@ class Lane : public std::enable_shared_from_this<Lane> {
   bool isThread() const { return interactiveThread() == std::this_thread::get_id(); }
   bool hasThread() const { return interactiveThread() != std::thread::id(); }
   void setWaker(Function<void()> wake) { waker_ = std::move(wake); }
-  bool run(std::size_t maxItems);
-  bool prepareToSleep();
   // On its thread. Null: steps follow one another without anything in between.
   using StepsTaker = Function<void(std::unique_ptr<SteppedWork>)>;
   void setStepsTaker(StepsTaker taker) { stepsTaker_ = std::move(taker); }
   const StepsTaker& stepsTaker() const { return stepsTaker_; }
+  bool run(std::size_t maxItems);
+  bool prepareToSleep();
   std::optional<Monotonic> nextDue();
 
   bool drain(Monotonic deadline);
@@ -122,12 +124,13 @@ class Lane : public std::enable_shared_from_this<Lane> {
   const LaneOptions options_;
   UserAccounts& accounts_;  // used by no thread after stop()
   const WorkQueue* concurrentQueue_ = nullptr;
+  bool unrecorded_ = false;
   Function<void()> waker_;
+  StepsTaker stepsTaker_;  // the interactive thread's
   std::atomic<std::thread::id> interactiveThread_{};
   std::atomic<std::size_t> backlog_{0};
   std::atomic<bool> hasDelayed_{false};  // delayed_ is not empty; set under the lock
 
-  StepsTaker stepsTaker_;  // the interactive thread's
   Mutex mutex_;
   CondVar wake_;     // for sleeping threads
   CondVar changed_;  // for drain and stop
