@@ -90,10 +90,19 @@ void CrashSafety::cutJournal() {
             return delegate != nullptr && delegate->saveState(std::move(saved));
           },
       .connections = [this] { return means_.listener.recordedConnections(); },
+      .crowded = [this] { return recorder_->shares().isCrowded(); },
       .commitSoon = [this] { means_.store.commitSoon(); },
       .freed = [this] { means_.listener.congestionEnded(); },
-      .began = [this] { means_.aggregates.snapshotBegan(); },
-      .completed = [this] { means_.aggregates.snapshotCompleted(); },
+      .began =
+          [this] {
+            means_.aggregates.snapshotBegan();
+            recorder_->shares().generationBegan();
+          },
+      .completed =
+          [this] {
+            means_.aggregates.snapshotCompleted();
+            recorder_->shares().snapshotCompleted();
+          },
   });
   means_.loop.addPassEndHook([this] { snapshots_->afterPass(); });
   means_.loop.addDeadline([this] { return snapshots_->nextDue(); },

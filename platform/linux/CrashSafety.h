@@ -68,9 +68,11 @@ class CrashSafety {
   // Posts a change of the preferences to its handlers, as work that is recorded.
   void recordNotification(std::string_view name, const Function<void()>& post);
 
-  // Calls have to wait until some of those before are done.
-  bool isFull() const {
-    return journal_ != nullptr && !journal_->hasCapacity() && !snapshots_->cannotCut();
+  // The user's calls have to wait until some of those before are done.
+  bool isFull(uid_t user) const {
+    if (journal_ == nullptr) return false;
+    if (!journal_->hasCapacity()) return !snapshots_->cannotCut();
+    return snapshots_->isUnderWay() && recorder_->shares().isOver(user);
   }
   bool isAllRecorded() const { return recorder_ && recorder_->counters().unrecorded == 0; }
   std::string counters() const;

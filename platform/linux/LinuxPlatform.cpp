@@ -264,7 +264,7 @@ class RunningPlatform final : public LinuxPlatform {
   void connect() {
     accounts_.setResumedHandler([this] { listener_.congestionEnded(); });
     listener_.setHooks({
-        .congested = [this] { return crashSafety_->isFull(); },
+        .congested = [this](uid_t user) { return crashSafety_->isFull(user); },
         .listening = [] { sd_notify(0, "READY=1"); },
         .stopping =
             [this] {

@@ -26,7 +26,7 @@ class ListenerTest : public IpcTest, public ServiceListenerDelegate {
     const std::shared_ptr<ServiceListenerDelegate> delegate(this, [](auto*) {});
     listener_->setDelegate(delegate);
     const auto queue = executor_.makeSerial("stop", QualityOfService::UserInteractive);
-    listener_->setHooks({.congested = [this] { return congested; },
+    listener_->setHooks({.congested = [this](uid_t) { return congested; },
                          .listening =
                              [&] {
                                script();

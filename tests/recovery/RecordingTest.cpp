@@ -29,13 +29,21 @@ class RecordingTest : public JournalFixture {
   void serve() {
     service = std::make_unique<RecordedService>(journal.get());
     service->fakes.services.processNames = {{getpid(), "recording"}};
+    if (whileSettingUp) {  // with nobody to relay to
+      service->executor.setRelayUnrecorded();
+      service->fakes.vyr.toRows = [this, add = service->fakes.vyr.toRows](std::string text,
+                                                                          const Payload& payload) {
+        if (text.starts_with("session")) whileSettingUp();
+        return add(std::move(text), payload);
+      };
+    }
     recorder.emplace(*journal, service->fakes.clock);
     recorder->setUnrecordedHandler([this](const Status&) { ++timesTold; });
     service->listener.setRecorder(*recorder);
     const Status opened = service->listener.open(root);
     ASSERT_TRUE(opened.ok()) << opened.text();
     std::promise<void> listening;
-    service->listener.setHooks({.congested = [] { return false; },
+    service->listener.setHooks({.congested = [](uid_t) { return false; },
                                 .listening = [&] { listening.set_value(); },
                                 .stopping = [] {}});
     service->listener.setDelegate(service->delegate);
@@ -136,6 +144,7 @@ class RecordingTest : public JournalFixture {
   std::unique_ptr<RecordedService> service;
   std::optional<JournalRecorder> recorder;
   std::vector<std::unique_ptr<SocketEnd>> clients;
+  std::function<void()> whileSettingUp;
   int timesTold = 0;
 
  private:
@@ -273,6 +282,57 @@ TEST_F(RecordingTest, MemoryIsGivenBackForNoCallsSakeAndDroppedWorkLeavesItsCall
   }
   own.reset();
   EXPECT_FALSE(journal->allDone()) << "work that was dropped is not done";
+}
+
+TEST_F(RecordingTest, CallsAreServedBetweenTheStepsOfLongWorkAndAStopDoesTheRest) {
+  serve();
+  const std::size_t a = connect();
+  std::atomic<int> left = 300;
+  service->executor.makeSerial("long", QualityOfService::UserInteractive)->asyncInSteps([&] {
+    std::this_thread::sleep_for(std::chrono::milliseconds(1));
+    return --left > 0;
+  });
+  for (const int before = left; left == before;) std::this_thread::yield();
+  call(a, Operation::ReporterID, 1);
+  EXPECT_GT(left, 0);
+  stop();
+  EXPECT_EQ(left, 0);
+}
+
+TEST_F(RecordingTest, ARelayThatReachesNobodyKeepsNothingInTheJournal) {
+  const VXReportingProcessState processState;
+  std::promise<void> setUp;
+  whileSettingUp = [over = setUp.get_future().share()] { over.wait(); };
+  serve();
+  const std::size_t a = connect();
+  create(a, 1);
+  start(a, 1);      // call 4
+  send(a, 1, {1});  // 5
+  service->rows.commit();
+  EXPECT_TRUE(done(4) && done(5)) << "although the set-up waits";
+  setUp.set_value();
+  ASSERT_TRUE(service->executor.drain(Monotonic::max()));
+  EXPECT_FALSE(liesIn(options.folder, service->rows.places("message 1 ").at(0)));
+}
+
+TEST(JournalSharesTest, WhoeverHasMoreThanHisShareIsOverItUntilASnapshotIsComplete) {
+  JournalShares shares(1000);
+  shares.add(1, 1500);
+  EXPECT_FALSE(shares.isOver(1)) << "nobody else is there";
+  shares.add(2, 500);
+  EXPECT_TRUE(shares.isOver(1));
+  EXPECT_FALSE(shares.isOver(2)) << "an equal share";
+  shares.add(2, 1);
+  EXPECT_TRUE(shares.isOver(2));
+  shares.generationBegan();
+  shares.add(2, 600);
+  shares.add(3, 400);
+  EXPECT_TRUE(shares.isOver(1)) << "what was before still counts";
+  shares.snapshotCompleted();
+  EXPECT_FALSE(shares.isCrowded());
+  shares.add(3, 1);
+  EXPECT_TRUE(shares.isOver(2));
+  EXPECT_FALSE(shares.isOver(3) || shares.isOver(1));
 }
 
 // What a journal of another version, or by somebody else, may hold.

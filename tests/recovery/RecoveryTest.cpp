@@ -60,6 +60,7 @@ class RecoveryTest : public JournalFixture {
               }
               return all;
             },
+        .crowded = [this] { return crowded; },
         .commitSoon = [this] { service->rows.commit(); },
         .freed = [] {},
         .began = [this] { hooks = "began"; },
@@ -67,8 +68,8 @@ class RecoveryTest : public JournalFixture {
     });
   }
   void endLife() {
-    recovery.reset();
     steps.clear();
+    recovery.reset();
     snapshots.reset();
     connections.clear();
     if (service != nullptr) {  // whose handlers hold sessions
@@ -94,8 +95,8 @@ class RecoveryTest : public JournalFixture {
     wall += later;
     beginLife();
     service->fakes.services.processNames.clear();  // they are dead
-    recovery.emplace(
     service->executor.setStepsTaker(nullptr);
+    recovery.emplace(
         RecoveryMeans{service->fakes.installed, service->executor, *journal, {"test"}, {}},
         std::move(left));
     return recovery->run([] { return VXReportingServiceDelegate::create(); });
@@ -103,8 +104,8 @@ class RecoveryTest : public JournalFixture {
 
   // --- what clients do ---
   void tick() {
-    service->fakes.clock.wall = wall += std::chrono::milliseconds(10);
     if (!steps.empty() && !steps.front()->runStep()) steps.pop_front();
+    service->fakes.clock.wall = wall += std::chrono::milliseconds(10);
     recorder->endPass();
   }
   void connect(int client, int pid) {
@@ -184,9 +185,9 @@ class RecoveryTest : public JournalFixture {
   }
 
   std::string hooks;  // that the snapshots called
-  Date wall{std::chrono::hours(24 * 365 * 50)};
   bool crowded = false;
   std::deque<std::unique_ptr<SteppedWork>> steps;  // one is done with each tick
+  Date wall{std::chrono::hours(24 * 365 * 50)};
   JournalContents left;
   std::vector<std::string> poisoned;
   fakes::FakeAggregateMemory memory;  // of all lives
@@ -226,10 +227,10 @@ TEST_F(RecoveryTest, AKilledProcessLosesNothingAndWritesNothingTwice) {
       [&] { connect(2, 201); },
       [&] { prefer("first", "false"); },
       [&] { create(2, 22, 3); },  // never started: needs no end
-      [&] { send(1, 2); },
       [&] { connect(3, 202); },
       [&] { create(3, 44, 3), create(3, 55, 3), create(3, 66, 7); },
       [&] { start(3, 44), start(3, 55), start(3, 66); },
+      [&] { send(1, 2); },
       [&] { end(3, End::Orderly); },  // one session after the other, while others are served
       [&] { send(2, 3, both); },      // also to another client's
       [&] { create(2, 33, 3), start(2, 33); },
@@ -304,6 +305,24 @@ TEST_F(RecoveryTest, AKilledProcessLosesNothingAndWritesNothingTwice) {
       endLife();
     }
   }
+}
+
+TEST_F(RecoveryTest, WhoHasNoShareOfTheJournalLeftGetsASnapshotAsSoonAsItCanBe) {
+  beginLife();
+  connect(1, 200);
+  create(1, 11, 3), start(1, 11), send(1, 1);
+  snapshots->afterPass();
+  EXPECT_FALSE(snapshots->isUnderWay());
+  crowded = true;
+  snapshots->afterPass();
+  service->runQueues();
+  EXPECT_TRUE(snapshots->isUnderWay());
+  snapshots->afterPass();  // asks the store to commit
+  send(1, 2);
+  snapshots->onDue();  // and again, for what came to it since
+  crowded = false;
+  snapshots->afterPass();
+  EXPECT_EQ(hooks, "began1");
 }
 
 // Two lives in one journal: the second knows neither the clients nor the preferences of the first.

@@ -30,9 +30,9 @@ class SocketListener final : public ServiceListener,
   // What lies behind the service: whether it is congested, and how to wait for what it has
   // accepted.
   struct Hooks {
-    Function<bool()> congested;  // for everybody; cheap; asked before every frame
-    Function<void()> listening;  // the endpoint accepts clients now
-    Function<void()> stopping;   // it no longer does
+    Function<bool(uid_t)> congested;  // for that user; cheap; asked before every frame
+    Function<void()> listening;       // the endpoint accepts clients now
+    Function<void()> stopping;        // it no longer does
   };
 
   SocketListener(EventLoop& loop, Executor& executor, Clock& clock, const ListenerOptions& limits);
@@ -72,7 +72,7 @@ class SocketListener final : public ServiceListener,
   CallRecorder& recorder() override { return *recorder_; }
   wire::ReadBuffers& readBuffers() override { return readBuffers_; }
   bool readingPaused(UserIndex user) override {
-    return accounts_.isPaused(user) || hooks_.congested();
+    return accounts_.isPaused(user) || hooks_.congested(accounts_.uidOf(user));
   }
   void waitForReading(const std::shared_ptr<SocketConnection>& connection) override;
   void readInTurn(uid_t user, std::shared_ptr<TurnTaker> connection) override {

@@ -93,6 +93,8 @@ JournalAppended JournalRecorder::append(RecordKind kind, uint64_t connection,
     return {};
   }
   ++counters_.recorded;
+  if (record.user != kNoUser)
+    shares_.add(record.user, bodyOffset(head.size()) + (dictionary ? dictionary->bytes.size() : 0));
   return std::move(appended).value();
 }
 

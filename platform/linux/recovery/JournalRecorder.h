@@ -12,6 +12,7 @@
 #include "platform/linux/ipc/CallRecorder.h"
 #include "platform/linux/journal/Journal.h"
 #include "platform/linux/journal/RecordKind.h"
+#include "platform/linux/recovery/JournalShares.h"
 
 namespace vx::lnx {
 
@@ -43,8 +44,12 @@ class JournalRecorder final : public CallRecorder {
   JournalTicket preferencesChanged(std::string_view notification);
 
   const Counters& counters() const { return counters_; }
+  JournalShares& shares() { return shares_; }
+  const JournalShares& shares() const { return shares_; }
 
  private:
+  // Half of what calls may fill.
+  static constexpr std::size_t kMostShared = std::size_t{24} << 20;
   // Calls wait in their sockets while there is no capacity; what else happens cannot.
   enum class Must : uint8_t { WithinShare, Always };
   JournalAppended append(RecordKind kind, uint64_t connection, std::span<const uint8_t> head,
@@ -57,6 +62,7 @@ class JournalRecorder final : public CallRecorder {
   Clock& clock_;
   Function<void(const Status&)> unrecorded_;
   Counters counters_;
+  JournalShares shares_{kMostShared};
   std::unordered_map<uint64_t, uint32_t> users_;  // of the connections that are recorded
   std::optional<double> time_;                    // of this pass
   std::vector<uint8_t> head_;                     // of the call that is being recorded

@@ -19,22 +19,22 @@ void Snapshots::afterPass() {
   const bool recorded = bytes != std::exchange(seenBytes_, bytes);
   if (recorded && seenBytes_ - bytesThen_ >= kWorthwhileBytes)
     lastRecorded_ = means_.clock.monotonic();
-  const bool full = !means_.journal.hasCapacity();
-  if (full != nextLook_.has_value()) watchCapacity();
-  if (state_ == State::Idle && (demanded_ || recorded || full) && isWanted()) begin();
+  const bool tight = isTight();
+  if (tight != nextLook_.has_value()) watchCapacity();
+  if (state_ == State::Idle && (demanded_ || recorded || tight) && isWanted()) begin();
   if (state_ != State::Waiting) return;
   if (means_.journal.earlierCallsAreDone()) return complete();
-  if (full && !std::exchange(urged_, true)) means_.commitSoon();
+  if (tight && !std::exchange(urged_, true)) means_.commitSoon();
 }
 
 void Snapshots::watchCapacity() {
   nextLook_.reset();
-  if (!means_.journal.hasCapacity()) nextLook_ = means_.clock.monotonic() + kLookAgain;
+  if (isTight()) nextLook_ = means_.clock.monotonic() + kLookAgain;
 }
 
 bool Snapshots::isWanted() {
   if (notBefore_ > Monotonic() && means_.clock.monotonic() < notBefore_) return false;
-  return demanded_ || !means_.journal.hasCapacity() ||
+  return demanded_ || isTight() ||
          seenBytes_ - bytesThen_ >= std::max(kBytesBetween, 2 * counters_.bytes);
 }
 
@@ -48,6 +48,7 @@ std::optional<Monotonic> Snapshots::nextDue() const {
 
 void Snapshots::onDue() {
   if (nextLook_) {
+    urged_ = false;  // more may have come to the store
     if (means_.journal.lookForCapacity()) means_.freed();
     return watchCapacity();
   }
@@ -68,7 +69,7 @@ void Snapshots::begin() {
 void Snapshots::saved(SavedService service) {
   const Monotonic began = means_.clock.monotonic();
   // Better that a summary may lack something after a crash than that nobody is served.
-  if (!service.complete && means_.journal.hasCapacity()) return giveUp();
+  if (!service.complete && !isTight()) return giveUp();
   const std::span<const uint8_t> facts = service.facts.encoded();
   (void)addPart(RecordKind::ServiceState, 0, {facts.begin(), facts.end()});
   for (SavedClient& client : service.clients) add(client);
@@ -150,7 +151,7 @@ void Snapshots::giveUp() {
   state_ = State::Idle;
   demanded_ = true;
   notBefore_ = means_.clock.monotonic() + kAfterFailure;
-  if (means_.journal.hasCapacity() || std::exchange(cannotCut_, true)) return;
+  if (!means_.journal.hasCapacity()) cannotCut_ = true;
   means_.freed();
 }
 

@@ -23,9 +23,10 @@ using RecordedConnection = SocketListener::Recorded;
 
 // Owned by the platform; lives on the interactive thread. A snapshot is begun when kBytesBetween
 // bytes have been recorded since the one before (twice that one's size, if it is larger), when the
-// journal has no capacity, and when it is quiet and kWorthwhileBytes could be given back. What the
-// service answers is kept in memory until all calls before are done; then it is written, and
-// counts. Bounds: one snapshot at a time, and the state of the clients that there are.
+// journal has no capacity or somebody has no share of it left, and when it is quiet and
+// kWorthwhileBytes could be given back. What the service answers is kept in memory until all calls
+// before are done; then it is written, and counts. Bounds: one snapshot at a time, and the state of
+// the clients that there are.
 class Snapshots {
  public:
   static constexpr uint64_t kBytesBetween = uint64_t{8} << 20;
@@ -40,7 +41,9 @@ class Snapshots {
     // By the objects that they export; all that may be among the clients of a state that is asked
     // for now.
     Function<std::unordered_map<const ExportedObject*, RecordedConnection>()> connections;
-    Function<void()> commitSoon;  // what the store holds: the journal has no capacity
+    // Some have to wait for the next one although there is capacity.
+    Function<bool()> crowded;
+    Function<void()> commitSoon;  // what the store holds: somebody waits
     Function<void()> freed;       // there may be capacity again; or cannotCut()
     Function<void()> began;       // around what must not be forgotten meanwhile
     Function<void()> completed;
@@ -68,6 +71,7 @@ class Snapshots {
   // There is no capacity, and none that a snapshot could make: what there is to keep is too much.
   // To wait would be for ever.
   bool cannotCut() const { return cannotCut_; }
+  bool isUnderWay() const { return state_ != State::Idle; }
   const Counters& counters() const { return counters_; }
 
  private:
@@ -82,6 +86,7 @@ class Snapshots {
     RecordedRelayState relayState;
   };
 
+  bool isTight() const { return !means_.journal.hasCapacity() || means_.crowded(); }
   void watchCapacity();
   bool isWanted();
   void begin();
