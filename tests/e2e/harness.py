@@ -125,9 +125,9 @@ class Daemon:
             os.makedirs(f"{self.folder}/{name}", exist_ok=True)
         sensor = "" if "[orientation]" in config else "[orientation]\ndevice_sensor = false\n"
         store = "" if "[store]" in config else "[store]\ncommit_interval_ms = 100\n"
+        log = "" if "[log]" in config else '[log]\ndestination = "stderr"\nlevel = "info"\nburst = 0\n'
         with open(f"{self.folder}/etc/platform.toml", "w") as f:
-            f.write(f'[log]\ndestination = "stderr"\nlevel = "info"\nburst = 0\n'
-                    f'[drivers]\nroot = "{self.folder}/drivers"\n{sensor}{store}{config}')
+            f.write(f'{log}[drivers]\nroot = "{self.folder}/drivers"\n{sensor}{store}{config}')
         self.notify = socket.socket(socket.AF_UNIX, socket.SOCK_DGRAM)
         self.notify.bind(self.folder + "/notify")
         self.environment = dict(

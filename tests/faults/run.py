@@ -13,13 +13,15 @@ import time
 
 SCRATCH_BYTES = 2 << 30
 PROGRAMS = ("kill", "term", "io", "power", "disk", "journal", "fair")
+LONG = ("soak",)  # ten minutes by itself: with the others only in small
 
 
 def main():
     parser = argparse.ArgumentParser(description=__doc__, formatter_class=argparse.RawDescriptionHelpFormatter)
     parser.add_argument("--build", default="build/dev")
     parser.add_argument("--small", action="store_true", help="three minutes at most instead of twenty")
-    parser.add_argument("--only", default=",".join(PROGRAMS), help="programs, with commas between")
+    parser.add_argument("--only", help=f"programs, with commas between: {', '.join(PROGRAMS + LONG)}")
+    parser.add_argument("--seconds", type=int, help="how long soak takes; 600, in small 20")
     parser.add_argument("--rounds", type=int, help="rounds, points or images of each program")
     parser.add_argument("--seed", type=int, default=random.randrange(1 << 30))
     parser.add_argument("--jobs", type=int, default=2 * (os.cpu_count() or 1))
@@ -34,7 +36,7 @@ def main():
     sys.dont_write_bytecode = True
     passed = failed = 0
     try:
-        for name in options.only.split(","):
+        for name in options.only.split(",") if options.only else PROGRAMS + (LONG if options.small else ()):
             began = time.monotonic()
             outcome = importlib.import_module(name + "_faults").run(options)
             if outcome.skipped:
