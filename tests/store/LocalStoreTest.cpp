@@ -82,6 +82,8 @@ TEST_F(LocalStoreTest, WhatWasSentIsThereAfterTheClose) {
                                           Payload(), 7, 2, numbered(3)),
             std::nullopt);
   EXPECT_TRUE(close());
+  // Whoever may only read needs them, and cannot make them.
+  EXPECT_TRUE(std::filesystem::exists(file("-wal")) && std::filesystem::exists(file("-shm")));
   EXPECT_THAT(query("SELECT s.session_id, m.category, m.type, m.payload FROM relay_messages m "
                     "JOIN relay_sessions s ON s.id = m.relay_session"),
               ElementsAre("42|5|1|{\"i\":1}", "-1|7|2|{\"i\":3}"));

@@ -115,6 +115,10 @@ OpenedStore openStoreDatabase(const std::string& path, const JournalEpoch& epoch
     if (code == SQLITE_OK) code = execute(database, pragma);
   }
   if (code != SQLITE_OK) return fail(code);
+  // The log and its index stay when the file is closed, empty: without them nobody could read it
+  // who may not write into the folder.
+  int keep = 1;
+  sqlite3_file_control(database, "main", SQLITE_FCNTL_PERSIST_WAL, &keep);
   // A checkpoint at every 4 MiB of log, whatever the size of a page.
   Statement pageSize(database, "PRAGMA page_size");
   if (!pageSize.row()) return fail(sqlite3_extended_errcode(database));
