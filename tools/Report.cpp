@@ -3,6 +3,7 @@
 #include <cerrno>
 #include <cstdio>
 #include <cstdlib>
+#include <filesystem>
 #include <iostream>
 #include <limits>
 #include <sstream>
@@ -10,6 +11,8 @@
 #include <vector>
 
 #include "client/ReportingClient.h"
+#include "platform/linux/ConfigurationCheck.h"
+#include "platform/linux/PlatformConfiguration.h"
 
 namespace {
 
@@ -30,6 +33,8 @@ constexpr const char* kHelp =
     "  reporters                     every client's sessions\n"
     "  kill                          ends the service\n"
     "  script                        reads commands from standard input over one connection\n"
+    "  check-config [FOLDER]         what is wrong in platform.toml and the preferences; asks no "
+    "service\n"
     "values: true, false, whole and floating numbers, everything else is text\n"
     "the socket: $VXREPORTING_SOCKET, or /run/vxreporting/service.socket\n";
 
@@ -161,6 +166,23 @@ int runScript(vx::ReportingClient& client) {
   return worst;
 }
 
+// 0: nothing is wrong; 1: something is.
+int checkConfig(const Words& words) {
+  if (words.size() > 2) throw UsageError();
+  const std::string folder =
+      words.size() > 1 ? words[1] : vx::lnx::Directories::fromEnvironment().configuration;
+  std::error_code unknown;
+  if (!std::filesystem::is_directory(folder, unknown)) {
+    std::fprintf(stderr, "vxreport: %s is not a folder; every key would have its default\n",
+                 folder.c_str());
+    return 1;
+  }
+  const std::vector<std::string> complaints = vx::lnx::checkConfiguration(folder);
+  for (const std::string& complaint : complaints) std::fprintf(stderr, "%s\n", complaint.c_str());
+  if (complaints.empty()) std::printf("nothing is wrong in %s\n", folder.c_str());
+  return complaints.empty() ? 0 : 1;
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -172,6 +194,7 @@ int main(int argc, char** argv) {
     return words.empty() ? 2 : 0;
   }
   try {
+    if (words[0] == "check-config") return checkConfig(words);
     vx::ReportingClient client;
     if (const vx::ClientStatus status = client.connect(); !status.ok()) return report(status, "");
     const int status = words[0] == "script" ? runScript(client) : run(client, words);

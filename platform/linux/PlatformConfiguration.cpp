@@ -323,9 +323,7 @@ PlatformConfiguration PlatformConfiguration::load(const Directories& directories
     const toml::table root = toml::parse(*text, path);
     Reader(root, path, complaints).read(configuration);
   } catch (const toml::parse_error& failure) {
-    complaints.push_back(path + ":" + std::to_string(failure.source().begin.line) + ":" +
-                         std::to_string(failure.source().begin.column) + ": " +
-                         std::string(failure.description()));
+    complaints.push_back(complaintOf(path, failure));
   }
   return configuration;
 }

@@ -17,7 +17,7 @@ ALLOWED = {  # layer -> prefixes of the headers it may include beside its own; t
     "platform/linux": (*PURE, "platform/"),
     "Statistics": (*PURE, "platform/"),
     "client": (*PURE, "wire/"),
-    "tools": (*PURE, "client/"),
+    "tools": (*PURE, "client/", LINUX + "ConfigurationCheck.h", LINUX + "PlatformConfiguration.h"),
     **{f"platform/linux/{wing}": (*PURE, "platform/", *others) for wing, others in {
         "execution": (LINUX + "journal/",),
         "settings": (LINUX + "execution/",),
@@ -42,7 +42,7 @@ def layer_of(path):
 def may_include(layer, target):
     if target.startswith(LINUX) and layer != "platform/linux":
         others = [p for p in ALLOWED[layer] if p.startswith(LINUX)]
-        return layer.startswith(LINUX) and target.startswith((layer + "/", *others))
+        return target.startswith((*((layer + "/",) if layer.startswith(LINUX) else ()), *others))
     return target.startswith((layer + "/", *ALLOWED[layer]))
 
 

@@ -1,5 +1,6 @@
 #include <sys/stat.h>
 
+#include "platform/linux/ConfigurationCheck.h"
 #include "platform/linux/PlatformConfiguration.h"
 #include "platform/linux/settings/TomlPreferences.h"
 #include "tests/linux/FolderTest.h"
@@ -8,12 +9,14 @@ namespace vx::lnx {
 namespace {
 
 using ::testing::SizeIs;
+using ::testing::UnorderedElementsAre;
 
 class ConfigurationTest : public FolderTest {
  protected:
   std::vector<std::string> load() {
     std::vector<std::string> complaints;
     configuration = PlatformConfiguration::load({"", "", folder, ""}, complaints);
+    EXPECT_EQ(checkConfiguration(folder), complaints);
     return complaints;
   }
   std::vector<std::string> complaintsOf(const std::string& text) {
@@ -98,6 +101,24 @@ TEST_F(ConfigurationTest, KeysNestedWithoutEndAreRefused) {
   write("d.toml", "# " + dots + "\na = \"" + dots + "\\\"" + dots + "\"\nb = '" + dots +
                       "'\nc = \"\"\"" + dots + "\n\"" + dots + "\"\"\"\nd = 1\n");
   EXPECT_TRUE(TomlPreferences(folder).open("d")->hasObject("d"));
+}
+
+TEST_F(ConfigurationTest, PreferencesAreCheckedForWhatTheServicePassesOver) {
+  std::filesystem::create_directory(folder + "/preferences");
+  auto check = [&](const std::string& text) {
+    write("preferences/com.quorvel.sonik.toml", text);
+    return checkConfiguration(folder);
+  };
+  EXPECT_THAT(check("disable_reporting = \"No\"\ndevice_name = 3\n"
+                    "reporting_server_verbose = 1\nreporting_session_verbose = false\n"),
+              IsEmpty());
+  EXPECT_THAT(check("disable_reporting = \"off\"\ndevice_name = [\"a\"]\n"
+                    "disable_reportin = true\n[reporting_server_verbose]\n"),
+              UnorderedElementsAre(HasSubstr("sonik.toml:1: disable_reporting: counts as false"),
+                                   HasSubstr(":2: device_name: counts as absent"),
+                                   HasSubstr(":3: disable_reportin: unknown key"),
+                                   HasSubstr(":4: reporting_server_verbose: counts as false")));
+  EXPECT_THAT(check("device_name = \n"), ElementsAre(HasSubstr("sonik.toml:1:")));
 }
 
 TEST_F(ConfigurationTest, PreferencesKeepTheLastGoodValuesAndComplainOnce) {

@@ -65,9 +65,7 @@ Result<std::shared_ptr<const TomlPreferences::Values>> TomlPreferences::read(
   try {
     return std::make_shared<const Values>(Values{toml::parse(*text, path)});
   } catch (const toml::parse_error& failure) {
-    return Status::failure(path + ":" + std::to_string(failure.source().begin.line) + ":" +
-                           std::to_string(failure.source().begin.column) + ": " +
-                           std::string(failure.description()));
+    return Status::failure(complaintOf(path, failure));
   }
 }
 

@@ -12,4 +12,12 @@ namespace vx::lnx {
 // file and line).
 Result<std::string> readTomlText(const std::string& path);
 
+// "file:line:column: why" of a toml::parse_error.
+template <class ParseError>
+std::string complaintOf(const std::string& path, const ParseError& failure) {
+  const auto& begin = failure.source().begin;
+  return path + ":" + std::to_string(begin.line) + ":" + std::to_string(begin.column) + ": " +
+         std::string(failure.description());
+}
+
 }  // namespace vx::lnx
