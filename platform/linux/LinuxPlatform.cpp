@@ -69,7 +69,7 @@ void raiseDescriptorLimit() {
 
 OrientationOptions withDefaults(OrientationOptions orientation, const Directories& directories) {
   if (orientation.interfaceStateFile.empty()) {
-    orientation.interfaceStateFile = directories.runtime + "/interface-orientation";
+    orientation.interfaceStateFile = directories.runtime + "/interface/orientation";
   }
   return orientation;
 }

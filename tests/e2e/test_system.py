@@ -99,13 +99,13 @@ class OrientationTest(DaemonTest):
         return list(json.loads(pathlib.Path(self.d.summaries()[-1]).read_text())[-1].values())[0]
 
     def test_bus_that_comes_late_and_dies_and_sensor_that_wakes_up_and_comes_back(self):
-        self.d.replace_file("run/interface-orientation", "portrait\n")
+        self.d.replace_file("run/interface/orientation", "portrait\n")
         self.c.started(1, 7)
         self.d.wait_until(lambda: "device orientation is off for now" in self.d.log(), "the bus is looked for")
         bus = self.start_bus()
         sensor = self.sensor(refusals=2)
         self.assertEqual(sensor.turn("normal", "left-up"), ["told"] * 2)
-        self.d.replace_file("run/interface-orientation", "landscape-left\n")  # the thread of the sensor's words sees it
+        self.d.replace_file("run/interface/orientation", "landscape-left\n")  # the thread of the sensor's words sees it
         sensor.leave()
         sensor = self.sensor()
         self.assertEqual(sensor.turn("right-up"), ["told"])
@@ -123,3 +123,44 @@ class OrientationTest(DaemonTest):
         self.assertEqual(words[-1], "bottom-up")
         self.assertEqual(self.d.log().count("device orientation is off for now"), 1)  # nothing is said of what lasts
         self.assertEqual(self.d.stop(), 0)
+
+
+AGENT = os.environ.get("VXORIENTATIONAGENT", "")
+
+
+@unittest.skipUnless(AGENT and shutil.which("phoc") and shutil.which("wlr-randr"),
+                     "libwayland-dev, phoc and wlr-randr are not installed")
+class OrientationAgentTest(DaemonTest):
+    def start(self, *command):
+        log = open(self.folder + "/" + os.path.basename(command[0]) + ".log", "w+")
+        process = subprocess.Popen(command, env=self.environment, stdin=subprocess.DEVNULL, stdout=log, stderr=log)
+        self.addCleanup(lambda: (process.kill(), process.wait(), log.close()))
+        return process
+
+    def test_words_of_a_turned_output_reach_the_session(self):
+        self.folder = tempfile.mkdtemp(prefix="vx")
+        d = self.daemon(config=INTERNAL, folder=self.folder)
+        os.mkdir(self.folder + "/run/interface")
+        self.environment = {"PATH": os.environ["PATH"], "XDG_RUNTIME_DIR": self.folder, "WAYLAND_DISPLAY": "wayland-0",
+                            "GSETTINGS_BACKEND": "memory", "WLR_BACKENDS": "headless", "WLR_RENDERER": "pixman",
+                            "WLR_LIBINPUT_NO_DEVICES": "1"}
+        compositor = self.start("phoc")
+        d.wait_until(lambda: os.path.exists(self.folder + "/wayland-0"), "there is a compositor")
+        turn = lambda *how: subprocess.run(["wlr-randr", "--output", "HEADLESS-1", *how], env=self.environment, check=True)
+        turn("--custom-mode", "720x1280")
+        file = self.folder + "/run/interface/orientation"
+        agent = self.start(AGENT, file)
+        c = d.client()
+        c.started(1)
+        words = ["portrait", "landscape-left", "portrait-upside-down", "landscape-right", "portrait"]
+        for transform, word in zip(("normal", "90", "flipped-180", "270", "normal"), words):
+            turn("--transform", transform)
+            d.wait_until(lambda: os.path.exists(file) and pathlib.Path(file).read_text() == word + "\n", f"it is {word}")
+        turn("--custom-mode", "1280x720")  # a panel that is wide as it is built
+        d.wait_until(lambda: pathlib.Path(file).read_text() == "landscape-left\n", "it is wide")
+        c.call(SEND, {"a": 1}, 3, 1, [1])
+        c.call(STOP, 1)
+        told = list(json.loads(pathlib.Path(d.summaries()[-1]).read_text())[-1].values())[0]["ui_orientation"]
+        self.assertTrue(set(told.split(",")) <= set(words) and told.endswith("landscape-left"), told)
+        compositor.kill()
+        self.assertEqual(agent.wait(PATIENCE), 1)  # the service manager starts it again

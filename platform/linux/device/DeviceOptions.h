@@ -33,7 +33,7 @@ struct DriverOptions {
 
 struct OrientationOptions {
   bool deviceSensor = true;        // net.hadess.SensorProxy on the system bus
-  std::string interfaceStateFile;  // empty: <runtime>/interface-orientation
+  std::string interfaceStateFile;  // empty: <runtime>/interface/orientation
 };
 
 }  // namespace vx::lnx
