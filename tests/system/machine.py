@@ -50,6 +50,7 @@ class Machine:
         self.group = f"vxsystem.{os.getpid()}"
         self.console = self.root.with_name("console.log")
         self.leader = None
+        self.processes = 0
 
     def boot(self):
         with open(self.console, "w") as out:
@@ -75,7 +76,8 @@ class Machine:
 
     def start(self, command, user):
         """A process of the machine, with a pipe into it and a file out of it."""
-        out = open(self.root.with_name("process.log"), "w+")
+        self.processes += 1
+        out = open(self.root.with_name(f"process.{self.processes}.log"), "w+")
         process = subprocess.Popen(["nsenter", "--target", self.leader, "--all", "env", "-i", f"PATH={PATH}", "setpriv",
                                     f"--reuid={user}", f"--regid={user}", "--init-groups", "sh", "-c", "cd /; exec " + command],
                                    stdin=subprocess.PIPE, stdout=out, stderr=out, text=True)

@@ -147,6 +147,9 @@ class Life:
         client.stdin.write(SESSION.format(4))
         client.stdin.flush()
         self.m.wait_until(lambda: "taken" in client.said(), "the message is accepted")
+        keeping = [self.m.start(f"/clients/{name} {number}", "outsider") for number, name in enumerate(self.clients(), 11)]
+        for process in keeping:
+            self.hear(process)
         upgraded = threading.Event()
 
         def send():
@@ -169,6 +172,34 @@ class Life:
         assert taken > 50, taken
         self.expect([f"service_stopped|{taken}"], "SELECT ended_how, count(*) FROM relay_messages m JOIN relay_sessions s "
                     "ON s.id = m.relay_session WHERE s.session_id = 4 AND category = 5 GROUP BY 1")
+        for number, process in enumerate(keeping, 11):
+            self.hear(process)
+            process.stdin.close()
+            assert process.wait(30) == 0, process.said()
+            accepted = process.said().count("accepted")
+            self.expect(["service_stopped", "stopped"], f"SELECT ended_how FROM relay_sessions WHERE session_id = {number}")
+            self.expect([str(accepted)], "SELECT count(*) FROM relay_messages m JOIN relay_sessions s "
+                        f"ON s.id = m.relay_session WHERE s.session_id = {number} AND category = 5")
+
+    def clients(self):
+        """Of each language, built against the packages by pkg-config alone."""
+        subprocess.run(["cp", "-r", pathlib.Path(__file__).with_name("clients"), self.m.root], check=True)
+        for build in ("cc -std=c11 client.c $(pkg-config --cflags --libs vxreporting) -o c",
+                      "c++ -std=c++20 client.cpp $(pkg-config --cflags --libs vxreporting-cpp) -o cpp"):
+            self.m.run("cd /clients && " + build.replace(" -std", " -Wall -Wextra -Wpedantic -Werror -std"))
+        return "c", "cpp", "client.py"
+
+    def hear(self, process):
+        """Lets it send until five messages more are accepted: one that was under way when the service ended is not."""
+        before = process.said().count("accepted")
+        for _ in range(20):
+            said = process.said().count("\n")
+            process.stdin.write("\n")
+            process.stdin.flush()
+            self.m.wait_until(lambda: process.said().count("\n") > said, lambda: f"it goes on: {process.said()}")
+            if process.said().count("accepted") == before + 5:
+                return
+        raise AssertionError(process.said())
 
     def newer(self):
         """The same packages under a higher version."""
