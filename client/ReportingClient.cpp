@@ -82,6 +82,10 @@ std::size_t ReportingClient::pendingCalls() const { return connection_->pendingC
 uint64_t ReportingClient::unknownAnswers() const { return connection_->unknownAnswers(); }
 ClientStatus ReportingClient::process() { return connection_->process(); }
 ClientStatus ReportingClient::flush() { return connection_->flush(); }
+ClientStatus ReportingClient::waitUntil(const Function<bool()>& condition,
+                                        std::chrono::milliseconds patience) {
+  return connection_->waitUntil(condition, patience);
+}
 ClientStatus ReportingClient::goodbye(std::chrono::milliseconds patience) {
   return connection_->sayGoodbye(patience);
 }

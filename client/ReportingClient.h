@@ -109,6 +109,9 @@ class ReportingClient {
   ClientStatus process();
   // Writes what is buffered as far as the socket takes it. Never blocks.
   ClientStatus flush();
+  // process()es until the condition, which callbacks may bring about, holds. Blocks for that long.
+  ClientStatus waitUntil(const Function<bool()>& condition,
+                         std::chrono::milliseconds patience = kDefaultPatience);
 
   // --- never blocking: the callback is called once, with the answer or the reason why there will
   // be none. The returned status says whether the call was taken; when it was not, the callback is

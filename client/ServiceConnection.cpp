@@ -339,7 +339,7 @@ void ServiceConnection::setReceiveTimeout(Patience patience) {
 // wait is the read itself, bounded by the descriptor's own time-out; only what is left of the
 // patience after it, and a socket that takes nothing, need a poll.
 ClientStatus ServiceConnection::waitStep(Wait& wait) {
-  if (!isConnected()) return ended_;
+  if (!isConnected()) return ended_.ok() ? whyNoCalls() : ended_;
   if (ClientStatus status = flush(); !status.ok()) return status;
   if (std::exchange(wait.first, false) && !wantsWrite() && wait.patience > Patience(0)) {
     setReceiveTimeout(wait.patience);

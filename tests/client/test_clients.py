@@ -1,5 +1,6 @@
 """The client printed in docs/protocol.md and the vxreport tool, each with the real daemon."""
 import os
+import pathlib
 import re
 import subprocess
 import sys
@@ -7,8 +8,8 @@ import sys
 from harness import DaemonTest
 
 VXREPORT = os.environ["VXREPORT"]
-with open(os.path.join(os.path.dirname(__file__), "../../docs/protocol.md")) as f:
-    PAGE = f.read()
+ROOT = pathlib.Path(__file__).resolve().parents[2]
+PAGE = (ROOT / "docs/protocol.md").read_text()
 
 
 def run(daemon, *command, stdin=""):
@@ -32,6 +33,24 @@ class ClientsTest(DaemonTest):
         self.assertEqual(client.answers[3], [[2, 3, True]])
         self.assertEqual(client.answers[4][0][:3], [3, 4, 4])
         self.assertIn(client.answers[4][0][3][:44], PAGE)
+
+    def test_a_program_in_c(self):
+        daemon = self.daemon()
+        ended = run(daemon, os.environ["C_CLIENT"])
+        self.assertEqual((ended.returncode, ended.stderr), (0, ""))
+        self.assertEqual(daemon.stop(), 0)
+        self.assertEqual(daemon.rows("SELECT payload FROM session_messages WHERE session_id = 42 AND category = 3"),
+                         [('{"frames":-3,"gain":0.5,"on":true,"at":"1970-01-01T00:00:00Z","inner":{"route":"Speaker"},'
+                           '"ints":[1,-2],"doubles":[0.5],"names":["keyboard","game"]}',)])
+
+    def test_the_c_library_exports_its_api_alone_and_needs_no_other(self):
+        shown = subprocess.run(["readelf", "--wide", "--dyn-syms", "--dynamic", os.environ["LIBVXREPORTING"]],
+                               capture_output=True, text=True, check=True).stdout
+        defined = set(re.findall(r"(?:GLOBAL|WEAK|UNIQUE) +DEFAULT +(?!UND)\S+ (\S+)$", shown, re.M))
+        declared = set(re.findall(r"VXR_API [\w *]*?(vxr_\w+)\(", (ROOT / "client/vxreporting.h").read_text()))
+        self.assertEqual(defined, {"VXREPORTING_0"} | {name + "@@VXREPORTING_0" for name in declared})
+        self.assertLessEqual(set(re.findall(r"NEEDED.*\[(\w+)", shown)), {"libstdc", "libgcc_s", "libc", "libm", "ld"})
+        self.assertIn("[libvxreporting.so.0]", shown)
 
     def test_a_script_of_vxreport_holds_one_connection(self):
         daemon = self.daemon()
