@@ -3,16 +3,21 @@
 
 #include <cstdint>
 #include <memory>
+#include <new>
+#include <stdexcept>
+#include <string>
 #include <utility>
 
 #include "base/Function.h"
+#include "platform/Log.h"
 #include "platform/linux/execution/CauseScope.h"
 #include "platform/linux/execution/Lane.h"
 
 namespace vx::lnx {
 
 // What is left of it. Whatever a step causes belongs to the item of the queue that did the first
-// one, as if that had done them all. Owned by whoever runs it; belongs to the interactive thread.
+// one, as if that had done them all. A step that fails for lack of memory is not tried again. Owned
+// by whoever runs it; belongs to the interactive thread.
 class SteppedWork {
  public:
   // Within that item.
@@ -34,13 +39,25 @@ class SteppedWork {
     if (!step_) return false;
     const Lane::Current onQueue(queue_.get());
     const CauseScope scope(cause_, taken_);
-    const bool more = step_();
+    bool more = true;
+    try {
+      more = step_();
+    } catch (const std::bad_alloc&) {
+      giveUpStep();
+    } catch (const std::length_error&) {
+      giveUpStep();
+    }
     taken_ = CauseScope::taken();
     if (!more) step_ = nullptr;
     return more;
   }
 
  private:
+  void giveUpStep() {
+    VX_LOG(nullptr, Error, "there is no memory for a part of %s; it is left out",
+           std::string(queue_->label()).c_str());
+  }
+
   const std::shared_ptr<const WorkQueue> queue_;
   Cause cause_;
   uint32_t taken_;
