@@ -101,19 +101,23 @@ bool PendingCalls::take(uint64_t number, CallAnswer& answer) {
   return true;
 }
 
-std::vector<CallAnswer> PendingCalls::takeAll() {
-  std::vector<CallAnswer> all;
-  all.reserve(waiting_);
-  for (auto& [number, answer] : older_) all.push_back(std::move(answer));
-  older_.clear();
-  for (; first_ != next_; ++first_) {
-    Slot& slot = at(first_);
-    if (slot.waiting) all.push_back(std::move(slot.answer));
+std::vector<CallAnswer> PendingCalls::takeBefore(uint64_t end, const std::set<uint64_t>& except) {
+  std::vector<CallAnswer> taken;
+  const auto takes = [&](uint64_t number) { return number < end && !except.contains(number); };
+  for (auto it = older_.begin(); it != older_.end();) {
+    if (takes(it->first)) taken.push_back(std::move(it->second));
+    it = takes(it->first) ? older_.erase(it) : std::next(it);
+  }
+  for (uint64_t number = first_; number != next_; ++number) {
+    Slot& slot = at(number);
+    if (!slot.waiting || !takes(number)) continue;
+    taken.push_back(std::move(slot.answer));
     slot.answer = std::monostate();
     slot.waiting = false;
   }
-  waiting_ = 0;
-  return all;
+  while (first_ != next_ && !at(first_).waiting) ++first_;
+  waiting_ -= taken.size();
+  return taken;
 }
 
 // The ring is full. When few of its calls still wait, those at its front keep the others from

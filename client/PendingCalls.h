@@ -4,6 +4,7 @@
 #include <cstddef>
 #include <cstdint>
 #include <map>
+#include <set>
 #include <variant>
 #include <vector>
 
@@ -39,8 +40,8 @@ class PendingCalls {
   }
   // False when no such call is waiting.
   bool take(uint64_t number, CallAnswer& answer);
-  // Everything that waits, oldest first. Numbering goes on.
-  std::vector<CallAnswer> takeAll();
+  // Everything below `end` that waits, oldest first, with exceptions. Numbering goes on.
+  std::vector<CallAnswer> takeBefore(uint64_t end, const std::set<uint64_t>& except = {});
 
  private:
   struct Slot {

@@ -75,7 +75,12 @@ ClientStatus ReportingClient::reconnect(std::chrono::milliseconds patience) {
   return connect(connection_->socketPath(), patience);
 }
 
-bool ReportingClient::isConnected() const { return connection_->isConnected(); }
+bool ReportingClient::isConnected() const { return connection_->isGreeted(); }
+ClientStatus ReportingClient::status() const { return connection_->status(); }
+std::optional<std::chrono::milliseconds> ReportingClient::retryIn() const {
+  return connection_->retryIn();
+}
+ReportingClient::Counters ReportingClient::counters() const { return connection_->counters(); }
 int ReportingClient::fd() const { return connection_->fd(); }
 bool ReportingClient::wantsWrite() const { return connection_->wantsWrite(); }
 std::size_t ReportingClient::pendingCalls() const { return connection_->pendingCalls(); }

@@ -10,12 +10,31 @@
 //
 // No threads of its own, never blocks unless asked to, never aborts the caller, whatever the daemon
 // does.
+//
+// Sessions that outlive the connection (Options::keepSessions). From connect() on, whether it
+// succeeded or not, until goodbye(), disconnect() or another connect(): calls are taken without a
+// connection too, up to the bounds, and process() and the blocking forms make it again, with pauses
+// that grow to five seconds. Then the sessions are created, configured and started again in the
+// order of their creation, and what was not begun to be written follows. A call that was written
+// and not answered fails with Disconnected and is never sent again, since what the service accepted
+// survives it. A start that holds goes on, and is answered when its session stops. process() and
+// flush() are Ok without a connection; status() says why there is none.
+//
+// Threads: a client belongs to one thread at a time; different clients are independent.
+// fork(): the connection stays with the parent. A child may destroy its copy of the client, which
+// sends nothing and leaves the parent's connection alone, and do nothing else with it. Descriptors
+// are closed by exec.
+// EAGAIN: a full socket is not an error. Calls are buffered up to maxBufferedBytes and written by
+// later calls, process() and flush(); beyond that they are refused with BufferFull, as a whole. A
+// service whose queue of new connections is full counts as away. EINTR is retried, SIGPIPE never
+// raised.
 #pragma once
 
 #include <chrono>
 #include <cstddef>
 #include <cstdint>
 #include <memory>
+#include <optional>
 #include <string>
 #include <variant>
 #include <vector>
@@ -77,6 +96,15 @@ class ReportingClient {
     // Bytes of calls that are gathered before one write; process() and flush() write whatever there
     // is.
     std::size_t writeAtBytes = 16 << 10;
+    // Sessions outlive the connection: see below.
+    bool keepSessions = false;
+  };
+  // Of a client that keeps its sessions; calls, but for the first and the last.
+  struct Counters {
+    uint64_t reconnections = 0;
+    uint64_t unanswered = 0;  // written when the connection was lost: may have run, not sent again
+    uint64_t dropped = 0;     // refused with BufferFull, or given up before they were written
+    uint64_t sessionsNotRestored = 0;  // the service refused to have them again
   };
 
   ReportingClient();
@@ -95,6 +123,7 @@ class ReportingClient {
   ClientStatus adopt(int connectedFd, std::chrono::milliseconds patience = kDefaultPatience);
   ClientStatus reconnect(std::chrono::milliseconds patience = kDefaultPatience);
   bool isConnected() const;
+  ClientStatus status() const;  // Ok while connected, otherwise why not
   // An orderly end: everything sent before is run and answered, then the daemon closes. Waits for
   // that.
   ClientStatus goodbye(std::chrono::milliseconds patience = kDefaultPatience);
@@ -105,6 +134,8 @@ class ReportingClient {
   // process().
   int fd() const;
   bool wantsWrite() const;
+  // With keepSessions: call process() again after so long, whatever the descriptor says.
+  std::optional<std::chrono::milliseconds> retryIn() const;
   // Writes what is buffered, reads what is there (up to 64 KiB), runs callbacks. Never blocks.
   ClientStatus process();
   // Writes what is buffered as far as the socket takes it. Never blocks.
@@ -162,6 +193,7 @@ class ReportingClient {
 
   std::size_t pendingCalls() const;
   uint64_t unknownAnswers() const;  // answers to calls that were not made, or answered already
+  Counters counters() const;
 
  private:
   // Callbacks may destroy the client, so its state outlives the call that runs them.

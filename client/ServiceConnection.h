@@ -8,11 +8,13 @@
 #include <cstddef>
 #include <cstdint>
 #include <memory>
+#include <optional>
 #include <span>
 #include <string>
 #include <vector>
 
 #include "base/UniqueFd.h"
+#include "client/KeptSessions.h"
 #include "client/PendingCalls.h"
 #include "client/ReportingClient.h"
 #include "wire/FrameReader.h"
@@ -31,7 +33,8 @@ class ServiceConnection : public std::enable_shared_from_this<ServiceConnection>
   ClientStatus open(const std::string& path, Patience patience);
   ClientStatus adopt(UniqueFd connected, Patience patience);
   const std::string& socketPath() const { return socketPath_; }
-  bool isConnected() const { return static_cast<bool>(socket_); }
+  bool isGreeted() const { return helloSeen_; }
+  ClientStatus status() const { return isGreeted() ? ClientStatus() : whyNoCalls(); }
   int fd() const { return socket_.get(); }
   ClientStatus sayGoodbye(Patience patience);
   // Every pending call fails with this reason, once.
@@ -39,7 +42,9 @@ class ServiceConnection : public std::enable_shared_from_this<ServiceConnection>
   // The client is being destroyed: as disconnect(), but no callback runs any more.
   void abandon();
 
-  bool wantsWrite() const { return outBegin_ < out_.size(); }
+  bool wantsWrite() const { return outBegin_ < out_.size() && mayWrite(); }
+  // Until process() should be called though the descriptor, if there is one, is not ready.
+  std::optional<Patience> retryIn() const;
   ClientStatus process();
   ClientStatus flush();
 
@@ -63,6 +68,7 @@ class ServiceConnection : public std::enable_shared_from_this<ServiceConnection>
 
   std::size_t pendingCalls() const { return calls_.size(); }
   uint64_t unknownAnswers() const { return unknownAnswers_; }
+  ReportingClient::Counters counters() const { return counters_; }
 
  private:
   enum class Received : uint8_t { Nothing, Something, Ended };
@@ -73,11 +79,26 @@ class ServiceConnection : public std::enable_shared_from_this<ServiceConnection>
     bool first = true;
   };
 
+  bool isConnected() const { return static_cast<bool>(socket_); }
+  // To a service that leaves, nothing is written that the next one may have.
+  bool mayWrite() const { return helloSeen_ && !(keeping_ && goodbyeSeen_); }
+  enum class Waits : bool { No, Yes };
+  ClientStatus dial(Waits waits, Patience patience, UniqueFd& made) const;
+  void attach(UniqueFd connected);
   ClientStatus begin(UniqueFd connected, Patience patience);
+  // The connection is lost, sessions are kept.
+  void interrupted(const ClientStatus& why);
+  void maybeReconnect();
+  void retryLater();
+  void restoreSessions();
   ClientStatus waitStep(Wait& wait);
   void setReceiveTimeout(Patience patience);
 
   int writeUpTo(std::size_t end);  // 0, or the errno that ends the connection
+  void noteWritten();
+  uint64_t firstUnwritten() const;  // number of a call, or the next one's
+  std::span<const uint8_t> frameAt(std::size_t at) const;
+  void fail(const std::vector<CallAnswer>& calls, const ClientStatus& why);
   void trimOutput();
   ClientStatus lostWhileSending(int error);
   Received lost(const std::string& what);
@@ -95,17 +116,27 @@ class ServiceConnection : public std::enable_shared_from_this<ServiceConnection>
   bool helloSeen_ = false;
   bool goodbyeSeen_ = false;
   bool abandoned_ = false;
-  uint64_t generation_ = 0;       // changes with every connection and disconnection
-  Patience receiveTimeout_{0};    // as the descriptor has it
-  std::size_t largestFrame_ = 0;  // as the service announced it
-  std::string serviceError_;      // what the service said about the connection before closing it
-  ClientStatus ended_;            // why the last connection ended
+  uint64_t generation_ = 0;     // changes with every connection and disconnection
+  Patience receiveTimeout_{0};  // as the descriptor has it
+  std::size_t largestFrame_ = wire::kMaxFrameBytes;  // as the service announced it
+  std::string serviceError_;  // what the service said about the connection before closing it
+  ClientStatus ended_;        // why the last connection ended
 
   wire::ReadBuffers readBuffers_;
   wire::FrameReader reader_{readBuffers_};
   std::vector<uint8_t> out_;  // not yet written: from outBegin_
   std::size_t outBegin_ = 0;
   std::size_t writeAt_ = 0;  // bytes in out_ at which the next write is due
+  // For keepSessions alone. While keeping_, a connection that is lost is made again.
+  bool keeping_ = false;
+  bool greetedBefore_ = false;
+  KeptSessions kept_;
+  std::size_t frameBegin_ = 0;      // in out_: the first frame that is not begun to be written
+  std::size_t restorationEnd_ = 0;  // in out_: up to here it is calls of kept_
+  Patience delay_{0};               // before the next attempt
+  std::chrono::steady_clock::time_point retryAt_;
+  ReportingClient::Counters counters_;
+
   PendingCalls calls_;
   uint64_t unknownAnswers_ = 0;
 };

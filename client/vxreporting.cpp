@@ -266,6 +266,7 @@ vxr_client* vxr_client_new(const vxr_options* options) {
         ReportingClient::Options chosen;
         if (given.max_buffered_bytes != 0) chosen.maxBufferedBytes = given.max_buffered_bytes;
         if (given.max_pending_calls != 0) chosen.maxPendingCalls = given.max_pending_calls;
+        chosen.keepSessions = given.keep_sessions;
         auto client = std::make_unique<vxr_client>();
         client->cpp = std::make_unique<ReportingClient>(chosen);
         made = client.release();
@@ -313,6 +314,21 @@ int vxr_fd(const vxr_client* client) {
 
 bool vxr_wants_write(const vxr_client* client) {
   return client != nullptr && !client->freed && client->cpp->wantsWrite();
+}
+
+int vxr_retry_in_ms(const vxr_client* client) {
+  if (client == nullptr || client->freed) return -1;
+  const auto retry = client->cpp->retryIn();
+  return retry ? static_cast<int>(retry->count()) : -1;
+}
+
+int vxr_get_counters(const vxr_client* client, vxr_counters* counters, size_t size) {
+  if (client == nullptr || client->freed || counters == nullptr) return VXR_INVALID_ARGUMENT;
+  const ReportingClient::Counters now = client->cpp->counters();
+  const vxr_counters all{now.reconnections, now.unanswered, now.dropped, now.sessionsNotRestored};
+  std::memset(counters, 0, size);  // a caller that was built with a newer header knows more of them
+  std::memcpy(counters, &all, std::min(size, sizeof all));
+  return VXR_OK;
 }
 
 int vxr_process(vxr_client* client) {

@@ -27,6 +27,13 @@
  * fork(): the connection stays with the parent. In the child only vxr_client_free() may be called,
  * which leaves the parent's connection alone; descriptors are closed by exec.
  *
+ * Sessions that outlive the connection (keep_sessions): from vxr_connect() on, whether it succeeded
+ * or not, until vxr_goodbye() or vxr_disconnect(), calls are taken without a connection too, up to
+ * the bounds. vxr_process() and the functions that wait make the connection again, with pauses that
+ * grow to five seconds; then the sessions are created, configured and started again, and what was
+ * not begun to be written follows. A call that was written and not answered fails with
+ * VXR_DISCONNECTED and is never sent again: it may have run. A start that holds goes on.
+ *
  * Errors: a function that can fail returns VXR_OK or one of the codes below. vxr_error_text() says
  * what happened to a client, vxr_code_text() what a code means, for people. Wrong arguments (NULL,
  * too deep a dictionary) are VXR_INVALID_ARGUMENT, never a crash. No C++ exception leaves the
@@ -102,9 +109,10 @@ typedef struct vxr_options {
   size_t size;               /* of this structure, as VXR_OPTIONS_INIT sets it */
   size_t max_buffered_bytes; /* of calls not yet written; 0: 1 MiB */
   size_t max_pending_calls;  /* calls not yet answered, held starts included; 0: 65536 */
+  bool keep_sessions;        /* see above */
 } vxr_options;
 #define VXR_OPTIONS_INIT \
-  { sizeof(vxr_options), 0, 0 }
+  { sizeof(vxr_options), 0, 0, false }
 
 /* Milliseconds; anything below 0 stands for the default of 5 seconds. */
 #define VXR_DEFAULT_TIMEOUT (-1)
@@ -128,6 +136,9 @@ VXR_API void vxr_disconnect(vxr_client* client);
    -1 when there is no connection. */
 VXR_API int vxr_fd(const vxr_client* client);
 VXR_API bool vxr_wants_write(const vxr_client* client);
+/* With keep_sessions: in so many milliseconds vxr_process() should be called whatever the
+   descriptor says; -1: no need. */
+VXR_API int vxr_retry_in_ms(const vxr_client* client);
 /* Writes what is buffered, reads what is there, runs callbacks. */
 VXR_API int vxr_process(vxr_client* client);
 /* Writes what is buffered as far as the socket takes it. */
@@ -135,6 +146,16 @@ VXR_API int vxr_flush(vxr_client* client);
 /* Waits until every call is answered, started sessions apart. The first failure since the last wait
    of a call that had no callback is returned here. */
 VXR_API int vxr_wait(vxr_client* client, int timeout_ms);
+
+/* Of a client that keeps its sessions: calls, but for the first and the last. */
+typedef struct vxr_counters {
+  uint64_t reconnections;
+  uint64_t unanswered; /* written when the connection was lost: may have run, not sent again */
+  uint64_t dropped;    /* refused with VXR_BUFFER_FULL, or given up before they were written */
+  uint64_t sessions_not_restored; /* the service refused to have them again */
+} vxr_counters;
+/* `size` is that of the structure. */
+VXR_API int vxr_get_counters(const vxr_client* client, vxr_counters* counters, size_t size);
 
 /* What the last function of this client that failed would say to people. Valid until the next
    call. */

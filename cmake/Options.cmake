@@ -42,6 +42,18 @@ function(vx_program name)
   target_link_libraries(${name} PRIVATE vx_options ${ARG_LINK})
 endfunction()
 
+# Adds a program in C over the C interface.
+function(vx_c_program name)
+  add_executable(${name} ${ARGN})
+  set_target_properties(${name} PROPERTIES C_STANDARD 11 C_STANDARD_REQUIRED ON)
+  target_compile_options(${name} PRIVATE -Wall -Wextra -Wpedantic $<$<BOOL:${VX_WERROR}>:-Werror>)
+  target_link_libraries(${name} PRIVATE vxreporting)
+  if(VX_SANITIZE)  # what the library needs then comes with its own compiler
+    set_target_properties(${name} PROPERTIES LINKER_LANGUAGE CXX)
+    target_link_options(${name} PRIVATE -fsanitize=${VX_SANITIZE})
+  endif()
+endfunction()
+
 # The TOML parser is compiled in: one shared library less to load, and no other one that is C++.
 function(vx_uses_toml name)
   target_include_directories(${name} SYSTEM PRIVATE ${TOMLPP_INCLUDE_DIRS})

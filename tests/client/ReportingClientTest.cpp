@@ -1,4 +1,6 @@
 #include <gmock/gmock.h>
+#include <sys/un.h>
+#include <unistd.h>
 
 #include <functional>
 #include <memory>
@@ -333,6 +335,173 @@ TEST_F(ReportingClientTest, ACallbackMayDestroyTheClient) {
     EXPECT_EQ(client, nullptr);
     EXPECT_THAT(outcomes, IsEmpty()) << "no callback runs after the client is gone";
   }
+}
+
+// A service that comes and goes at one path. Its end of the connection is `service`.
+class KeptSessionsTest : public ReportingClientTest {
+ protected:
+  KeptSessionsTest() {
+    std::string folder = "/tmp/vxkeptXXXXXX";
+    path = mkdtemp(folder.data()) + std::string("/s");
+    makeClient(512);
+  }
+  ~KeptSessionsTest() override {
+    client.reset();
+    goAway();
+    rmdir(path.substr(0, path.size() - 2).c_str());
+  }
+  void makeClient(std::size_t bufferedBytes) {
+    ReportingClient::Options options;
+    options.keepSessions = true;
+    options.maxBufferedBytes = options.writeAtBytes = bufferedBytes;
+    client = std::make_unique<ReportingClient>(options);
+  }
+  std::vector<std::string> readAll() {
+    std::vector<std::string> all = service.texts();
+    while (client->wantsWrite()) {
+      EXPECT_TRUE(client->process().ok());
+      for (std::string& text : service.texts()) all.push_back(std::move(text));
+    }
+    return all;
+  }
+  void listen() {
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    path.copy(static_cast<char*>(address.sun_path), sizeof address.sun_path - 1);
+    listener.reset(socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+    ASSERT_EQ(bind(listener.get(), reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
+    ASSERT_EQ(::listen(listener.get(), 4), 0);
+  }
+  void accept() {
+    service.take(UniqueFd(::accept(listener.get(), nullptr, nullptr)));
+    EXPECT_THAT(service.texts(), ElementsAre("0 1")) << "nothing else before the service greets";
+    service.write(hello(1));
+    EXPECT_TRUE(client->process().ok());
+    EXPECT_TRUE(client->isConnected());
+  }
+  void goAway() {
+    service.close();
+    listener.reset();
+    unlink(path.c_str());
+  }
+  void comeBack() {
+    listen();
+    poll(nullptr, 0, static_cast<int>(client->retryIn().value_or(kShort).count()));
+    EXPECT_TRUE(client->process().ok());
+    accept();
+  }
+  void send(int i) {
+    const Payload numbered = PayloadBuilder().set("i", i).build();
+    EXPECT_TRUE(client->sendMessageAsync(numbered, 1, 1).ok());
+  }
+
+  std::string path;
+  UniqueFd listener;
+};
+
+TEST_F(KeptSessionsTest, AreMadeAgainBeforeWhatWaited) {
+  listen();
+  EXPECT_EQ(client->connect(path, std::chrono::milliseconds(0)).code, Code::TimedOut);
+  send(1);
+  accept();
+  EXPECT_THAT(service.texts(), ElementsAre("1 1 6 {i=1} 1 1 null"));
+  std::vector<Code> stopped;
+  create(7, 10);  // 2 to 5
+  client->setServiceTypeAsync(2, 7, nullptr);
+  client->setConfigurationAsync(PayloadBuilder().set("a", 1).build(), 8, nullptr);
+  client->startReportingSession(8, [&](const auto& r) { stopped.push_back(r.status.code); });  // 8
+  client->startReportingSession(7, nullptr);
+  client->stopReportingSessionAsync(7, nullptr);
+  client->destroyReportingSessionAsync(9, nullptr);
+  client->setServiceTypeAsync(3, 7, nullptr);  // 12
+  ASSERT_TRUE(client->flush().ok());
+  EXPECT_TRUE(receive(yes(2) + frame(3, 5, 5, "too many") + frame(4)).ok());
+  EXPECT_THAT(outcomes, ElementsAre("7 ok", "10 too many"));
+  send(2);  // 13: the service is leaving
+  EXPECT_TRUE(client->flush().ok());
+  EXPECT_THAT(service.texts(), testing::SizeIs(11));
+  create(11, 11);
+  client->startReportingSession(11, nullptr);
+  goAway();
+  EXPECT_TRUE(client->process().ok());
+  EXPECT_THAT(client->status().text, HasSubstr("the service ended"));
+  EXPECT_THAT(outcomes, testing::SizeIs(4)) << "8 and 9 were not answered";
+  send(3);
+  EXPECT_TRUE(client->process().ok());
+  EXPECT_GT(client->retryIn(), std::chrono::milliseconds(0)) << "it is not there yet";
+
+  comeBack();
+  const std::string again = "1 46116860184273879";
+  const std::vector<std::string> restored = {again + "04 1 7", again + "05 2 3 7", again + "07 1 8",
+                                             again + "09 4 {a=1} 8", "1 8 5 8"};
+  std::vector<std::string> expected = restored;
+  for (const char* waited :
+       {"1 13 6 {i=2} 1 1 null", "1 14 1 11", "1 15 5 11", "1 16 6 {i=3} 1 1 null"})
+    expected.emplace_back(waited);
+  EXPECT_EQ(service.texts(), expected);
+  goAway();
+  EXPECT_TRUE(client->process().ok());
+  comeBack();
+  expected = restored;
+  expected.push_back(again + "10 1 11");
+  expected.emplace_back("1 15 5 11");
+  EXPECT_EQ(service.texts(), expected) << "messages are not sent again";
+  EXPECT_TRUE(receive(frame(3, 1LL << 62, 5, "no more") + yes((1LL << 62) + 1) + yes(8)).ok());
+  EXPECT_THAT(stopped, ElementsAre(Code::Ok));
+  EXPECT_EQ(client->unknownAnswers(), 0U);
+  EXPECT_EQ(client->counters().reconnections, 2U);
+  EXPECT_EQ(client->counters().sessionsNotRestored, 1U);
+}
+
+TEST_F(KeptSessionsTest, WhatIsBegunIsNotSentAgainAndWhatIsTooMuchIsCounted) {
+  makeClient(600 << 10);  // more than a socket takes at once
+  EXPECT_EQ(client->connect(path).code, Code::NotConnected);
+  std::size_t taken = 0;
+  while (client->sendMessageAsync(message, kCategory, 1).ok()) ++taken;
+  comeBack();
+  const std::size_t first = service.texts().size();
+  EXPECT_TRUE(service.holdsHalfAFrame());
+  goAway();
+  EXPECT_TRUE(client->process().ok());
+  EXPECT_EQ(client->counters().unanswered, first + 1);
+  comeBack();
+  EXPECT_EQ(first + 1 + readAll().size(), taken);
+  EXPECT_EQ(client->counters().dropped, 1U);
+  create(2, 3);
+  client->disconnect();
+  EXPECT_EQ(client->counters().dropped, 3U);
+  EXPECT_EQ(create(4).code, Code::NotConnected);
+  EXPECT_FALSE(client->retryIn());
+}
+
+TEST_F(KeptSessionsTest, AreMadeAgainWhereThatWasCutShort) {
+  makeClient(900 << 10);
+  EXPECT_EQ(client->connect(path).code, Code::NotConnected);
+  client->createReportingSessionAsync(1, nullptr);
+  const Payload large = PayloadBuilder().set("x", std::string(600 << 10, 'x')).build();
+  client->setConfigurationAsync(large, 1, nullptr);
+  client->startReportingSession(1, nullptr);
+  client->setServiceTypeAsync(7, 1, nullptr);
+  comeBack();
+  EXPECT_THAT(readAll(), testing::SizeIs(4));
+  for (int i = 0; i < 2; ++i) {
+    goAway();
+    EXPECT_TRUE(client->process().ok());
+    comeBack();
+    EXPECT_TRUE(client->wantsWrite()) << "the socket is full";
+  }
+  const std::vector<std::string> texts = readAll();
+  ASSERT_THAT(texts, testing::SizeIs(4));
+  EXPECT_THAT(texts[1], testing::EndsWith(" 2 7 1"));
+  EXPECT_EQ(texts[3], "1 3 5 1");
+}
+
+TEST_F(KeptSessionsTest, BlockingFormsWaitAcrossConnections) {
+  EXPECT_EQ(client->connect(path).code, Code::NotConnected);
+  EXPECT_THAT(client->createReportingSession(1, kShort).status.text, HasSubstr("cannot connect"));
+  EXPECT_EQ(client->goodbye(kShort).code, Code::TimedOut);
+  EXPECT_EQ(client->counters().dropped, 1U);
+  EXPECT_EQ(client->goodbye().code, Code::NotConnected);
 }
 
 }  // namespace

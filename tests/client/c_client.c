@@ -78,7 +78,7 @@ static void wholeLife(void) {
 static void failuresHaveCodesAndTexts(void) {
   const char* const strings[] = {"a", NULL};
   int64_t abandoned = 0, dropped = 0;
-  const vxr_options small = {sizeof small, 4096, 3};
+  const vxr_options small = {sizeof small, 4096, 3, false};
   vxr_client* client = vxr_client_new(&small);
   vxr_dict* dict = vxr_dict_new();
   int level;
@@ -130,7 +130,48 @@ static void aCallbackMayFreeTheClient(void) {
   EXPECT(alive == NULL);
 }
 
-int main(void) {
+/* With keep_sessions; whoever runs this restarts the service between the two lines. */
+static void outliveTheService(void) {
+  vxr_options options = VXR_OPTIONS_INIT;
+  vxr_counters counters;
+  vxr_dict* dict = vxr_dict_new();
+  int64_t stopped = 0;
+  vxr_client* client;
+  options.keep_sessions = true;
+  client = vxr_client_new(&options);
+  EXPECT(vxr_retry_in_ms(client) == -1);
+  EXPECT(vxr_connect(client, NULL, VXR_DEFAULT_TIMEOUT) == VXR_OK);
+  EXPECT(vxr_create_session(client, 7, NULL, NULL) == VXR_OK);
+  EXPECT(vxr_set_service_type(client, 7, 2, NULL, NULL) == VXR_OK);
+  EXPECT(vxr_start_session(client, 7, remember, &stopped) == VXR_OK);
+  EXPECT(vxr_wait(client, VXR_DEFAULT_TIMEOUT) == VXR_OK);
+  puts("started");
+  fflush(stdout);
+  EXPECT(getchar() == '\n'); /* it is gone */
+  while (vxr_is_connected(client)) EXPECT(vxr_process(client) == VXR_OK);
+  EXPECT(vxr_retry_in_ms(client) >= 0);
+  EXPECT(vxr_dict_set_string(dict, "sent", "while it was away") == VXR_OK);
+  EXPECT(vxr_send_message(client, dict, 3, 0, NULL, NULL) == VXR_OK);
+  EXPECT(vxr_wait(client, 0) == VXR_TIMED_OUT);
+  puts("sent");
+  fflush(stdout);
+  EXPECT(vxr_wait(client, 20000) == VXR_OK);
+  EXPECT(vxr_stop_session(client, 7, NULL, NULL) == VXR_OK);
+  EXPECT(vxr_wait(client, VXR_DEFAULT_TIMEOUT) == VXR_OK);
+  EXPECT(stopped == 1);
+  EXPECT(vxr_get_counters(client, &counters, sizeof counters) == VXR_OK);
+  EXPECT(counters.reconnections == 1 && counters.unanswered == 0 && counters.dropped == 0);
+  EXPECT(vxr_goodbye(client, VXR_DEFAULT_TIMEOUT) == VXR_OK);
+  vxr_dict_free(dict);
+  vxr_client_free(client);
+}
+
+int main(int count, char** arguments) {
+  (void)arguments;
+  if (count > 1) {
+    outliveTheService();
+    return failures != 0;
+  }
   wholeLife();
   failuresHaveCodesAndTexts();
   aCallbackMayFreeTheClient();

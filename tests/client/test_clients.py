@@ -5,7 +5,7 @@ import re
 import subprocess
 import sys
 
-from harness import DaemonTest
+from harness import Daemon, DaemonTest
 
 VXREPORT = os.environ["VXREPORT"]
 ROOT = pathlib.Path(__file__).resolve().parents[2]
@@ -42,6 +42,24 @@ class ClientsTest(DaemonTest):
         self.assertEqual(daemon.rows("SELECT payload FROM session_messages WHERE session_id = 42 AND category = 3"),
                          [('{"frames":-3,"gain":0.5,"on":true,"at":"1970-01-01T00:00:00Z","inner":{"route":"Speaker"},'
                            '"ints":[1,-2],"doubles":[0.5],"names":["keyboard","game"]}',)])
+
+    def test_sessions_of_a_program_in_c_outlive_the_service(self):
+        for end in (Daemon.kill, Daemon.stop):
+            daemon = self.daemon()
+            with subprocess.Popen([os.environ["C_CLIENT"], "keep"], stdin=subprocess.PIPE, stdout=subprocess.PIPE, text=True,
+                                  env=dict(os.environ, VXREPORTING_SOCKET=daemon.socket_path)) as program:
+                self.assertEqual(program.stdout.readline(), "started\n")
+                end(daemon)
+                program.stdin.write("\n")
+                program.stdin.flush()
+                self.assertEqual(program.stdout.readline(), "sent\n")
+                daemon.start()
+                self.assertEqual(program.wait(30), 0)
+            self.assertEqual(daemon.stop(), 0)
+            self.assertEqual(daemon.rows("SELECT payload FROM session_messages WHERE session_id = 7 AND category = 3"),
+                             [('{"sent":"while it was away"}',)])
+            self.assertEqual(daemon.rows("SELECT count(*) FROM relay_sessions WHERE session_id = 7 AND service_name LIKE 'telephony%'"),
+                             [(2,)])
 
     def test_the_c_library_exports_its_api_alone_and_needs_no_other(self):
         shown = subprocess.run(["readelf", "--wide", "--dyn-syms", "--dynamic", os.environ["LIBVXREPORTING"]],

@@ -69,6 +69,10 @@ class SocketEnd {
     socket_.reset(ends[0]);
     return UniqueFd(ends[1]);
   }
+  void take(UniqueFd socket) {
+    close();
+    socket_ = std::move(socket);
+  }
   void write(const Bytes& bytes) {
     ASSERT_EQ(send(fd(), bytes.data(), bytes.size(), MSG_NOSIGNAL | MSG_DONTWAIT),
               static_cast<ssize_t>(bytes.size()));
