@@ -1,12 +1,15 @@
 // The steps of a message's road by themselves, one benchmark each.
 #include <benchmark/benchmark.h>
 
+#include <atomic>
 #include <cstring>
 #include <filesystem>
+#include <memory>
 #include <string>
 #include <vector>
 
 #include "benchmarks/Workload.h"
+#include "client/RealtimeReporter.h"
 #include "platform/linux/execution/Executor.h"
 #include "platform/linux/journal/Journal.h"
 #include "propertylist/CborWriter.h"
@@ -170,6 +173,51 @@ void queueToUtilityLane(benchmark::State& state) {
   executor.stop(Monotonic::max());
 }
 BENCHMARK(queueToUtilityLane);
+
+constexpr uint64_t kRing = 4096;
+constexpr std::size_t kNumbers = 4;
+
+void pushToBareRing(benchmark::State& state) {  // the floor of the next one
+  struct Slot {
+    uint64_t words[kNumbers];
+  };
+  std::vector<Slot> slots(kRing);
+  std::atomic<uint64_t> head{0};
+  std::atomic<uint64_t> tail{0};
+  uint64_t i = 0;
+  for (auto _ : state) {
+    const uint64_t at = head.load(std::memory_order_relaxed);
+    if (at - tail.load(std::memory_order_acquire) == kRing)
+      tail.store(at, std::memory_order_release);
+    slots[at & (kRing - 1)] = {{i, i, i, i}};
+    head.store(at + 1, std::memory_order_release);
+    benchmark::ClobberMemory();
+    ++i;
+  }
+}
+BENCHMARK(pushToBareRing);
+
+void sendFromAudioThread(benchmark::State& state) {  // the ring is emptied off the clock
+  using Kind = RealtimeReporter::Kind;
+  const RealtimeReporter::Shape shape{{{"frames", Kind::Integer},
+                                       {"peak", Kind::Double},
+                                       {"late", Kind::Boolean},
+                                       {"load", Kind::Double}},
+                                      kWorkloadCategory,
+                                      kWorkloadType,
+                                      {}};
+  auto reporter = std::make_unique<RealtimeReporter>(shape, kRing);
+  int64_t i = 0;
+  for (auto _ : state) {
+    if (!reporter->send({i, 0.5, i % 2 == 0, 0.25})) {
+      state.PauseTiming();
+      reporter = std::make_unique<RealtimeReporter>(shape, kRing);
+      state.ResumeTiming();
+    }
+    ++i;
+  }
+}
+BENCHMARK(sendFromAudioThread);
 
 }  // namespace
 }  // namespace vx::bench

@@ -6,10 +6,12 @@
 #include <exception>
 #include <memory>
 #include <new>
+#include <span>
 #include <string>
 #include <utility>
 #include <vector>
 
+#include "client/RealtimeReporter.h"
 #include "client/ReportingClient.h"
 #include "propertylist/Payload.h"
 
@@ -70,6 +72,10 @@ struct vxr_client {
   int note(const ClientStatus& status) {
     return status.ok() ? VXR_OK : fail(static_cast<int>(status.code), status.text.c_str());
   }
+};
+
+struct vxr_realtime {
+  vx::RealtimeReporter reporter;
 };
 
 namespace {
@@ -426,4 +432,48 @@ int vxr_get_reporters(vxr_client* client, vxr_callback done, void* user) {
   return call<std::vector<int64_t>>(client, done, user, [&](ReportingClient& cpp, auto answer) {
     return cpp.getAllReportersAsync(std::move(answer));
   });
+}
+
+// ---------------------------------------------------------------------------------------------------------------------
+// From a thread that must never wait
+
+static_assert(sizeof(vxr_number) == sizeof(uint64_t));
+
+vxr_realtime* vxr_realtime_new(const vxr_key* keys, size_t key_count, uint32_t category,
+                               uint16_t type, const int64_t* identifiers, size_t identifier_count,
+                               size_t capacity) {
+  using Kind = vx::RealtimeReporter::Kind;
+  if (keys == nullptr && key_count > 0) return nullptr;
+  vxr_realtime* made = nullptr;
+  (void)guarded(
+      [&]() -> int {
+        vx::RealtimeReporter::Shape shape{{}, category, type, {}};
+        for (const vxr_key& key : std::span(keys, key_count)) {
+          if (key.name == nullptr || key.kind < VXR_INTEGER || key.kind > VXR_BOOLEAN)
+            return VXR_INVALID_ARGUMENT;
+          shape.keys.push_back({key.name, static_cast<Kind>(key.kind)});
+        }
+        if (identifiers != nullptr)
+          shape.reporterIDs.emplace(identifiers, identifiers + identifier_count);
+        made = new vxr_realtime{{std::move(shape), capacity}};
+        return VXR_OK;
+      },
+      [](int code, const char*) { return code; });
+  return made;
+}
+
+void vxr_realtime_free(vxr_realtime* realtime) { delete realtime; }
+
+bool vxr_realtime_send(vxr_realtime* realtime, const vxr_number* numbers, size_t count) {
+  return realtime != nullptr && (numbers != nullptr || count == 0) &&
+         realtime->reporter.sendWords(std::span(reinterpret_cast<const uint64_t*>(numbers), count));
+}
+
+int vxr_realtime_process(vxr_realtime* realtime, vxr_client* client) {
+  if (realtime == nullptr) return missing(client, "there is no ring");
+  return withClient(client, [&](ReportingClient& cpp) { return realtime->reporter.process(cpp); });
+}
+
+uint64_t vxr_realtime_dropped(const vxr_realtime* realtime) {
+  return realtime == nullptr ? 0 : realtime->reporter.dropped() + realtime->reporter.refused();
 }

@@ -209,6 +209,38 @@ VXR_API int vxr_validate_reporter(vxr_client* client, int64_t identifier, vxr_ca
                                   void* user);
 VXR_API int vxr_get_reporters(vxr_client* client, vxr_callback done, void* user);
 
+/* --- from a thread that must never wait, as one that renders audio --- */
+
+typedef struct vxr_realtime vxr_realtime;
+
+enum vxr_kind { VXR_INTEGER = 0, VXR_DOUBLE = 1, VXR_BOOLEAN = 2 };
+typedef struct vxr_key {
+  const char* name;
+  int kind; /* enum vxr_kind */
+} vxr_key;
+/* The member that the key's kind names; a boolean is an integer, 0 or 1. */
+typedef union vxr_number {
+  int64_t integer;
+  double real;
+} vxr_number;
+
+/* A ring of at least `capacity` messages with these keys, category and type, between one thread
+   that calls vxr_realtime_send() and one that calls vxr_realtime_process(). `identifiers`: the
+   sessions that get them; NULL: all that are started. NULL when there is no memory or a kind is
+   unknown. */
+VXR_API vxr_realtime* vxr_realtime_new(const vxr_key* keys, size_t key_count, uint32_t category,
+                                       uint16_t type, const int64_t* identifiers,
+                                       size_t identifier_count, size_t capacity);
+VXR_API void vxr_realtime_free(vxr_realtime* realtime); /* NULL is fine */
+/* One number for each key, in their order. Neither allocates nor locks nor makes a system call.
+   False, and counted, when the ring is full or there are not as many numbers as keys. */
+VXR_API bool vxr_realtime_send(vxr_realtime* realtime, const vxr_number* numbers, size_t count);
+/* On the thread of the client: gives it what was sent so far. What the client does not take now
+   stays in the ring. Never blocks. */
+VXR_API int vxr_realtime_process(vxr_realtime* realtime, vxr_client* client);
+/* How many messages were not sent, for either reason. */
+VXR_API uint64_t vxr_realtime_dropped(const vxr_realtime* realtime);
+
 #ifdef __cplusplus
 }
 #endif

@@ -2,9 +2,13 @@
 #include <sys/un.h>
 #include <unistd.h>
 
+#include <atomic>
+#include <cmath>
 #include <functional>
 #include <memory>
+#include <thread>
 
+#include "client/RealtimeReporter.h"
 #include "client/ReportingClient.h"
 #include "tests/wire/SocketEnd.h"
 
@@ -335,6 +339,57 @@ TEST_F(ReportingClientTest, ACallbackMayDestroyTheClient) {
     EXPECT_EQ(client, nullptr);
     EXPECT_THAT(outcomes, IsEmpty()) << "no callback runs after the client is gone";
   }
+}
+
+using Kind = RealtimeReporter::Kind;
+
+TEST_F(ReportingClientTest, NumbersOfAnotherThreadArriveInOrderOrAreCounted) {
+  RealtimeReporter reporter({{{"i", Kind::Integer}, {"half", Kind::Double}}, 1, 2, {{42}}}, 60);
+  constexpr int kCount = 3000;
+  int sent = 0;
+  std::atomic<bool> done{false};
+  EXPECT_TRUE(reporter.send({-1, 0}));
+  EXPECT_EQ(reporter.process(*std::make_unique<ReportingClient>()).code, Code::NotConnected);
+  connect();
+  std::thread audio([&] {
+    while (sent < kCount) sent += reporter.send({sent, sent / 2.0}) ? 1 : 0;
+    done = true;
+  });
+  std::vector<std::string> arrived;
+  for (bool last = false; !last;) {
+    last = done;
+    EXPECT_TRUE(reporter.process(*client).ok());
+    EXPECT_TRUE(client->process().ok());
+    for (std::string& text : service.texts()) arrived.push_back(std::move(text));
+  }
+  audio.join();
+  ASSERT_EQ(arrived.size(), kCount + 1U);
+  for (int i = 0; i <= kCount; ++i) {
+    const Payload expected =
+        PayloadBuilder().set("i", i - 1).set("half", i == 0 ? 0 : (i - 1) / 2.0).build();
+    ASSERT_EQ(arrived[i], "1 " + std::to_string(i + 1) + " 6 " + expected.text() + " 1 2 (42)");
+  }
+  const uint64_t before = reporter.dropped();
+  for (int i = 0; i < 66; ++i) EXPECT_EQ(reporter.send({i, i}), i < 64);
+  EXPECT_FALSE(reporter.send({1}));
+  EXPECT_EQ(reporter.dropped() - before, 2U);
+  EXPECT_EQ(reporter.refused(), 1U);
+}
+
+TEST_F(ReportingClientTest, NumbersBecomeOfTheirKeysKinds) {
+  connect();
+  RealtimeReporter reporter(
+      {{{"i", Kind::Integer}, {"d", Kind::Double}, {"b", Kind::Boolean}}, 1, 2, {}}, 8);
+  EXPECT_TRUE(reporter.send({2.9, true, 7}));
+  EXPECT_TRUE(reporter.send({-1e300, -3, 0.5}));
+  EXPECT_TRUE(reporter.send({std::nan(""), 0.5F, 0.0}));
+  EXPECT_TRUE(reporter.send({1e300, 1U, false}));
+  EXPECT_TRUE(reporter.process(*client).ok());
+  client->flush();
+  EXPECT_THAT(service.texts(), ElementsAre("1 1 6 {i=2,d=1,b=1} 1 2 null",
+                                           "1 2 6 {i=-9223372036854775808,d=-3,b=1} 1 2 null",
+                                           "1 3 6 {i=0,d=0.5,b=0} 1 2 null",
+                                           "1 4 6 {i=9223372036854775807,d=1,b=0} 1 2 null"));
 }
 
 // A service that comes and goes at one path. Its end of the connection is `service`.

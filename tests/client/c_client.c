@@ -121,6 +121,31 @@ static void failuresHaveCodesAndTexts(void) {
   vxr_client_free(client);
 }
 
+static void aRingOfNumbers(void) {
+  const vxr_key keys[] = {{"frames", VXR_INTEGER}, {"peak", VXR_DOUBLE}, {"on", VXR_BOOLEAN}};
+  const vxr_key wrong[] = {{"x", 3}};
+  const int64_t ids[] = {6};
+  vxr_number numbers[3];
+  vxr_realtime* ring = vxr_realtime_new(keys, 3, 4, 0, ids, 1, 1);
+  vxr_client* client = vxr_client_new(NULL);
+  numbers[0].integer = -3;
+  numbers[1].real = 0.5;
+  numbers[2].integer = 1;
+  EXPECT(vxr_realtime_new(wrong, 1, 4, 0, NULL, 0, 1) == NULL);
+  EXPECT(vxr_realtime_send(ring, numbers, 3));
+  EXPECT(!vxr_realtime_send(ring, numbers, 3) && !vxr_realtime_send(ring, numbers, 2));
+  EXPECT(vxr_realtime_dropped(ring) == 2);
+  EXPECT(vxr_realtime_process(ring, client) == VXR_NOT_CONNECTED);
+  EXPECT(vxr_connect(client, NULL, VXR_DEFAULT_TIMEOUT) == VXR_OK);
+  EXPECT(vxr_create_session(client, 6, NULL, NULL) == VXR_OK);
+  EXPECT(vxr_start_session(client, 6, NULL, NULL) == VXR_OK);
+  EXPECT(vxr_realtime_process(ring, client) == VXR_OK);
+  EXPECT(vxr_realtime_process(NULL, client) == VXR_INVALID_ARGUMENT);
+  EXPECT(vxr_goodbye(client, VXR_DEFAULT_TIMEOUT) == VXR_OK);
+  vxr_client_free(client);
+  vxr_realtime_free(ring);
+}
+
 static void aCallbackMayFreeTheClient(void) {
   vxr_client* client = vxr_client_new(NULL);
   vxr_client* alive = client;
@@ -174,6 +199,7 @@ int main(int count, char** arguments) {
   }
   wholeLife();
   failuresHaveCodesAndTexts();
+  aRingOfNumbers();
   aCallbackMayFreeTheClient();
   puts(failures == 0 ? vxr_version() : "failed");
   return failures != 0;

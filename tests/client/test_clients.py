@@ -42,6 +42,8 @@ class ClientsTest(DaemonTest):
         self.assertEqual(daemon.rows("SELECT payload FROM session_messages WHERE session_id = 42 AND category = 3"),
                          [('{"frames":-3,"gain":0.5,"on":true,"at":"1970-01-01T00:00:00Z","inner":{"route":"Speaker"},'
                            '"ints":[1,-2],"doubles":[0.5],"names":["keyboard","game"]}',)])
+        self.assertEqual(daemon.rows("SELECT payload FROM session_messages WHERE session_id = 6 AND category = 4"),
+                         [('{"frames":-3,"peak":0.5,"on":true}',)])
 
     def test_sessions_of_a_program_in_c_outlive_the_service(self):
         for end in (Daemon.kill, Daemon.stop):
