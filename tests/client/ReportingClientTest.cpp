@@ -4,6 +4,8 @@
 
 #include <atomic>
 #include <cmath>
+#include <filesystem>
+#include <fstream>
 #include <functional>
 #include <memory>
 #include <thread>
@@ -11,6 +13,8 @@
 #include "client/RealtimeReporter.h"
 #include "client/ReportingClient.h"
 #include "tests/wire/SocketEnd.h"
+
+extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size);
 
 namespace vx {
 
@@ -339,6 +343,17 @@ TEST_F(ReportingClientTest, ACallbackMayDestroyTheClient) {
     EXPECT_EQ(client, nullptr);
     EXPECT_THAT(outcomes, IsEmpty()) << "no callback runs after the client is gone";
   }
+}
+
+TEST_F(ReportingClientTest, WhateverAServiceSaysEachCallIsAnsweredOnce) {
+  int files = 0;
+  for (const auto& entry : std::filesystem::directory_iterator(VX_FUZZ_CORPUS "/client")) {
+    std::ifstream in(entry.path(), std::ios::binary);
+    const Bytes bytes((std::istreambuf_iterator<char>(in)), {});
+    EXPECT_EQ(LLVMFuzzerTestOneInput(bytes.data(), bytes.size()), 0);
+    ++files;
+  }
+  EXPECT_GE(files, 20);
 }
 
 using Kind = RealtimeReporter::Kind;
