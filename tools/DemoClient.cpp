@@ -1,6 +1,6 @@
 // vx-demo-client ROLE [SECONDS]: acts out one audio client of a phone for a while: media,
-// telephony, haptics, alarms, setup (which is there to be killed in mid-session), or early, which
-// reports before anybody has started a session.
+// telephony, setup (which is there to be killed in mid-session), or early, which reports before
+// anybody has started a session. vx-demo-haptics is another one in C, demo-alarms in Python.
 #include <poll.h>
 #include <sys/prctl.h>
 
@@ -24,15 +24,9 @@ constexpr uint32_t kSessionSetup = 0x08000005;
 constexpr uint32_t kSessionPlayback = 0x08000003;
 constexpr uint32_t kRouteChange = 0x40000007;
 constexpr uint32_t kHalPerformance = 0x2000000A;
-constexpr uint32_t kHalGeneric = 0x20000001;
 constexpr uint16_t kGeneric = 0;
 constexpr uint16_t kStart = 1;
 constexpr uint16_t kStop = 2;
-constexpr uint16_t kRunningTime = 6;
-
-double wallClock() {
-  return std::chrono::duration<double>(std::chrono::system_clock::now().time_since_epoch()).count();
-}
 
 // A client and what it counted.
 class Actor {
@@ -175,36 +169,6 @@ void makeCalls(Actor& actor) {
   actor.end(2001);
 }
 
-void playHaptics(Actor& actor) {
-  actor.begin(3001, 3, "com.example.keyboard");
-  for (int i = 1; actor.goesOn(); ++i) {
-    actor.send(
-        PayloadBuilder().set("EngineOnTime", 0.015 * i).set("vxreporting_timestamp", wallClock()),
-        kHalGeneric, kRunningTime, {3001});
-    if (i == 4) {
-      actor.send(PayloadBuilder()
-                     .set("Haptic_Active_Hardware_Time_Seconds", 42)
-                     .set("Active_Clients", vx::ArrayBuilder().add("keyboard").add("game")),
-                 kHalGeneric, kRunningTime, {3001});
-    }
-    actor.pass(std::chrono::milliseconds(400));
-  }
-  actor.end(3001);
-}
-
-void ringAlarms(Actor& actor) {
-  for (int64_t reporter = 4001; actor.goesOn(); ++reporter) {
-    actor.begin(reporter, reporter % 2 == 0 ? 4 : 10, "com.example.clock");
-    for (int i = 0; i < 4; ++i) {
-      actor.send(PayloadBuilder().set("sound", "chimes").set("volume", 0.25 * i), kSessionPlayback,
-                 kStart, {reporter});
-      actor.pass(std::chrono::milliseconds(250));
-    }
-    actor.end(reporter);
-    actor.client().destroyReportingSession(reporter);
-  }
-}
-
 // Holds a started session until it is killed.
 void setUp(Actor& actor) {
   actor.begin(5001, 6, "com.example.setup");
@@ -221,16 +185,14 @@ void reportEarly(Actor& actor) {
 }
 
 const std::map<std::string, void (*)(Actor&)> kRoles = {
-    {"media", playMedia},   {"telephony", makeCalls}, {"haptics", playHaptics},
-    {"alarms", ringAlarms}, {"setup", setUp},         {"early", reportEarly}};
+    {"media", playMedia}, {"telephony", makeCalls}, {"setup", setUp}, {"early", reportEarly}};
 
 }  // namespace
 
 int main(int argc, char** argv) {
   const auto role = kRoles.find(argc > 1 ? argv[1] : "");
   if (role == kRoles.end()) {
-    std::fprintf(stderr,
-                 "usage: vx-demo-client media|telephony|haptics|alarms|setup|early [SECONDS]\n");
+    std::fprintf(stderr, "usage: vx-demo-client media|telephony|setup|early [SECONDS]\n");
     return 2;
   }
   prctl(PR_SET_NAME, ("demo-" + role->first).c_str());  // the name the service knows it by

@@ -24,6 +24,24 @@ class ClientsTest(DaemonTest):
         ended = run(daemon, sys.executable, "-c", program)
         self.assertEqual((ended.stdout.split(), ended.stderr), (["True", "True", "None", "True", "True"], ""))
 
+    def test_the_programs_of_the_clients_page_report_the_same(self):
+        page = (ROOT / "docs/clients.md").read_text()
+        python = re.search(r"```python\n(.*?)```", page, re.S).group(1)
+        frames = bytes.fromhex(re.search(r"```\n(03000000.*?)```", page, re.S).group(1))
+        for program in (*([p] for p in os.environ["PAGE_CLIENTS"].split(":")), [sys.executable, "-c", python], None):
+            daemon = self.daemon()
+            if program:
+                ended = run(daemon, *program)
+                self.assertEqual((ended.returncode, ended.stdout, ended.stderr), (0, "", ""))
+            else:
+                client = daemon.client(hello=False)
+                client.raw(frames)
+                client.until_closed()
+                self.assertEqual([client.answers[n][-1][2] for n in (1, 2, 3, 4, 5)], [True, True, True, None, True])
+            self.assertEqual(daemon.stop(), 0)
+            self.assertEqual(daemon.rows("SELECT session_id, service_name, category, type, payload FROM session_messages "
+                                         "WHERE category = 5"), [(42, "longformaudio_session", 5, 1, '{"gain":0.5}')])
+
     def test_the_frames_printed_on_the_protocol_page_are_answered_as_printed(self):
         frames = {text: bytes.fromhex(code) for code, text in
                   re.findall(r"^ {4}((?:[0-9a-f]{2} +)+)(\[.*\])$", PAGE, re.M)}
