@@ -7,6 +7,7 @@
 #include <future>
 
 #include "Statistics/VXReportingProcessState.h"
+#include "platform/linux/execution/SteppedWork.h"
 #include "platform/linux/recovery/Records.h"
 #include "tests/ipc/IpcTest.h"
 #include "tests/journal/JournalFixture.h"
@@ -282,6 +283,17 @@ TEST_F(RecordingTest, MemoryIsGivenBackForNoCallsSakeAndDroppedWorkLeavesItsCall
   }
   own.reset();
   EXPECT_FALSE(journal->allDone()) << "work that was dropped is not done";
+  own = std::make_unique<RecordedService>(journal.get());
+  const uint64_t inSteps = append(1, dictionary(3))->call;
+  {
+    const Cause cause{append(1, dictionary(4))->ticket, {}};
+    const CauseScope scope(cause);
+    own->executor.setStepsTaker([](auto) {});  // drops them
+    serviceQueue()->asyncInSteps([] { return true; });
+  }
+  own->runQueues();
+  EXPECT_TRUE(done(inSteps));
+  EXPECT_FALSE(done(inSteps + 1)) << "nor are steps";
 }
 
 TEST_F(RecordingTest, CallsAreServedBetweenTheStepsOfLongWorkAndAStopDoesTheRest) {

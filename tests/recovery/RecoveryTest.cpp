@@ -229,10 +229,10 @@ TEST_F(RecoveryTest, AKilledProcessLosesNothingAndWritesNothingTwice) {
       [&] { create(2, 22, 3); },  // never started: needs no end
       [&] { connect(3, 202); },
       [&] { create(3, 44, 3), create(3, 55, 3), create(3, 66, 7); },
-      [&] { start(3, 44), start(3, 55), start(3, 66); },
-      [&] { send(1, 2); },
+      [&] { start(3, 44), start(3, 55), start(3, 66), send(1, 9); },
       [&] { end(3, End::Orderly); },  // one session after the other, while others are served
-      [&] { send(2, 3, both); },      // also to another client's
+      [&] { send(1, 2); },
+      [&] { send(2, 3, both); },  // also to another client's
       [&] { create(2, 33, 3), start(2, 33); },
       [&] { send(2, 4); },
       [&] { prefer("second", "true"); },
