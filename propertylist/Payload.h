@@ -295,10 +295,16 @@ class PayloadBuilder {
   PayloadBuilder& set(std::string_view key, const Value& value);
   PayloadBuilder& set(std::string_view key, const Payload& dictionary);
   PayloadBuilder& set(std::string_view key, const ArrayBuilder& array);
-  // Adds every entry of `from`, replacing values under keys that are there already.
+  // Adds every entry of `from`, replacing values under keys that are there already. Costs what is
+  // added, not what is there. What memory it wants it asks for first: std::bad_alloc leaves it
+  // whole.
   PayloadBuilder& merge(const Payload& from);
 
   std::size_t size() const { return entries_.size(); }
+  // Bytes of what build() would make after merge(from).
+  std::size_t encodedSizeWith(const Payload& from);
+  // That it keeps itself.
+  std::size_t memoryBytes() const;
   Payload build() const;
   // For a dictionary of long texts that would be put together first and then copied: each is given
   // in pieces, which must be UTF-8 as a whole. The keys must be UTF-8 and unique.
@@ -327,8 +333,9 @@ class PayloadBuilder {
   Entry* find(std::string_view key, uint32_t hash);
   void add(std::string_view key, const Entry& entry);
   void replace(Entry& entry, std::size_t value);
+  bool wantsIndex(std::size_t entries) const;
   void index(std::size_t entry);
-  void growIndex();
+  void growIndex(std::size_t entries);
   void compact();
 
   // Keys and values one after the other, encoded. A value that was replaced may stay as dead bytes

@@ -1,4 +1,5 @@
 #include <algorithm>
+#include <bit>
 #include <cmath>
 
 #include "base/SeededHash.h"
@@ -26,6 +27,12 @@ std::size_t headSize(uint64_t argument) {
   if (argument < 24) return 1;
   if (argument <= 0xFF) return 2;
   return argument <= 0xFFFF ? 3 : argument <= 0xFFFFFFFF ? 5 : 9;
+}
+
+template <class T>
+void makeSpace(std::vector<T>& items, std::size_t more) {
+  if (items.capacity() - items.size() < more)
+    items.reserve(std::max(items.size() + more, 2 * items.capacity()));
 }
 
 uint32_t offset(std::size_t value) { return static_cast<uint32_t>(value); }
@@ -77,9 +84,31 @@ PayloadBuilder& PayloadBuilder::setUnsigned(std::string_view key, uint64_t value
 }
 
 PayloadBuilder& PayloadBuilder::merge(const Payload& from) {
-  entries_.reserve(std::max(entries_.size(), from.size()));
+  makeSpace(body_, from.encoded().size());
+  makeSpace(entries_, from.size());
+  if (const std::size_t most = entries_.size() + from.size(); wantsIndex(most)) growIndex(most);
   for (const auto& [key, value] : from) set(key, value);
   return *this;
+}
+
+std::size_t PayloadBuilder::encodedSizeWith(const Payload& from) {
+  std::size_t count = entries_.size();
+  std::size_t bytes = body_.size() - deadBytes_;
+  for (const auto& [key, value] : from) {
+    bytes += value.encoded().size();
+    if (const Entry* const old = find(key, hashOf(key))) {
+      bytes -= old->valueEnd - old->value;
+    } else {
+      bytes += headSize(key.size()) + key.size();
+      ++count;
+    }
+  }
+  return headSize(count) + bytes;
+}
+
+std::size_t PayloadBuilder::memoryBytes() const {
+  return body_.capacity() + entries_.capacity() * sizeof(Entry) +
+         slots_.capacity() * sizeof(slots_[0]);
 }
 
 Payload PayloadBuilder::build() const {
@@ -177,8 +206,8 @@ void PayloadBuilder::add(std::string_view key, const Entry& entry) {
   if (entries_.capacity() == 0) entries_.reserve(kMaxLinear);
   entries_.push_back(entry);
   spaceInKeys_ = spaceInKeys_ || key.find(' ') != std::string_view::npos;
-  if (2 * entries_.size() > slots_.size() && entries_.size() > kMaxLinear)
-    growIndex();
+  if (wantsIndex(entries_.size()))
+    growIndex(entries_.size());
   else if (!slots_.empty())
     index(entries_.size() - 1);
 }
@@ -205,6 +234,10 @@ void PayloadBuilder::replace(Entry& entry, std::size_t value) {
   if (deadBytes_ > kMinDead && deadBytes_ > body_.size() / 2) compact();
 }
 
+bool PayloadBuilder::wantsIndex(std::size_t entries) const {
+  return entries > kMaxLinear && 2 * entries > slots_.size();
+}
+
 void PayloadBuilder::index(std::size_t entry) {
   const std::size_t mask = slots_.size() - 1;
   std::size_t slot = entries_[entry].hash & mask;
@@ -212,8 +245,8 @@ void PayloadBuilder::index(std::size_t entry) {
   slots_[slot] = offset(entry + 1);
 }
 
-void PayloadBuilder::growIndex() {
-  slots_.assign(std::max<std::size_t>(4 * kMaxLinear, 2 * slots_.size()), 0);
+void PayloadBuilder::growIndex(std::size_t entries) {
+  slots_.assign(std::max(4 * kMaxLinear, std::bit_ceil(2 * entries)), 0);
   for (std::size_t i = 0; i < entries_.size(); ++i) index(i);
 }
 
