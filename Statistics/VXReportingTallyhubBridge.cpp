@@ -32,7 +32,8 @@ void VXReportingTallyhubBridge::handleEvent(const Payload* payload, MessageCateg
   // Both dictionaries are immutable, so holding them is as good as copying them now: the event's
   // own dictionary is put together only if and when the service wants it.
   std::optional<Payload> userInfo;
-  if (session != nullptr) userInfo = session->userInfo()->snapshot();
+  if (session != nullptr) userInfo = session->userInfo()->application();
+  const std::size_t holds = userInfo ? userInfo->encoded().size() : 0;
   const Payload& message = payload != nullptr ? *payload : kNoMessage;
   platform().analytics.sendEventLazy(
       eventName(messageKind(category, type)),
@@ -40,7 +41,7 @@ void VXReportingTallyhubBridge::handleEvent(const Payload* payload, MessageCateg
         return VXReportingHostApplicationDisplayID(userInfo).addedTo(message,
                                                                      kHostApplicationDisplayIDKey);
       },
-      message);
+      message, holds);
 }
 
 }  // namespace vx

@@ -23,7 +23,7 @@ void VXReportingWattmarkUtility::handleEvent(const Payload* payload, MessageCate
     PayloadBuilder record;
     record.set("EngineOnDuration", *onTime);
     std::optional<Payload> userInfo;
-    if (session != nullptr) userInfo = session->userInfo()->snapshot();
+    if (session != nullptr) userInfo = session->userInfo()->application();
     const std::optional<HostApplicationDisplayID> application =
         VXReportingHostApplicationDisplayID(userInfo);
     // Always there while the lookup falls back to "Unknown"; kept for the day it does not.

@@ -24,6 +24,18 @@ class AggregateMemory {
   };
 
   virtual ~AggregateMemory() = default;
+  // Somebody who pays for what is kept.
+  using Payer = uint16_t;
+  // Whoever the calling thread works for, and whether more may be kept for him.
+  struct Account {
+    Payer payer = 0;
+    bool isFull = false;
+  };
+  virtual Account account() { return {}; }
+  // So many bytes more are kept for him, or less: here, or in a session.
+  virtual void charge(Payer /*payer*/, int64_t /*bytes*/) {}
+  // Of a session: something is left out from here on (0), or so many messages were in all.
+  virtual void leftOut(int64_t /*reporterID*/, uint64_t /*messages*/) {}
   // Not 0, and never given twice, by no other process either.
   virtual uint64_t nameAggregate() = 0;
   // Of `bytes` at least; what is in them is anything. Ordinals count from 0 without a gap. Never

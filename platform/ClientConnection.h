@@ -146,6 +146,9 @@ struct OperationDescription {
   bool (*isHeavy)(const CallArguments& arguments) = nullptr;
   // For the users whom the connection's configuration names; others get an error.
   bool privileged = false;
+  // Makes the service hold more for the caller's user until he takes it back: refused beyond his
+  // bound.
+  bool holds = false;
 };
 
 // Operations are numbered from 1 in declaration order on the wire. Each has one dictionary at most

@@ -20,6 +20,11 @@ class RecordedInputs {
   // source is never asked. `what` is a literal that names the question.
   virtual std::optional<Payload> once(std::string_view what,
                                       const Function<std::optional<Payload>()>& source) = 0;
+  // A decision that rests on what no later process can know: how it falls `now`, which is recorded
+  // with the call when it is true; false where it cannot be. Where that call is run again: how it
+  // fell then. Takes no place of the call, so it may be left unasked; at each place once for each
+  // `what`.
+  virtual bool decide(std::string_view /*what*/, bool now) { return now; }
   // Records work that waits for long as a call of its own, so that the one that it goes back to
   // need not be kept for it. The work keeps its name. Again: in the place of the record before.
   virtual void keepDelayed(const Payload& /*facts*/, const Payload& /*content*/,

@@ -1,5 +1,6 @@
 #include "wire/FrameReader.h"
 
+#include <algorithm>
 #include <cstring>
 
 namespace vx::wire {
@@ -33,6 +34,8 @@ std::span<uint8_t> FrameReader::spaceOfItsOwn() {
   inShared_ = false;
   begin_ = 0;
   end_ = had;
+  // All of it now: growing step by step would take twice as much.
+  own_.reserve(kLengthBytes + std::min(nextLength(), limit_) + ReadBuffers::kReadBytes);
   own_.resize(had + ReadBuffers::kReadBytes);
   return {own_.data() + had, ReadBuffers::kReadBytes};
 }

@@ -32,6 +32,7 @@ enum class ErrorCode : uint8_t {
   TooManyConnections = 6,
   UnsupportedVersion = 7,
   Abandoned = 8,
+  TooMuchMemory = 9,
   NotPermitted = 10,
   TooManyIdentifiers = 11,
 };

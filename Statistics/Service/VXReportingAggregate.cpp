@@ -39,9 +39,20 @@ VXReportingRows& VXReportingAggregate::rows() {
   return *rows_;
 }
 
-void VXReportingAggregate::appendMessage(MessageKind kind, uint64_t count, const Payload& payload) {
+void VXReportingAggregate::append(std::optional<MessageKind> kind, uint64_t count,
+                                  const Payload& payload, AggregateMemory::Payer payer) {
+  rows().append(kind, count, payload);
+  rows().chargeTo(payer);
+}
+
+// A call that is run again leaves out what it left out before, however much is kept now.
+bool VXReportingAggregate::appendMessage(MessageKind kind, uint64_t count, const Payload& payload) {
+  const AggregateMemory::Account account = platform().aggregates.account();
   MutexLock lock(mutex_);
-  if (present_) rows().append(kind, count, payload);
+  if (!present_) return true;
+  if (platform().inputs.decide("left out", account.isFull)) return false;
+  append(kind, count, payload, account.payer);
+  return true;
 }
 
 void VXReportingAggregate::appendReference(MessageKind kind, uint64_t count,
@@ -52,7 +63,7 @@ void VXReportingAggregate::appendReference(MessageKind kind, uint64_t count,
 
 void VXReportingAggregate::appendToFlat(const Payload& payload) {
   MutexLock lock(mutex_);
-  if (present_) rows().append(std::nullopt, 0, payload);
+  if (present_) append(std::nullopt, 0, payload, platform().aggregates.account().payer);
 }
 
 void VXReportingAggregate::insertHeader(Payload header) {

@@ -31,8 +31,9 @@ class VXReportingAggregate {
   [[nodiscard]] Contents removeAll();
 
   // All of them are dropped without a word where the aggregate is absent. None keeps the payload
-  // alive, but appendReference: for one that is too large for a copy and is let go of soon.
-  void appendMessage(MessageKind kind, uint64_t count, const Payload& payload);
+  // alive, but appendReference: for one that is too large for a copy and is let go of soon. False:
+  // it is left out, because whoever sent it has enough kept already.
+  bool appendMessage(MessageKind kind, uint64_t count, const Payload& payload);
   void appendReference(MessageKind kind, uint64_t count, const Payload& payload);
   void appendToFlat(const Payload& payload);
   // Puts `header` before everything in the nested one.
@@ -77,6 +78,8 @@ class VXReportingAggregate {
  private:
   Contents exchange(Contents rows, bool present);
   VXReportingRows& rows() REQUIRES(mutex_);
+  void append(std::optional<MessageKind> kind, uint64_t count, const Payload& payload,
+              AggregateMemory::Payer payer) REQUIRES(mutex_);
 
   mutable Mutex mutex_;
   Contents rows_ GUARDED_BY(mutex_);  // none yet

@@ -3,6 +3,7 @@
 #include <array>
 #include <bit>
 #include <cstring>
+#include <utility>
 
 #include "Statistics/Service/VXReportingRowScan.h"
 #include "base/Bytes.h"
@@ -98,6 +99,26 @@ bool shorten(const uint8_t* item, uint8_t (&out)[VXReportingRowFormat::kShortDou
 }
 
 }  // namespace
+
+VXReportingRows::~VXReportingRows() {
+  for (const Share& share : shares_) memory_.charge(share.payer, -share.bytes);
+  memory_.release(blocks_);
+}
+
+void VXReportingRows::chargeTo(AggregateMemory::Payer payer) {
+  const int64_t more = static_cast<int64_t>(memoryBytes() + shapeBytes_) - charged_;
+  if (more == 0) return;
+  charged_ += more;
+  if (shares_.empty() || shares_.back().payer != payer) {
+    const auto found = std::ranges::find(shares_, payer, &Share::payer);
+    if (found == shares_.end())
+      shares_.push_back({payer, 0});
+    else
+      std::swap(*found, shares_.back());
+  }
+  shares_.back().bytes += more;
+  memory_.charge(payer, more);
+}
 
 // ---------------------------------------------------------------------------------------------------------------------
 // Rows
@@ -241,20 +262,22 @@ void VXReportingRows::appendShape(std::optional<MessageKind> kind, std::span<con
     kept.emplace_back(out, key.size());
     out = copy(out, key.data(), key.size());
   }
-  at_ = out;
   addShape(kind, kept);
+  at_ = out;
 }
 
 // The keys are in the stream.
 void VXReportingRows::addShape(std::optional<MessageKind> kind, std::span<const Bytes> keys) {
+  shapes_.resize(fingerprints_.size());  // the last may be one that there was no memory for
   Shape& shape = shapes_.emplace_back();
-  fingerprints_.push_back(fingerprintOf(kind, keys));
   shape.kind = kind;
   for (const Bytes key : keys) {
     shape.columns.push_back({.key = key, .last = {}});
     shape.keys.push_back(cbor::text(key.data()));
     shape.keyBytes += key.size();
   }
+  fingerprints_.push_back(fingerprintOf(kind, keys));
+  shapeBytes_ += sizeof(Shape) + keys.size() * (sizeof(Column) + sizeof(std::string_view));
 }
 
 // ---------------------------------------------------------------------------------------------------------------------

@@ -27,12 +27,15 @@ class VXReportingRows {
   explicit VXReportingRows(AggregateMemory& memory) : memory_(memory) {}
   VXReportingRows(const VXReportingRows&) = delete;
   VXReportingRows& operator=(const VXReportingRows&) = delete;
-  ~VXReportingRows() { memory_.release(blocks_); }
+  ~VXReportingRows();
 
   // Copies the dictionary. A row without a kind is no message, and its count means nothing.
   void append(std::optional<MessageKind> kind, uint64_t count, const Payload& payload);
   // Keeps a reference, to what is too large for a copy. Such a row does not survive the process.
   void appendReference(MessageKind kind, uint64_t count, Payload payload);
+
+  // What was appended since the last time is paid for by him.
+  void chargeTo(AggregateMemory::Payer payer);
 
   std::size_t rows() const { return rows_; }
   std::size_t messages() const { return messages_; }
@@ -74,6 +77,11 @@ class VXReportingRows {
     uint64_t count = 0;         // of its last message
   };
 
+  struct Share {
+    AggregateMemory::Payer payer = 0;
+    int64_t bytes = 0;
+  };
+
   AggregateMemory::Block block() const {
     return blocks_.empty() ? AggregateMemory::Block{} : blocks_.back();
   }
@@ -99,6 +107,9 @@ class VXReportingRows {
   std::vector<Kind> kinds_;             // bounded by the number of kinds, some hundreds
   std::size_t kind_ = 0;                // the one used last
   std::vector<Payload> references_;
+  std::size_t shapeBytes_ = 0;  // beside the stream
+  std::vector<Share> shares_;   // of those who pay, the last one of late
+  int64_t charged_ = 0;
   std::size_t rows_ = 0;
   std::size_t messages_ = 0;
   bool mayHoldNonFinite_ = false;

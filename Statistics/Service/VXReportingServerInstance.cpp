@@ -192,7 +192,7 @@ void VXReportingServerInstance::setConfiguration(std::optional<Payload> configur
   serviceQueue()->async([self = shared_from_this(), configuration = std::move(configuration),
                          reporterID, reply = std::move(reply)] {
     if (const auto session = self->findReportingSessionForID(reporterID, Lookup::OwnMap)) {
-      session->setConfiguration(configuration);
+      if (!session->setConfiguration(configuration)) return;  // the answer is that there is none
     }
     reply(true);
   });

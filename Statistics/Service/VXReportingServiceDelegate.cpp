@@ -146,7 +146,7 @@ void VXReportingServiceDelegate::clientInvalidated(
           event.set("seconds", -1);
         return event.build();
       },
-      Payload());
+      Payload(), name->size());
 }
 
 const VXReportingServiceDelegate::Clients& VXReportingServiceDelegate::getAllClients() {

@@ -3,6 +3,7 @@
 #include <algorithm>
 #include <cmath>
 #include <stdexcept>
+#include <utility>
 
 #include "Statistics/Service/VXReportingServiceDelegate.h"
 #include "Statistics/Service/VXReportingSummaryEvent.h"
@@ -30,9 +31,13 @@ constexpr std::string_view kSavedStarted = "started";
 constexpr std::string_view kSavedPresent = "present";
 constexpr std::string_view kSavedAggregate = "aggregate";
 constexpr std::string_view kSavedBytes = "bytes";
+constexpr std::string_view kSavedLeftOut = "left out";
 constexpr std::string_view kSavedCounts = "counts";  // kind, count, kind, count...
 // What one client's call may be, and beside it what else a record says.
 constexpr std::size_t kMostPieceBytes = std::size_t{512} << 10;
+
+// What a session takes that has received nothing: itself, its queue, its place in the map.
+constexpr std::size_t kSessionBytes = 1024;
 
 // Seconds since `start`, to the nearest millisecond, halves away from zero.
 double secondsSince(Date start) {
@@ -57,9 +62,34 @@ std::string fileDate() {
 
 const LogScope* sessionLogScope() { return VXReportingProcessState::current().sessionLogScope(); }
 
-void VXReportingUserInfo::merge(const Payload& entries) {
+VXReportingUserInfo::VXReportingUserInfo()
+    : payer_(platform().aggregates.account().payer), charged_(kSessionBytes) {
+  platform().aggregates.charge(payer_, charged_);
+}
+
+VXReportingUserInfo::~VXReportingUserInfo() {
   MutexLock lock(mutex_);
-  entries_ = PayloadBuilder(entries_).merge(entries).build();
+  platform().aggregates.charge(payer_, -charged_);
+}
+
+bool VXReportingUserInfo::merge(const Payload& entries) {
+  MutexLock lock(mutex_);
+  const std::size_t size = entries_.encodedSizeWith(entries);
+  if (size > kMostBytes) return false;
+  entries_.merge(entries);
+  whole_.reset();
+  if (const std::optional<Value> application = entries.find(kHostApplicationDisplayIDKey))
+    application_ = PayloadBuilder().set(kHostApplicationDisplayIDKey, *application).build();
+  const auto charge = static_cast<int64_t>(kSessionBytes + entries_.memoryBytes() + size +
+                                           application_.encoded().size());
+  platform().aggregates.charge(payer_, charge - std::exchange(charged_, charge));
+  return true;
+}
+
+Payload VXReportingUserInfo::snapshot() const {
+  MutexLock lock(mutex_);
+  if (!whole_) whole_ = entries_.build();
+  return *whole_;
 }
 
 std::vector<Payload> VXReportingUserInfo::pieces(std::size_t bytes) const {
@@ -118,17 +148,21 @@ void VXReportingSession::setServiceType(ServiceType type) {
   VX_LOG(sessionLogScope(), Info, "setting service type %s", std::string(serviceName_).c_str());
 }
 
-void VXReportingSession::setConfiguration(const std::optional<Payload>& configuration) {
-  mergeIntoUserInfo(configuration);
+bool VXReportingSession::setConfiguration(const std::optional<Payload>& configuration) {
+  return mergeIntoUserInfo(configuration);
 }
 
 void VXReportingSession::updateDefaults(const std::optional<Payload>& defaults) {
-  mergeIntoUserInfo(defaults);
+  (void)mergeIntoUserInfo(defaults);
 }
 
-void VXReportingSession::mergeIntoUserInfo(const std::optional<Payload>& entries) {
+bool VXReportingSession::mergeIntoUserInfo(const std::optional<Payload>& entries) {
   serviceQueue()->assertIsCurrent();
-  if (entries) userInfo_->merge(*entries);
+  if (!entries || userInfo_->merge(*entries)) return true;
+  VX_LOG(sessionLogScope(), Error,
+         "reporter %lli: its user information would be larger than %zu bytes; left as it is",
+         static_cast<long long>(reporterID_), VXReportingUserInfo::kMostBytes);
+  return false;
 }
 
 void VXReportingSession::start() {
@@ -165,6 +199,7 @@ void VXReportingSession::stop() {
     deliver(*summary, kCategoryUndefined, kMessageTypeUnknown, Keep::Reference, nullptr);
   }
   writeSummaryJson();
+  tellLeftOut();
   vyrReportingQueue_->async([self = shared_from_this()] { self->flushRelay(); });
   // Letting go of what millions of messages left takes its time: not on the queue that serves
   // everybody.
@@ -195,7 +230,8 @@ SavedSession VXReportingSession::savedState(bool& complete) const {
       .set(kSavedCounts, counts)
       .set(kSavedPresent, received.present)
       .set(kSavedAggregate, received.aggregate)
-      .set(kSavedBytes, received.bytes);
+      .set(kSavedBytes, received.bytes)
+      .set(kSavedLeftOut, leftOut_);
   saved.facts = facts.build();
   if (received_.unrecordedBytes() > 0) complete = false;
   saved.information = userInfo_->pieces(kMostPieceBytes);
@@ -224,6 +260,7 @@ std::shared_ptr<VXReportingSession> VXReportingSession::restored(
   session->serviceType_.store(code, std::memory_order_relaxed);
   session->serviceName_ = VXReportingServiceTypeName(code);
   session->started_ = started->asBool();
+  session->leftOut_ = number(kSavedLeftOut);
   std::optional<uint64_t> kind;
   for (const Value& item : counts->asArray()) {
     if (!kind) {
@@ -276,6 +313,23 @@ Payload VXReportingSession::normalizePayloadKeys(const Payload& payload) {
   return normalised.build();
 }
 
+void VXReportingSession::onLeftOut() {
+  if (leftOut_++ > 0) return;
+  VX_LOG(sessionLogScope(), Error,
+         "reporter %lli: its summary leaves out messages from here on, because whoever sends them "
+         "makes the service hold too much already",
+         static_cast<long long>(reporterID_));
+  platform().aggregates.leftOut(reporterID_, 0);
+}
+
+void VXReportingSession::tellLeftOut() {
+  if (leftOut_ == 0) return;
+  VX_LOG(sessionLogScope(), Error, "reporter %lli: its summary leaves out %llu messages",
+         static_cast<long long>(reporterID_), static_cast<unsigned long long>(leftOut_));
+  platform().aggregates.leftOut(reporterID_, leftOut_);
+  leftOut_ = 0;
+}
+
 void VXReportingSession::sendMessage(const Payload& message, MessageCategory category,
                                      MessageType type, Sync, MessageReply reply) {
   deliver(message, category, type, Keep::Copy, std::move(reply));
@@ -291,10 +345,11 @@ void VXReportingSession::deliver(const Payload& message, MessageCategory categor
   }
   Payload normalised = normalizePayloadKeys(message);
   const KindCount identifier = nextIdentifier(category, type);
-  if (keep == Keep::Copy)
-    received_.appendMessage(identifier.kind, identifier.count, normalised);
-  else
+  if (keep == Keep::Copy) {
+    if (!received_.appendMessage(identifier.kind, identifier.count, normalised)) onLeftOut();
+  } else {
     received_.appendReference(identifier.kind, identifier.count, normalised);
+  }
   platform().trace.emit(kTraceMessage, 0, 0, 0, 0);
   // What the client sent goes along only where it is another object: a count less to keep.
   std::optional<Payload> asSent;

@@ -28,17 +28,31 @@ namespace vx {
 // copies: what is merged may lie where it must not stay for long. Thread-safe.
 class VXReportingUserInfo {
  public:
-  void merge(const Payload& entries);
-  Payload snapshot() const {
+  // Of the whole, encoded.
+  static constexpr std::size_t kMostBytes = std::size_t{1} << 20;
+  // What it takes is on the account of whoever has it made, until it is gone.
+  VXReportingUserInfo();
+  ~VXReportingUserInfo();
+  VXReportingUserInfo(const VXReportingUserInfo&) = delete;
+  VXReportingUserInfo& operator=(const VXReportingUserInfo&) = delete;
+  // Takes the time of what is new. False, and nothing changes, when it would become too large.
+  bool merge(const Payload& entries);
+  Payload snapshot() const;
+  // Its "HostApplicationDisplayID" alone, which each event has: no event keeps the rest alive.
+  Payload application() const {
     MutexLock lock(mutex_);
-    return entries_;
+    return application_;
   }
   // In pieces of at most about `bytes`, but for an entry that is larger by itself.
   std::vector<Payload> pieces(std::size_t bytes) const;
 
  private:
+  const AggregateMemory::Payer payer_;
   mutable Mutex mutex_;
-  Payload entries_ GUARDED_BY(mutex_);
+  PayloadBuilder entries_ GUARDED_BY(mutex_);
+  mutable std::optional<Payload> whole_ GUARDED_BY(mutex_);  // when it was asked for
+  Payload application_ GUARDED_BY(mutex_);
+  int64_t charged_ GUARDED_BY(mutex_);
 };
 
 // What a client configured, what it received while started, and its relay session. Owned by the
@@ -58,8 +72,8 @@ class VXReportingSession : public std::enable_shared_from_this<VXReportingSessio
   VXReportingSession& operator=(const VXReportingSession&) = delete;
 
   void setServiceType(ServiceType type);
-  // Both merge into the user information; none does nothing.
-  void setConfiguration(const std::optional<Payload>& configuration);
+  // Both merge into the user information; none does nothing. False: that would become too large.
+  bool setConfiguration(const std::optional<Payload>& configuration);
   void updateDefaults(const std::optional<Payload>& defaults);
   void start();
   void stop();
@@ -101,7 +115,7 @@ class VXReportingSession : public std::enable_shared_from_this<VXReportingSessio
   static std::shared_ptr<VXReportingSession> restored(ReporterID reporterID,
                                                       std::vector<int32_t> processIdentifiers,
                                                       const Payload& facts, bool& whole);
-  void restoreInformation(const Payload& entries) { userInfo_->merge(entries); }
+  void restoreInformation(const Payload& entries) { (void)userInfo_->merge(entries); }
   // Opens the relay session again that set-up had opened, as work of that set-up.
   void restoreRelay();
 
@@ -148,8 +162,10 @@ class VXReportingSession : public std::enable_shared_from_this<VXReportingSessio
   };
 
   VXReportingSession(ReporterID reporterID, std::vector<int32_t> processIdentifiers);
-  void mergeIntoUserInfo(const std::optional<Payload>& entries);
+  bool mergeIntoUserInfo(const std::optional<Payload>& entries);
   KindCount nextIdentifier(MessageCategory category, MessageType type);
+  void onLeftOut();
+  void tellLeftOut();
   enum class Keep : uint8_t { Copy, Reference };
   void deliver(const Payload& message, MessageCategory category, MessageType type, Keep keep,
                MessageReply reply);
@@ -187,6 +203,7 @@ class VXReportingSession : public std::enable_shared_from_this<VXReportingSessio
   std::shared_ptr<DriverSnapShot> driverSnapShot_;
   Function<void(bool)> transactionCompleteBlock_;
   VXReportingAggregate received_;             // what aggregatedPayloadData and its nested form show
+  uint64_t leftOut_ = 0;                      // messages that it has not taken
   std::vector<KindCount> messageTypeCounts_;  // bounded by the number of kinds, some hundreds
   std::shared_ptr<WorkQueue> vyrReportingQueue_;
   std::shared_ptr<RelaySetUp> relaySetUp_;  // of the last start

@@ -31,6 +31,7 @@
 #include "platform/linux/diagnostics/SystemLog.h"
 #include "platform/linux/execution/EventLoop.h"
 #include "platform/linux/execution/Executor.h"
+#include "platform/linux/execution/SpareMemory.h"
 #include "platform/linux/execution/SystemThreading.h"
 #include "platform/linux/ipc/SocketListener.h"
 #include "platform/linux/settings/PreferencesWatcher.h"
@@ -109,6 +110,13 @@ class RunningPlatform final : public LinuxPlatform {
                            // A call that is run again would not do it: it takes no place in one.
                            executor_.withoutCause(
                                [&] { executor_.background().async(std::move(work)); });
+                         },
+                     .accounts = &accounts_,
+                     .leftOut =
+                         [this](int64_t reporterID, uint64_t messages) {
+                           store_->note({"aggregate_left_out", "", static_cast<int64_t>(messages),
+                                         "reporter " + std::to_string(reporterID) +
+                                             (messages == 0 ? ": from here on" : "")});
                          }}),
         loop_(executor_, clock_),
         listener_(loop_, executor_, clock_, configuration.listener),
@@ -281,6 +289,7 @@ class RunningPlatform final : public LinuxPlatform {
     watch(signalFd_.get(), signalSource_);
 
     loop_.addPassEndHook([this] { heapPages_.askForNew(); });
+    loop_.addPassEndHook([] { SpareMemory::keep(); });
     watcher_->setPoster([this](std::string_view name, const PreferencesWatcher::Post& post) {
       crashSafety_->recordNotification(name, post);
     });
@@ -310,14 +319,18 @@ class RunningPlatform final : public LinuxPlatform {
       const LocalStore::Counters counters = store_->counters();
       VX_LOG(nullptr, Error,
              "counters: %s rows=%llu commits=%llu write_failures=%llu relay_backlog=%zu "
-             "orientation_refused=%llu waiting_bytes=%lld user_pauses=%llu %s",
+             "orientation_refused=%llu waiting_bytes=%lld kept_bytes=%lld user_pauses=%llu "
+             "work_given_up=%llu %s",
              listener_.counters().text().c_str(),
              static_cast<unsigned long long>(counters.rowsCommitted),
              static_cast<unsigned long long>(counters.commits),
              static_cast<unsigned long long>(counters.writeFailures), executor_.utilityBacklog(),
              static_cast<unsigned long long>(orientation_.refusedHandlers()),
              static_cast<long long>(accounts_.total(MemoryKind::Waiting)),
-             static_cast<unsigned long long>(accounts_.pauses()), crashSafety_->counters().c_str());
+             static_cast<long long>(accounts_.total(MemoryKind::Kept)),
+             static_cast<unsigned long long>(accounts_.pauses()),
+             static_cast<unsigned long long>(executor_.itemsGivenUp()),
+             crashSafety_->counters().c_str());
     }
   }
 
@@ -362,6 +375,7 @@ std::unique_ptr<LinuxPlatform> LinuxPlatform::start(std::string& problem) {
   // Large buffers go back to the system when they are freed, whatever has been allocated since.
   mallopt(M_MMAP_THRESHOLD, 256 << 10);
   mallopt(M_TOP_PAD, HeapPages::kStep);
+  SpareMemory::keep();
   const Directories directories = Directories::fromEnvironment();
   std::vector<std::string> complaints;
   const PlatformConfiguration configuration = PlatformConfiguration::load(directories, complaints);

@@ -226,6 +226,8 @@ class Reader {
       s.milliseconds("commit_interval_ms", c.store.commit.interval, 1, 60000);
     });
     section("memory", [&](Section& s) {
+      s.size("max_user_bytes", c.memory.maxUserBytes, 64 << 10);
+      s.size("max_bytes", c.memory.maxBytes, 64 << 10);
       s.size("max_user_waiting_bytes", c.memory.maxUserWaitingBytes, 64 << 10);
     });
     section("listener", [&](Section& s) {

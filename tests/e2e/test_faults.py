@@ -1,5 +1,6 @@
 """Failing surroundings: the other clients notice nothing, and nothing accepted is lost."""
 import glob
+import re
 import resource
 
 from harness import *
@@ -52,6 +53,72 @@ class Faults(DaemonTest):
         flood.socket.settimeout(PATIENCE)
         flood.answer(1000 + posts - 1)
         self.assertGreater(time.monotonic(), began + 8)
+
+    @unittest.skipUnless(os.geteuid() == 0, "needs a second user")
+    def test_who_holds_too_much_is_refused_and_left_out_of_summaries_and_of_the_same_ones_after_a_crash(self):
+        def send(client, numbers, *ids, size=15000):
+            for n in numbers:
+                client.call(SEND, {"n": n, "text": f"{n:03}" * (size // 3)}, 3, 1, ids)
+
+        summaries = []
+        for crash in (False, True):
+            d = self.daemon("[memory]\nmax_user_bytes = 100000\n")
+            os.chmod(d.folder, 0o755)
+            c = d.client()
+            for id_ in (1, 2):
+                c.started(id_, 2)
+            send(c, range(10), 1)
+            send(c, range(10, 15), 1, 2)
+            for call in ((CREATE, 3), (CONFIGURE, {"a": 1}, 2)):
+                self.assertEqual(c.answer(c.post(*call))[2], 9)
+            os.seteuid(65534)
+            try:
+                other = d.client()
+            finally:
+                os.seteuid(0)
+            other.started(5, 2, {"a": 1})
+            send(other, range(15, 17), 5, 2, size=300)
+            c.call(STOP, 1)
+            d.wait_until(lambda: c.answer(c.post(CREATE, 3))[0] == REPLY, "there is space again")
+            send(c, range(17, 20), 2)
+            if crash:
+                d.kill()
+                d.start()
+            else:
+                c.call(STOP, 2)
+                other.call(STOP, 5)
+            self.assertEqual(d.stop(), 0)
+            self.assertEqual(d.rows("SELECT count(*) FROM relay_messages WHERE category = 3"), [(27,)])
+            summaries.append({session: payload for session, payload in d.rows(
+                "SELECT session_id, json_extract(payload, '$.n') FROM relay_messages JOIN relay_sessions s"
+                " ON s.id = relay_session WHERE category = 65535")})
+            left_out = d.rows("SELECT detail, rows FROM store_ledger WHERE event = 'aggregate_left_out' AND rows > 0")
+            self.assertEqual(len(left_out), 2)
+        self.assertEqual(summaries[0], summaries[1])
+        self.assertEqual(summaries[0][5], "15,16")
+        self.assertEqual(summaries[0][2], "15,16,17,18,19")
+        self.assertNotIn("9", summaries[0][1])
+
+    def test_without_memory_calls_end_and_not_the_service(self):
+        d = self.daemon()
+        c = d.client()
+        c.started(1, 2)
+        with open(f"/proc/{d.process.pid}/status") as status:
+            size = int(re.search(r"VmSize:\s+(\d+)", status.read()).group(1)) << 10
+        if size > 1 << 40:
+            self.skipTest("a sanitizer has all the addresses there are")
+        resource.prlimit(d.process.pid, resource.RLIMIT_AS, (size + (8 << 20), resource.RLIM_INFINITY))
+        errors = set()
+        with contextlib.suppress(OSError):  # the connection may end
+            for n in range(400):
+                f = c.answer(c.post(SEND, {"n": n, "text": f"{n:05}" * 40000}, 3, 1, [1]))
+                errors.update(f[2:3] if f[0] == ERROR else ())
+        errors.update(f[2] for f in c.answers.get(None, ()))
+        resource.prlimit(d.process.pid, resource.RLIMIT_AS, (resource.RLIM_INFINITY, resource.RLIM_INFINITY))
+        self.assertTrue(errors and errors <= {8, 9}, errors)
+        self.assert_unharmed(d)
+        d.client().session(2)
+        self.assertEqual(d.stop(), 0)
 
     def test_what_is_in_use_or_unusable_is_named(self):
         d = self.daemon()

@@ -2,6 +2,7 @@
 #pragma once
 
 #include <algorithm>
+#include <atomic>
 #include <deque>
 #include <map>
 #include <mutex>
@@ -13,6 +14,14 @@ namespace vx::fakes {
 
 class FakeAggregateMemory final : public AggregateMemory {
  public:
+  Account account() override { return {payer, full}; }
+  void charge(Payer who, int64_t bytes) override {
+    const std::lock_guard lock(mutex_);
+    charged[who] += bytes;
+  }
+  void leftOut(int64_t reporterID, uint64_t messages) override {
+    told.emplace_back(reporterID, messages);
+  }
   uint64_t nameAggregate() override {
     const std::lock_guard lock(mutex_);
     return ++named;
@@ -43,6 +52,10 @@ class FakeAggregateMemory final : public AggregateMemory {
   void snapshotCompleted() override {}
 
   std::map<std::pair<uint64_t, uint32_t>, Block> blocks;  // by aggregate and ordinal; ever
+  Payer payer = 0;
+  std::atomic<bool> full{false};
+  std::map<Payer, int64_t> charged;
+  std::vector<std::pair<int64_t, uint64_t>> told;  // of what was left out
   std::size_t held = 0;
   std::size_t least = 0;  // of a block
   uint8_t fill = 0xA5;    // what a new one holds

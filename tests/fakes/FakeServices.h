@@ -168,7 +168,7 @@ class FakeServices final : public AnalyticsEventService,
   using Name = std::string_view;
   explicit FakeServices(Journal& journal) : journal_(journal) {}
 
-  void sendEventLazy(Name name, Function<Payload()> builder, const Payload&) override {
+  void sendEventLazy(Name name, Function<Payload()> builder, const Payload&, std::size_t) override {
     if (toRows) return (void)toRows("event " + std::string(name) + " " + builder().text(), {});
     note(journal_, "event ", name);
     events.push_back({std::string(name), share(std::move(builder))});

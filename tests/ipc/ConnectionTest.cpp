@@ -1,3 +1,4 @@
+#include <algorithm>
 #include <thread>
 #include <utility>
 
@@ -34,7 +35,7 @@ class ConnectionTest : public IpcTest, public ConnectionHost {
   void accept() {
     events.clear();
     object = std::make_shared<TestObject>();
-    connection = std::make_shared<SocketConnection>(*this, peer.pair(), 200, 501, kServiceItself);
+    connection = std::make_shared<SocketConnection>(*this, peer.pair(), 200, 501, kUser);
     connection->setExportedInterface(testInterface());
     connection->setExportedObject(object);
     connection->setInterruptionHandler([this] { events.emplace_back("interrupted"); });
@@ -76,7 +77,8 @@ class ConnectionTest : public IpcTest, public ConnectionHost {
   CallRecorder& recorder() override { return records; }
   wire::ReadBuffers& readBuffers() override { return buffers_; }
   bool readingPaused(UserIndex) override { return congested; }
-  void waitForReading(const std::shared_ptr<SocketConnection>&) override { ++waits; }
+  UserAccounts& accounts() override { return accounts_; }
+  void waitForReading(const std::shared_ptr<SocketConnection>&, std::size_t) override { ++waits; }
   void readInTurn(uid_t user, std::shared_ptr<TurnTaker> reader) override {
     turns_.add(user, std::move(reader));
   }
@@ -86,6 +88,7 @@ class ConnectionTest : public IpcTest, public ConnectionHost {
   void unreadChanged(SocketConnection&, bool unread) override { unreadSays = unread; }
   void closed(SocketConnection&) override { ++closes; }
 
+  const UserIndex kUser = accounts_.enter(501).value();
   ListenerCounters counted;
   CallRecorder records;
   bool unreadSays = false;
@@ -301,6 +304,48 @@ TEST_F(ConnectionTest, RepliesMadeLaterOvershootTheirLimitByOneStep) {
     run();
   }
   EXPECT_THAT(answers(), SizeIs(70));
+}
+
+TEST_F(ConnectionTest, WhatThereIsNoMemoryForIsRefusedOrGivenUp) {
+  connect();
+  object->hasMemory = false;
+  EXPECT_THAT(ask(calls(kKeep, 1, 1) + calls(kEcho, 2, 2)), ElementsAre("3 1 8", "2 2 1"));
+  EXPECT_EQ(counted.callsGivenUp, 1U);
+  accounts_.add(kUser, MemoryKind::Kept, MemoryLimits().maxUserBytes + 1);
+  EXPECT_THAT(ask(calls(kAcquire, 3, 3) + calls(kEcho, 4, 4)), ElementsAre("3 3 9", "2 4 1"));
+  accounts_.remove(kUser, MemoryKind::Kept, MemoryLimits().maxUserBytes + 1);
+  accounts_.add(kUser, MemoryKind::Waiting, 1 << 20);
+  EXPECT_THAT(ask(calls(kAcquire, 5, 5)), ElementsAre("2 5 1"));
+  EXPECT_EQ(counted.tooMuchMemory, 1U);
+}
+
+TEST_F(ConnectionTest, LargeFramesAndUnreadRepliesWaitWhileTheUserHoldsTooMuchOfThem) {
+  connect();
+  const std::size_t most = MemoryLimits().maxUserWaitingBytes;
+  const Payload dictionary = PayloadBuilder().set("k", std::string(300 << 10, 'x')).build();
+  const Bytes large = frame(1, 1, kMessage, dictionary.encoded());
+  accounts_.add(kUser, MemoryKind::Frames, most);
+  const auto middle = large.begin() + (150 << 10);
+  peer.write({large.begin(), middle});
+  runUntil([&] { return waits > 0; });
+  EXPECT_THAT(object->calls, IsEmpty());
+  accounts_.remove(kUser, MemoryKind::Frames, most);
+  connection->continueReading();
+  run();
+  EXPECT_GE(accounts_.bytes(kUser, MemoryKind::Frames), 300 << 10)
+      << "the whole frame, not what has come";
+  peer.write({middle, large.end()});
+  runUntil([&] { return accounts_.bytes(kUser, MemoryKind::Unread) > 0; });  // of its echo
+  EXPECT_EQ(accounts_.bytes(kUser, MemoryKind::Frames), 0);
+
+  accounts_.add(kUser, MemoryKind::Unread, most);
+  send(calls(kEcho, 3, 40));
+  EXPECT_THAT(object->calls, IsEmpty());
+  runUntil([&] {
+    (void)answers();
+    return object->calls.size() == 38;
+  });
+  accounts_.remove(kUser, MemoryKind::Unread, most);
 }
 
 TEST_F(ConnectionTest, CongestionHoldsFramesBack) {

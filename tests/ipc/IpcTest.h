@@ -3,6 +3,7 @@
 #pragma once
 
 #include <array>
+#include <new>
 #include <string>
 #include <vector>
 
@@ -22,6 +23,7 @@ struct TestObject final : ExportedObject {
   std::vector<std::string> calls;    // operation and arguments
   std::vector<Reply> kept;           // of kKeep and kHold
   std::vector<int64_t> list;         // what kList answers
+  bool hasMemory = true;             // for kKeep
   std::shared_ptr<WorkQueue> later;  // where kEcho and kList answer; at once without one
 
   void answer(Reply reply, ReplyValue value) const {
@@ -37,7 +39,8 @@ struct TestObject final : ExportedObject {
     note(object, "echo " + std::to_string(arguments.int64(0))).answer(std::move(reply), true);
   }
   static void runKeep(ExportedObject& object, CallArguments&, Reply reply) {
-    note(object, "keep").kept.push_back(std::move(reply));
+    if (!note(object, "keep").hasMemory) throw std::bad_alloc();
+    static_cast<TestObject&>(object).kept.push_back(std::move(reply));
   }
   static void runList(ExportedObject& object, CallArguments&, Reply reply) {
     const TestObject& test = note(object, "list");
@@ -68,7 +71,8 @@ inline const InterfaceDescription& testInterface() {
       {"echo", kInteger, ReplyKind::Boolean, false, None, true, Object::runEcho, nullptr},
       {"keep", kInteger, ReplyKind::Boolean, false, None, true, Object::runKeep, nullptr},
       {"hold", kInteger, ReplyKind::Boolean, true, None, true, Object::runKeep, nullptr},
-      {"acquire", kInteger, ReplyKind::Boolean, false, Acquire, true, Object::runEcho, nullptr},
+      {"acquire", kInteger, ReplyKind::Boolean, false, Acquire, true, Object::runEcho, nullptr,
+       false, true},
       {"release", kInteger, ReplyKind::Boolean, false, Release, true, Object::runEcho, nullptr},
       {"list",
        {},

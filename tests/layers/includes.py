@@ -24,7 +24,7 @@ ALLOWED = {  # layer -> prefixes of the headers it may include beside its own; t
         "diagnostics": (LINUX + "execution/",),
         "device": (LINUX + "execution/",),
         "journal": (),
-        "aggregates": (LINUX + "journal/",),
+        "aggregates": (LINUX + "execution/", LINUX + "journal/"),
         "store": (LINUX + "execution/", LINUX + "journal/", LINUX + "RelayBackend.h"),
         "ipc": (LINUX + "execution/", LINUX + "journal/", "wire/"),
         "recovery": (*(LINUX + wing for wing in ("execution/", "journal/", "store/", "ipc/")), "wire/"),

@@ -26,6 +26,7 @@ class ExecutorTest : public ::testing::Test {
   ~ExecutorTest() override { executor.stop(soon()); }
   Queue interactive() { return executor.makeSerial("i", QualityOfService::UserInteractive); }
   Queue utility() { return executor.makeSerial("u", QualityOfService::Utility); }
+  fakes::FakePlatform p;
   UserAccounts accounts;
   Executor executor{accounts};
 };
@@ -133,10 +134,17 @@ TEST_F(ExecutorTest, BlockedQueuesDelayNobodyAndTheirWorkIsOnTheAccountOfWhoCaus
   EXPECT_TRUE(executor.drain(soon()));
   EXPECT_EQ(done, 400);
   EXPECT_EQ(waiting(), 0);
+  const auto held = std::make_shared<int>();
+  queues[0]->async([held] { throw std::bad_alloc(); }, 1000);
+  queues[0]->async([held] { throw std::length_error("too long"); });
+  executor.background().async([held] { throw std::bad_alloc(); });
   std::atomic<bool> ran{false};
   executor.background().async([&] { std::this_thread::sleep_for(20ms), ran = true; });
   EXPECT_TRUE(executor.drain(soon()));
   EXPECT_TRUE(ran);
+  EXPECT_EQ(executor.itemsGivenUp(), 3u);
+  EXPECT_EQ(held.use_count(), 1);
+  EXPECT_EQ(waiting(), 0);
 }
 
 TEST_F(ExecutorTest, UndueWorkIsDroppedAtTheEndAndLateWorkAtOnce) {

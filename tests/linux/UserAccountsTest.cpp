@@ -16,7 +16,10 @@ class UserAccountsTest : public ::testing::Test {
   void done(UserIndex user, std::size_t bytes) {
     std::thread([&] { accounts.remove(user, MemoryKind::Waiting, bytes); }).join();
   }
-  UserAccounts accounts{{.maxUserWaitingBytes = 500, .maxWaitingBytes = 1000}};
+  UserAccounts accounts{{.maxUserBytes = 2000,
+                         .maxBytes = 3500,
+                         .maxUserWaitingBytes = 500,
+                         .maxWaitingBytes = 1000}};
   const UserIndex a = accounts.enter(501).value();
   const UserIndex b = accounts.enter(502).value();
   const UserIndex c = accounts.enter(503).value();
@@ -58,6 +61,28 @@ TEST_F(UserAccountsTest, WhenTooMuchWaitsTheBoundIsAnEqualShare) {
   EXPECT_FALSE(accounts.isPaused(kServiceItself));
   done(a, 235);
   EXPECT_EQ(resumed, 1);
+}
+
+TEST_F(UserAccountsTest, WhoHoldsTooMuchOfAllKindsIsFullUntilHeHoldsLess) {
+  accounts.add(a, MemoryKind::Kept, 1500);
+  accounts.add(a, MemoryKind::Unread, 500);
+  add(a, 400);
+  EXPECT_FALSE(accounts.isFull(a)) << "what waits is bounded by itself";
+  accounts.add(b, MemoryKind::Delayed, 1400);
+  accounts.add(a, MemoryKind::Kept, 1);
+  EXPECT_TRUE(accounts.isFull(a));
+  accounts.add(c, MemoryKind::Kept, 99);
+  accounts.remove(a, MemoryKind::Kept, 1);
+  EXPECT_FALSE(accounts.isFull(a)) << "although nothing more was added, which was refused";
+  accounts.add(kServiceItself, MemoryKind::Kept, 2);
+  add(b, 1);
+  EXPECT_TRUE(accounts.isFull(b)) << "a third of all is his";
+  EXPECT_FALSE(accounts.isFull(c));
+  EXPECT_FALSE(accounts.isFull(kServiceItself));
+  EXPECT_TRUE(accounts.mayHold(c, MemoryKind::Frames, 5000)) << "the first one";
+  accounts.add(c, MemoryKind::Frames, 400);
+  EXPECT_TRUE(accounts.mayHold(c, MemoryKind::Frames, 100));
+  EXPECT_FALSE(accounts.mayHold(c, MemoryKind::Frames, 101));
 }
 
 TEST_F(UserAccountsTest, AnAccountIsAnothersOnceItsUserHoldsNothing) {

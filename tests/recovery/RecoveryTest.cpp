@@ -234,7 +234,7 @@ TEST_F(RecoveryTest, AKilledProcessLosesNothingAndWritesNothingTwice) {
       [&] { send(1, 2); },
       [&] { send(2, 3, both); },  // also to another client's
       [&] { create(2, 33, 3), start(2, 33); },
-      [&] { send(2, 4); },
+      [&] { memory.full = true, send(2, 4), memory.full = false; },  // no part of a summary
       [&] { prefer("second", "true"); },
       [&] { send(2, 5); },  // refused
       [&] { prefer("third", "false"); },

@@ -70,6 +70,55 @@ TEST_F(SessionTest, RelaySessionCarriesWhatTheSetUpTook) {
             "vxrr 1987605106 com.quorvel.sonik reporting_session_verbose 31");
 }
 
+TEST_F(SessionTest, WhoeverHoldsTooMuchIsLeftOutOfTheAggregateAndOfNothingElse) {
+  const auto s = make();
+  s->start();
+  auto& memory = p.aggregates;
+  const auto send = [&](AggregateMemory::Payer payer, bool full, int64_t n) {
+    memory.payer = payer;
+    memory.full = full;
+    s->sendMessage(dictionary(payer == 7 ? "n" : "other", n), 1, 1, nullptr);
+  };
+  send(7, false, 1);
+  send(8, false, 2);
+  for (int i = 0; i < 3; ++i) send(8, true, 3);
+  send(7, false, 4);
+  run();
+  EXPECT_EQ(s->aggregatedPayloadData()->size(), 3u);
+  EXPECT_EQ(s->messageIdForCategory(1, 1), messageIdentifier(messageKind(1, 1), 7));
+  EXPECT_EQ(p.vyr.sent.size(), 6u);
+  EXPECT_GT(memory.charged[7], memory.charged[8]);
+  EXPECT_GT(memory.charged[8], 0);
+  const std::pair<int64_t, uint64_t> begin{s->reporterID(), 0};
+  EXPECT_EQ(memory.told, std::vector{begin});
+  s->stop();
+  run();
+  EXPECT_EQ(memory.told, (std::vector{begin, {begin.first, 3}}));
+  EXPECT_EQ(memory.charged[7], 0);
+  EXPECT_EQ(memory.charged[8], 0);
+}
+
+TEST_F(SessionTest, UserInformationIsBoundedAndOnTheAccountOfWhoeverMadeTheSession) {
+  auto& charged = p.aggregates.charged;
+  p.aggregates.payer = 7;
+  auto s = make();
+  p.aggregates.payer = 8;
+  const auto large = [](std::size_t kib) {
+    return dictionary("large", std::string(kib << 10, 'x'));
+  };
+  EXPECT_TRUE(s->setConfiguration(dictionary("HostApplicationDisplayID", "app")));
+  EXPECT_TRUE(s->setConfiguration(large(600)));
+  EXPECT_FALSE(s->setConfiguration(large(1024)));
+  EXPECT_FALSE(s->setConfiguration(dictionary("more", std::string(500 << 10, 'x'))));
+  EXPECT_TRUE(s->setConfiguration(large(1000))) << "in the place of the one before";
+  EXPECT_EQ(s->userInfo()->snapshot().size(), 2u);
+  EXPECT_EQ(s->userInfo()->application().text(), "{HostApplicationDisplayID=app}");
+  EXPECT_GT(charged[7], 2000 << 10);
+  EXPECT_EQ(charged[8], 0);
+  s.reset();
+  EXPECT_EQ(charged[7], 0);
+}
+
 TEST_F(SessionTest, EventsNeedNeitherAMessageNorASession) {
   VXReportingWattmarkUtility::handleEvent(nullptr, 1, 6, nullptr);
   VXReportingTallyhubBridge::handleEvent(nullptr, 0x10000009, 0xFFFF, nullptr);

@@ -76,7 +76,7 @@ TEST_F(LocalStoreTest, WhatWasSentIsThereAfterTheClose) {
   relay = session(42);
   EXPECT_EQ(relay->send(5, 1, numbered(1)), std::nullopt);
   store->sendEventLazy(
-      "e", [] { return tagged(numbered(1)); }, Payload());
+      "e", [] { return tagged(numbered(1)); }, Payload(), 0);
   power(2);
   EXPECT_EQ(store->relayBackend().sendOne({{kVyrReportingSessionInfoSessionID, int32_t{-1}}},
                                           Payload(), 7, 2, numbered(3)),
@@ -103,7 +103,7 @@ TEST_F(LocalStoreTest, EventWaitsForAMessageOfTheNextBatch) {
   open();
   const Payload late = numbered(1);
   store->sendEventLazy(
-      "late", [late] { return tagged(late); }, late);
+      "late", [late] { return tagged(late); }, late, 0);
   power(1);
   waitUntil([&] { return store->counters().rowsCommitted >= 1; });
   session()->send(1, 1, late);
@@ -279,7 +279,7 @@ TEST_F(LocalStoreTest, ReplayWritesWhatIsMissingAndNothingTwice) {
       const CauseScope scope(calls[call]);
       sender->send(5, 1, payload);
       store->sendEventLazy(
-          "e", [payload] { return tagged(payload); }, payload);
+          "e", [payload] { return tagged(payload); }, payload, 0);
       power(call);
       sender->send(6, 1, Payload());
     }
@@ -362,7 +362,7 @@ TEST_F(StoreFaultsTest, LostStoreIsBegunAfreshWithWhatWaitsAndTheSessionsItIsOf)
     if (std::exchange(there, false)) std::filesystem::remove(file());
     return numbered(0);
   };
-  store->sendEventLazy("e", lose, Payload());  // within a transaction
+  store->sendEventLazy("e", lose, Payload(), 0);  // within a transaction
   EXPECT_EQ(say(2), std::nullopt);
   EXPECT_THAT(messages(), ElementsAre("42|{\"i\":2}"));
   EXPECT_THAT(ledger(), ElementsAre("store_lost"));

@@ -11,6 +11,8 @@
 #include <random>
 #include <utility>
 
+#include "platform/linux/execution/CauseScope.h"
+
 namespace vx::lnx {
 
 namespace {
@@ -135,6 +137,26 @@ std::vector<AggregateMemory::Block> AggregateSegments::takeFound(uint64_t aggreg
 void AggregateSegments::setUnrecordedHandler(Function<void(const Status& why)> handler) {
   MutexLock lock(mutex_);
   onUnrecorded_ = std::move(handler);
+}
+
+AggregateMemory::Account AggregateSegments::account() {
+  const UserIndex user = CauseScope::currentUser();
+  return {user, options_.accounts != nullptr && options_.accounts->isFull(user)};
+}
+
+void AggregateSegments::charge(Payer payer, int64_t bytes) {
+  if (options_.accounts == nullptr) return;
+  if (bytes >= 0)
+    options_.accounts->add(payer, MemoryKind::Kept, static_cast<std::size_t>(bytes));
+  else
+    options_.accounts->remove(payer, MemoryKind::Kept, static_cast<std::size_t>(-bytes));
+}
+
+// What a call that is run again says, it has said before.
+void AggregateSegments::leftOut(int64_t reporterID, uint64_t messages) {
+  const JournalTicket* const call = CauseScope::current();
+  if (options_.leftOut && (call == nullptr || !call->wasDone()))
+    options_.leftOut(reporterID, messages);
 }
 
 uint64_t AggregateSegments::nameAggregate() {

@@ -15,6 +15,7 @@
 #include "base/Status.h"
 #include "platform/AggregateMemory.h"
 #include "platform/linux/aggregates/AggregateSegment.h"
+#include "platform/linux/execution/UserAccounts.h"
 #include "platform/linux/journal/JournalFolder.h"
 
 namespace vx::lnx {
@@ -25,7 +26,9 @@ struct AggregateOptions {
   std::size_t maxBytes = std::size_t{192} << 20;  // of files
   // Runs work soon, on a thread that may be held up: giving memory back to the system takes half a
   // millisecond for each MiB. Without it that is done at once.
-  Function<void(Function<void()> work)> runElsewhere;
+  Function<void(Function<void()> work)> runElsewhere{};
+  UserAccounts* accounts = nullptr;  // of those who pay; without, nobody does
+  Function<void(int64_t reporterID, uint64_t messages)> leftOut{};  // see AggregateMemory
 };
 
 struct AggregateCounters {
@@ -51,6 +54,9 @@ class AggregateSegments final : public AggregateMemory {
   void discard();
   AggregateCounters counters() const;
 
+  Account account() override;
+  void charge(Payer payer, int64_t bytes) override;
+  void leftOut(int64_t reporterID, uint64_t messages) override;
   uint64_t nameAggregate() override;
   Block acquire(uint64_t aggregate, uint32_t ordinal, std::size_t bytes) override;
   void release(std::span<const Block> blocks) override;

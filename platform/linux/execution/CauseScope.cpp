@@ -50,16 +50,22 @@ std::optional<WorkOrigin> CauseScope::origin() {
   return WorkOrigin{ticket.namedCall(), scope->place_, scope->depth_, ticket.time()};
 }
 
+uint32_t CauseScope::nextPlace() {
+  const CauseScope* const scope = innermost;
+  if (scope == nullptr || !scope->ticket_) return 0;
+  const Bits bits = kBits[scope->depth_];
+  // More than a call can cause; they would share the last place rather than take another's.
+  return scope->place_ | std::min(scope->taken_, bits.most) << bits.shift;
+}
+
 Cause Cause::take() {
   CauseScope* const scope = innermost;
   if (scope == nullptr) return {};
   if (!scope->ticket_) return {.user = scope->user_};
-  const Bits bits = kBits[scope->depth_];
-  // More than a call can cause; they would share the last place rather than take another's.
-  const uint32_t taken = std::min(scope->taken_++, bits.most);
+  const uint32_t place = CauseScope::nextPlace();
+  ++scope->taken_;
   return {scope->ticket_,
-          {scope->place_ | taken << bits.shift,
-           std::min<uint8_t>(static_cast<uint8_t>(scope->depth_ + 1), kDeepestCause)},
+          {place, std::min<uint8_t>(static_cast<uint8_t>(scope->depth_ + 1), kDeepestCause)},
           scope->user_};
 }
 

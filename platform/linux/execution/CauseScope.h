@@ -62,6 +62,8 @@ class CauseScope {
   // The innermost scope's own cause, for work that goes on later as the same work: with taken().
   static Cause share();
   static uint32_t taken();
+  // The place that Cause::take() would give next; 0 outside of a call.
+  static uint32_t nextPlace();
   // Names the innermost scope's work; none outside of a call.
   static std::optional<WorkOrigin> origin();
 

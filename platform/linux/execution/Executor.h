@@ -81,6 +81,10 @@ class Executor final : public WorkQueues {
   // Items queued or running on the utility lane, delayed ones not counted: the relay work that
   // accepted messages have caused.
   std::size_t utilityBacklog() const { return utility_->backlog(); }
+  // Items of all lanes for which there was no memory.
+  uint64_t itemsGivenUp() const {
+    return interactive_->itemsGivenUp() + utility_->itemsGivenUp() + background_->itemsGivenUp();
+  }
 
   // Waits until the utility lane and the undelayed background work are idle, at most until the
   // deadline. True: idle.

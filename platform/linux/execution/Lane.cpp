@@ -6,8 +6,11 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <new>
+#include <stdexcept>
 #include <utility>
 
+#include "platform/Log.h"
 #include "platform/linux/execution/Threads.h"
 
 namespace vx::lnx {
@@ -153,6 +156,23 @@ void Lane::moveDue() {
 // ---------------------------------------------------------------------------------------------------------------------
 // Running it
 
+void Lane::run(WorkItem& item) {
+  try {
+    item.run();
+  } catch (const std::bad_alloc& failure) {
+    giveUp(item, failure.what());
+  } catch (const std::length_error& failure) {
+    giveUp(item, failure.what());
+  }
+  if (item.charged > 0) accounts_.remove(item.cause.user, MemoryKind::Waiting, item.charged);
+}
+
+void Lane::giveUp(WorkItem& item, const char* why) {
+  givenUp_.fetch_add(1, std::memory_order_relaxed);
+  item.work = nullptr;  // who waits for an answer is told
+  VX_LOG(nullptr, Error, "%s: work was given up: %s", options_.threadName, why);
+}
+
 std::size_t Lane::runOne(std::size_t maxItems) {
   ++running_;
   std::size_t ran = 0;
@@ -170,8 +190,7 @@ std::size_t Lane::runOne(std::size_t maxItems) {
     mutex_.unlock();
     {
       const Current current(concurrentQueue_);
-      item->run();
-      itemRan(*item);
+      run(*item);
       item.reset();
     }
     itemsDone(1);

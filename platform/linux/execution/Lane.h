@@ -87,9 +87,10 @@ class Lane : public std::enable_shared_from_this<Lane> {
   // Those of the interactive lane are on nobody's account: they are run in the pass in which they
   // come.
   void itemQueued(WorkItem& item, std::size_t holds);
-  void itemRan(const WorkItem& item) {
-    if (item.charged > 0) accounts_.remove(item.cause.user, MemoryKind::Waiting, item.charged);
-  }
+  // Runs it; work for which there is no memory is given up, counted and logged. What was called is
+  // over with that: it is not run again by a later process, which would have no more memory.
+  void run(WorkItem& item);
+  uint64_t itemsGivenUp() const { return givenUp_.load(std::memory_order_relaxed); }
   void itemsDone(std::size_t count) { backlog_.fetch_sub(count, std::memory_order_relaxed); }
   std::size_t backlog() const { return backlog_.load(std::memory_order_relaxed); }
 
@@ -118,6 +119,7 @@ class Lane : public std::enable_shared_from_this<Lane> {
   // Runs one turn of one queue, or one concurrent item, with the lock released meanwhile. How many
   // items ran.
   std::size_t runOne(std::size_t maxItems) REQUIRES(mutex_);
+  void giveUp(WorkItem& item, const char* why);
   void sleep(bool didWork) REQUIRES(mutex_);
   void waitForChange(Monotonic deadline) REQUIRES(mutex_);
 
@@ -130,6 +132,7 @@ class Lane : public std::enable_shared_from_this<Lane> {
   std::atomic<std::thread::id> interactiveThread_{};
   std::atomic<std::size_t> backlog_{0};
   std::atomic<bool> hasDelayed_{false};  // delayed_ is not empty; set under the lock
+  std::atomic<uint64_t> givenUp_{0};
 
   Mutex mutex_;
   CondVar wake_;     // for sleeping threads

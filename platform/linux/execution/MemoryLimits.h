@@ -6,6 +6,9 @@
 namespace vx::lnx {
 
 struct MemoryLimits {
+  // Of everything that is counted but what waits: of one user, and of all.
+  uint64_t maxUserBytes = 64u << 20;
+  uint64_t maxBytes = 192u << 20;
   // Accepted and not yet committed, on whatever queue: of one user, and of all.
   uint64_t maxUserWaitingBytes = 24u << 20;
   uint64_t maxWaitingBytes = 32u << 20;

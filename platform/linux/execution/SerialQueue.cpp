@@ -54,8 +54,7 @@ SerialQueue::Turn SerialQueue::runTurn(std::size_t maxItems) {
     const Lane::Current current(this);
     while (!taken.empty() && ran < maxItems) {
       const std::unique_ptr<WorkItem> item(taken.pop());
-      item->run();
-      lane_->itemRan(*item);
+      lane_->run(*item);
       ++ran;
     }
   }

@@ -13,8 +13,10 @@ constexpr std::size_t kMostUnseen = 16 << 10;
 
 UserAccounts::UserAccounts(const MemoryLimits& limits)
     : limits_(limits),
-      quantum_(std::min<std::size_t>(
-          kMostUnseen, std::min(limits.maxUserWaitingBytes, limits.maxWaitingBytes) / 256)) {
+      quantum_(std::min<std::size_t>(kMostUnseen,
+                                     std::min({limits.maxUserWaitingBytes, limits.maxWaitingBytes,
+                                               limits.maxUserBytes, limits.maxBytes}) /
+                                         256)) {
   chunks_[0] = new Chunk;
 }
 
@@ -32,6 +34,20 @@ std::optional<UserIndex> UserAccounts::enter(uid_t user) {
 }
 
 void UserAccounts::leave(UserIndex user) { --at(user).connections; }
+
+// What comes and goes by itself has bounds of its own, at which nothing is refused or left out.
+int64_t UserAccounts::heldBytesOf(const Account& account) {
+  return bytesOf(account, MemoryKind::Unread) + bytesOf(account, MemoryKind::Delayed) +
+         bytesOf(account, MemoryKind::Kept);
+}
+
+bool UserAccounts::mayHold(UserIndex user, MemoryKind kind, std::size_t bytes) const {
+  const auto ofKind = [kind](const Account& of) { return bytesOf(of, kind); };
+  const int64_t own = ofKind(at(user));
+  const int64_t wanted = own + static_cast<int64_t>(bytes);
+  return own == 0 ||
+         wanted <= boundOf(wanted, limits_.maxUserWaitingBytes, limits_.maxWaitingBytes, ofKind);
+}
 
 bool UserAccounts::isIdle(const Account& account) {
   if (account.connections > 0) return false;
@@ -60,28 +76,34 @@ int64_t UserAccounts::total(MemoryKind kind) const {
   return total;
 }
 
-// Of a user who has so much waiting.
-int64_t UserAccounts::waitingBound(int64_t own) const {
-  const auto most = static_cast<int64_t>(limits_.maxWaitingBytes);
-  const auto ofUser = static_cast<int64_t>(limits_.maxUserWaitingBytes);
+// Of a user who has so many bytes of some kind: his bound, or his share while all have too many.
+template <class BytesOf>
+int64_t UserAccounts::boundOf(int64_t own, uint64_t ofUser, uint64_t ofAll,
+                              const BytesOf& bytesOf) const {
+  const auto most = static_cast<int64_t>(ofAll);
+  const auto bound = static_cast<int64_t>(ofUser);
   // Below the least share that there can be, the others need not be asked.
-  if (own <= most / static_cast<int64_t>(used_)) return ofUser;
-  int64_t total = bytesOf(at(kServiceItself), MemoryKind::Waiting);
+  if (own <= most / static_cast<int64_t>(used_)) return bound;
+  int64_t total = bytesOf(at(kServiceItself));
   int64_t users = 0;
   for (std::size_t i = 1; i < used_; ++i) {
-    const int64_t waiting = bytesOf(at(static_cast<UserIndex>(i)), MemoryKind::Waiting);
-    total += waiting;
-    users += waiting > 0 ? 1 : 0;
+    const int64_t bytes = bytesOf(at(static_cast<UserIndex>(i)));
+    total += bytes;
+    users += bytes > 0 ? 1 : 0;
   }
-  return total <= most ? ofUser : std::min(ofUser, most / std::max<int64_t>(users, 1));
+  return total <= most ? bound : std::min(bound, most / std::max<int64_t>(users, 1));
 }
 
 void UserAccounts::look(Account& account) {
   account.sinceLook = 0;
+  const int64_t held = heldBytesOf(account);
+  account.full = held > boundOf(held, limits_.maxUserBytes, limits_.maxBytes, heldBytesOf);
   if (account.paused.load()) return;
-  const int64_t own = bytesOf(account, MemoryKind::Waiting);
-  const int64_t bound = waitingBound(own);
-  if (own <= bound) return;
+  const auto waitingOf = [](const Account& of) { return bytesOf(of, MemoryKind::Waiting); };
+  const int64_t waiting = waitingOf(account);
+  const int64_t bound =
+      boundOf(waiting, limits_.maxUserWaitingBytes, limits_.maxWaitingBytes, waitingOf);
+  if (waiting <= bound) return;
   ++pauses_;
   account.resumeAt.store(bound / 2);
   account.paused.store(true);

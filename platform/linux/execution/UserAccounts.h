@@ -23,9 +23,12 @@ inline constexpr UserIndex kServiceItself = 0;
 // Bytes, as the kernel's allocator and the files see them: about.
 enum class MemoryKind : uint8_t {
   Waiting,  // work of the relay and standalone queues, and records of the store
+  Frames,   // large ones that are coming in, and what reading has left over
+  Unread,   // replies
   Delayed,  // standalone messages in their delay
+  Kept,     // aggregates, sessions and what they were configured with
 };
-inline constexpr std::size_t kMemoryKinds = 2;
+inline constexpr std::size_t kMemoryKinds = 5;
 
 // The accounts of the users. Owned by the platform, which it outlives nobody of. add() and remove()
 // are for any thread, everything else for the interactive one. Counting takes no lock, and the
@@ -34,7 +37,9 @@ inline constexpr std::size_t kMemoryKinds = 2;
 //
 // A user whose work waits beyond his bound is paused: whoever reads from his clients stops until
 // half of it is done. While all that waits is beyond its bound too, his bound is no more than his
-// share of it, an equal one for each user that has something waiting.
+// share of it, an equal one for each user that has something waiting. Frames and unread replies
+// have the same bounds, each for itself. In the same way a user is full whose bytes of the other
+// kinds and unread replies are beyond his bound: nothing more is to be kept for him.
 //
 // Bounded: kMostUsers accounts, each for good; those that are not used are used again.
 class UserAccounts {
@@ -84,6 +89,16 @@ class UserAccounts {
       look(account);
     return account.paused.load(std::memory_order_relaxed);
   }
+  // Cheap, but for one who is: asked before something is kept.
+  bool isFull(UserIndex user) {
+    if (user == kServiceItself) return false;
+    Account& account = at(user);
+    if (account.full || account.sinceLook >= quantum_) [[unlikely]]
+      look(account);
+    return account.full;
+  }
+  // Whether so many bytes more of that kind are within his bound, or the first ones.
+  bool mayHold(UserIndex user, MemoryKind kind, std::size_t bytes) const;
   // All that waits is beyond its bound.
   bool isTooMuchWaiting() const {
     return total(MemoryKind::Waiting) > static_cast<int64_t>(limits_.maxWaitingBytes);
@@ -100,6 +115,7 @@ class UserAccounts {
     std::size_t sinceLook = 0;              // bytes added
     uint32_t connections = 0;
     uid_t user = 0;
+    bool full = false;
     alignas(kLine) Counts byOthers{};
     alignas(kLine) std::atomic<bool> paused{false};
     std::atomic<int64_t> resumeAt{0};
@@ -115,10 +131,12 @@ class UserAccounts {
     return account.byInteractive[index(kind)].load(std::memory_order_relaxed) +
            account.byOthers[index(kind)].load();
   }
+  static int64_t heldBytesOf(const Account& account);
   static bool isIdle(const Account& account);
   UserIndex accountFor(uid_t user);
   void look(Account& account);
-  int64_t waitingBound(int64_t own) const;
+  template <class BytesOf>
+  int64_t boundOf(int64_t own, uint64_t ofUser, uint64_t ofAll, const BytesOf& bytesOf) const;
   void maybeResume(Account& account);
 
   const MemoryLimits limits_;

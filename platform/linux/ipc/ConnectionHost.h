@@ -30,7 +30,10 @@ class ConnectionHost {
   // True while what has been accepted, of that user or in all, must drain first. The connection
   // then waits for continueReading().
   virtual bool readingPaused(UserIndex user) = 0;
-  virtual void waitForReading(const std::shared_ptr<SocketConnection>& connection) = 0;
+  virtual UserAccounts& accounts() = 0;
+  // `frameBytes`: what the user must be allowed to hold, besides.
+  virtual void waitForReading(const std::shared_ptr<SocketConnection>& connection,
+                              std::size_t frameBytes) = 0;
   // Something has come that the connection will read in its turn.
   virtual void readInTurn(uid_t user, std::shared_ptr<TurnTaker> connection) = 0;
   virtual void flushAtPassEnd(const std::shared_ptr<SocketConnection>& connection) = 0;

@@ -17,6 +17,8 @@ namespace vx::lnx {
   X(unknownOperations, "unknown_operations")         \
   X(wrongArguments, "wrong_arguments")               \
   X(tooManySessions, "too_many_sessions")            \
+  X(tooMuchMemory, "too_much_memory")                \
+  X(callsGivenUp, "calls_given_up")                  \
   X(tooManyIdentifiers, "too_many_identifiers")      \
   X(notPermitted, "not_permitted")                   \
   X(unsupportedVersions, "unsupported_versions")     \

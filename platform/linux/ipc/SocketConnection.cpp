@@ -4,6 +4,8 @@
 
 #include <algorithm>
 #include <cerrno>
+#include <new>
+#include <stdexcept>
 
 #include "platform/Log.h"
 #include "platform/linux/ipc/ArgumentReading.h"
@@ -90,13 +92,20 @@ void SocketConnection::takeTurn(ReadTurn& turn) {
   assertInteractive();
   readScheduled_ = false;
   const Lane::Current onQueue(queue_.get());
-  readPass(&turn);
+  try {
+    readPass(&turn);
+  } catch (const std::bad_alloc& failure) {
+    onNoMemory(failure.what());
+    fail(WireError::TooMuchMemory, "the service has no memory for this call; try later");
+  }
 }
 
+// One who has read everything may always ask.
 bool SocketConnection::mustPause() const {
   const ListenerOptions& limits = host_.limits();
   return calls_.inFlight() >= limits.maxCallsInFlight ||
-         replies_.unreadBytes() >= limits.maxUnreadReplyBytes;
+         replies_.unreadBytes() >= limits.maxUnreadReplyBytes ||
+         (unreadCounted_ > 0 && !host_.accounts().mayHold(account_, MemoryKind::Unread, 0));
 }
 
 void SocketConnection::pauseReading() {
@@ -116,14 +125,46 @@ void SocketConnection::readPass(ReadTurn* turn) {
   if (state_ != State::Open || waitingForHost_) return;
   // Complete frames left over from the read before come first; only when they are through is more
   // read.
-  if (!reader_.hasNext() && !readSocket()) return;
+  if (!reader_.hasNext() && !(mayGatherFrame() && readSocket())) return;
   runFrames(turn);
   if (state_ != State::Open) return;
   reader_.keepRest();
+  countFrames();
   if (waitingForHost_ || mustPause()) return pauseReading();
   // More bytes in the socket than one read takes are left to the next pass, so that this one's
   // replies leave first.
   if (reader_.hasNext()) scheduleRead();
+}
+
+// A large frame is gathered in memory of its own, which is the user's before it is touched: where
+// he holds too much of it the frame waits for others of his, of which one at least can always end.
+bool SocketConnection::mayGatherFrame() {
+  if (reader_.unread() < wire::kLengthBytes) return true;
+  const std::size_t length = reader_.nextLength();
+  if (length <= wire::ReadBuffers::kReadBytes || length <= framesCounted_) return true;
+  const std::size_t more = length - framesCounted_;
+  if (!host_.accounts().mayHold(account_, MemoryKind::Frames, more)) {
+    waitingForHost_ = true;
+    host_.waitForReading(shared_from_this(), more);
+    pauseReading();
+    return false;
+  }
+  count(MemoryKind::Frames, framesCounted_, length);
+  return true;
+}
+
+void SocketConnection::countFrames() {
+  const bool gathers = reader_.unread() >= wire::kLengthBytes && !reader_.hasNext() &&
+                       reader_.nextLength() == framesCounted_;
+  if (!gathers) count(MemoryKind::Frames, framesCounted_, reader_.unread());
+}
+
+void SocketConnection::count(MemoryKind kind, std::size_t& counted, std::size_t bytes) {
+  if (bytes > counted)
+    host_.accounts().add(account_, kind, bytes - counted);
+  else if (bytes < counted)
+    host_.accounts().remove(account_, kind, counted - bytes);
+  counted = bytes;
 }
 
 bool SocketConnection::readSocket() {
@@ -149,7 +190,7 @@ void SocketConnection::runFrames(ReadTurn* turn) {
     if (mustPause()) return;
     if (host_.readingPaused(account_)) {
       waitingForHost_ = true;
-      host_.waitForReading(shared_from_this());
+      host_.waitForReading(shared_from_this(), 0);
       return;
     }
     std::span<const uint8_t> body;
@@ -165,6 +206,11 @@ void SocketConnection::runFrames(ReadTurn* turn) {
         runFrame(body);
     }
   }
+}
+
+void SocketConnection::onNoMemory(const char* why) {
+  ++host_.counters().callsGivenUp;
+  VX_LOG(nullptr, Error, "a call of user %u was given up: %s", uid_, why);
 }
 
 void SocketConnection::runFrame(std::span<const uint8_t> body) {
@@ -236,6 +282,12 @@ void SocketConnection::runCall(const Frame& frame) {
     ++host_.counters().wrongArguments;
     return sendError(callNumber, WireError::WrongArguments, read.text());
   }
+  if (operation.holds && host_.accounts().isFull(account_)) {
+    ++host_.counters().tooMuchMemory;
+    return sendError(callNumber, WireError::TooMuchMemory,
+                     "the service holds too much for user " + std::to_string(uid_) +
+                         " already; stop or destroy some sessions first");
+  }
   if (!admitResource(operation, arguments)) {
     ++host_.counters().tooManySessions;
     return sendError(callNumber, WireError::TooManySessions,
@@ -246,9 +298,16 @@ void SocketConnection::runCall(const Frame& frame) {
   const uint64_t token =
       calls_.open(callNumber, operation.replyMayBeHeld ? CallTable::Answer::MayBeHeld
                                                        : CallTable::Answer::Soon);
-  const Cause cause = recordCall(operation, frame, arguments);
-  const CauseScope scope(cause);
-  operation.invoke(*object_, arguments, Reply(weak_from_this(), token));
+  Reply reply(weak_from_this(), token);
+  try {
+    const Cause cause = recordCall(operation, frame, arguments);
+    const CauseScope scope(cause);
+    operation.invoke(*object_, arguments, std::move(reply));
+  } catch (const std::bad_alloc& failure) {
+    onNoMemory(failure.what());  // the peer is told that it was let go of
+  } catch (const std::length_error& failure) {
+    onNoMemory(failure.what());
+  }
 }
 
 // The dictionary that the operation gets lies where it was recorded, or else on the heap.
@@ -364,6 +423,7 @@ void SocketConnection::flush() {
     const bool wasFull = mustPause();
     const ReplyStream::Peer peer = replies_.writeTo(socket_.get(), host_.clock());
     if (peer == ReplyStream::Peer::Gone && state_ == State::Draining) return closeNow();
+    countUnread();
     // Also of a peer that is gone: what it sent before still runs, and its end is read behind that.
     if (wasFull && !mustPause()) scheduleRead();
   }
@@ -371,8 +431,13 @@ void SocketConnection::flush() {
   updateInterest();
 }
 
+void SocketConnection::countUnread() {
+  count(MemoryKind::Unread, unreadCounted_, replies_.unreadBytes());
+}
+
 void SocketConnection::updateInterest() {
   assertInteractive();
+  countUnread();
   if (state_ == State::Closed || state_ == State::Accepted) return;
   uint32_t wanted = 0;
   if (state_ == State::Open && !waitingForHost_ && !mustPause()) wanted |= EPOLLIN;
@@ -420,6 +485,7 @@ void SocketConnection::finishReading(End end) {
   if (state_ != State::Open) return;
   state_ = State::Draining;
   reader_.clear();
+  countFrames();
   updateInterest();
   // In their own turns on this connection's queue: the caller may be inside a front half.
   async([self = shared_from_this(), end] {
@@ -475,6 +541,8 @@ void SocketConnection::closeNow() {
   if (interest_ != 0) host_.loop().remove(socket_.get(), *this);
   interest_ = 0;
   state_ = State::Closed;
+  replies_.clear();
+  countUnread();
   socket_.reset();
   host_.closed(*this);
 }

@@ -106,6 +106,7 @@ class SocketConnection final : public ClientConnection,
   bool mustPause() const;
   void pauseReading();
   void runFrame(std::span<const uint8_t> body);
+  void onNoMemory(const char* why);
   void runHello(const Frame& frame);
   void runCall(const Frame& frame);
   Cause recordCall(const OperationDescription& operation, const Frame& frame,
@@ -113,6 +114,10 @@ class SocketConnection final : public ClientConnection,
   bool isPrivileged() const;
   bool admitResource(const OperationDescription& operation, const CallArguments& arguments);
   void settle(CallTable::Call& call);
+  bool mayGatherFrame();
+  void countFrames();
+  void countUnread();
+  void count(MemoryKind kind, std::size_t& counted, std::size_t bytes);
 
   void sendError(std::optional<uint64_t> number, wire::ErrorCode code, std::string_view text);
   void sendGoodbye();
@@ -147,6 +152,9 @@ class SocketConnection final : public ClientConnection,
   wire::FrameReader reader_;
   CallTable calls_;
   ReplyStream replies_;
+  // Bytes on the user's account: of replies, and of what was read or is to be and has not run.
+  std::size_t unreadCounted_ = 0;
+  std::size_t framesCounted_ = 0;
   std::unordered_set<int64_t> resources_;
 };
 

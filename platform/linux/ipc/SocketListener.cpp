@@ -236,9 +236,17 @@ SocketListener::recordedConnections() const {
   return recorded;
 }
 
-void SocketListener::waitForReading(const std::shared_ptr<SocketConnection>& connection) {
+void SocketListener::waitForReading(const std::shared_ptr<SocketConnection>& connection,
+                                    std::size_t frameBytes) {
   VX_DCHECK(executor_.isInteractiveThread());
-  waiting_.push_back({connection, connection->account()});
+  waiting_.push_back({connection, connection->account(), frameBytes});
+}
+
+bool SocketListener::mayGoOn(const Waiting& waiting) {
+  return waiting.connection.expired() ||
+         (!readingPaused(waiting.account) &&
+          (waiting.frameBytes == 0 ||
+           accounts_.mayHold(waiting.account, MemoryKind::Frames, waiting.frameBytes)));
 }
 
 void SocketListener::congestionEnded() {
@@ -274,7 +282,7 @@ void SocketListener::closed(SocketConnection& connection) {
 
 void SocketListener::runPassEnd() {
   VX_DCHECK(executor_.isInteractiveThread());
-  if (std::ranges::any_of(waiting_, [this](const Waiting& w) { return !readingPaused(w.account); }))
+  if (std::ranges::any_of(waiting_, [this](const Waiting& w) { return mayGoOn(w); }))
     congestionEnded();
   for (std::size_t i = 0; i < toFlush_.size(); ++i) toFlush_[i]->flush();
   toFlush_.clear();

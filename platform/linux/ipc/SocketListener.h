@@ -74,7 +74,9 @@ class SocketListener final : public ServiceListener,
   bool readingPaused(UserIndex user) override {
     return accounts_.isPaused(user) || hooks_.congested(accounts_.uidOf(user));
   }
-  void waitForReading(const std::shared_ptr<SocketConnection>& connection) override;
+  UserAccounts& accounts() override { return accounts_; }
+  void waitForReading(const std::shared_ptr<SocketConnection>& connection,
+                      std::size_t frameBytes) override;
   void readInTurn(uid_t user, std::shared_ptr<TurnTaker> connection) override {
     turns_.add(user, std::move(connection));
   }
@@ -126,7 +128,9 @@ class SocketListener final : public ServiceListener,
   struct Waiting {
     std::weak_ptr<SocketConnection> connection;
     UserIndex account;
+    std::size_t frameBytes;
   };
+  bool mayGoOn(const Waiting& waiting);
   std::vector<Waiting> waiting_;
   std::unordered_set<SocketConnection*> unread_;
 };

@@ -16,6 +16,14 @@ std::optional<Payload> JournaledInputs::once(std::string_view what,
   return answer;
 }
 
+// One that finds no space is not made.
+bool JournaledInputs::decide(std::string_view what, bool now) {
+  const JournalTicket* const call = CauseScope::current();
+  if (!now || call == nullptr || journal_ == nullptr) return now;
+  return journal_->note(*call, kInputNote, writeInput(CauseScope::nextPlace(), what, Payload()))
+      .ok();
+}
+
 // Where there is no space the call waits with its work.
 void JournaledInputs::keepDelayed(const Payload& facts, const Payload& content, WorkCause& cause) {
   auto& held = static_cast<HeldCause&>(cause);

@@ -14,6 +14,7 @@ class JournaledInputs final : public RecordedInputs {
   explicit JournaledInputs(Journal* journal) : journal_(journal) {}
   std::optional<Payload> once(std::string_view what,
                               const Function<std::optional<Payload>()>& source) override;
+  bool decide(std::string_view what, bool now) override;
   void keepDelayed(const Payload& facts, const Payload& content, WorkCause& cause) override;
 
  private:

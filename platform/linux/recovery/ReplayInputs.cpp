@@ -13,13 +13,22 @@ ReplayInputs::ReplayInputs(const JournalContents& contents) {
 std::optional<Payload> ReplayInputs::once(std::string_view what,
                                           const Function<std::optional<Payload>()>&) {
   const Cause cause = Cause::take();
-  const auto found = noted_.find(cause.ticket.call());
+  return find(cause.ticket.call(), cause.position.place, what);
+}
+
+bool ReplayInputs::decide(std::string_view what, bool) {
+  const JournalTicket* const call = CauseScope::current();
+  return call != nullptr && find(call->call(), CauseScope::nextPlace(), what).has_value();
+}
+
+std::optional<Payload> ReplayInputs::find(uint64_t call, uint32_t place,
+                                          std::string_view what) const {
+  const auto found = noted_.find(call);
   if (found == noted_.end()) return std::nullopt;
   for (const JournalContents::Note& note : found->second->notes) {
     if (note.kind != kInputNote) continue;
     std::optional<RecordedInput> input = readInput(note.bytes);
-    if (input && input->place == cause.position.place && input->what == what)
-      return std::move(input->answer);
+    if (input && input->place == place && input->what == what) return std::move(input->answer);
   }
   return std::nullopt;
 }

@@ -16,8 +16,11 @@ class ReplayInputs final : public RecordedInputs {
   explicit ReplayInputs(const JournalContents& contents);
   std::optional<Payload> once(std::string_view what,
                               const Function<std::optional<Payload>()>& source) override;
+  bool decide(std::string_view what, bool now) override;
 
  private:
+  std::optional<Payload> find(uint64_t call, uint32_t place, std::string_view what) const;
+
   std::unordered_map<uint64_t, const JournalContents::Record*> noted_;  // by call
 };
 

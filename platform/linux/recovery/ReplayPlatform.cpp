@@ -180,9 +180,9 @@ class UnwrittenEvents final : public AnalyticsEventService, public PowerEventLog
  public:
   UnwrittenEvents(AnalyticsEventService& analytics, PowerEventLog& power)
       : analytics_(analytics), power_(power) {}
-  void sendEventLazy(std::string_view name, Function<Payload()> builder,
-                     const Payload& message) override {
-    if (!isWritten()) analytics_.sendEventLazy(name, std::move(builder), message);
+  void sendEventLazy(std::string_view name, Function<Payload()> builder, const Payload& message,
+                     std::size_t holds) override {
+    if (!isWritten()) analytics_.sendEventLazy(name, std::move(builder), message, holds);
   }
   void logRegisteredEvent(int64_t clientIdentifier, std::string_view eventName,
                           const Payload& record, const Payload* options) override {

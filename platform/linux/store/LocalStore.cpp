@@ -1,5 +1,6 @@
 #include "platform/linux/store/LocalStore.h"
 
+#include <algorithm>
 #include <utility>
 
 namespace vx::lnx {
@@ -33,12 +34,11 @@ void LocalStore::endReplay(Function<void()> committed) {
 }
 
 void LocalStore::sendEventLazy(std::string_view name, Function<Payload()> builder,
-                               const Payload& message) {
-  // The builder holds a message, most likely one that the relay holds too: counted by a typical
-  // size.
+                               const Payload& message, std::size_t holds) {
+  // The relay may hold the message too, or not: it is counted for both.
   constexpr std::size_t kTypicalEventBytes = 128;
   (void)writer_.queue().append(AnalyticsRecord{name, message, std::move(builder)},
-                               kTypicalEventBytes);
+                               std::max(kTypicalEventBytes, message.encoded().size() + holds));
 }
 
 void LocalStore::logRegisteredEvent(int64_t clientIdentifier, std::string_view eventName,

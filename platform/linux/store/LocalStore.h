@@ -56,8 +56,8 @@ class LocalStore final : public AnalyticsEventService, public PowerEventLog {
   void yieldToOthers() { writer_.yieldToOthers(); }
 
   RelayBackend& relayBackend() { return backend_; }
-  void sendEventLazy(std::string_view name, Function<Payload()> builder,
-                     const Payload& message) override;
+  void sendEventLazy(std::string_view name, Function<Payload()> builder, const Payload& message,
+                     std::size_t holds) override;
   void logRegisteredEvent(int64_t clientIdentifier, std::string_view eventName,
                           const Payload& record, const Payload* options) override;
 

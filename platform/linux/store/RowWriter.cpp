@@ -3,6 +3,7 @@
 #include <algorithm>
 #include <cmath>
 #include <exception>
+#include <new>
 #include <optional>
 #include <tuple>
 #include <utility>
@@ -101,14 +102,20 @@ Result<RowWriter::Written> RowWriter::write(const StoreRecords& batch, std::size
   begun_.clear();
   allowance_ = allowance;
   const auto markedBefore = std::pair(lastMarkedRow_, lastMarkedCall_);
-  const int code = writeTransaction(batch, first, last, notes);
+  int code = SQLITE_NOMEM;
+  try {
+    code = writeTransaction(batch, first, last, notes);
+  } catch (const std::bad_alloc&) {
+    // As where SQLite has none: tried again later.
+  }
   for (std::string* text : {&json_, &eventJson_}) {
     if (text->capacity() > kKeptText) std::string().swap(*text);
   }
   if (code == SQLITE_OK) return written_;
   std::tie(lastMarkedRow_, lastMarkedCall_) = markedBefore;
   for (RelayRow* session : begun_) session->id = 0;
-  Status failure = Status::failure(sqlite3_errmsg(database_));
+  Status failure =
+      Status::failure(code == SQLITE_NOMEM ? sqlite3_errstr(code) : sqlite3_errmsg(database_));
   nameRows_.clear();  // the names that were added are not there
   if (sqlite3_get_autocommit(database_) == 0) execute(database_, "ROLLBACK");
   return failure;
