@@ -13,8 +13,8 @@ namespace vx {
 //
 // Blocks that were released stay findable, and are not used again, before a snapshot of the
 // service's state is complete that was begun after their release: until then the snapshot before it
-// may have to be gone back to, and it names them. The same goes for the blocks of an earlier
-// process that nobody asks for.
+// may have to be gone back to, and it names them. (Those that were acquired after it are named by
+// none.) The same goes for the blocks of an earlier process that nobody asks for.
 class AggregateMemory {
  public:
   struct Block {

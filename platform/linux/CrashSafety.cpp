@@ -98,6 +98,7 @@ void CrashSafety::cutJournal() {
             means_.aggregates.snapshotBegan();
             recorder_->shares().generationBegan();
           },
+      .taken = [this] { means_.aggregates.snapshotTaken(); },
       .completed =
           [this] {
             means_.aggregates.snapshotCompleted();
@@ -217,6 +218,17 @@ std::string CrashSafety::counters() const {
   add("snapshot_bytes", snapshots.bytes);
   add("snapshot_us", static_cast<uint64_t>(longest));
   return text;
+}
+
+void CrashSafety::giveBack() {
+  if (journal_ == nullptr) return;
+  // What sessions have released a snapshot must make free.
+  if (means_.aggregates.counters().waitingBytes >= Snapshots::kWorthwhileBytes)
+    snapshots_->demand();
+  means_.executor.background().async([this] {
+    means_.aggregates.giveBack();
+    journal_->giveBack();
+  });
 }
 
 bool CrashSafety::keepWhatIsLeft(Function<void(std::chrono::milliseconds)> askForTime) {

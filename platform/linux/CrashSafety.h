@@ -76,6 +76,8 @@ class CrashSafety {
   }
   bool isAllRecorded() const { return recorder_ && recorder_->counters().unrecorded == 0; }
   std::string counters() const;
+  // Load is over: what it has left free goes back to the system, on the background queue.
+  void giveBack();
 
   // No thread is left that works on calls.
   void stop() { Journal::setCallsDoneHandler(nullptr, nullptr); }

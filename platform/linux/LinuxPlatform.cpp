@@ -17,6 +17,7 @@
 #include "platform/Log.h"
 #include "platform/linux/CrashSafety.h"
 #include "platform/linux/PlatformConfiguration.h"
+#include "platform/linux/QuietMoments.h"
 #include "platform/linux/RelayReporting.h"
 #include "platform/linux/StopDeadline.h"
 #include "platform/linux/aggregates/AggregateSegments.h"
@@ -31,6 +32,7 @@
 #include "platform/linux/diagnostics/SystemLog.h"
 #include "platform/linux/execution/EventLoop.h"
 #include "platform/linux/execution/Executor.h"
+#include "platform/linux/execution/FreeList.h"
 #include "platform/linux/execution/SpareMemory.h"
 #include "platform/linux/execution/SystemThreading.h"
 #include "platform/linux/ipc/SocketListener.h"
@@ -268,6 +270,16 @@ class RunningPlatform final : public LinuxPlatform {
     return names;
   }
 
+  // The allocator returns by itself only what lies at the end of its heap.
+  void giveBackMemory() {
+    FreeList<WorkItem>::clearAll();
+    executor_.withoutCause([this] {
+      crashSafety_->giveBack();
+      store_->giveBackMemory();
+      executor_.background().async([] { malloc_trim(0); });
+    });
+  }
+
   // Everything that the event loop looks after besides connections.
   void connect() {
     accounts_.setResumedHandler([this] { listener_.congestionEnded(); });
@@ -289,7 +301,12 @@ class RunningPlatform final : public LinuxPlatform {
     watch(signalFd_.get(), signalSource_);
 
     loop_.addPassEndHook([this] { heapPages_.askForNew(); });
-    loop_.addPassEndHook([] { SpareMemory::keep(); });
+    loop_.addPassEndHook([this] {
+      SpareMemory::keep();
+      quietMoments_.afterPass(listener_.counters().workBegun());
+    });
+    loop_.addDeadline([this] { return quietMoments_.nextDue(); },
+                      [this] { quietMoments_.onDue(); });
     watcher_->setPoster([this](std::string_view name, const PreferencesWatcher::Post& post) {
       crashSafety_->recordNotification(name, post);
     });
@@ -348,6 +365,7 @@ class RunningPlatform final : public LinuxPlatform {
   ConfiguredDeviceProperties properties_;
   LinuxOrientation orientation_;
   HeapPages heapPages_;
+  QuietMoments quietMoments_{clock_, [this] { giveBackMemory(); }};
   LinuxDiagnosticFiles diagnosticFiles_;
   ProcProcessInfo processInfo_;
   ImmediateProcessControl processControl_;

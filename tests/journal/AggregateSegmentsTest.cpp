@@ -87,10 +87,14 @@ TEST_F(AggregateSegmentsTest, WhatWasReleasedWaitsForASnapshotThatWasBegunAfterw
   reopen();
   const Block blocks[] = {acquire(1, 0, 480), acquire(6, 0, 480), acquire(2, 0, 480),
                           acquire(3, 0, 1 << 20)};
+  memory->snapshotTaken();
   memory->release({blocks, 2});
   memory->snapshotBegan();
   memory->snapshotBegan();  // the one before it was not completed
   memory->release({blocks + 2, 2});
+  const Block since = acquire(7, 0, 480);
+  memory->release({&since, 1});
+  EXPECT_EQ(acquire(8, 0, 480).bytes, since.bytes) << "no snapshot names it";
   EXPECT_NE(acquire(4, 0, 480).bytes, blocks[1].bytes);
   memory->snapshotCompleted();
   EXPECT_EQ(memory->counters().waitingBytes, blocks[2].size + blocks[3].size);

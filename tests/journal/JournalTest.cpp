@@ -186,6 +186,12 @@ TEST_F(JournalTest, IsFullAtItsLimitButForTheSnapshotThatMakesSpace) {
   EXPECT_TRUE(appendLarge(21).ok());
   for (uint8_t i = 22; i < 26; ++i) EXPECT_TRUE(appendLarge(i).ok());
   EXPECT_EQ(readKinds(), "20s 21d 22d 23d 24d 25d") << "done, but after the snapshot";
+  snapshot(30);
+  EXPECT_THAT(files(), SizeIs(::testing::Gt(4u)));
+  journal->giveBack();
+  EXPECT_THAT(files(), SizeIs(1));
+  for (uint8_t i = 31; i < 34; ++i) EXPECT_TRUE(appendLarge(i).ok());
+  EXPECT_THAT(files(), SizeIs(4)) << "with spares again";
 }
 
 TEST_F(JournalTest, AFileSystemWithoutSpaceMakesItFullAndNoWorse) {

@@ -64,6 +64,7 @@ class RecoveryTest : public JournalFixture {
         .commitSoon = [this] { service->rows.commit(); },
         .freed = [] {},
         .began = [this] { hooks = "began"; },
+        .taken = [] {},
         .completed = [this] { hooks += std::to_string(snapshots->counters().completed); },
     });
   }

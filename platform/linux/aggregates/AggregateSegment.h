@@ -28,7 +28,7 @@ class AggregateSegment {
   struct BlockHeader {
     uint64_t aggregate;  // written last when a block is taken, first when it is free: 0
     uint32_t ordinal;
-    uint32_t reserved;
+    uint32_t taken;  // when, as AggregateSegments counts; of no use to another process
     uint64_t padding[2];
   };
   // A block in a segment.

@@ -125,6 +125,7 @@ std::vector<AggregateMemory::Block> AggregateSegments::takeFound(uint64_t aggreg
       makeFree(place);
       continue;
     }
+    place.segment->header(place.index).taken = 0;
     blocks.push_back({place.segment->contents(place.index), place.segment->capacity(), true});
     have += blocks.back().size;
   }
@@ -176,6 +177,7 @@ AggregateMemory::Block AggregateSegments::acquire(uint64_t aggregate, uint32_t o
     if (taken.ok()) {
       AggregateSegment::BlockHeader& header = taken->segment->header(taken->index);
       header.ordinal = ordinal;
+      header.taken = snapshotsTaken_;
       std::atomic_ref<uint64_t>(header.aggregate).store(aggregate, std::memory_order_release);
       return {taken->segment->contents(taken->index), taken->segment->capacity(), true};
     }
@@ -247,12 +249,17 @@ void AggregateSegments::add(std::unique_ptr<AggregateSegment> segment) {
 void AggregateSegments::release(std::span<const Block> blocks) {
   MutexLock lock(mutex_);
   for (const Block& block : blocks) {
-    if (block.survives) {
-      released_.push_back(placeOf(block));
-      counters_.waitingBytes += block.size;
-    } else {
+    if (!block.survives) {
       counters_.unrecordedBytes -= block.size;
       delete[] block.bytes;
+      continue;
+    }
+    const Place place = placeOf(block);
+    if (place.segment->header(place.index).taken == snapshotsTaken_) {
+      makeFree(place);
+    } else {
+      released_.push_back(place);
+      counters_.waitingBytes += block.size;
     }
   }
 }
@@ -278,6 +285,20 @@ void AggregateSegments::snapshotBegan() {
   cut_.insert(cut_.end(), released_.begin(), released_.end());
   released_.clear();
   adoptedCut_ = true;
+}
+
+void AggregateSegments::snapshotTaken() {
+  MutexLock lock(mutex_);
+  ++snapshotsTaken_;
+}
+
+void AggregateSegments::giveBack() {
+  Segments unused;
+  {
+    MutexLock lock(mutex_);
+    unused = takeUnused();
+  }
+  unmap(std::move(unused));
 }
 
 void AggregateSegments::snapshotCompleted() {

@@ -53,6 +53,10 @@ class AggregateSegments final : public AggregateMemory {
   // Nothing in the files is wanted by another process: a stop that has committed everything.
   void discard();
   AggregateCounters counters() const;
+  // A snapshot names no block that is taken from here on.
+  void snapshotTaken();
+  // Files without a block in use go back to the system.
+  void giveBack();
 
   Account account() override;
   void charge(Payer payer, int64_t bytes) override;
@@ -90,6 +94,7 @@ class AggregateSegments final : public AggregateMemory {
   std::vector<Place> released_ GUARDED_BY(mutex_);  // since the newest snapshot was begun
   std::vector<Place> cut_ GUARDED_BY(mutex_);       // before it
   bool adoptedCut_ GUARDED_BY(mutex_) = false;
+  uint32_t snapshotsTaken_ GUARDED_BY(mutex_) = 1;  // 0: of an earlier process
   uint64_t named_ GUARDED_BY(mutex_);
   // Of the next file. A journal that is moved takes its files along, to where others may be.
   uint64_t nextFile_ GUARDED_BY(mutex_);

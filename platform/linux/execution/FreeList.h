@@ -37,8 +37,14 @@ class FreeList {
   }
   // Frees what the calling thread keeps; before it ends.
   static void clearThread() {
-    while (own_ != nullptr) ::operator delete(std::exchange(own_, own_->next));
+    clear(std::exchange(own_, nullptr));
     ownCount_ = 0;
+  }
+  // And what no thread keeps: little, but each of them holds on to a page.
+  static void clearAll() {
+    clearThread();
+    clear(shared_.exchange(nullptr, std::memory_order_acquire));
+    sharedCount_.store(0, std::memory_order_relaxed);
   }
 
  private:
@@ -48,6 +54,9 @@ class FreeList {
   static constexpr uint32_t kChain = 64;
   static constexpr uint32_t kMaxShared = 4096;
 
+  static void clear(Node* nodes) {
+    while (nodes != nullptr) ::operator delete(std::exchange(nodes, nodes->next));
+  }
   // The counted ones at the front of the own list.
   static void handOver() {
     Node* const first = own_;
@@ -56,8 +65,7 @@ class FreeList {
     ownCount_ = 0;
     if (sharedCount_.fetch_add(kChain, std::memory_order_relaxed) >= kMaxShared) {
       sharedCount_.fetch_sub(kChain, std::memory_order_relaxed);
-      for (Node* node = first; node != nullptr;) ::operator delete(std::exchange(node, node->next));
-      return;
+      return clear(first);
     }
     // Nodes are only ever taken all at once, so a list that looks unchanged is unchanged.
     ownLast_->next = shared_.load(std::memory_order_relaxed);

@@ -34,6 +34,7 @@ struct ListenerCounters {
   VX_LISTENER_COUNTERS(VX_COUNTER_FIELD)
 #undef VX_COUNTER_FIELD
 
+  uint64_t workBegun() const { return accepted + refusedConnections + calls; }
   // "accepted=3 calls=17 ..."
   std::string text() const;
 };

@@ -310,6 +310,20 @@ bool Journal::lookForCapacity() {
   return hasCapacity();
 }
 
+void Journal::giveBack() {
+  std::vector<JournalSegment::Pointer> free;  // unmapped without the lock
+  MutexLock lock(mutex_);
+  recycle();
+  if (sealed_.empty() && lingering_.empty()) severalNeeded_ = false;
+  const std::size_t kept = severalNeeded_ ? kSpares : 0;
+  while (free_.size() > kept) {
+    folder_.remove(free_.back()->name());
+    free.push_back(std::move(free_.back()));
+    free_.pop_back();
+  }
+  updateCapacity();
+}
+
 Result<JournalSegment::Pointer> Journal::acquire(Use use) {
   if (discarded_ || !isWithinShare(use)) return full("cannot record a call");
   const bool first = active_ == nullptr && sealed_.empty();

@@ -84,6 +84,9 @@ class Journal {
   bool hasCapacity() const { return !full_.load(std::memory_order_relaxed); }
   // Tries to find some where there was none.
   bool lookForCapacity();
+  // Load is over: what it has left free goes back to the system, which takes its time; spares too,
+  // where one segment is enough again.
+  void giveBack();
   // Records an input of a call that is not done.
   Status note(const JournalTicket& ticket, uint8_t kind, std::span<const uint8_t> bytes);
 

@@ -68,6 +68,7 @@ void Snapshots::begin() {
 
 void Snapshots::saved(SavedService service) {
   const Monotonic began = means_.clock.monotonic();
+  means_.taken();
   // Better that a summary may lack something after a crash than that nobody is served.
   if (!service.complete && !isTight()) return giveUp();
   const std::span<const uint8_t> facts = service.facts.encoded();

@@ -46,6 +46,7 @@ class Snapshots {
     Function<void()> commitSoon;  // what the store holds: somebody waits
     Function<void()> freed;       // there may be capacity again; or cannotCut()
     Function<void()> began;       // around what must not be forgotten meanwhile
+    Function<void()> taken;       // the state is that of now
     Function<void()> completed;
   };
   struct Counters {

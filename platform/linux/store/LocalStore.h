@@ -55,6 +55,9 @@ class LocalStore final : public AnalyticsEventService, public PowerEventLog {
   // Once clients do not wait for a replay to be committed: the writer lets others go first.
   void yieldToOthers() { writer_.yieldToOthers(); }
 
+  // Load is over.
+  void giveBackMemory() { writer_.giveBackMemory(); }
+
   RelayBackend& relayBackend() { return backend_; }
   void sendEventLazy(std::string_view name, Function<Payload()> builder, const Payload& message,
                      std::size_t holds) override;

@@ -100,6 +100,12 @@ void StoreWriter::note(LedgerNote note) {
   queue_.runSoon([this, note = std::move(note)] { notes_.push_back(note); });
 }
 
+void StoreWriter::giveBackMemory() {
+  queue_.runSoon([this] {
+    if (open_) sqlite3_db_release_memory(open_->database.get());
+  });
+}
+
 void StoreWriter::yieldToOthers() {
   queue_.runSoon(
       [] { setpriority(PRIO_PROCESS, static_cast<id_t>(syscall(SYS_gettid)), kWriterNiceness); });

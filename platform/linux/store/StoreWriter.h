@@ -50,6 +50,7 @@ class StoreWriter {
   void start();
   // Nobody waits for it any more: from here on whoever has something to do goes first.
   void yieldToOthers();
+  void giveBackMemory();
   // On the writer's thread; see LocalStore::beginReplay.
   void expectKnownRows(ReplayedCalls calls) { replayFrom_ = std::move(calls); }
 
