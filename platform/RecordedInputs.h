@@ -20,10 +20,10 @@ class RecordedInputs {
   // source is never asked. `what` is a literal that names the question.
   virtual std::optional<Payload> once(std::string_view what,
                                       const Function<std::optional<Payload>()>& source) = 0;
-  // A decision that rests on what no later process can know: how it falls `now`, which is recorded
-  // with the call when it is true; false where it cannot be. Where that call is run again: how it
-  // fell then. Takes no place of the call, so it may be left unasked; at each place once for each
-  // `what`.
+  // A decision that rests on what no later process can know: how it falls `now`. The first time
+  // that it is true is recorded with the call, false where that cannot be, and then it is true for
+  // the rest of the call. Where that call is run again: how it fell then. Takes no place of the
+  // call, so it may be left unasked; on the service queue, about one `what`.
   virtual bool decide(std::string_view /*what*/, bool now) { return now; }
   // Records work that waits for long as a call of its own, so that the one that it goes back to
   // need not be kept for it. The work keeps its name. Again: in the place of the record before.

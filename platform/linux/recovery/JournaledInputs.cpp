@@ -16,12 +16,16 @@ std::optional<Payload> JournaledInputs::once(std::string_view what,
   return answer;
 }
 
-// One that finds no space is not made.
+// One note for a call, however many sessions it reaches.
 bool JournaledInputs::decide(std::string_view what, bool now) {
   const JournalTicket* const call = CauseScope::current();
-  if (!now || call == nullptr || journal_ == nullptr) return now;
-  return journal_->note(*call, kInputNote, writeInput(CauseScope::nextPlace(), what, Payload()))
-      .ok();
+  if (call == nullptr || journal_ == nullptr) return now;
+  if (call->call() == decided_) return true;
+  if (!now) return false;
+  const std::vector<uint8_t> note = writeInput(CauseScope::nextPlace(), what, Payload());
+  if (!journal_->note(*call, kInputNote, note).ok()) return false;
+  decided_ = call->call();
+  return true;
 }
 
 // Where there is no space the call waits with its work.

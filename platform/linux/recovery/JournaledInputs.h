@@ -19,6 +19,7 @@ class JournaledInputs final : public RecordedInputs {
 
  private:
   Journal* const journal_;
+  uint64_t decided_ = 0;  // the last call of which something was
 };
 
 }  // namespace vx::lnx

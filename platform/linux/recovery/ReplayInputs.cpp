@@ -18,7 +18,12 @@ std::optional<Payload> ReplayInputs::once(std::string_view what,
 
 bool ReplayInputs::decide(std::string_view what, bool) {
   const JournalTicket* const call = CauseScope::current();
-  return call != nullptr && find(call->call(), CauseScope::nextPlace(), what).has_value();
+  if (call == nullptr) return false;
+  if (call->call() != decided_) {
+    if (!find(call->call(), CauseScope::nextPlace(), what)) return false;
+    decided_ = call->call();
+  }
+  return true;
 }
 
 std::optional<Payload> ReplayInputs::find(uint64_t call, uint32_t place,

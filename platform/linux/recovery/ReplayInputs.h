@@ -22,6 +22,7 @@ class ReplayInputs final : public RecordedInputs {
   std::optional<Payload> find(uint64_t call, uint32_t place, std::string_view what) const;
 
   std::unordered_map<uint64_t, const JournalContents::Record*> noted_;  // by call
+  uint64_t decided_ = 0;  // the last call of which something was
 };
 
 }  // namespace vx::lnx
