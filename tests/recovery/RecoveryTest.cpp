@@ -61,7 +61,7 @@ class RecoveryTest : public JournalFixture {
               return all;
             },
         .crowded = [this] { return crowded; },
-        .commitSoon = [this] { service->rows.commit(); },
+        .commitSoon = [this] { ++urged, service->rows.commit(); },
         .freed = [] {},
         .began = [this] { hooks = "began"; },
         .taken = [] {},
@@ -187,6 +187,7 @@ class RecoveryTest : public JournalFixture {
 
   std::string hooks;  // that the snapshots called
   bool crowded = false;
+  int urged = 0;
   std::deque<std::unique_ptr<SteppedWork>> steps;  // one is done with each tick
   Date wall{std::chrono::hours(24 * 365 * 50)};
   JournalContents left;
@@ -312,16 +313,20 @@ TEST_F(RecoveryTest, WhoHasNoShareOfTheJournalLeftGetsASnapshotAsSoonAsItCanBe) 
   beginLife();
   connect(1, 200);
   create(1, 11, 3), start(1, 11), send(1, 1);
+  JournalTicket late = recorder->preferencesChanged("of which a row comes late");
   snapshots->afterPass();
   EXPECT_FALSE(snapshots->isUnderWay());
   crowded = true;
   snapshots->afterPass();
   service->runQueues();
   EXPECT_TRUE(snapshots->isUnderWay());
-  snapshots->afterPass();  // asks the store to commit
-  send(1, 2);
-  snapshots->onDue();  // and again, for what came to it since
-  crowded = false;
+  snapshots->afterPass();
+  snapshots->afterPass();
+  EXPECT_EQ(urged, 1) << "the store is asked to commit";
+  snapshots->onDue();
+  snapshots->afterPass();
+  EXPECT_EQ(urged, 2) << "and again, for what has come to it since";
+  late = {};
   snapshots->afterPass();
   EXPECT_EQ(hooks, "began1");
 }
