@@ -43,8 +43,16 @@ class Life:
         self.m.wait_until(lambda: self.rows(query, **options) == wanted,
                           lambda: f"{query} is {wanted}; it is {self.rows(query, **options)}", 20)
 
-    def session(self, number, end="stop {0}\n"):
-        self.m.run("vxreport script", user="outsider", stdin=None, input=(SESSION + end).format(number))
+    def session(self, number):
+        self.m.run("vxreport script", user="outsider", stdin=None, input=(SESSION + "stop {0}\n").format(number))
+
+    def opened(self, number):
+        """The client of an open session, whose first message is accepted."""
+        client = self.m.start("vxreport script", "outsider")
+        client.stdin.write(SESSION.format(number))
+        client.stdin.flush()
+        self.m.wait_until(lambda: "taken" in client.said(), "the message is accepted")
+        return client
 
     # --- the life, in order
 
@@ -110,12 +118,11 @@ class Life:
         self.m.run(f"kill -STOP {before}")
         self.m.wait_until(lambda: self.pid() not in (0, before), "the watchdog has restarted it")
         self.report()
+        self.m.run("rm -r /run/systemd/system/vxreporting.service.d && systemctl daemon-reload && "
+                   "systemctl restart vxreporting.service")
 
     def step_crash_loses_nothing(self):
-        client = self.m.start("vxreport script", "outsider")
-        client.stdin.write(SESSION.format(2))
-        client.stdin.flush()
-        self.m.wait_until(lambda: "taken" in client.said(), "the message is accepted")
+        client = self.opened(2)
         before = self.pid()
         self.m.run(f"kill -SEGV {before}")
         self.report()  # waits in the socket
@@ -134,19 +141,18 @@ class Life:
             assert self.pid() not in (0, before)
 
     def step_stop_is_bounded(self):
-        self.session(3, end="")  # leaves without stopping
+        client = self.opened(3)
         began = time.monotonic()
         self.m.run("systemctl stop vxreporting.service")
         assert time.monotonic() - began < 10
         assert self.shown("Result") == "success"
-        assert self.rows("SELECT count(*) FROM relay_sessions WHERE ended_how IS NULL") == ["0"]
+        assert self.rows("SELECT ended_how FROM relay_sessions WHERE session_id = 3") == ["service_stopped"]
+        client.stdin.close()
+        client.wait(30)
 
     def step_upgrade_with_open_sessions(self):
         """What is sent all the time meanwhile is stored as far as it was accepted."""
-        client = self.m.start("vxreport script", "outsider")
-        client.stdin.write(SESSION.format(4))
-        client.stdin.flush()
-        self.m.wait_until(lambda: "taken" in client.said(), "the message is accepted")
+        client = self.opened(4)
         keeping = [self.m.start(f"/clients/{name} {number}", "outsider") for number, name in enumerate(self.clients(), 11)]
         for process in keeping:
             self.hear(process)
