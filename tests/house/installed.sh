@@ -17,5 +17,8 @@ case $flags in *-Werror* | *-Wall* | *-Wextra* | *-fsanitize* | *-DVX_* | *"$roo
 export PKG_CONFIG_SYSROOT_DIR="$folder/root" PKG_CONFIG_PATH
 PKG_CONFIG_PATH=$(dirname "$(find "$folder/root" -name vxreporting-cpp.pc)")
 g++ -std=c++20 -Wall -Wextra -Wpedantic -Werror "$folder/build/readme.cpp" $(pkg-config --cflags --libs vxreporting-cpp) -o "$folder/readme"
-ldd "$folder/readme" | grep -v -e linux-vdso -e ld-linux -e 'lib\(c\|m\|stdc++\|gcc_s\)\.so' && fail "it needs more than libc and libstdc++"
-echo "both built, no flag came with it"
+cc -std=c11 -Wall -Wextra -Wpedantic -Werror "$root/tests/client/c_client.c" $(pkg-config --cflags --libs vxreporting) \
+  -o "$folder/c"
+export LD_LIBRARY_PATH="$PKG_CONFIG_PATH/.."
+ldd "$folder/readme" "$folder/c" | grep -v -e linux-vdso -e ld-linux -e 'lib\(c\|m\|stdc++\|gcc_s\|vxreporting\)\.so' -e ':$' && fail "it needs more than libc and libstdc++"
+echo "all built, no flag came with it"
