@@ -22,9 +22,9 @@ uint64_t RealtimeReporter::Number::converted(Kind kind) const noexcept {
 }
 
 RealtimeReporter::RealtimeReporter(Shape shape, std::size_t capacity)
-    : shape_(std::move(shape)),
-      mask_(std::bit_ceil(std::max<std::size_t>(capacity, 1)) - 1),
-      words_((mask_ + 1) * shape_.keys.size() + 1) {
+    : mask_(std::bit_ceil(std::max<std::size_t>(capacity, 1)) - 1),
+      words_((mask_ + 1) * shape.keys.size() + 1),
+      shape_(std::move(shape)) {
   for (const Key& key : shape_.keys) kinds_.push_back(key.kind);
 }
 

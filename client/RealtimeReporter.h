@@ -28,6 +28,7 @@ namespace vx {
 // sees to it that neither does. Owned by the caller. Bounded by its capacity: what does not fit is
 // counted and gone. All memory is allocated and touched by the constructor; on a system that pages
 // memory out, lock it (mlockall).
+// NOLINTNEXTLINE(clang-analyzer-optin.performance.Padding): the threads' variables lie apart
 class RealtimeReporter {
  public:
   enum class Kind : uint8_t { Integer, Double, Boolean };
@@ -116,17 +117,17 @@ class RealtimeReporter {
   Payload messageAt(uint64_t number) const;
 
   static_assert(std::atomic<uint64_t>::is_always_lock_free);
-  const Shape shape_;
-  std::vector<Kind> kinds_;
-  const uint64_t mask_;  // of a message's number: its place
-  std::vector<uint64_t> words_;
   // What one thread writes lies apart from what the other does.
   alignas(64) std::atomic<uint64_t> head_{0};  // of the sending thread: messages sent
   uint64_t tailSeen_ = 0;
   std::atomic<uint64_t> dropped_{0};
   std::atomic<uint64_t> refused_{0};
+  const uint64_t mask_;  // of a message's number: its place
+  std::vector<uint64_t> words_;
+  std::vector<Kind> kinds_;
   alignas(64) std::atomic<uint64_t> tail_{0};  // of the other: messages given to the client
   bool processing_ = false;
+  const Shape shape_;
 };
 
 }  // namespace vx

@@ -60,7 +60,7 @@ ClientStatus ServiceConnection::open(const std::string& path, Patience patience)
   greetedBefore_ = false;
   delay_ = Patience(0);
   UniqueFd made;
-  const ClientStatus status = dial(Waits::Yes, patience, made);
+  ClientStatus status = dial(Waits::Yes, patience, made);
   if (status.ok()) return begin(std::move(made), patience);
   ended_ = status;
   retryLater();
