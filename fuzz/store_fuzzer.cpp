@@ -8,10 +8,15 @@
 
 #include "platform/linux/store/Salvage.h"
 #include "platform/linux/store/StoreFile.h"
+#include "platform/linux/store/StoreViews.h"
 
-static constexpr const char* kReads[] = {
-    "PRAGMA quick_check", "SELECT * FROM analytics_events", "SELECT * FROM session_messages",
-    "SELECT * FROM power_records", "SELECT * FROM store_ledger"};
+static void readAll(sqlite3* database, const std::string& sql) {
+  vx::lnx::Statement read(database, sql);
+  if (read.code() == SQLITE_ERROR) __builtin_trap();  // a table or column is missing
+  for (int rows = 0; rows < 1000 && read.row(); ++rows) {
+  }
+  if (read.code() == SQLITE_ERROR) __builtin_trap();  // a row fails the whole query
+}
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   static const std::string path = [] {
@@ -24,12 +29,9 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
       .write(reinterpret_cast<const char*>(data), static_cast<std::streamsize>(size));
   vx::lnx::OpenedStore opened = vx::lnx::openStoreDatabase(path, {1});
   if (opened.status.ok()) {
-    for (const char* sql : kReads) {
-      vx::lnx::Statement read(opened.database.get(), sql);
-      if (read.code() == SQLITE_ERROR) __builtin_trap();  // a table or column is missing
-      for (int rows = 0; rows < 1000 && read.row(); ++rows) {
-      }
-    }
+    readAll(opened.database.get(), "PRAGMA quick_check");
+    for (const vx::lnx::StoreView& view : vx::lnx::storeViews())
+      readAll(opened.database.get(), std::string("SELECT * FROM ") + view.name);
   }
   opened.database.reset();
   const vx::lnx::OpenedStore fresh = vx::lnx::openStoreDatabase(":memory:", {2});

@@ -224,7 +224,7 @@ TEST_F(LocalStoreTest, NewerStoreIsLeftAloneAndOneBesideItIsBegun) {
   open();
   close();
   store.reset();
-  query("PRAGMA user_version = 4");
+  query("PRAGMA user_version = 5");
   open();
   power(1);
   reopen();
@@ -232,8 +232,8 @@ TEST_F(LocalStoreTest, NewerStoreIsLeftAloneAndOneBesideItIsBegun) {
   EXPECT_TRUE(close());
   EXPECT_THAT(
       query("SELECT user_version, (SELECT count(*) FROM power_records) FROM pragma_user_version"),
-      ElementsAre("4|0"));
-  std::filesystem::rename(folder + "/telemetry-schema3.db", file());
+      ElementsAre("5|0"));
+  std::filesystem::rename(folder + "/telemetry-schema4.db", file());
   EXPECT_THAT(query("SELECT record FROM power_records"), ElementsAre("{\"i\":1}", "{\"i\":2}"));
   EXPECT_THAT(query("SELECT event FROM store_ledger"), ElementsAre("beside_newer", "beside_newer"));
 }

@@ -68,7 +68,8 @@ TEST_F(RowWriterTest, EveryColumnIsWhatWasGivenAndOfItsKind) {
   EXPECT_THAT(
       query("SELECT * FROM relay_messages"),
       ElementsAre("2|2.5|2|65535|65534|{\"x\":0.5,\"t\":true}|null|null|null|null|null|null|null"));
-  EXPECT_THAT(query("SELECT * FROM analytics_events"), ElementsAre("3|3.0|name|{\"i\":1}|null"));
+  EXPECT_THAT(query("SELECT * FROM analytics_events"),
+              ElementsAre("3|3.0|1970-01-01 00:00:03.000|name|{\"i\":1}|null"));
   EXPECT_THAT(query("SELECT * FROM power_records"),
               ElementsAre("1|4.0|28|Lumo_Haptics|{\"i\":2}|null|null|null"));
   EXPECT_THAT(query("SELECT id, time = 1576800000, event, table_name, rows, detail "

@@ -20,11 +20,10 @@ class StoreFileTest : public StoreTest {
       "SELECT s.name, group_concat(c.name || ' ' || c.type) FROM sqlite_master s,"
       " pragma_table_info(s.name) c WHERE s.type IN ('table', 'view') GROUP BY 1 ORDER BY 1";
   static constexpr const char* kReaders =
-      "SELECT id, session_id, service_name, application, category, type, payload"
-      " FROM session_messages UNION ALL"
-      " SELECT id, time, client_identifier, name, record, '', '' FROM power_records UNION ALL"
-      " SELECT id, time, event, table_name, rows, detail, '' FROM store_ledger UNION ALL"
-      " SELECT id, at, process, seconds, '', '', '' FROM client_uptimes";
+      "SELECT id, session_id, application, category, type, payload FROM session_messages UNION ALL"
+      " SELECT id, time, client_identifier, name, record, '' FROM power_records UNION ALL"
+      " SELECT id, time, event, table_name, rows, detail FROM store_ledger UNION ALL"
+      " SELECT id, process, seconds, '', '', '' FROM client_uptimes";
   static std::string textOf(const std::string& name) {
     std::stringstream text;
     text << std::ifstream(std::string(VX_STORE_DATA) + "/" + name).rdbuf();
@@ -119,7 +118,7 @@ TEST_F(StoreFileTest, SecondLockIsRefusedUntilTheFirstIsGone) {
 // Files as the service of that time made them.
 TEST_F(StoreFileTest, EarlierSchemasAreBroughtUpToDateAndKeepTheirRows) {
   const Rows fresh = query(open(), kColumns);
-  for (const char* version : {"1", "2"}) {
+  for (const char* version : {"1", "2", "3"}) {
     removeStore();
     StoreTest::query(textOf(std::string("schema-") + version + ".sql"));
     const Rows kept = StoreTest::query(kReaders);
@@ -133,10 +132,75 @@ TEST_F(StoreFileTest, EarlierSchemasAreBroughtUpToDateAndKeepTheirRows) {
                             "7|com.quorvel.sonik.vxreportingclientuptime|null",
                             "9|com.quorvel.sonik.Playback.Error|null"));
     EXPECT_EQ(query(opened, kColumns), fresh);
-    EXPECT_EQ(opened.epoch, JournalEpoch{9});
+    EXPECT_EQ(opened.epoch[0], *version == '3' ? 3 : 9);  // that of version 3 has one
+    EXPECT_EQ(open().epoch, opened.epoch);
+    EXPECT_THAT(query(opened, "SELECT count(*) FROM store_epochs"), ElementsAre("1"));
   }
-  EXPECT_EQ(open().epoch, JournalEpoch{9});  // has one
-  EXPECT_THAT(query(open(), "PRAGMA user_version"), ElementsAre("3"));
+  EXPECT_THAT(query(open(), "PRAGMA user_version"), ElementsAre("4"));
+}
+
+TEST_F(StoreFileTest, ViewsTellSessionsApartAndCompareNumbersAsNumbers) {
+  setenv("TZ", "XXX-9", 1);
+  tzset();
+  const OpenedStore opened = open();
+  for (const char* sql :
+       {// An identifier that is used again, a standalone, and a row that is no JSON.
+        "INSERT INTO relay_sessions(time, session_id, client_name, service_name, batch_event,"
+        " user_info, uid, ended_at, ended_how) VALUES"
+        " (1000.25, 7, 'c', 'telephony_session', 1, '{\"HostApplicationDisplayID\":\"a\"}', 5, "
+        "1004,"
+        " 'stopped'), (2000, 7, 'c', 'alarms_session', 0, '{', 5, NULL, NULL),"
+        " (3000, -1, 'c', 'standalone', NULL, '{}', 5, NULL, NULL)",
+        "INSERT INTO event_names VALUES (1, 'com.quorvel.sonik.ChannelReporting.Generic'),"
+        " (2, 'com.quorvel.sonik.HAL_ChannelReporting.Generic')",
+        "INSERT INTO relay_messages(time, relay_session, category, type, payload, event_name,"
+        " event_microseconds, event_tail) VALUES"
+        " (1001, 1, 9, 0, '{\"clicks\":40,\"t\":\"5\"}', 1, 500000, ',\"b\":1}'),"
+        " (1002, 1, 9, 0, '{\"mine\":9}', 2, 0, '}'),"
+        " (1003, 1, 65535, 65535, '{\"VX_Session_Summary_Event\":\"2\","
+        "\"rate\":\"96000,624000,01,1e400\",\"q\":\"a\\\",b\",\"e\":\"\"}', NULL, NULL, NULL),"
+        " (1003, 1, 65535, 65535, '{\"rate\":\"1\"}', NULL, NULL, NULL),"
+        " (2001, 2, 65535, 65535, '{\"VX_Session_Summary_Event\":\"2,', NULL, NULL, NULL),"
+        " (2002, 2, 9, 0, 'no', 1, 0, '}'), (3000, 3, 3, 1, '{}', NULL, NULL, NULL)",
+        "INSERT INTO analytics_entries(id, time, name, message, payload) VALUES"
+        " (90, 5, 1, 77, '}'), (91, 5, 2, NULL, x'7b00')",
+        "INSERT INTO power_records(time, client_identifier, name, record) VALUES"
+        " (1, 28, 'Lumo_Haptics', '{\"ApplicationName\":\"a\",\"EngineOnDuration\":0.5}'),"
+        " (2, 28, 'Lumo_Haptics', 'no')",
+        "INSERT INTO store_ledger(time, event, rows) VALUES (1.5, 'left_out', 1), (2, 'new', 2)"})
+    query(opened, sql);
+  EXPECT_THAT(
+      query(opened,
+            "SELECT relay_session, session_id, application, service_type, uid, started_utc,"
+            " ended_utc, seconds, ended_how, messages, bytes FROM sessions"),
+      ElementsAre("1|7|a|telephony|5|1970-01-01 00:16:40.250|1970-01-01 00:16:44.000|3.75|stopped|"
+                  "4|125",
+                  "2|7|Unknown|alarms|5|1970-01-01 00:33:20.000|null|null|null|2|33"));
+  EXPECT_THAT(
+      query(opened,
+            "SELECT relay_session, session_id, key, position, text, number"
+            " FROM summary_values WHERE key NOT LIKE 'VX%' ORDER BY key, number DESC, position"),
+      ElementsAre("1|7|e|1||null", "1|7|q|1|a\"|null", "1|7|q|2|b|null", "1|7|rate|4|1e400|Inf",
+                  "1|7|rate|2|624000|624000.0", "1|7|rate|1|96000|96000.0", "1|7|rate|3|01|null"));
+  EXPECT_THAT(query(opened,
+                    "SELECT relay_session, application, counter, growth"
+                    " FROM driver_statistics"),
+              ElementsAre("1|a|clicks|40"));
+  EXPECT_THAT(query(opened,
+                    "SELECT id, time_utc, relay_session, payload FROM analytics_events"
+                    " ORDER BY id"),
+              ElementsAre("1|1970-01-01 00:16:41.500|1|{\"clicks\":40,\"t\":\"5\",\"b\":1}",
+                          "2|1970-01-01 00:16:42.000|1|{\"mine\":9}",
+                          "6|1970-01-01 00:33:22.000|2|{\"malformed\":\"n}\"}",
+                          "90|1970-01-01 00:00:05.000|null|{\"malformed\":null}",
+                          "91|1970-01-01 00:00:05.000|null|{\"malformed\":\"{\\u0000\"}"));
+  EXPECT_THAT(query(opened, "SELECT min(json_valid(payload)), count(*) FROM session_messages"),
+              ElementsAre("1|7"));
+  EXPECT_THAT(query(opened, "SELECT application, engine_on FROM haptics_runs ORDER BY id"),
+              ElementsAre("a|0.5", "null|null"));
+  EXPECT_THAT(query(opened, "SELECT time_utc, cause, rows, meaning FROM losses ORDER BY id"),
+              ElementsAre("1970-01-01 00:00:01.500|left_out|1|one payload is too large for a row",
+                          "1970-01-01 00:00:02.000|new|2|null"));
 }
 
 TEST_F(StoreFileTest, MigrationThatFailsChangesNothingAndAStoreWithoutItsTablesIsDamaged) {

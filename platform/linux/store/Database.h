@@ -53,6 +53,9 @@ class Statement {
   }
   // Until the next step.
   std::span<const uint8_t> blob(int column) const;
+  int columns() const { return sqlite3_column_count(statement_.get()); }
+  const char* name(int column) const { return sqlite3_column_name(statement_.get(), column); }
+  int type(int column) const { return sqlite3_column_type(statement_.get(), column); }
   void reset();
 
  private:

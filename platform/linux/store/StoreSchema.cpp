@@ -1,23 +1,21 @@
 #include "platform/linux/store/StoreSchema.h"
 
 #include <algorithm>
+#include <ranges>
 #include <span>
 #include <string>
+#include <string_view>
 #include <vector>
 
 #include "platform/linux/store/Database.h"
 #include "platform/linux/store/StoreTables.h"
+#include "platform/linux/store/StoreViews.h"
 
 namespace vx::lnx {
 
 namespace {
 
-constexpr const char* kMessageView = R"sql(
-CREATE VIEW session_messages AS
-  SELECT m.id, datetime(m.time, 'unixepoch', 'localtime') AS at, s.session_id, s.service_name,
-         json_extract(s.user_info, '$.HostApplicationDisplayID') AS application, m.category, m.type, m.payload
-  FROM relay_messages m JOIN relay_sessions s ON s.id = m.relay_session;
-)sql";
+constexpr std::string_view kEventsView = "analytics_events";
 
 constexpr const char* kEventNames =
     "CREATE TABLE event_names(id INTEGER PRIMARY KEY, name TEXT NOT NULL UNIQUE);";
@@ -31,33 +29,11 @@ CREATE TABLE store_epochs(id INTEGER PRIMARY KEY, epoch BLOB NOT NULL,
 CREATE TABLE store_marks(id INTEGER PRIMARY KEY, call INTEGER NOT NULL, last_row INTEGER NOT NULL);
 )sql";
 
-// An event says what a relay message says and a little more: it lies in that message's row, which
-// keeps what its text has after the message's (`,"k":1}`). Otherwise it is an entry with its whole
-// text; one of the second schema may name a message.
-constexpr const char* kEventViews = R"sql(
-CREATE VIEW analytics_events AS
-  SELECT m.id, m.time + m.event_microseconds / 1e6 AS time,
-         (SELECT n.name FROM event_names n WHERE n.id = m.event_name) AS name,
-         substr(m.payload, 1, length(m.payload) - 1) || m.event_tail AS payload, m.relay_session
-  FROM relay_messages m WHERE m.event_name IS NOT NULL
-  UNION ALL
-  SELECT e.id, e.time, (SELECT n.name FROM event_names n WHERE n.id = e.name) AS name,
-         CASE WHEN e.message IS NULL THEN e.payload
-              ELSE (SELECT substr(m.payload, 1, length(m.payload) - 1) FROM relay_messages m WHERE m.id = e.message)
-                   || e.payload END AS payload, e.relay_session
-  FROM analytics_entries e;
-CREATE VIEW client_uptimes AS
-  SELECT id, datetime(time, 'unixepoch', 'localtime') AS at, json_extract(payload, '$.processName') AS process,
-         json_extract(payload, '$.seconds') AS seconds
-  FROM analytics_events WHERE name = 'com.quorvel.sonik.vxreportingclientuptime';
-)sql";
-
 // What follows is fixed: it makes of an older file what its successor was, whatever the tables
 // above become.
 
 // Version 1 kept every event's name and text in a table of their own.
 constexpr const char* kFromVersion1 = R"sql(
-DROP VIEW client_uptimes;
 ALTER TABLE analytics_events RENAME TO events_before;
 CREATE TABLE event_names(id INTEGER PRIMARY KEY, name TEXT NOT NULL UNIQUE);
 CREATE TABLE analytics_entries(
@@ -75,8 +51,6 @@ DROP TABLE events_before;
 // Version 2 kept an entry of its own for each event, and could not tell where a row came from. An
 // entry that was left out after its message's text was no JSON.
 constexpr const char* kFromVersion2 = R"sql(
-DROP VIEW IF EXISTS client_uptimes;
-DROP VIEW IF EXISTS analytics_events;
 ALTER TABLE relay_sessions ADD COLUMN call INTEGER;
 ALTER TABLE relay_sessions ADD COLUMN place INTEGER;
 ALTER TABLE relay_sessions ADD COLUMN uid INTEGER;
@@ -104,29 +78,32 @@ CREATE TABLE store_marks(id INTEGER PRIMARY KEY, call INTEGER NOT NULL, last_row
 
 using Script = std::vector<std::string>;
 
-Script wholeSchema() {
-  return {kRelaySessions.createSql(),
-          kRelayMessages.createSql(),
-          kPowerRecords.createSql(),
-          kStoreLedger.createSql(),
-          kMessageView,
-          kEventNames,
-          kAnalyticsEntries.createSql(),
-          kBookkeeping,
-          kEventViews};
-}
-
+// Version 3 had other views.
 Script scriptFrom(int64_t version) {
-  if (version <= 0) return wholeSchema();
   Script script;
+  // A view that reads a table would keep it from being changed.
+  for (const StoreView& view : storeViews() | std::views::reverse) {
+    // Of the first version, one of them was a table.
+    if (version != 1 || std::string_view(view.name) != kEventsView)
+      script.push_back(std::string("DROP VIEW IF EXISTS ") + view.name);
+  }
+  if (version <= 0) {
+    for (const std::string& table :
+         {kRelaySessions.createSql(), kRelayMessages.createSql(), kPowerRecords.createSql(),
+          kStoreLedger.createSql(), std::string(kEventNames), kAnalyticsEntries.createSql(),
+          std::string(kBookkeeping)})
+      script.push_back(table);
+  }
   if (version == 1) script.emplace_back(kFromVersion1);
-  script.emplace_back(kFromVersion2);
-  script.emplace_back(kEventViews);
+  if (version == 1 || version == 2) script.emplace_back(kFromVersion2);
+  for (const StoreView& view : storeViews()) script.push_back(view.createSql());
   return script;
 }
 
 int beginEpoch(sqlite3* database, const JournalEpoch& epoch) {
-  Statement insert(database, "INSERT INTO store_epochs(epoch) VALUES(?)");
+  Statement insert(database,
+                   "INSERT INTO store_epochs(epoch) SELECT ?"
+                   " WHERE NOT EXISTS (SELECT 1 FROM store_epochs)");
   return insert.bind(std::span<const uint8_t>(epoch)).run();
 }
 
@@ -154,14 +131,16 @@ std::optional<JournalEpoch> epochOf(sqlite3* database) {
 
 int findSchema(sqlite3* database) {
   int code = SQLITE_OK;
+  for (const StoreView& view : storeViews()) {
+    if (code == SQLITE_OK)
+      code = Statement(database, std::string("SELECT * FROM ") + view.name).code();
+  }
   for (const std::string& sql :
        {kRelaySessions.insertSql(), kRelayMessages.insertSql(), kAnalyticsEntries.insertSql(),
         kPowerRecords.insertSql(), kStoreLedger.insertSql(),
         std::string("INSERT INTO event_names(id, name) VALUES(?, ?)"),
         std::string("INSERT INTO store_marks(id, call, last_row) VALUES(?, ?, ?)"),
-        std::string("SELECT epoch, after_row, after_power, after_session FROM store_epochs"),
-        std::string("SELECT id, time, name, payload, relay_session FROM analytics_events"),
-        std::string("SELECT payload FROM session_messages")}) {
+        std::string("SELECT epoch, after_row, after_power, after_session FROM store_epochs")}) {
     if (code == SQLITE_OK) code = Statement(database, sql).code();
   }
   return code;

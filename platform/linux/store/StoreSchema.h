@@ -11,7 +11,7 @@
 
 namespace vx::lnx {
 
-inline constexpr int64_t kStoreSchemaVersion = 3;
+inline constexpr int64_t kStoreSchemaVersion = 4;
 
 // Brings a database of `version` (0: an empty one) up to kStoreSchemaVersion, in one transaction. A
 // database that has no epoch gets this one. SQLITE_OK or SQLite's extended error code.
