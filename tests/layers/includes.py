@@ -17,7 +17,10 @@ ALLOWED = {  # layer -> prefixes of the headers it may include beside its own; t
     "platform/linux": (*PURE, "platform/"),
     "Statistics": (*PURE, "platform/"),
     "client": (*PURE, "wire/"),
-    "tools": (*PURE, "client/", LINUX + "ConfigurationCheck.h", LINUX + "PlatformConfiguration.h"),
+    "tools": (*PURE, "client/"),
+    # Checks the configuration, reads the store, explains a message.
+    "tools/report": (*PURE, "client/", "Statistics/", "platform/", LINUX + "store/", LINUX + "ConfigurationCheck.h",
+                     LINUX + "PlatformConfiguration.h"),
     **{f"platform/linux/{wing}": (*PURE, "platform/", *others) for wing, others in {
         "execution": (LINUX + "journal/",),
         "settings": (LINUX + "execution/",),
@@ -63,6 +66,8 @@ WRONG = {  # of each kind of wrong arrow: the check itself must be able to fail
     "Statistics/a.cpp": (LINUX + "execution/EventLoop.h", "client/a.h", "wire/Protocol.h"),
     LINUX + "store/a.cpp": (LINUX + "ipc/SocketListener.h", LINUX + "recovery/a.h", "wire/a.h", "Statistics/a.h"),
     "client/a.cpp": ("platform/Log.h", LINUX + "ipc/a.h"),
+    "tools/report/a.cpp": (LINUX + "ipc/a.h", "wire/a.h"),
+    "platform/a.h": (LINUX + "store/a.h",),
     "base/a.h": ("propertylist/a.h",),
 }
 

@@ -1,9 +1,8 @@
-// vxreport: talks to the service from a shell. `vxreport help` lists the commands; `vxreport
-// script` reads them from standard input, one a line, over one connection.
+// Calls of the running service, as a client makes them; `vxreport script` reads them from standard
+// input, one a line, over one connection.
 #include <cerrno>
 #include <cstdio>
 #include <cstdlib>
-#include <filesystem>
 #include <iostream>
 #include <limits>
 #include <sstream>
@@ -11,47 +10,16 @@
 #include <vector>
 
 #include "client/ReportingClient.h"
-#include "platform/linux/ConfigurationCheck.h"
-#include "platform/linux/PlatformConfiguration.h"
+#include "tools/report/Command.h"
+
+namespace vx::report {
 
 namespace {
-
-using vx::PayloadBuilder;
-using Words = std::vector<std::string>;
-
-constexpr const char* kHelp =
-    "commands:\n"
-    "  create ID                     a reporting session\n"
-    "  type ID SERVICE_TYPE          0 generic, 2 telephony, 3 haptics, 4 alarms, 7 longformaudio "
-    "...\n"
-    "  configure ID KEY=VALUE...     for example HostApplicationDisplayID=com.example.app\n"
-    "  start ID                      answered when the session stops\n"
-    "  send CATEGORY TYPE KEY=VALUE...           to every started session; CATEGORY such as "
-    "0x08000005\n"
-    "  sendto ID[,ID...] CATEGORY TYPE KEY=VALUE...\n"
-    "  stop ID / destroy ID / validate ID / service ID\n"
-    "  reporters                     every client's sessions\n"
-    "  kill                          ends the service\n"
-    "  script                        reads commands from standard input over one connection\n"
-    "  check-config [FOLDER]         what is wrong in platform.toml and the preferences; asks no "
-    "service\n"
-    "values: true, false, whole and floating numbers, everything else is text\n"
-    "the socket: $VXREPORTING_SOCKET, or /run/vxreporting/service.socket\n";
-
-class UsageError : public std::exception {};
-
-int64_t number(const std::string& text) {
-  char* end = nullptr;
-  errno = 0;
-  const long long value = std::strtoll(text.c_str(), &end, 0);
-  if (end == text.c_str() || *end != '\0' || errno == ERANGE) throw UsageError();
-  return value;
-}
 
 // A code of the service: a service type, a category or a message type.
 template <class Code>
 Code codeOf(const std::string& text) {
-  const int64_t value = number(text);
+  const int64_t value = numberOf(text);
   if (value < 0 || value > int64_t{std::numeric_limits<Code>::max()}) throw UsageError();
   return static_cast<Code>(value);
 }
@@ -99,16 +67,16 @@ const std::string& at(const Words& words, std::size_t i) {
 
 int run(vx::ReportingClient& client, const Words& words) {
   const std::string& command = at(words, 0);
-  if (command == "create") return answered(client.createReportingSession(number(at(words, 1))));
+  if (command == "create") return answered(client.createReportingSession(numberOf(at(words, 1))));
   if (command == "type") {
-    return answered(client.setServiceType(codeOf<uint16_t>(at(words, 2)), number(at(words, 1))));
+    return answered(client.setServiceType(codeOf<uint16_t>(at(words, 2)), numberOf(at(words, 1))));
   }
   if (command == "configure")
-    return answered(client.setConfiguration(payload(words, 2), number(at(words, 1))));
+    return answered(client.setConfiguration(payload(words, 2), numberOf(at(words, 1))));
   if (command == "start") {
     const std::string id = at(words, 1);
     return report(client.startReportingSession(
-                      number(id),
+                      numberOf(id),
                       [id](const auto& result) {
                         std::printf("session %s: %s\n", id.c_str(),
                                     result.ok() ? "ended" : result.status.text.c_str());
@@ -123,19 +91,19 @@ int run(vx::ReportingClient& client, const Words& words) {
   if (command == "sendto") {
     std::vector<int64_t> ids;
     std::stringstream list(at(words, 1));
-    for (std::string id; std::getline(list, id, ',');) ids.push_back(number(id));
+    for (std::string id; std::getline(list, id, ',');) ids.push_back(numberOf(id));
     return report(client.sendMessage(payload(words, 4), codeOf<uint32_t>(at(words, 2)),
                                      codeOf<uint16_t>(at(words, 3)), ids),
                   "taken");
   }
-  if (command == "stop") return answered(client.stopReportingSession(number(at(words, 1))));
-  if (command == "destroy") return answered(client.destroyReportingSession(number(at(words, 1))));
+  if (command == "stop") return answered(client.stopReportingSession(numberOf(at(words, 1))));
+  if (command == "destroy") return answered(client.destroyReportingSession(numberOf(at(words, 1))));
   if (command == "service") {
-    const auto result = client.getServiceType(number(at(words, 1)));
+    const auto result = client.getServiceType(numberOf(at(words, 1)));
     return report(result.status, std::to_string(result.value));
   }
   if (command == "validate") {
-    const auto result = client.validateReporter(number(at(words, 1)));
+    const auto result = client.validateReporter(numberOf(at(words, 1)));
     return report(result.status, "reporterID=" + std::to_string(result.value.reporterID) +
                                      " serviceType=" + std::to_string(result.value.serviceType));
   }
@@ -166,42 +134,51 @@ int runScript(vx::ReportingClient& client) {
   return worst;
 }
 
-// 0: nothing is wrong; 1: something is.
-int checkConfig(const Words& words) {
-  if (words.size() > 2) throw UsageError();
-  const std::string folder =
-      words.size() > 1 ? words[1] : vx::lnx::Directories::fromEnvironment().configuration;
-  std::error_code unknown;
-  if (!std::filesystem::is_directory(folder, unknown)) {
-    std::fprintf(stderr, "vxreport: %s is not a folder; every key would have its default\n",
-                 folder.c_str());
-    return 1;
-  }
-  const std::vector<std::string> complaints = vx::lnx::checkConfiguration(folder);
-  for (const std::string& complaint : complaints) std::fprintf(stderr, "%s\n", complaint.c_str());
-  if (complaints.empty()) std::printf("nothing is wrong in %s\n", folder.c_str());
-  return complaints.empty() ? 0 : 1;
+int callService(const Words& words) {
+  vx::ReportingClient client;
+  if (const vx::ClientStatus status = client.connect(); !status.ok()) return report(status, "");
+  const int status = words[0] == "script" ? runScript(client) : run(client, words);
+  if (client.isConnected()) (void)client.goodbye();
+  return status;
 }
+
+#define VX_SOCKET_HELP "The socket: $VXREPORTING_SOCKET, or /run/vxreporting/service.socket.\n"
+#define VX_PAIRS_HELP "Values are true, false, whole or floating numbers; all else is text.\n"
+constexpr Command kCommands[] = {
+    {"create", "ID", "a reporting session",
+     "Creates a session of that identifier.\n" VX_SOCKET_HELP, callService},
+    {"type", "ID SERVICE_TYPE", "its service type",
+     "0 generic, 2 telephony, 3 haptics, 4 alarms, 7 longformaudio, 8 nonlongformaudio, 10 "
+     "alerts,\n"
+     "12 apiusage.\n" VX_SOCKET_HELP,
+     callService},
+    {"configure", "ID KEY=VALUE...", "its configuration",
+     "For example HostApplicationDisplayID=com.example.app.\n" VX_PAIRS_HELP VX_SOCKET_HELP,
+     callService},
+    {"start", "ID", "answered when the session stops", "Starts a session.\n" VX_SOCKET_HELP,
+     callService},
+    {"send", "CATEGORY TYPE KEY=VALUE...", "a message to every started session",
+     "CATEGORY such as 0x08000005.\n" VX_PAIRS_HELP VX_SOCKET_HELP, callService},
+    {"sendto", "ID[,ID...] CATEGORY TYPE KEY=VALUE...", "a message to the listed sessions",
+     "CATEGORY such as 0x08000005.\n" VX_PAIRS_HELP VX_SOCKET_HELP, callService},
+    {"stop", "ID", "a session, with its summary", "Stops a session.\n" VX_SOCKET_HELP, callService},
+    {"destroy", "ID", "a session", "Destroys a session.\n" VX_SOCKET_HELP, callService},
+    {"service", "ID", "its service type's number",
+     "65535 when nobody has that session.\n" VX_SOCKET_HELP, callService},
+    {"validate", "ID", "whether there is such a session",
+     "Its identifier and service type; 0 and 65535 when nobody has it.\n" VX_SOCKET_HELP,
+     callService},
+    {"reporters", "", "every client's sessions", "Their identifiers.\n" VX_SOCKET_HELP,
+     callService},
+    {"kill", "", "ends the service", "For users whom kill_allowed_users names.\n" VX_SOCKET_HELP,
+     callService},
+    {"script", "", "commands from standard input, over one connection",
+     "One of the calls above a line; lines that begin with # are left out.\n" VX_SOCKET_HELP,
+     callService},
+};
 
 }  // namespace
 
-int main(int argc, char** argv) {
-  std::setvbuf(stdout, nullptr, _IOLBF,
-               0);  // a script's answers come one by one, through a pipe too
-  const Words words(argv + 1, argv + argc);
-  if (words.empty() || words[0] == "help" || words[0] == "--help") {
-    std::fputs(kHelp, words.empty() ? stderr : stdout);
-    return words.empty() ? 2 : 0;
-  }
-  try {
-    if (words[0] == "check-config") return checkConfig(words);
-    vx::ReportingClient client;
-    if (const vx::ClientStatus status = client.connect(); !status.ok()) return report(status, "");
-    const int status = words[0] == "script" ? runScript(client) : run(client, words);
-    if (client.isConnected()) (void)client.goodbye();
-    return status;
-  } catch (const UsageError&) {
-    std::fputs(kHelp, stderr);
-    return 2;
-  }
-}
+std::span<const Command> serviceCommands() { return kCommands; }
+
+}  // namespace vx::report
