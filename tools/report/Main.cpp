@@ -17,6 +17,7 @@ struct Group {
 };
 
 const Group kGroups[] = {
+    {"The store", vx::report::storeCommands()},
     {"Configuration", vx::report::configurationCommands()},
     {"Calls of the running service", vx::report::serviceCommands()},
 };
