@@ -31,6 +31,7 @@ struct Command {
 // One function a group; each group is a file.
 std::span<const Command> serviceCommands();  // calls of the running service
 std::span<const Command> storeCommands();    // what the store holds, as text
+std::span<const Command> pictureCommands();  // what it holds, to look at
 std::span<const Command> configurationCommands();
 
 // The options of a command, taken out of its words. UsageError for one that it does not have.

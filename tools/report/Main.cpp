@@ -18,6 +18,7 @@ struct Group {
 
 const Group kGroups[] = {
     {"The store", vx::report::storeCommands()},
+    {"To look at", vx::report::pictureCommands()},
     {"Configuration", vx::report::configurationCommands()},
     {"Calls of the running service", vx::report::serviceCommands()},
 };
