@@ -32,6 +32,7 @@ struct Command {
 std::span<const Command> serviceCommands();  // calls of the running service
 std::span<const Command> storeCommands();    // what the store holds, as text
 std::span<const Command> pictureCommands();  // what it holds, to look at
+std::span<const Command> messageCommands();  // what becomes of a message
 std::span<const Command> configurationCommands();
 
 // The options of a command, taken out of its words. UsageError for one that it does not have.

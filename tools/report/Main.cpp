@@ -19,6 +19,7 @@ struct Group {
 const Group kGroups[] = {
     {"The store", vx::report::storeCommands()},
     {"To look at", vx::report::pictureCommands()},
+    {"Messages", vx::report::messageCommands()},
     {"Configuration", vx::report::configurationCommands()},
     {"Calls of the running service", vx::report::serviceCommands()},
 };
