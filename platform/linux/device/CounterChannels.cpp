@@ -152,27 +152,6 @@ class Collector {
   bool full_ = false;
 };
 
-// The number after "key" in a status file. ENOENT when the line is not there. A stream that is
-// closed has moved nothing yet: once it is opened, it counts from zero.
-Result<int64_t> statusValue(const std::string& text, const std::string& key) {
-  if (text.starts_with("closed")) return 0;
-  std::size_t at = 0;
-  while (at < text.size()) {
-    const std::size_t end = std::min(text.find('\n', at), text.size());
-    const std::string_view line = std::string_view(text).substr(at, end - at);
-    const std::size_t colon = line.find(':');
-    if (colon != std::string_view::npos) {
-      std::string_view name = line.substr(0, colon);
-      std::string_view number = line.substr(colon + 1);
-      while (!name.empty() && name.back() == ' ') name.remove_suffix(1);
-      while (!number.empty() && number.front() == ' ') number.remove_prefix(1);
-      if (name == key) return parseCounter(number);
-    }
-    at = end + 1;
-  }
-  return Status::posix(key, ENOENT);
-}
-
 // The beginning of a regular file, as much as fits into `text`. Not by the size that the file says
 // it has: below /proc and /sys that is 0 or 4096, whatever it holds.
 Result<std::size_t> readInto(const std::string& path, std::string& text) {
@@ -199,7 +178,7 @@ Result<int64_t> readChannel(const Channel& channel) {
   if (*size == 0) return Status::posix(channel.path, ENOENT);
   text.resize(*size);
   const Result<int64_t> value =
-      channel.statusKey.empty() ? parseCounter(text) : statusValue(text, channel.statusKey);
+      channel.statusKey.empty() ? parseCounter(text) : parseStatus(text, channel.statusKey);
   return value.ok() ? value : Status::posix(channel.path, value.status().code());
 }
 
@@ -222,6 +201,25 @@ Result<int64_t> parseCounter(std::string_view text) {
   if (code == std::errc::result_out_of_range) return Status::posix("too large a number", ERANGE);
   if (code != std::errc() || end != text.data() + text.size() || text.empty()) return none;
   return value;
+}
+
+Result<int64_t> parseStatus(std::string_view text, std::string_view key) {
+  if (text.starts_with("closed")) return 0;
+  std::size_t at = 0;
+  while (at < text.size()) {
+    const std::size_t end = std::min(text.find('\n', at), text.size());
+    const std::string_view line = text.substr(at, end - at);
+    const std::size_t colon = line.find(':');
+    if (colon != std::string_view::npos) {
+      std::string_view name = line.substr(0, colon);
+      std::string_view number = line.substr(colon + 1);
+      while (!name.empty() && name.back() == ' ') name.remove_suffix(1);
+      while (!number.empty() && number.front() == ' ') number.remove_prefix(1);
+      if (name == key) return parseCounter(number);
+    }
+    at = end + 1;
+  }
+  return Status::posix(std::string(key), ENOENT);
 }
 
 ChannelDictionaryRef CounterChannels::copyChannelsInGroup(

@@ -59,4 +59,9 @@ class CounterChannels : public ChannelReportService {
 // most one newline after it. Code EINVAL when it is none, ERANGE when it does not fit into 64 bits.
 Result<int64_t> parseCounter(std::string_view text);
 
+// The number after "key" in the text of a status file, which has lines "key : number". Code ENOENT
+// when the line is not there. A stream that is closed has moved nothing yet: once it is opened, it
+// counts from zero.
+Result<int64_t> parseStatus(std::string_view text, std::string_view key);
+
 }  // namespace vx::lnx

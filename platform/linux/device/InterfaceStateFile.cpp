@@ -55,11 +55,15 @@ void InterfaceStateFile::onReadable() {
 
 void InterfaceStateFile::read() {
   const Result<std::string> text = readRegularFile(path_, kMaxBytes);
-  if (!text.ok()) return;
+  const std::string_view word = text.ok() ? orientationWord(*text) : "";
+  if (!word.empty()) report_(std::string(word));
+}
+
+std::string_view orientationWord(std::string_view text) {
   constexpr const char* kSpace = " \t\r\n";
-  const std::size_t first = text->find_first_not_of(kSpace);
-  if (first == std::string::npos) return;
-  report_(text->substr(first, text->find_last_not_of(kSpace) - first + 1));
+  const std::size_t first = text.find_first_not_of(kSpace);
+  if (first == std::string_view::npos) return {};
+  return text.substr(first, text.find_last_not_of(kSpace) - first + 1);
 }
 
 }  // namespace vx::lnx

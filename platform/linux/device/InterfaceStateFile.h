@@ -3,6 +3,7 @@
 
 #include <filesystem>
 #include <string>
+#include <string_view>
 
 #include "base/Function.h"
 #include "base/ThreadChecker.h"
@@ -40,5 +41,8 @@ class InterfaceStateFile {
   FolderWatch folder_ GUARDED_BY(thread_){path_.parent_path(), IN_CLOSE_WRITE | IN_MOVED_TO};
   bool saidFolderIsMissing_ GUARDED_BY(thread_) = false;
 };
+
+// The file's text without the space around it; empty when there is nothing else.
+std::string_view orientationWord(std::string_view text);
 
 }  // namespace vx::lnx

@@ -7,14 +7,13 @@
 #include <cstring>
 
 #include "platform/Log.h"
+#include "platform/linux/device/SensorProxyMessages.h"
 
 namespace vx::lnx {
 
 namespace {
 
-constexpr const char* kSensorName = "net.hadess.SensorProxy";
 constexpr const char* kSensorPath = "/net/hadess/SensorProxy";
-constexpr const char* kProperty = "AccelerometerOrientation";
 constexpr const char* kProperties = "org.freedesktop.DBus.Properties";
 constexpr std::chrono::milliseconds kFirstRetry{200};
 constexpr std::chrono::milliseconds kLastClaimRetry{5000};
@@ -165,47 +164,22 @@ void SensorProxyClient::onClaimed(sd_bus_message* answer) {
       this, "ss", kSensorName, kProperty);
 }
 
-void SensorProxyClient::onProperty(sd_bus_message* answer) {
-  const char* word = nullptr;
-  if (sd_bus_message_get_error(answer) == nullptr &&
-      sd_bus_message_read(answer, "v", "s", &word) >= 0) {
-    deviceIs(word);
-  }
-}
+void SensorProxyClient::onProperty(sd_bus_message* answer) { deviceIs(propertyIn(answer)); }
 
 void SensorProxyClient::onOwnerChanged(sd_bus_message* signal) {
   thread_.assertHere();
-  const char* name = nullptr;
-  const char* before = nullptr;
-  const char* after = nullptr;
-  if (sd_bus_message_read(signal, "sss", &name, &before, &after) < 0 ||
-      std::strcmp(name, kSensorName) != 0)
-    return;
+  const std::optional<bool> owned = ownerIn(signal);
+  if (!owned) return;
   backoff_ = {};
-  if (*after != '\0') claim();
+  if (*owned) claim();
 }
 
 void SensorProxyClient::onPropertiesChanged(sd_bus_message* signal) {
-  const char* interface = nullptr;
-  if (sd_bus_message_read(signal, "s", &interface) < 0 || std::strcmp(interface, kSensorName) != 0)
-    return;
-  if (sd_bus_message_enter_container(signal, 'a', "{sv}") < 0) return;
-  while (sd_bus_message_enter_container(signal, 'e', "sv") > 0) {
-    const char* key = nullptr;
-    const char* word = nullptr;
-    if (sd_bus_message_read(signal, "s", &key) < 0) break;
-    if (std::strcmp(key, kProperty) == 0) {
-      if (sd_bus_message_read(signal, "v", "s", &word) >= 0) deviceIs(word);
-    } else if (sd_bus_message_skip(signal, "v") < 0) {
-      break;
-    }
-    if (sd_bus_message_exit_container(signal) < 0) break;
-  }
+  deviceIs(changedPropertyIn(signal));
 }
 
-void SensorProxyClient::deviceIs(const char* word) {
-  const std::string text = std::string(word).substr(0, kMaxWordBytes);
-  if (!text.empty()) report_(text);
+void SensorProxyClient::deviceIs(const std::string& word) {
+  if (!word.empty()) report_(word);
 }
 
 }  // namespace vx::lnx

@@ -23,7 +23,6 @@ namespace vx::lnx {
 class SensorProxyClient {
  public:
   using TimePoint = std::chrono::steady_clock::time_point;
-  static constexpr std::size_t kMaxWordBytes = 64;
 
   // `report` is told the word each time the service says one.
   explicit SensorProxyClient(Function<void(const std::string& word)> report)
@@ -54,7 +53,7 @@ class SensorProxyClient {
   void onProperty(sd_bus_message* answer);
   void onOwnerChanged(sd_bus_message* signal);
   void onPropertiesChanged(sd_bus_message* signal);
-  void deviceIs(const char* word);
+  void deviceIs(const std::string& word);
 
   const Function<void(const std::string&)> report_;
   ThreadChecker thread_;
