@@ -23,6 +23,9 @@ if(VX_SANITIZE)
     target_compile_options(vx_options INTERFACE $<$<CXX_COMPILER_ID:GNU>:-Wno-tsan>)
   endif()
 endif()
+if(VX_FUZZ)
+  target_compile_options(vx_options INTERFACE -fsanitize=fuzzer-no-link)  # or fuzzers would be blind inside libraries
+endif()
 
 # Adds a static library whose link line is the list of what its layer may see.
 function(vx_library name)

@@ -11,8 +11,6 @@
 #include "platform/linux/store/LogReaders.h"
 #include "tests/store/StoreTest.h"
 
-extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size);
-
 namespace vx::lnx {
 namespace {
 
@@ -444,17 +442,6 @@ TEST_F(StoreFaultsTest, WritingPausesWhileAReaderHoldsTheLogAtItsBoundAndSaysWho
       query("SELECT event, detail LIKE '%(pid " + std::to_string(reader) + ")' FROM store_ledger"),
       ElementsAre("log_held|1"));
   for (const int end : ends) ::close(end);
-}
-
-TEST_F(StoreFaultsTest, OlderFilesOfTheFuzzerHoldNoSurprise) {
-  int files = 0;
-  for (const auto& entry : std::filesystem::directory_iterator(VX_FUZZ_CORPUS "/store")) {
-    std::ifstream in(entry.path(), std::ios::binary);
-    const std::string bytes((std::istreambuf_iterator<char>(in)), {});
-    files +=
-        LLVMFuzzerTestOneInput(reinterpret_cast<const uint8_t*>(bytes.data()), bytes.size()) + 1;
-  }
-  EXPECT_GE(files, 3);
 }
 
 TEST_F(StoreFaultsTest, ReadersAreThoseWithAReadLockOnTheIndex) {
