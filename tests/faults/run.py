@@ -12,7 +12,7 @@ import tempfile
 import time
 
 SCRATCH_BYTES = 2 << 30
-PROGRAMS = ("kill", "term", "io", "power", "disk", "journal", "fair")
+PROGRAMS = ("kill", "term", "io", "power", "disk", "journal", "fair", "mixed")
 LONG = ("soak",)  # ten minutes by itself: with the others only in small
 
 
