@@ -4,6 +4,7 @@
 #include <memory>
 
 #include "platform/ClientConnection.h"
+#include "platform/ServiceInspection.h"
 #include "platform/ServiceState.h"
 
 namespace vx {
@@ -21,6 +22,9 @@ class ServiceListenerDelegate {
   // Calls back on its own queue, later, with the state that all work leaves which reached the
   // service before this call. False: it has none that could be kept.
   virtual bool saveState(Function<void(SavedService)> /*saved*/) { return false; }
+
+  // None: it says nothing of itself. As long as this object lives.
+  virtual ServiceInspection* inspection() { return nullptr; }
 
   // For a service that has just been made, on the interactive thread while its queues are idle.
   // What cannot be understood is left out, and the answer is false. Clients have been accepted

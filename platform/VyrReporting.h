@@ -2,6 +2,7 @@
 // messages.
 #pragma once
 
+#include <atomic>
 #include <cstdint>
 #include <memory>
 #include <optional>
@@ -55,6 +56,9 @@ class VyrReportingSession {
   // The handler runs once every message handed over before is where it belongs, or with the error
   // that prevents it.
   virtual void flushMessagesWithCompletion(Function<void(std::optional<Error>)> handler) = 0;
+  // How many of the messages are where they belong by now, for whoever looks into the service; null
+  // where nobody counts them.
+  virtual std::shared_ptr<const std::atomic<uint64_t>> storedMessages() const { return nullptr; }
 };
 
 class VyrReporting {

@@ -14,6 +14,8 @@ constexpr uint32_t kTraceStart = 0x21042818;
 constexpr uint32_t kTraceStop = 0x2104281C;
 constexpr uint32_t kTraceSend = 0x21042824;
 
+using Fate = VXReportingActivity::Fate;
+
 const Error& reportingIsOff() {
   static const Error error{"com.quorvel.audio.reporting", 1, ""};
   return error;
@@ -59,9 +61,13 @@ void VXReportingServerInstance::routeMessage(
     const std::optional<std::vector<ReporterID>>& reportingIDs, const ErrorReply& reply) {
   serviceQueue()->assertIsCurrent();
   const auto delegate = delegate_.lock();
-  if (delegate == nullptr || !delegate->isReportingEnabled()) return reply(reportingIsOff());
+  if (delegate == nullptr) return reply(reportingIsOff());
+  if (!delegate->isReportingEnabled()) {
+    delegate->activity().routed(Fate::ReportingOff, message, category, type, 0, nullptr);
+    return reply(reportingIsOff());
+  }
   if (reportingIDs)
-    routeToListed(message, category, type, *reportingIDs);
+    routeToListed(*delegate, message, category, type, *reportingIDs);
   else
     routeToStarted(*delegate, message, category, type);
   reply(std::nullopt);
@@ -69,12 +75,15 @@ void VXReportingServerInstance::routeMessage(
 
 // Sessions are served last here and first on the other path; both orders are meant. A session need
 // not be started.
-void VXReportingServerInstance::routeToListed(const Payload& message, MessageCategory category,
+void VXReportingServerInstance::routeToListed(VXReportingServiceDelegateProtocol& delegate,
+                                              const Payload& message, MessageCategory category,
                                               MessageType type,
                                               const std::vector<ReporterID>& reportingIDs) {
   for (const ReporterID id : reportingIDs) {
     if (id == 0) continue;
     const auto session = findReportingSessionForID(id, Lookup::AcrossAllClients);
+    delegate.activity().routed(session != nullptr ? Fate::Delivered : Fate::UnknownSession, message,
+                               category, type, id, session.get());
     if (session == nullptr) continue;
     VXReportingTallyhubBridge::handleEvent(&message, category, type, session.get());
     VXReportingWattmarkUtility::handleEvent(&message, category, type, session.get());
@@ -100,6 +109,8 @@ void VXReportingServerInstance::routeToStarted(VXReportingServiceDelegateProtoco
   VX_LOG_AS(kFunction, serverLogScope(), Default, "active reporting sessions %lu : %s",
             static_cast<unsigned long>(active.size()), sessionsText(active).c_str());
   for (VXReportingSession* session : active) {
+    delegate.activity().routed(Fate::Delivered, message, category, type, session->reporterID(),
+                               session);
     session->sendMessage(message, category, type, nullptr);
     VXReportingTallyhubBridge::handleEvent(&message, category, type, session);
     VXReportingWattmarkUtility::handleEvent(&message, category, type, session);
@@ -109,6 +120,7 @@ void VXReportingServerInstance::routeToStarted(VXReportingServiceDelegateProtoco
   if (delivered) return;
   VX_LOG_AS(kFunction, serverLogScope(), Default,
             "no active reporting sessions found, sending as standalone");
+  delegate.activity().routed(Fate::Standalone, message, category, type, 0, nullptr);
   VXReportingWattmarkUtility::handleEvent(&message, category, type, nullptr);
   VXReportingSession::sendSingleMessage(message, category, type, kServiceTypeStandalone,
                                         delegate.getDefaults(), nullptr);
@@ -140,6 +152,8 @@ void VXReportingServerInstance::stopSession(ReporterID reporterID) {
             ? delegate->getDriverStatisticsRelativeToSnapShot(session->driverSnapShot())
             : std::nullopt;
     if (statistics) {
+      delegate->activity().routed(Fate::Drivers, *statistics, kCategoryChannelReporting,
+                                  kMessageTypeGeneric, reporterID, session.get());
       session->sendMessage(*statistics, kCategoryChannelReporting, kMessageTypeGeneric, nullptr);
       VXReportingTallyhubBridge::handleEvent(&*statistics, kCategoryChannelReporting,
                                              kMessageTypeGeneric, session.get());

@@ -10,6 +10,7 @@
 #include <string>
 #include <vector>
 
+#include "Statistics/Service/VXReportingActivity.h"
 #include "Statistics/Service/VXReportingReporterIndex.h"
 #include "Statistics/Service/VXReportingServiceProtocol.h"
 #include "Statistics/Service/VXReportingSession.h"
@@ -43,6 +44,7 @@ class VXReportingServiceDelegateProtocol {
   virtual std::optional<Payload> getDriverStatisticsRelativeToSnapShot(
       const std::shared_ptr<DriverSnapShot>& snapShot) = 0;
   virtual void removeClient(const std::shared_ptr<VXReportingServerInstance>& client) = 0;
+  virtual VXReportingActivity& activity() = 0;
 };
 
 // ---------------------------------------------------------------------------------------------------------------------
@@ -116,7 +118,8 @@ class VXReportingServerInstance final
   void routeMessage(const Payload& message, MessageCategory category, MessageType type,
                     const std::optional<std::vector<ReporterID>>& reportingIDs,
                     const ErrorReply& reply);
-  void routeToListed(const Payload& message, MessageCategory category, MessageType type,
+  void routeToListed(VXReportingServiceDelegateProtocol& delegate, const Payload& message,
+                     MessageCategory category, MessageType type,
                      const std::vector<ReporterID>& reportingIDs);
   void routeToStarted(VXReportingServiceDelegateProtocol& delegate, const Payload& message,
                       MessageCategory category, MessageType type);
@@ -140,6 +143,7 @@ class VXReportingServerInstance final
 // the service queue.
 class VXReportingServiceDelegate final
     : public ServiceListenerDelegate,
+      public ServiceInspection,
       public VXReportingServiceDelegateProtocol,
       public std::enable_shared_from_this<VXReportingServiceDelegate> {
  public:
@@ -157,6 +161,14 @@ class VXReportingServiceDelegate final
   bool restoreDelayed(const Payload& facts, const Payload& content,
                       std::unique_ptr<WorkCause> cause) override;
 
+  ServiceInspection* inspection() override { return this; }
+  void totals(Answer answer) override;
+  void clients(Function<void(std::vector<Client>)> answer) override;
+  void sessions(std::size_t first, Answer answer) override;
+  void session(int64_t reporterID, Answer answer) override;
+  void watch(std::weak_ptr<MessageWatcher> watcher) override;
+
+  VXReportingActivity& activity() override { return activity_; }
   std::optional<Payload> getDefaults() override;
   const Clients& getAllClients() override;
   bool isReportingEnabled() override { return reportingEnabled_.load(std::memory_order_relaxed); }
@@ -175,6 +187,7 @@ class VXReportingServiceDelegate final
   VXReportingServiceDelegate() = default;
   void init();
   SavedService savedState();
+  Payload withClient(const VXReportingServerInstance& client, const Payload& facts) const;
   void preferencesChanged(int token);
   static void clientInvalidated(const std::weak_ptr<VXReportingServerInstance>& client,
                                 int32_t processIdentifier);
@@ -185,6 +198,7 @@ class VXReportingServiceDelegate final
   uint64_t registered_ = 0;  // clients so far
   std::shared_ptr<VXReportingReporterIndex> index_ = std::make_shared<VXReportingReporterIndex>();
   std::unique_ptr<VXReportingDriverUtility> driverUtility_;
+  VXReportingActivity activity_;
   std::optional<Payload> defaults_;
   std::atomic<bool> reportingEnabled_{true};
 };

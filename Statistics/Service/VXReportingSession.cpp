@@ -175,6 +175,9 @@ void VXReportingSession::start() {
   }
   started_ = true;
   received_.renew();
+  startedAt_ = platform().clock.now();
+  acceptedAtStart_ = acceptedMessages();
+  relayOutcome_.state.store(RelayState::SettingUp, std::memory_order_relaxed);
   platform().trace.emit(kTraceStarted, 0, 0, 0, 0);
   if (shouldReportOrientation()) registerOrientationHandlers();
   relaySetUp_ = std::make_shared<RelaySetUp>();

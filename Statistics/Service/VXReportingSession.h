@@ -155,6 +155,11 @@ class VXReportingSession : public std::enable_shared_from_this<VXReportingSessio
   std::optional<std::vector<Payload>> nestedAggregatedPayloadData() const;
   std::string description() const;
 
+  // What it says of itself to whoever looks into the service; in full with its configuration and
+  // what became of its messages.
+  enum class Detail : uint8_t { Line, Full };
+  Payload inspect(Detail detail) const;
+
  private:
   struct KindCount {
     MessageKind kind;
@@ -187,6 +192,25 @@ class VXReportingSession : public std::enable_shared_from_this<VXReportingSessio
   std::shared_ptr<VyrReportingSession> openRelay(std::string_view serviceName,
                                                  ServiceType serviceType);
   void configureRelay(const std::shared_ptr<VyrReportingSession>& relay, bool configurationDone);
+  // What has become of the messages since the last start. Written by the relay queue alone, but for
+  // the state's SettingUp; read from any thread.
+  enum class RelayState : uint8_t { None, SettingUp, Open, NoBackend, Test, Ended };
+  struct RelayOutcome {
+    std::atomic<RelayState> state{RelayState::None};
+    std::atomic<uint64_t> relayed{0};
+    std::atomic<uint64_t> alone{0};       // not started: sent as single messages
+    std::atomic<uint64_t> notAllowed{0};  // of the test service type
+    std::atomic<uint64_t> noRelay{0};
+    std::atomic<uint64_t> refused{0};
+  };
+  // Of one writer: needs no locked instruction.
+  static void countOne(std::atomic<uint64_t>& counter) {
+    counter.store(counter.load(std::memory_order_relaxed) + 1, std::memory_order_relaxed);
+  }
+  void resetOutcome();
+  std::string_view relayStateName() const;
+  uint64_t acceptedMessages() const;
+
   void relayMessage(const Payload& normalised, const Payload& message, MessageCategory category,
                     MessageType type, bool startedThen);
   void flushRelay();
@@ -208,12 +232,16 @@ class VXReportingSession : public std::enable_shared_from_this<VXReportingSessio
   std::shared_ptr<WorkQueue> vyrReportingQueue_;
   std::shared_ptr<RelaySetUp> relaySetUp_;  // of the last start
   std::optional<WorkOrigin> relayOrigin_;   // belongs to the relay queue
+  std::optional<Date> startedAt_;           // for inspect() alone, as acceptedAtStart_ is
+  uint64_t acceptedAtStart_ = 0;
+  RelayOutcome relayOutcome_;
 
   mutable Mutex fieldsMutex_;  // the references below, each read and replaced as a whole
   std::optional<std::string> orientationCallbackID_ GUARDED_BY(fieldsMutex_);
   std::optional<Date> startDate_ GUARDED_BY(fieldsMutex_);
   std::shared_ptr<VyrReportingSession> vyrReportingSession_ GUARDED_BY(fieldsMutex_);
   std::shared_ptr<const VyrSecureHierarchyToken> vyrReportingAgentToken_ GUARDED_BY(fieldsMutex_);
+  std::shared_ptr<const std::atomic<uint64_t>> storedMessages_ GUARDED_BY(fieldsMutex_);
 };
 
 // The "vxrr" scope, once a session has been created; null before.

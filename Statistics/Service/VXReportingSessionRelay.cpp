@@ -78,6 +78,9 @@ std::shared_ptr<VyrReportingSession> VXReportingSession::openRelay(std::string_v
   std::shared_ptr<VyrReportingSession> relay =
       platform().vyrReporting.initWithSessionInfo(sessionInfo, userInformation.build(), {});
   setVyrReportingSession(relay);
+  relayOutcome_.state.store(RelayState::Open, std::memory_order_relaxed);
+  MutexLock lock(fieldsMutex_);
+  storedMessages_ = relay->storedMessages();
   return relay;
 }
 
@@ -87,6 +90,7 @@ void VXReportingSession::setUpRelay(std::string_view serviceName, ServiceType se
                                     bool configurationDone,
                                     const std::shared_ptr<RelaySetUp>& setUp) {
   vyrReportingQueue_->assertIsCurrent();
+  resetOutcome();
   if (serviceType() != kServiceTypeTest) {
     relayOrigin_ = platform().workQueues.currentOrigin();
     configureRelay(openRelay(serviceName, serviceTypeThen), configurationDone);
@@ -126,7 +130,18 @@ void VXReportingSession::configureRelay(const std::shared_ptr<VyrReportingSessio
   if (!foundBackends) {
     setVyrReportingSession(nullptr);
     setVyrReportingSessionStarted(false);
+    relayOutcome_.state.store(RelayState::NoBackend, std::memory_order_relaxed);
   }
+}
+
+void VXReportingSession::resetOutcome() {
+  const bool isTest = serviceType() == kServiceTypeTest;
+  relayOutcome_.state.store(isTest ? RelayState::Test : RelayState::SettingUp,
+                            std::memory_order_relaxed);
+  for (std::atomic<uint64_t>* counter :
+       {&relayOutcome_.relayed, &relayOutcome_.alone, &relayOutcome_.notAllowed,
+        &relayOutcome_.noRelay, &relayOutcome_.refused})
+    counter->store(0, std::memory_order_relaxed);
 }
 
 void VXReportingSession::relayMessage(const Payload& normalised, const Payload& message,
@@ -135,6 +150,7 @@ void VXReportingSession::relayMessage(const Payload& normalised, const Payload& 
   vyrReportingQueue_->assertIsCurrent();
   static constexpr const char* kFunction = "sendMessage";
   if (!startedThen) {
+    countOne(relayOutcome_.alone);
     if (platform().log.isLogEnabled(5, sessionLogScope())) {
       VX_LOG_AS(kFunction, sessionLogScope(), Debug,
                 "session not started, will send as a single message");
@@ -143,17 +159,20 @@ void VXReportingSession::relayMessage(const Payload& normalised, const Payload& 
     return;
   }
   if (serviceType() == kServiceTypeTest) {
+    countOne(relayOutcome_.notAllowed);
     VX_LOG_AS(kFunction, sessionLogScope(), Info, "transactions aren't allowed on this platform");
     return;
   }
   const std::shared_ptr<VyrReportingSession> relay = vyrReportingSession();
   if (relay == nullptr) {
+    countOne(relayOutcome_.noRelay);
     const Error error{kGenericErrorDomain, -1, "No valid VyrReportingSession"};
     VX_LOG_AS(kFunction, sessionLogScope(), Error, "%s", error.reason.c_str());
     return;
   }
   std::optional<Error> sendError;
   if (relay->sendMessageWithCategory(relayCategory(category), type, normalised, sendError)) {
+    countOne(relayOutcome_.relayed);
     if (platform().log.isLogEnabled(5, sessionLogScope())) {
       VX_LOG_AS(kFunction, sessionLogScope(), Debug,
                 "VyrReportingAgent %s : message %s : category %i : type %i",
@@ -162,6 +181,7 @@ void VXReportingSession::relayMessage(const Payload& normalised, const Payload& 
     }
     return;
   }
+  countOne(relayOutcome_.refused);
   // A failed send is silent. The line below looks at an error slot that belongs to this piece of
   // work and is always empty, not at the error the send returned; the silence is intended.
   const std::optional<Error> error;
@@ -174,6 +194,7 @@ void VXReportingSession::flushRelay() {
   vyrReportingQueue_->assertIsCurrent();
   static constexpr const char* kFunction = "stop";
   if (serviceType() == kServiceTypeTest) return;
+  relayOutcome_.state.store(RelayState::Ended, std::memory_order_relaxed);
   if (const std::shared_ptr<VyrReportingSession> relay = vyrReportingSession()) {
     relay->flushMessagesWithCompletion([](std::optional<Error> error) {
       if (error)

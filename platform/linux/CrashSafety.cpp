@@ -162,7 +162,7 @@ void CrashSafety::recover(Platform& live, std::vector<std::string> backends,
            static_cast<unsigned long long>(outcome.unreadable));
   }
   VX_LOG(
-      nullptr, Default,
+      nullptr, Info,
       "finished what an earlier process had accepted: restored=%llu calls=%llu undone=%llu "
       "connections=%llu unreadable=%llu ms=%lld",
       static_cast<unsigned long long>(outcome.restored),
@@ -198,25 +198,28 @@ void CrashSafety::recordNotification(std::string_view name, const Function<void(
   post();
 }
 
-std::string CrashSafety::counters() const {
+std::vector<CrashSafety::Figure> CrashSafety::figures() const {
   const JournalCounters journal = journal_ != nullptr ? journal_->counters() : JournalCounters{};
   const AggregateCounters aggregates = means_.aggregates.counters();
   const Snapshots::Counters snapshots = snapshots_ ? snapshots_->counters() : Snapshots::Counters{};
   const auto longest = std::chrono::round<std::chrono::microseconds>(snapshots.longest).count();
+  return {{"journal_entries", journal.appended},
+          {"journal_bytes", journal.bytes},
+          {"journal_segments", journal.segmentsInUse},
+          {"journal_full", journal.full},
+          {"unrecorded", recorder_ ? recorder_->counters().unrecorded : 0},
+          {"aggregate_bytes", aggregates.fileBytes},
+          {"aggregates_unrecorded", aggregates.unrecordedBytes},
+          {"snapshots", snapshots.completed},
+          {"snapshot_bytes", snapshots.bytes},
+          {"snapshot_us", static_cast<uint64_t>(longest)}};
+}
+
+std::string CrashSafety::counters() const {
   std::string text;
-  const auto add = [&text](const char* name, uint64_t value) {
-    text += (text.empty() ? "" : " ") + std::string(name) + '=' + std::to_string(value);
-  };
-  add("journal_entries", journal.appended);
-  add("journal_bytes", journal.bytes);
-  add("journal_segments", journal.segmentsInUse);
-  add("journal_full", journal.full);
-  add("unrecorded", recorder_ ? recorder_->counters().unrecorded : 0);
-  add("aggregate_bytes", aggregates.fileBytes);
-  add("aggregates_unrecorded", aggregates.unrecordedBytes);
-  add("snapshots", snapshots.completed);
-  add("snapshot_bytes", snapshots.bytes);
-  add("snapshot_us", static_cast<uint64_t>(longest));
+  for (const Figure& figure : figures())
+    text +=
+        (text.empty() ? "" : " ") + std::string(figure.name) + '=' + std::to_string(figure.value);
   return text;
 }
 

@@ -75,9 +75,17 @@ class CrashSafety {
     return snapshots_->isUnderWay() && recorder_->shares().isOver(user);
   }
   bool isAllRecorded() const { return recorder_ && recorder_->counters().unrecorded == 0; }
+  struct Figure {
+    const char* name;
+    uint64_t value;
+  };
+  std::vector<Figure> figures() const;
   std::string counters() const;
   // Load is over: what it has left free goes back to the system, on the background queue.
   void giveBack();
+  bool hasJournal() const { return journal_ != nullptr; }
+  // Where the journal lies survives the process alone, as intended, and costs no disk a write.
+  bool journalIsInMemory() const { return inMemory_; }
 
   // No thread is left that works on calls.
   void stop() { Journal::setCallsDoneHandler(nullptr, nullptr); }

@@ -16,6 +16,7 @@
 #include "base/UniqueFd.h"
 #include "platform/Log.h"
 #include "platform/linux/CrashSafety.h"
+#include "platform/linux/Inspection.h"
 #include "platform/linux/PlatformConfiguration.h"
 #include "platform/linux/QuietMoments.h"
 #include "platform/linux/RelayReporting.h"
@@ -35,6 +36,7 @@
 #include "platform/linux/execution/FreeList.h"
 #include "platform/linux/execution/SpareMemory.h"
 #include "platform/linux/execution/SystemThreading.h"
+#include "platform/linux/ipc/InspectEndpoint.h"
 #include "platform/linux/ipc/SocketListener.h"
 #include "platform/linux/settings/PreferencesWatcher.h"
 #include "platform/linux/settings/TomlPreferences.h"
@@ -122,11 +124,13 @@ class RunningPlatform final : public LinuxPlatform {
                          }}),
         loop_(executor_, clock_),
         listener_(loop_, executor_, clock_, configuration.listener),
+        inspectEndpoint_(loop_, executor_, clock_, configuration.inspect),
         preferences_(directories.configuration + "/preferences"),
         channels_(configuration.drivers),
         properties_(configuration.device),
         orientation_(withDefaults(configuration.orientation, directories)),
-        diagnosticFiles_(directories.logs) {
+        diagnosticFiles_(directories.logs),
+        directories_(directories) {
     log_.configure(configuration.log);
     log_.setPreferences(preferences_);
   }
@@ -179,12 +183,16 @@ class RunningPlatform final : public LinuxPlatform {
         .inputs = crashSafety_->inputs(),
         .aggregates = aggregates_,
     });
+    inspection_.emplace(Inspection::Means{clock_, executor_, accounts_, listener_, inspectEndpoint_,
+                                          *store_, *crashSafety_, orientation_, log_,
+                                          configuration_, directories_.logs});
     return true;
   }
 
   Platform& services() override { return *services_; }
 
   void begin() override {
+    sd_notify(0, "STATUS=Finishing what an earlier process had accepted");
     crashSafety_->report();
     watcher_->start(PreferencesWatcher::openInotify());
     store_->start();
@@ -285,11 +293,12 @@ class RunningPlatform final : public LinuxPlatform {
     accounts_.setResumedHandler([this] { listener_.congestionEnded(); });
     listener_.setHooks({
         .congested = [this](uid_t user) { return crashSafety_->isFull(user); },
-        .listening = [] { sd_notify(0, "READY=1"); },
+        .listening = [this] { onListening(); },
         .stopping =
             [this] {
               stopBegan_ = clock_.monotonic();
-              sd_notify(0, "STOPPING=1");
+              sd_notify(0, "STOPPING=1\nSTATUS=Closing sessions and committing");
+              inspectEndpoint_.stop();
             },
     });
 
@@ -326,6 +335,14 @@ class RunningPlatform final : public LinuxPlatform {
     }
   }
 
+  void onListening() {
+    // The service does without it.
+    if (const Status opened = inspectEndpoint_.open(directories_.runtime); !opened.ok())
+      VX_LOG(nullptr, Error, "nobody can look into the service: %s", opened.text().c_str());
+    inspectEndpoint_.serve(Inspection::interface(), [this] { return inspection_->makeObject(); });
+    sd_notify(0, "READY=1\nSTATUS=Serving; vxreport status says more");
+  }
+
   void onSignal() {
     signalfd_siginfo info{};
     while (read(signalFd_.get(), &info, sizeof info) == static_cast<ssize_t>(sizeof info)) {
@@ -334,7 +351,7 @@ class RunningPlatform final : public LinuxPlatform {
         continue;
       }
       const LocalStore::Counters counters = store_->counters();
-      VX_LOG(nullptr, Error,
+      VX_LOG(nullptr, Info,
              "counters: %s rows=%llu commits=%llu write_failures=%llu relay_backlog=%zu "
              "orientation_refused=%llu waiting_bytes=%lld kept_bytes=%lld user_pauses=%llu "
              "work_given_up=%llu %s",
@@ -360,6 +377,7 @@ class RunningPlatform final : public LinuxPlatform {
   SystemThreading threading_{executor_.background()};
   EventLoop loop_;
   SocketListener listener_;
+  InspectEndpoint inspectEndpoint_;
   TomlPreferences preferences_;
   CounterChannels channels_;
   ConfiguredDeviceProperties properties_;
@@ -367,6 +385,7 @@ class RunningPlatform final : public LinuxPlatform {
   HeapPages heapPages_;
   QuietMoments quietMoments_{clock_, [this] { giveBackMemory(); }};
   LinuxDiagnosticFiles diagnosticFiles_;
+  const Directories directories_;
   ProcProcessInfo processInfo_;
   ImmediateProcessControl processControl_;
   KernelRandom random_;
@@ -376,6 +395,7 @@ class RunningPlatform final : public LinuxPlatform {
   std::optional<Monotonic> stopBegan_;
   std::optional<CrashSafety> crashSafety_;
   std::optional<RelayReporting> relay_;
+  std::optional<Inspection> inspection_;
   std::optional<Platform> services_;
   UniqueFd signalFd_;
   CallOnReady signalSource_{[this] { onSignal(); }};

@@ -242,6 +242,7 @@ class Reader {
       s.milliseconds("stalled_client_timeout_ms", l.stalledClientTimeout, 10, 3600000);
       s.users("kill_allowed_users", l.killAllowedUsers);
     });
+    section("inspect", [&](Section& s) { s.text("group", c.inspect.group); });
     section("drivers", [&](Section& s) {
       s.text("root", c.drivers.root);
       readMapped(s, c.drivers.mapped);

@@ -8,6 +8,7 @@
 #include "platform/linux/device/DeviceOptions.h"
 #include "platform/linux/diagnostics/LogOptions.h"
 #include "platform/linux/execution/MemoryLimits.h"
+#include "platform/linux/ipc/InspectOptions.h"
 #include "platform/linux/ipc/ListenerOptions.h"
 #include "platform/linux/settings/PreferencesOptions.h"
 #include "platform/linux/store/StoreOptions.h"
@@ -32,6 +33,7 @@ struct PlatformConfiguration {
   MemoryLimits memory;
   StoreOptions store;
   ListenerOptions listener;
+  InspectOptions inspect;
   DriverOptions drivers;
   OrientationOptions orientation;
   PreferencesOptions preferences;

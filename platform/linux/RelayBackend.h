@@ -3,6 +3,7 @@
 #pragma once
 
 #include <array>
+#include <atomic>
 #include <cstdint>
 #include <memory>
 #include <optional>
@@ -36,6 +37,8 @@ class RelayBackend {
     // The handler runs once: when every message handed over before is where it belongs, or with the
     // error that prevents it; on a thread of the back end's choosing, perhaps before this returns.
     virtual void flush(Function<void(std::optional<Error>)> handler) = 0;
+    // See VyrReportingSession.
+    virtual std::shared_ptr<const std::atomic<uint64_t>> storedMessages() const { return nullptr; }
   };
 
   virtual ~RelayBackend() = default;

@@ -102,6 +102,10 @@ class RelayReporting::Session final : public VyrReportingSession {
       session->flush([all](std::optional<Error> error) { all->onFlushed(std::move(error)); });
   }
 
+  std::shared_ptr<const std::atomic<uint64_t>> storedMessages() const override {
+    return sessions_.empty() ? nullptr : sessions_.front()->storedMessages();
+  }
+
  private:
   const RelayReporting& reporting_;
   const int64_t sessionID_;

@@ -26,6 +26,8 @@ struct ListenerOptions {
   std::chrono::milliseconds stalledClientTimeout{10000};
   // Who may call privileged operations.
   std::vector<uid_t> killAllowedUsers{0, geteuid()};
+  // What the others are told.
+  const char* privilegedHint = "[listener] kill_allowed_users in platform.toml says for whom it is";
 };
 
 }  // namespace vx::lnx

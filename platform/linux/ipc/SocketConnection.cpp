@@ -268,7 +268,7 @@ void SocketConnection::runCall(const Frame& frame) {
     ++host_.counters().notPermitted;
     return sendError(callNumber, WireError::NotPermitted,
                      std::string(operation.name) + " is not for user " + std::to_string(uid_) +
-                         "; [listener] kill_allowed_users in platform.toml says for whom it is");
+                         "; " + host_.limits().privilegedHint);
   }
   const uint32_t mostIdentifiers = host_.limits().maxIdentifiers;
   if (const std::size_t named = longestArray(operation, frame); named > mostIdentifiers) {

@@ -71,6 +71,9 @@ class SocketConnection final : public ClientConnection,
   uid_t user() const { return uid_; }
   UserIndex account() const { return account_; }
   uint64_t recordedAs() const { return recordedAs_; }
+  std::size_t callsInFlight() const { return calls_.inFlight(); }
+  std::size_t unreadReplyBytes() const { return replies_.unreadBytes(); }
+  bool isReadingPaused() const { return waitingForHost_ || mustPause(); }
   // What the service does next belongs to this connection's being accepted.
   Cause recordAccepted();
   // The listener says that reading may go on.

@@ -4,17 +4,16 @@
 #include <sys/file.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
-#include <sys/un.h>
 #include <systemd/sd-daemon.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <cerrno>
-#include <cstring>
 
 #include "base/LockFile.h"
 #include "platform/Log.h"
 #include "platform/linux/execution/SteppedWork.h"
+#include "platform/linux/ipc/UnixSocket.h"
 #include "wire/FrameWriter.h"
 
 namespace vx::lnx {
@@ -124,22 +123,10 @@ Status SocketListener::adoptActivated(int sockets) {
 }
 
 Status SocketListener::bindAt(const std::string& path) {
-  sockaddr_un address{};
-  address.sun_family = AF_UNIX;
-  if (path.size() >= sizeof address.sun_path) {
-    return Status::failure("the socket path " + path + " is longer than the " +
-                           std::to_string(sizeof address.sun_path - 1) +
-                           " bytes a Unix socket allows");
-  }
-  std::memcpy(address.sun_path, path.c_str(), path.size() + 1);
-  socket_.reset(socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
-  // Left behind by a process that was killed: the lock says that nobody serves it.
-  unlink(path.c_str());
-  if (!socket_ ||
-      bind(socket_.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0 ||
-      chmod(path.c_str(), 0666) != 0 || listen(socket_.get(), SOMAXCONN) != 0) {
-    return Status::lastError("cannot listen on " + path);
-  }
+  // What was left behind by a process that was killed: the lock says that nobody serves it.
+  Result<UniqueFd> socket = listenAt(path, 0666);
+  if (!socket.ok()) return socket.status();
+  socket_ = std::move(*socket);
   path_ = path;
   return {};
 }

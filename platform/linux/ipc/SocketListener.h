@@ -59,6 +59,11 @@ class SocketListener final : public ServiceListener,
   };
   std::unordered_map<const ExportedObject*, Recorded> recordedConnections() const;
   std::shared_ptr<ServiceListenerDelegate> delegate() const { return delegate_.lock(); }
+  std::size_t connectionCount() const { return connections_.size(); }
+  // Every connection, for whoever looks into the service.
+  void forEachConnection(const Function<void(const SocketConnection&)>& each) const {
+    for (const auto& [key, connection] : connections_) each(*connection);
+  }
 
   // From any thread: what was congested no longer is.
   void congestionEnded();

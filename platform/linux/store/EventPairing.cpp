@@ -88,6 +88,8 @@ uint64_t EventPairing::markWritten(StoreRecords& batch, std::size_t first, std::
     auto* message = std::get_if<RelayMessageRecord>(&record.what);
     if (message == nullptr) continue;
     message->payload = Payload();
+    std::atomic<uint64_t>& committed = message->row->messagesCommitted;  // written here alone
+    committed.store(committed.load(std::memory_order_relaxed) + 1, std::memory_order_relaxed);
     if (record.event == StoreRecord::kNone) continue;
     StoreRecord& event = batch[record.event];
     event.sharing = StoreRecord::Sharing::Written;

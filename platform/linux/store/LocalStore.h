@@ -78,6 +78,11 @@ class LocalStore final : public AnalyticsEventService, public PowerEventLog {
   // not be written by the deadline; counters() and the log say how many.
   bool close(Monotonic deadline) { return writer_.close(deadline); }
   Counters counters() const { return writer_.counters(); }
+  StoreAccount account() const { return writer_.account(); }
+  // See StoreWriter.
+  void erase(ErasureSelection which, std::string summaries, StoreWriter::ErasureHandler done) {
+    writer_.erase(std::move(which), std::move(summaries), std::move(done));
+  }
   // The same in steps, for a stop that gives a slow disk more time: accepts nothing any more; waits
   // (false: not yet); what is not committed by now stays with the journal, and who waits for it to
   // be committed gets the error. progress() changes whenever something is committed.

@@ -110,6 +110,16 @@ void Retention::noteWritten(const UserBytes& bytes) {
   }
 }
 
+std::optional<double> Retention::oldest() {
+  thread_.assertHere();
+  std::optional<double> oldest;
+  for (std::size_t table = 0; table < kTableCount; ++table) {
+    const std::optional<double> time = oldestTime(table);
+    if (time && (!oldest || *time < *oldest)) oldest = time;
+  }
+  return oldest;
+}
+
 void Retention::removeForAge(Counts& removed) {
   if (options_.maxAgeDays == 0) return;
   if (lastAgeCheck_ && clock_.monotonic() - *lastAgeCheck_ < kAgeCheckInterval) return;

@@ -42,6 +42,10 @@ class Retention {
   bool takeShrunk() { return std::exchange(shrunk_, false); }
   // Text that was written since.
   void noteWritten(const UserBytes& bytes);
+  // Somebody else has removed rows.
+  void forgetUsers() { measured_ = false; }
+  // Of the rows that are there: seconds since 1970.
+  std::optional<double> oldest();
   // To be called after each batch: applies it every kBatchesPerPass.
   std::vector<LedgerNote> onBatchWritten();
 

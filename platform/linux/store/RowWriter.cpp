@@ -111,6 +111,7 @@ Result<RowWriter::Written> RowWriter::write(const StoreRecords& batch, std::size
   for (std::string* text : {&json_, &eventJson_}) {
     if (text->capacity() > kKeptText) std::string().swap(*text);
   }
+  written_.leftOut = leftOut_.size();
   if (code == SQLITE_OK) return written_;
   std::tie(lastMarkedRow_, lastMarkedCall_) = markedBefore;
   for (RelayRow* session : begun_) session->id = 0;

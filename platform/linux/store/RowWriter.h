@@ -29,6 +29,7 @@ class RowWriter {
  public:
   struct Written {
     uint64_t rows = 0;            // the ledger's not counted
+    uint64_t leftOut = 0;         // payloads that are too large for a row
     uint64_t failedBuilders = 0;  // events that are left out, because their builder failed
     std::size_t last = 0;         // records before this one are written
     std::size_t wanted = 0;       // bytes of the row at `last`, which did not fit

@@ -35,6 +35,10 @@ class StoreSession final : public RelayBackend::Session {
     if (!queue_.appendFlush(handler, row_)) handler(closed());
   }
 
+  std::shared_ptr<const std::atomic<uint64_t>> storedMessages() const override {
+    return {row_, &row_->messagesCommitted};
+  }
+
  private:
   std::optional<Error> append(StoreRecord::What what, std::size_t bytes) {
     if (queue_.append(std::move(what), bytes)) return std::nullopt;

@@ -29,6 +29,9 @@ class StoreIdentity {
   void remember(Shrunk shrunk);
   // Before a commit.
   StoreLoss look() const;
+  // As of the last look of remember().
+  uint64_t fileBytes() const { return static_cast<uint64_t>(file_.bytes); }
+  uint64_t logBytes() const { return static_cast<uint64_t>(log_.bytes); }
   // Right after one, whose checkpoint may have made the files shorter.
   StoreLoss lookForOthers() const;
 

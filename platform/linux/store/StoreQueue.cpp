@@ -101,6 +101,12 @@ void StoreQueue::runSoon(Function<void()> job) {
   wake_.notifyOne();
 }
 
+StoreQueue::Waiting StoreQueue::waiting() const {
+  MutexLock lock(mutex_);
+  if (pending_.records.empty()) return {};
+  return {pending_.records.size(), pending_.bytes, firstPending_};
+}
+
 void StoreQueue::close(Monotonic deadline) {
   {
     MutexLock lock(mutex_);
@@ -142,6 +148,7 @@ StoreQueue::Turn StoreQueue::takeLocked(StoreBatch& batch, std::optional<Monoton
   batch.flushes.swap(pending_.flushes);
   batch.charges.swap(pending_.charges);
   batch.bytes = std::exchange(pending_.bytes, 0);
+  batch.since = firstPending_;
   batch.urgent = std::exchange(pending_.urgent, false) || closing_;
   return Turn::Batch;
 }

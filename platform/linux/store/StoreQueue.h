@@ -37,6 +37,7 @@ struct StoreBatch {
   StoreRecords records;
   std::vector<StoreFlush> flushes;  // in order
   std::size_t bytes = 0;            // as taken
+  Monotonic since;                  // when its first record was appended
   std::vector<Charge> charges;      // on whose accounts they are until release()
   bool urgent = false;              // somebody waits for its end
 
@@ -68,6 +69,12 @@ class StoreQueue {
   void close(Monotonic deadline);
   void giveUp();
   bool gaveUp() const { return gaveUp_.load(std::memory_order_relaxed); }
+  struct Waiting {
+    std::size_t records = 0;
+    std::size_t bytes = 0;
+    std::optional<Monotonic> since;  // the first of them
+  };
+  Waiting waiting() const;
   // Rows so far of which no journal knows.
   uint64_t unrecordedRows() const { return unrecorded_.load(std::memory_order_relaxed); }
   // Such rows that came after the close.
@@ -104,7 +111,7 @@ class StoreQueue {
   Clock& clock_;
   UserAccounts* accounts_ = nullptr;
   std::atomic<bool> replaying_{false};
-  Mutex mutex_;
+  mutable Mutex mutex_;
   CondVar wake_;
   StoreBatch pending_ GUARDED_BY(mutex_);
   Monotonic firstPending_ GUARDED_BY(mutex_);

@@ -1,6 +1,7 @@
 // What is on its way to the database.
 #pragma once
 
+#include <atomic>
 #include <cstdint>
 #include <memory>
 #include <string>
@@ -27,7 +28,8 @@ struct RelayRow {
   uint32_t store = 0;  // in which store it has this id (see StoreBeginning)
   // Something that was sent to it was given up.
   bool hasLost = false;
-  bool hasItsMessage = false;  // it was written together with its only one
+  bool hasItsMessage = false;                  // it was written together with its only one
+  std::atomic<uint64_t> messagesCommitted{0};  // read from any thread
 };
 
 struct RelayOpenRecord {

@@ -107,6 +107,7 @@ const std::string kLosses = "  SELECT id, time, " + utc("time") +
          CASE event
            WHEN 'removed_for_age' THEN 'older than the configuration keeps'
            WHEN 'removed_for_size' THEN 'the oldest, to keep the file within its size'
+           WHEN 'erased' THEN 'a person asked to have it removed'
            WHEN 'left_out' THEN 'one payload is too large for a row'
            WHEN 'moved_aside' THEN 'the file was damaged; what could be read was taken over'
            WHEN 'beside_newer' THEN 'the file belongs to a newer version; another one is used beside it'

@@ -72,6 +72,26 @@ StoreCounters StoreWriter::counters() const {
           .unrecordedWaiting = queue_.unrecordedRows() - unrecordedDone_.load()};
 }
 
+StoreAccount StoreWriter::account() const {
+  StoreAccount account;
+  account.counters = counters();
+  account.path = beginning_->path();
+  account.maxBytes = options_.maxBytes;
+  account.fileBytes = fileBytes_.load();
+  account.logBytes = logBytes_.load();
+  if (const double oldest = oldest_.load(); oldest != 0) account.oldest = oldest;
+  account.failing = failingNow_.load();
+  const StoreQueue::Waiting waiting = queue_.waiting();
+  account.waitingRecords = waiting.records + batchRecords_.load();
+  account.waitingBytes = waiting.bytes + batchBytes_.load();
+  const bool isWriting = batchRecords_.load() > 0;
+  if (isWriting || waiting.since)
+    account.lag = clock_.monotonic() - (isWriting ? batchSince_.load() : *waiting.since);
+  MutexLock lock(ledgerMutex_);
+  account.ledgerRows = ledgerRows_;
+  return account;
+}
+
 bool StoreWriter::close(Monotonic deadline) {
   queue_.close(deadline);
   return waitUntilEnded(deadline + kCloseMargin) && rowsLost_.load() == 0;
@@ -104,6 +124,38 @@ void StoreWriter::giveBackMemory() {
   queue_.runSoon([this] {
     if (open_) sqlite3_db_release_memory(open_->database.get());
   });
+}
+
+void StoreWriter::erase(ErasureSelection which, std::string summaries, ErasureHandler done) {
+  FlushHandler committed = [this, which = std::move(which), summaries = std::move(summaries),
+                            done = std::move(done)](const std::optional<Error>& error) mutable {
+    if (error) return;
+    // In a turn of its own: this one is in the middle of a batch.
+    queue_.runSoon([this, which = std::move(which), summaries = std::move(summaries),
+                    done = std::move(done)] { done(eraseNow(which, summaries)); });
+  };
+  (void)queue_.appendFlush(committed);
+}
+
+Result<Erased> StoreWriter::eraseNow(const ErasureSelection& which, const std::string& summaries) {
+  if (Status begun = begin(); !begun.ok()) return begun;
+  const double now = std::chrono::duration<double>(clock_.now().time_since_epoch()).count();
+  Result<Erased> erased = eraseFromStore(open_->database.get(), which, summaries, now, [this] {
+    if (checkpoint() != SQLITE_OK) return;  // a reader holds it: the log grows meanwhile
+    ++progress_;
+  });
+  open_->retention.forgetUsers();
+  rememberFiles();
+  oldest_ = 0;
+  measure();
+  return erased;
+}
+
+void StoreWriter::measure() {
+  if (!open_) return;
+  fileBytes_ = open_->identity.fileBytes();
+  logBytes_ = open_->identity.logBytes();
+  if (oldest_.load() == 0) oldest_ = open_->retention.oldest().value_or(0);
 }
 
 void StoreWriter::yieldToOthers() {
@@ -164,6 +216,7 @@ Status StoreWriter::begin() {
   // The pages that the check has read are of no use to whoever appends.
   sqlite3_db_release_memory(open_->database.get());
   rememberFiles();
+  measure();
   return {};
 }
 
@@ -193,6 +246,9 @@ void StoreWriter::writeBatch(StoreBatch& batch) {
     const double now = std::chrono::duration<double>(clock_.now().time_since_epoch()).count();
     pairing_.hold(batch.records, now - kHoldSeconds, clock_.monotonic());
   }
+  batchSince_ = batch.since;
+  batchBytes_ = batch.bytes;
+  batchRecords_ = batch.records.size();
   std::size_t first = 0;
   // A batch without records may still have flushes.
   do {
@@ -207,8 +263,15 @@ void StoreWriter::writeBatch(StoreBatch& batch) {
     }
   } while (first < batch.records.size() || !batch.flushes.empty());
   batch.clear();
-  if (open_) add(open_->retention.onBatchWritten());
+  batchRecords_ = 0;
+  batchBytes_ = 0;
+  if (open_) {
+    std::vector<LedgerNote> removed = open_->retention.onBatchWritten();
+    if (!removed.empty()) oldest_ = 0;  // another one
+    add(std::move(removed));
+  }
   rememberFiles();
+  measure();
 }
 
 Result<RowWriter::Written> StoreWriter::write(const StoreBatch& batch, std::size_t first,
@@ -238,6 +301,10 @@ Result<RowWriter::Written> StoreWriter::write(const StoreBatch& batch, std::size
   ++commits_;
   rowsCommitted_ += written->rows;
   writeFailures_ += written->failedBuilders;
+  if (written->leftOut > 0) {
+    MutexLock lock(ledgerMutex_);
+    ledgerRows_["left_out"] += written->leftOut;
+  }
   if (open_) open_->retention.noteWritten(written->bytes);
   return written;
 }
@@ -283,6 +350,7 @@ void StoreWriter::makeRoomFor(std::size_t bytes) {
 void StoreWriter::onCommitted(StoreBatch& batch, std::size_t first, std::size_t last) {
   if (failing_) {
     failing_ = false;
+    failingNow_ = false;
     backoff_ = {};
     VX_LOG(nullptr, Error, "the store can be written again; nothing was lost");
   }
@@ -330,6 +398,7 @@ bool StoreWriter::waitBeforeRetry(const Status& failure) {
   ++writeFailures_;
   if (!failing_) {
     failing_ = true;
+    failingNow_ = true;
     VX_LOG(nullptr, Error, "cannot write %s: %s; what was accepted is kept and tried again",
            beginning_->path().c_str(), failure.text().c_str());
   }
@@ -338,6 +407,11 @@ bool StoreWriter::waitBeforeRetry(const Status& failure) {
 }
 
 void StoreWriter::add(std::vector<LedgerNote> notes) {
+  {
+    MutexLock lock(ledgerMutex_);
+    for (const LedgerNote& note : notes)
+      ledgerRows_[note.event] += static_cast<uint64_t>(std::max<int64_t>(note.rows, 1));
+  }
   std::move(notes.begin(), notes.end(), std::back_inserter(notes_));
 }
 

@@ -4,6 +4,7 @@
 #include <atomic>
 #include <chrono>
 #include <cstdint>
+#include <map>
 #include <memory>
 #include <optional>
 #include <string>
@@ -14,6 +15,7 @@
 #include "base/Mutex.h"
 #include "base/Status.h"
 #include "platform/linux/store/Database.h"
+#include "platform/linux/store/Erasure.h"
 #include "platform/linux/store/EventPairing.h"
 #include "platform/linux/store/Retention.h"
 #include "platform/linux/store/RowWriter.h"
@@ -32,6 +34,21 @@ struct StoreCounters {
   uint64_t rowsLeft = 0;
   uint64_t rowsLost = 0;
   uint64_t unrecordedWaiting = 0;  // rows of which no journal knows, neither committed nor lost
+};
+
+// For whoever looks into the service.
+struct StoreAccount {
+  StoreCounters counters;
+  std::string path;
+  uint64_t maxBytes = 0;
+  uint64_t fileBytes = 0;  // as of the last commit
+  uint64_t logBytes = 0;
+  std::optional<double> oldest;  // row: seconds since 1970
+  bool failing = false;          // it cannot be written at the moment
+  std::size_t waitingRecords = 0;
+  std::size_t waitingBytes = 0;
+  std::chrono::nanoseconds lag{0};             // since the oldest of them was accepted
+  std::map<std::string, uint64_t> ledgerRows;  // that the ledger was told of, by cause
 };
 
 // Owned by the local store. The public functions are thread-safe; everything private belongs to the
@@ -65,6 +82,11 @@ class StoreWriter {
   uint64_t progress() const { return progress_.load() + commits_.load(); }
   void note(LedgerNote note);
   StoreCounters counters() const;
+  StoreAccount account() const;
+  // Once what waits is committed; `done` is told on the writer's thread, or let go of without a
+  // word when that does not come to pass. The summaries' folder must stay.
+  using ErasureHandler = Function<void(const Result<Erased>&)>;
+  void erase(ErasureSelection which, std::string summaries, ErasureHandler done);
   // As found by the constructor; see LocalStore.
   const JournalEpoch& epoch() const { return epoch_; }
   uint64_t lastCall() const { return lastCall_; }
@@ -102,6 +124,8 @@ class StoreWriter {
   // False: the store is closing and time is up.
   bool waitBeforeRetry(const Status& failure);
   void add(std::vector<LedgerNote> notes);
+  Result<Erased> eraseNow(const ErasureSelection& which, const std::string& summaries);
+  void measure();
 
   const StoreOptions options_;
   Clock& clock_;
@@ -116,6 +140,16 @@ class StoreWriter {
   Mutex mutex_;
   CondVar ended_;
   bool finished_ GUARDED_BY(mutex_) = false;
+  // Written by the writer's thread, for account().
+  std::atomic<uint64_t> fileBytes_{0};
+  std::atomic<uint64_t> logBytes_{0};
+  std::atomic<double> oldest_{0};  // 0: none known
+  std::atomic<bool> failingNow_{false};
+  std::atomic<std::size_t> batchRecords_{0};  // of the batch that is being written
+  std::atomic<std::size_t> batchBytes_{0};
+  std::atomic<Monotonic> batchSince_{Monotonic()};
+  mutable Mutex ledgerMutex_;
+  std::map<std::string, uint64_t> ledgerRows_ GUARDED_BY(ledgerMutex_);  // bounded by the causes
 
   // The writer's thread.
   const std::unique_ptr<StoreBeginning> beginning_;
