@@ -30,6 +30,8 @@ struct Command {
 };
 // One function a group; each group is a file.
 std::span<const Command> serviceCommands();  // calls of the running service
+std::span<const Command> inspectCommands();  // what the running service says of itself
+std::span<const Command> eraseCommands();
 std::span<const Command> storeCommands();    // what the store holds, as text
 std::span<const Command> pictureCommands();  // what it holds, to look at
 std::span<const Command> messageCommands();  // what becomes of a message

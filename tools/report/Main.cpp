@@ -17,7 +17,9 @@ struct Group {
 };
 
 const Group kGroups[] = {
+    {"The running service", vx::report::inspectCommands()},
     {"The store", vx::report::storeCommands()},
+    {"What must not stay", vx::report::eraseCommands()},
     {"To look at", vx::report::pictureCommands()},
     {"Messages", vx::report::messageCommands()},
     {"Configuration", vx::report::configurationCommands()},

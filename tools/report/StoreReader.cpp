@@ -41,6 +41,8 @@ std::string uriOf(const std::string& path, const char* parameters) {
   return uri + parameters;
 }
 
+}  // namespace
+
 double timeOf(const std::string& text) {
   char* end = nullptr;
   const double number = std::strtod(text.c_str(), &end);
@@ -61,8 +63,6 @@ double timeOf(const std::string& text) {
   if (!parse.row() || parse.isNull(0)) throw UsageError();
   return parse.real(0);
 }
-
-}  // namespace
 
 StoreReader::StoreReader(const Options& options)
     : path_(pathOf(options)),

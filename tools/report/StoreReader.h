@@ -19,6 +19,9 @@ using lnx::Statement;
   "  --since TIME   a date and time in UTC (2026-11-22, 2026-11-22T10:30), or how\n" \
   "                 long ago (90m, 24h, 7d)\n"
 
+// Seconds since 1970, of what VX_SINCE_HELP names, or UsageError.
+double timeOf(const std::string& text);
+
 // Owned by a command, for as long as it runs. All of its queries see the store of one moment.
 class StoreReader {
  public:
