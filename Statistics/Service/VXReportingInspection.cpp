@@ -165,6 +165,7 @@ void VXReportingServiceDelegate::totals(Answer answer) {
                .set("sessions", sessions)
                .set("sessions_started", started)
                .set("delayed_messages", VXReportingProcessState::current().delayedMessages().size())
+               .set("delayed_messages_bound", VXReportingDelayedMessages::kMostMessages)
                .set("watchers", self->activity_.watchers())
                .set("messages", messages.build())
                .build());

@@ -43,7 +43,8 @@ class InspectTest(DaemonTest):
         d.wait_until(lambda: inspector.call(STATUS)["queues"]["store"]["records"] == 0, "everything is stored")
         status = inspector.call(STATUS)
         self.assertEqual(status["service"] | {"watchers": 0}, {
-            "reporting": True, "clients": 1, "sessions": 2, "sessions_started": 1, "delayed_messages": 0, "watchers": 0,
+            "reporting": True, "clients": 1, "sessions": 2, "sessions_started": 1, "delayed_messages": 0,
+            "delayed_messages_bound": 16384, "watchers": 0,
             "messages": {"delivered": 7, "standalone": 0, "unknown_session": 1, "reporting_off": 0, "drivers": 0}})
         self.assertEqual(status["pid"], d.process.pid)
         self.assertEqual(status["durability"]["commit_lag_ms"], 0)

@@ -1,6 +1,7 @@
 #include "platform/linux/ipc/InspectEndpoint.h"
 
 #include <sys/socket.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -53,8 +54,11 @@ Status InspectEndpoint::open(const std::string& runtimeDirectory) {
   if (!socket.ok()) return socket.status();
   socket_ = std::move(*socket);
   path_ = path;
-  // Of a service that is not root: only into a group that it is in.
-  if (group_ && chown(path_.c_str(), static_cast<uid_t>(-1), *group_) != 0) {
+  // Of a service that is not root: only into a group that it is in. Where that is its own, the
+  // socket has it already, and the call may not even be allowed.
+  struct stat made {};
+  const bool hasGroup = group_ && stat(path_.c_str(), &made) == 0 && made.st_gid == *group_;
+  if (group_ && !hasGroup && chown(path_.c_str(), static_cast<uid_t>(-1), *group_) != 0) {
     VX_LOG(nullptr, Info, "%s: cannot give it to the group %s: only root and user %u can look",
            path_.c_str(), options_.group.c_str(), geteuid());
   }
