@@ -134,12 +134,12 @@ class InspectTest(DaemonTest):
         before = self.switches(d)
         time.sleep(1)
         self.assertLessEqual(self.switches(d) - before, 1)
-        client.call(SEND, {"quote\u001b": 1}, CATEGORY, 1, [2])
+        client.call(SEND, {"quote\u001b\u009b\u00e9": 1}, CATEGORY, 1, [2])
         client.call(STOP, 2)
         client.call(SEND, {"last": 1}, CATEGORY, 1, [2])
         lines = tail.communicate(timeout=PATIENCE)[0].splitlines()
         self.assertEqual(len(lines), 2)
-        self.assertRegex(lines[0], r'^\d\d:\d\d:\d\d\.\d{3} delivered session 2 telephony \S+ \{"quote\\u001b":1\}$')
+        self.assertRegex(lines[0], r'^\d\d:\d\d:\d\d\.\d{3} delivered session 2 telephony \S+ \{"quote\\u001b\\xC2\\x9Bé":1\}$')
 
     @staticmethod
     def switches(d):

@@ -48,10 +48,14 @@ int64_t numberOf(const std::string& text) {
 
 std::string printable(std::string_view text) {
   std::string out;
-  for (const char c : text) {
-    const auto byte = static_cast<unsigned char>(c);
-    if (byte >= 0x20 && byte != 0x7F) {
-      out += c;
+  bool controls = false;  // terminals know those from U+0080 to U+009F too
+  for (std::size_t i = 0; i < text.size(); ++i) {
+    const auto byte = static_cast<unsigned char>(text[i]);
+    const bool second = controls;
+    controls =
+        byte == 0xC2 && i + 1 < text.size() && static_cast<unsigned char>(text[i + 1]) < 0xA0;
+    if (!controls && !second && byte >= 0x20 && byte != 0x7F) {
+      out += text[i];
       continue;
     }
     char escaped[5];

@@ -29,8 +29,8 @@ struct Erased {
   int64_t files = 0;
 };
 
-// Removes in steps, so that nobody who writes waits long; `betweenSteps` runs between them, outside
-// of a transaction. What was removed is overwritten with zeros, and a row of the ledger says how
+// Removes in steps, so that the log stays short; `betweenSteps` runs between them, outside of a
+// transaction. What was removed is overwritten with zeros, and a row of the ledger says how
 // much went, not what it was. Sessions that have not ended keep their row, because more of their
 // messages may come.
 //
