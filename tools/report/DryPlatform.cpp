@@ -121,7 +121,8 @@ class Sinks final : public VyrReporting,
     outcome.relayed.push_back({category, type, payload});
     return true;
   }
-  void sendEventLazy(std::string_view name, Function<Payload()> builder, const Payload&) override {
+  void sendEventLazy(std::string_view name, Function<Payload()> builder, const Payload&,
+                     std::size_t) override {
     outcome.events.emplace_back(name, builder());
   }
   void logRegisteredEvent(int64_t, std::string_view name, const Payload& record,

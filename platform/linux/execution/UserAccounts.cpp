@@ -45,7 +45,7 @@ bool UserAccounts::mayHold(UserIndex user, MemoryKind kind, std::size_t bytes) c
   const auto ofKind = [kind](const Account& of) { return bytesOf(of, kind); };
   const int64_t own = ofKind(at(user));
   const int64_t wanted = own + static_cast<int64_t>(bytes);
-  return own == 0 ||
+  return user == kServiceItself || own == 0 ||
          wanted <= boundOf(wanted, limits_.maxUserWaitingBytes, limits_.maxWaitingBytes, ofKind);
 }
 

@@ -55,7 +55,8 @@ class InspectEndpoint final : public ConnectionHost, private EventLoop::Source {
   CallRecorder& recorder() override { return nothingRecorded_; }
   wire::ReadBuffers& readBuffers() override { return readBuffers_; }
   bool readingPaused(UserIndex) override { return false; }
-  void waitForReading(const std::shared_ptr<SocketConnection>&) override {}
+  UserAccounts& accounts() override { return executor_.accounts(); }
+  void waitForReading(const std::shared_ptr<SocketConnection>&, std::size_t) override {}
   void readInTurn(uid_t user, std::shared_ptr<TurnTaker> connection) override {
     turns_.add(user, std::move(connection));
   }
