@@ -263,5 +263,16 @@ TEST_F(EventPairingTest, WhatIsWrittenIsNeitherLostNorKeptAndItsCallIsDone) {
   EXPECT_EQ(undone(), 2);
 }
 
+TEST_F(EventPairingTest, AnEventThatIsWrittenWithItsMessageCountsOnce) {
+  const Payload payload = numbered(1);
+  for (const JournalTicket& call : {recorded(), JournalTicket()}) {
+    batch.clear();
+    addOf(call, message(payload));
+    addOf(call, event("e", payload, payload));
+    pairing.pair(batch);
+    EXPECT_EQ(EventPairing::markWritten(batch, 0, 2), call ? 0u : 2u);
+  }
+}
+
 }  // namespace
 }  // namespace vx::lnx

@@ -82,7 +82,8 @@ uint64_t EventPairing::markWritten(StoreRecords& batch, std::size_t first, std::
   uint64_t unrecorded = 0;
   for (std::size_t i = first; i < last; ++i) {
     StoreRecord& record = batch[i];
-    if (record.sharing == StoreRecord::Sharing::Shares) continue;  // when its message is
+    if (record.sharing == StoreRecord::Sharing::Shares) continue;   // when its message is
+    if (record.sharing == StoreRecord::Sharing::Written) continue;  // as its message was
     if (!record.cause.ticket && !record.makesNoRow()) ++unrecorded;
     record.cause = {};
     auto* message = std::get_if<RelayMessageRecord>(&record.what);
