@@ -225,7 +225,14 @@ class InspectTest(DaemonTest):
         self.assertNotIn(secret, detail)
         sessions_of(secret)  # the store goes on
         d.wait_until(lambda: d.rows("SELECT count(*) FROM sessions WHERE ended IS NOT NULL") == [(2,)], "the next is stored")
-        self.assertIn("1 summary files", self.vxreport("erase", "--application", secret))
+        with contextlib.closing(sqlite3.connect(d.database)) as reader:
+            reader.execute("BEGIN")
+            reader.execute("SELECT count(*) FROM relay_messages").fetchall()
+            self.assertIn("somebody reads the store", self.vxreport("erase", "--application", secret, status=1))
+            reader.execute("COMMIT")
+        self.assertEqual(len(d.summaries()), 1)
+        self.vxreport("erase", "--application", secret)
+        self.assertEqual(where(secret), [])
         self.assertIn("erased: 0 messages", self.vxreport("erase", "--before", "1d"))
         self.assertEqual(self.inspector(d).call(ERASE, {"user": -1})["error"][:16], "erase takes one ")
         self.assertEqual(d.stop(), 0)

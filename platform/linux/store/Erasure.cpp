@@ -115,12 +115,17 @@ int64_t removeSummaries(const std::string& folder, const Function<bool(const Sum
   return removed;
 }
 
+int64_t pragma(sqlite3* database, const char* sql) {
+  Statement query(database, sql);
+  return query.row() ? query.integer(0) : 0;
+}
+
 class Removal {
  public:
-  Removal(sqlite3* database, const ErasureSelection& which, const Function<void()>& betweenSteps)
+  Removal(sqlite3* database, const ErasureSelection& which, const Function<bool()>& betweenSteps)
       : database_(database), which_(which), betweenSteps_(betweenSteps) {}
 
-  // False: the database has refused.
+  // False: the database has refused, or whoever is asked between the steps.
   bool remove(const std::string& table, const std::string& condition, int64_t& removed) {
     Statement range(database_, "SELECT max(id) FROM (SELECT id FROM " + table +
                                    " WHERE id > ? ORDER BY id LIMIT ?)");
@@ -137,14 +142,23 @@ class Removal {
       if (step.bind(done).bind(last).run() != SQLITE_OK) return false;
       removed += sqlite3_changes64(database_);
       done = last;
-      if (betweenSteps_) betweenSteps_();
+      if (betweenSteps_ && !betweenSteps_()) {
+        stopped_ = true;
+        return false;
+      }
     }
+  }
+  Status whyNot() const {
+    return Status::failure(stopped_ ? "somebody reads the store, whose log may not grow meanwhile;"
+                                      " a part is removed: ask again later"
+                                    : sqlite3_errmsg(database_));
   }
 
  private:
   sqlite3* const database_;
   const ErasureSelection& which_;
-  const Function<void()>& betweenSteps_;
+  const Function<bool()>& betweenSteps_;
+  bool stopped_ = false;
 };
 
 }  // namespace
@@ -157,22 +171,25 @@ std::string ErasureSelection::text() const {
 
 Result<Erased> eraseFromStore(sqlite3* database, const ErasureSelection& which,
                               const std::string& summaries, double now,
-                              const Function<void()>& betweenSteps) {
+                              const Function<bool()>& betweenSteps) {
   const std::vector<SummaryOfUser> ofUser =
       which.user ? summariesOfUser(database, *which.user) : std::vector<SummaryOfUser>();
   Erased erased;
   const Conditions go = conditionsOf(which);
   Removal removal(database, which, betweenSteps);
+  const bool overwritesAnyway = pragma(database, "PRAGMA secure_delete") != 0;
   execute(database, "PRAGMA secure_delete = ON");
   // What refers to others goes first.
-  bool ok = removal.remove("analytics_entries", go.event, erased.events) &&
-            removal.remove("relay_messages", go.message, erased.messages) &&
-            removal.remove("power_records", go.power, erased.powerRecords) &&
-            removal.remove("relay_sessions",
-                           go.session +
-                               " AND (ended_at IS NOT NULL OR batch_event IS NULL) AND id NOT IN"
-                               " (SELECT relay_session FROM relay_messages)",
-                           erased.sessions);
+  const bool finished =
+      removal.remove("analytics_entries", go.event, erased.events) &&
+      removal.remove("relay_messages", go.message, erased.messages) &&
+      removal.remove("power_records", go.power, erased.powerRecords) &&
+      removal.remove("relay_sessions",
+                     go.session +
+                         " AND (ended_at IS NOT NULL OR batch_event IS NULL) AND id NOT IN"
+                         " (SELECT relay_session FROM relay_messages)",
+                     erased.sessions);
+  const Status failure = finished ? Status() : removal.whyNot();
   if (which.application) {
     const std::string name = encodeFileNameComponent(*which.application);
     erased.files = removeSummaries(
@@ -190,24 +207,22 @@ Result<Erased> eraseFromStore(sqlite3* database, const ErasureSelection& which,
       return false;
     });
   }
-  if (ok) {
-    const int64_t rows = erased.messages + erased.events + erased.powerRecords + erased.sessions;
-    const std::string detail =
-        "asked for: " + which.text() + "; messages " + std::to_string(erased.messages) +
-        ", events " + std::to_string(erased.events) + ", power records " +
-        std::to_string(erased.powerRecords) + ", sessions " + std::to_string(erased.sessions) +
-        ", summary files " + std::to_string(erased.files);
-    Statement note(database,
-                   "INSERT INTO store_ledger(time, event, table_name, rows, detail)"
-                   " VALUES(?, 'erased', NULL, ?, ?)");
-    ok = note.bind(now).bind(rows).bind(std::string_view(detail)).run() == SQLITE_OK;
-  }
-  const Status failure = Status::failure(ok ? "" : sqlite3_errmsg(database));
-  execute(database, "PRAGMA secure_delete = OFF");
+  const int64_t rows = erased.messages + erased.events + erased.powerRecords + erased.sessions;
+  const std::string detail =
+      "asked for: " + which.text() + "; messages " + std::to_string(erased.messages) + ", events " +
+      std::to_string(erased.events) + ", power records " + std::to_string(erased.powerRecords) +
+      ", sessions " + std::to_string(erased.sessions) + ", summary files " +
+      std::to_string(erased.files) + (finished ? "" : "; not finished");
+  Statement note(database,
+                 "INSERT INTO store_ledger(time, event, table_name, rows, detail)"
+                 " VALUES(?, 'erased', NULL, ?, ?)");
+  const bool noted = note.bind(now).bind(rows).bind(std::string_view(detail)).run() == SQLITE_OK;
+  if (!overwritesAnyway) execute(database, "PRAGMA secure_delete = OFF");
   // The log has what was removed, until it is written back and emptied.
   const int code =
-      sqlite3_wal_checkpoint_v2(database, nullptr, SQLITE_CHECKPOINT_TRUNCATE, nullptr, nullptr);
-  if (!ok) return failure;
+      sqlite3_wal_checkpoint_v2(database, nullptr, SQLITE_CHECKPOINT_PASSIVE, nullptr, nullptr);
+  if (!finished) return failure;
+  if (!noted) return Status::failure("it is removed, but the ledger could not be told");
   if (code != SQLITE_OK) {
     return Status::failure(
         "it is removed, but the log still has it, because somebody reads the store: ask again "

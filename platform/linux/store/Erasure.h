@@ -30,14 +30,14 @@ struct Erased {
 };
 
 // Removes in steps, so that the log stays short; `betweenSteps` runs between them, outside of a
-// transaction. What was removed is overwritten with zeros, and a row of the ledger says how
-// much went, not what it was. Sessions that have not ended keep their row, because more of their
-// messages may come.
+// transaction, and may end it. What was removed is overwritten with zeros, and a row of the ledger
+// says how much went, not what it was. Sessions that have not ended keep their row, because more of
+// their messages may come.
 //
 // `summaries`: the folder of the summary files; those of a user are told by the sessions that the
 // store has of him. A failure leaves some removed: ask again.
 Result<Erased> eraseFromStore(sqlite3* database, const ErasureSelection& which,
                               const std::string& summaries, double now,
-                              const Function<void()>& betweenSteps = nullptr);
+                              const Function<bool()>& betweenSteps = nullptr);
 
 }  // namespace vx::lnx

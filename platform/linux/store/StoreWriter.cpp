@@ -141,8 +141,8 @@ Result<Erased> StoreWriter::eraseNow(const ErasureSelection& which, const std::s
   if (Status begun = begin(); !begun.ok()) return begun;
   const double now = std::chrono::duration<double>(clock_.now().time_since_epoch()).count();
   Result<Erased> erased = eraseFromStore(open_->database.get(), which, summaries, now, [this] {
-    if (checkpoint() != SQLITE_OK) return;  // a reader holds it: the log grows meanwhile
     ++progress_;
+    return checkpoint() == SQLITE_OK;
   });
   open_->retention.forgetUsers();
   rememberFiles();
