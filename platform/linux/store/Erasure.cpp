@@ -220,7 +220,7 @@ Result<Erased> eraseFromStore(sqlite3* database, const ErasureSelection& which,
   if (!overwritesAnyway) execute(database, "PRAGMA secure_delete = OFF");
   // The log has what was removed, until it is written back and emptied.
   const int code =
-      sqlite3_wal_checkpoint_v2(database, nullptr, SQLITE_CHECKPOINT_PASSIVE, nullptr, nullptr);
+      sqlite3_wal_checkpoint_v2(database, nullptr, SQLITE_CHECKPOINT_TRUNCATE, nullptr, nullptr);
   if (!finished) return failure;
   if (!noted) return Status::failure("it is removed, but the ledger could not be told");
   if (code != SQLITE_OK) {
