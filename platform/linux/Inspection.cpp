@@ -66,7 +66,11 @@ Payload describe(const PlatformConfiguration& c) {
                         .set("queue_bytes", c.memory.maxWaitingBytes)
                         .set("commit_interval_ms", c.store.commit.interval.count())
                         .build())
-      .set("memory", table().set("max_user_waiting_bytes", c.memory.maxUserWaitingBytes).build())
+      .set("memory", table()
+                         .set("max_user_bytes", c.memory.maxUserBytes)
+                         .set("max_bytes", c.memory.maxBytes)
+                         .set("max_user_waiting_bytes", c.memory.maxUserWaitingBytes)
+                         .build())
       .set("listener", describe(c.listener))
       .set("inspect", table().set("group", c.inspect.group).build())
       .set("drivers",

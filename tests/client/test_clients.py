@@ -39,8 +39,8 @@ class ClientsTest(DaemonTest):
                 client.until_closed()
                 self.assertEqual([client.answers[n][-1][2] for n in (1, 2, 3, 4, 5)], [True, True, True, None, True])
             self.assertEqual(daemon.stop(), 0)
-            self.assertEqual(daemon.rows("SELECT session_id, service_name, category, type, payload FROM session_messages "
-                                         "WHERE category = 5"), [(42, "longformaudio_session", 5, 1, '{"gain":0.5}')])
+            self.assertEqual(daemon.rows("SELECT session_id, service_type, category, type, payload FROM session_messages "
+                                         "WHERE category = 5"), [(42, "longformaudio", 5, 1, '{"gain":0.5}')])
 
     def test_the_frames_printed_on_the_protocol_page_are_answered_as_printed(self):
         frames = {text: bytes.fromhex(code) for code, text in
