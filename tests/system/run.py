@@ -110,6 +110,27 @@ class Life:
         assert owners == ["vxreporting:vxreporting-read:755", "vxreporting:vxreporting-agents:775",
                           "vxreporting:vxreporting-read:750"], owners
 
+    def step_who_may_look_into_the_service(self):
+        """Root and a member of the group see sessions and messages as they come; an outsider is told that he may not."""
+        client = self.opened(6)
+        for user in ("root", "reader"):
+            status = json.loads(self.m.run("vxreport status --json", user=user).stdout)
+            assert status["service"]["sessions_started"] == 1, status["service"]
+            assert json.loads(self.m.run("vxreport sessions --json", user=user).stdout)["session"] == 6
+            tail = self.m.start("vxreport tail --session 6 --count 1", user)
+
+            def seen():
+                client.stdin.write("sendto 6 5 2 tailed=1\n")
+                client.stdin.flush()
+                return "tailed" in tail.said()
+            self.m.wait_until(seen, "the message is seen as it comes", 20)
+            assert tail.wait(10) == 0
+        for command in ("status", "sessions", "tail"):
+            refused = self.m.run(f"vxreport {command}", user="outsider", check=False)
+            assert refused.returncode == 1 and refused.stderr.count("\n") == 1, refused
+        client.stdin.close()
+        client.wait(30)
+
     def step_watchdog_ends_what_does_not_move(self):
         self.m.run("mkdir -p /run/systemd/system/vxreporting.service.d && printf '[Service]\\nWatchdogSec=2\\n' "
                    ">/run/systemd/system/vxreporting.service.d/test.conf && systemctl daemon-reload && "
