@@ -85,8 +85,8 @@ class Life:
         self.expect(["1"], "SELECT count(*) FROM session_messages WHERE session_id = 1 AND category = 5")
 
     def step_journal_has_the_fields(self):
-        self.m.run(f"kill -USR1 {self.pid()}")
-        entry = lambda: self.m.run("journalctl -o json SYSLOG_IDENTIFIER=vxreporting --grep=counters: -n 1", check=False).stdout
+        entry = lambda: self.m.run("journalctl -o json SYSLOG_IDENTIFIER=vxreporting --grep='session created' -n 1",
+                                   check=False).stdout
         self.m.wait_until(entry, "the journal has the line")
         line = json.loads(entry())
         assert {"MESSAGE", "PRIORITY", "VX_SCOPE", "CODE_FILE", "CODE_LINE", "CODE_FUNC"} <= line.keys(), line
