@@ -116,6 +116,6 @@ def run(options):
         return Outcome(skipped="only root has two users")
     outcome = Outcome("fair")
     os.chmod(os.environ["VX_FAULTS_FOLDER"], 0o755)
-    for name, configuration, shim, rounds in SERVICES:
+    for name, configuration, shim, rounds in SERVICES[::2] if options.small else SERVICES:  # in small the first and the third
         serve(outcome, 2 if options.small else 6, options.small, name, configuration, shim, rounds)
     return outcome
